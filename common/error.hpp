@@ -1,0 +1,69 @@
+// orvane::Error, the one exception type of the system, and the throw-site routine that logs
+// where and why a failure arose before throwing it. Errors are plain values: copyable and
+// immutable once built.
+#ifndef ORVANE_COMMON_ERROR_HPP_
+#define ORVANE_COMMON_ERROR_HPP_
+
+#include <cstdint>
+#include <stdexcept>
+#include <string>
+
+namespace orvane {
+
+enum ErrorCode : int32_t {
+  kErrInvalidParam = 120,
+  kErrShareEnum = 121,
+  kErrSystem = 502,
+  kErrCredentials = 503,
+  kErrLoadConfig = 504,
+  kErrSaveConfig = 505,
+  kErrLockFile = 506,
+  kErrShareGet = 800,
+  kErrChown = 801,
+  kErrFolderInvalid = 901,
+  kErrFolderNotFound = 902,
+  kErrPathCannotIndex = 903,
+  kErrMalformedEvent = 906,
+  kErrElastic = 913,
+  kErrParseFile = 914,
+  kErrNoQueryData = 916,
+  kErrNoDocument = 917,
+  kErrSpaceNotEnough = 1003,
+  kErrOPTreePath = 9999,
+};
+
+class Error : public std::runtime_error {
+ public:
+  explicit Error(ErrorCode code);
+  Error(ErrorCode code, const std::string& reason);
+  Error(const Error& other);
+  ~Error() override = default;
+
+  const char* what() const noexcept override { return message.c_str(); }
+
+  ErrorCode code;
+  std::string message;
+};
+
+// Logs "file:line (pid, euid) (func) Failed [condition], reason: <what()>" (with " [err: %m]"
+// and errno cleared when errno is set) and throws Error(code, reason).
+[[noreturn]] void ThrowError(const char* file, int line, const char* func, const char* condition,
+                             ErrorCode code, const std::string& reason);
+
+// The logged-only form: the same prefix without a reason.
+void LogFailure(const char* file, int line, const char* func, const char* condition);
+
+}  // namespace orvane
+
+// Throws Error(code, reason), logged at the throw site, when `cond` holds. The condition's own
+// text is what the log line names, so write it as the failing test reads best.
+#define ORVANE_THROW_IF(cond, code, reason)                                             \
+  do {                                                                                  \
+    if (cond) ::orvane::ThrowError(__FILE__, __LINE__, __func__, #cond, code, reason); \
+  } while (0)
+
+// Logs a failed condition without throwing; evaluates to whether it failed.
+#define ORVANE_LOG_IF(cond) \
+  ((cond) ? (::orvane::LogFailure(__FILE__, __LINE__, __func__, #cond), true) : false)
+
+#endif  // ORVANE_COMMON_ERROR_HPP_

@@ -1,0 +1,133 @@
+#include "test/test_util.hpp"
+
+#include <ftw.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+#include <stdexcept>
+
+#include "common/root.hpp"
+
+namespace orvane {
+namespace test {
+
+TempDir::TempDir() {
+  const char* base = std::getenv("TMPDIR");
+  std::string tmpl = std::string(base != nullptr && base[0] != '\0' ? base : "/tmp") +
+                     "/fileindex-test-XXXXXX";
+  if (mkdtemp(tmpl.data()) == nullptr) throw std::runtime_error("mkdtemp failed");
+  path_ = tmpl;
+}
+
+TempDir::~TempDir() {
+  nftw(
+      path_.c_str(),
+      [](const char* p, const struct stat*, int, struct FTW*) { return remove(p) == 0 ? 0 : 0; },
+      64, FTW_DEPTH | FTW_PHYS);
+}
+
+std::string TempDir::Write(const std::string& rel, const std::string& content) const {
+  const std::string full = Path(rel);
+  MakeParentDirs(full);
+  std::ofstream out(full, std::ios::binary | std::ios::trunc);
+  out << content;
+  return full;
+}
+
+std::string ReadFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::ostringstream out;
+  out << in.rdbuf();
+  return out.str();
+}
+
+LogCapture::LogCapture()
+    : previous_(SetLogSink([this](int, const std::string& line) {
+        std::lock_guard<std::mutex> lock(mu_);
+        lines_.push_back(line);
+      })) {}
+
+LogCapture::~LogCapture() { SetLogSink(previous_); }
+
+std::vector<std::string> LogCapture::Lines() const {
+  std::lock_guard<std::mutex> lock(mu_);
+  return lines_;
+}
+
+bool LogCapture::Contains(const std::string& text) const { return Count(text) > 0; }
+
+int LogCapture::Count(const std::string& text) const {
+  std::lock_guard<std::mutex> lock(mu_);
+  int n = 0;
+  for (const std::string& line : lines_) n += line.find(text) != std::string::npos;
+  return n;
+}
+
+void LogCapture::Clear() {
+  std::lock_guard<std::mutex> lock(mu_);
+  lines_.clear();
+}
+
+FakeEnv::FakeEnv() : now_micros_(1700000000LL * 1000000), previous_(Env::Replace(this)) {}
+
+FakeEnv::~FakeEnv() { Env::Replace(previous_); }
+
+time_t FakeEnv::Now() {
+  std::lock_guard<std::mutex> lock(mu_);
+  return static_cast<time_t>(now_micros_ / 1000000);
+}
+
+int64_t FakeEnv::NowMicros() {
+  std::lock_guard<std::mutex> lock(mu_);
+  return now_micros_;
+}
+
+void FakeEnv::SleepMicros(int64_t micros) {
+  std::lock_guard<std::mutex> lock(mu_);
+  sleeps_.push_back(micros);
+  now_micros_ += micros;
+}
+
+int FakeEnv::Rand() {
+  std::lock_guard<std::mutex> lock(mu_);
+  if (rand_.empty()) return 0;
+  int v = rand_.front();
+  rand_.pop_front();
+  return v;
+}
+
+void FakeEnv::QueueRand(std::vector<int> values) {
+  std::lock_guard<std::mutex> lock(mu_);
+  rand_.insert(rand_.end(), values.begin(), values.end());
+}
+
+void FakeEnv::Advance(int64_t micros) {
+  std::lock_guard<std::mutex> lock(mu_);
+  now_micros_ += micros;
+}
+
+int64_t FakeEnv::slept_micros() const {
+  int64_t total = 0;
+  for (int64_t s : sleeps_) total += s;
+  return total;
+}
+
+ScopedRoot::ScopedRoot(const std::string& root) {
+  const char* old = std::getenv("ORVANE_ROOT");
+  had_ = old != nullptr;
+  if (had_) old_ = old;
+  setenv("ORVANE_ROOT", root.c_str(), 1);
+}
+
+ScopedRoot::~ScopedRoot() {
+  if (had_) {
+    setenv("ORVANE_ROOT", old_.c_str(), 1);
+  } else {
+    unsetenv("ORVANE_ROOT");
+  }
+}
+
+}  // namespace test
+}  // namespace orvane

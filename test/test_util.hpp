@@ -1,0 +1,103 @@
+// Helpers shared by every test: a scratch folder, a log capture, a fake clock and an
+// ORVANE_ROOT scope. Each is a scoped object that undoes itself; none is thread-safe.
+#ifndef ORVANE_TEST_TEST_UTIL_HPP_
+#define ORVANE_TEST_TEST_UTIL_HPP_
+
+#include <cstdint>
+#include <deque>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "common/env.hpp"
+#include "common/log.hpp"
+
+namespace orvane {
+namespace test {
+
+// A fresh folder under $TMPDIR (or /tmp), removed with everything in it at scope end.
+class TempDir {
+ public:
+  TempDir();
+  ~TempDir();
+  TempDir(const TempDir&) = delete;
+  TempDir& operator=(const TempDir&) = delete;
+
+  const std::string& path() const { return path_; }
+  // path() + "/" + rel.
+  std::string Path(const std::string& rel) const { return path_ + "/" + rel; }
+  // Writes `content` to path()/rel, creating parent folders; returns the full path.
+  std::string Write(const std::string& rel, const std::string& content) const;
+
+ private:
+  std::string path_;
+};
+
+// Reads a whole file; "" when it cannot be read.
+std::string ReadFile(const std::string& path);
+
+// Captures every log line for its lifetime instead of sending it to syslog.
+class LogCapture {
+ public:
+  LogCapture();
+  ~LogCapture();
+  LogCapture(const LogCapture&) = delete;
+  LogCapture& operator=(const LogCapture&) = delete;
+
+  std::vector<std::string> Lines() const;
+  // Whether some line contains `text`.
+  bool Contains(const std::string& text) const;
+  // The number of lines containing `text`.
+  int Count(const std::string& text) const;
+  void Clear();
+
+ private:
+  mutable std::mutex mu_;
+  std::vector<std::string> lines_;
+  LogSink previous_;
+};
+
+// A clock that only moves when slept on, with scripted rand() values; installed for its
+// lifetime. Every sleep is recorded.
+class FakeEnv : public Env {
+ public:
+  FakeEnv();
+  ~FakeEnv() override;
+
+  time_t Now() override;
+  int64_t NowMicros() override;
+  void SleepMicros(int64_t micros) override;
+  int Rand() override;
+
+  // Values Rand() returns, in order; 0 once they are used up.
+  void QueueRand(std::vector<int> values);
+  // Advances the clock without a sleep.
+  void Advance(int64_t micros);
+  const std::vector<int64_t>& sleeps() const { return sleeps_; }
+  int64_t slept_micros() const;
+
+ private:
+  std::mutex mu_;
+  int64_t now_micros_;
+  std::vector<int64_t> sleeps_;
+  std::deque<int> rand_;
+  Env* previous_;
+};
+
+// Sets ORVANE_ROOT for its lifetime and restores the former value.
+class ScopedRoot {
+ public:
+  explicit ScopedRoot(const std::string& root);
+  ~ScopedRoot();
+  ScopedRoot(const ScopedRoot&) = delete;
+  ScopedRoot& operator=(const ScopedRoot&) = delete;
+
+ private:
+  bool had_;
+  std::string old_;
+};
+
+}  // namespace test
+}  // namespace orvane
+
+#endif  // ORVANE_TEST_TEST_UTIL_HPP_
