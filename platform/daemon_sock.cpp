@@ -40,6 +40,7 @@ bool WaitFor(int fd, short events, int timeout_ms) {
 }  // namespace
 
 bool DomainSockConnection::Connect(long timeout_ms) {
+  const int saved_errno = errno;
   Disconnect();
   struct sockaddr_un addr;
   std::memset(&addr, 0, sizeof(addr));
@@ -71,6 +72,7 @@ bool DomainSockConnection::Connect(long timeout_ms) {
   struct timeval none = {0, 0};
   if (setsockopt(fd.get(), SOL_SOCKET, SO_SNDTIMEO, &none, sizeof(none)) != 0) return false;
   fd_ = std::move(fd);
+  errno = saved_errno;  // a success leaves no trace for the callers' failure logs
   return true;
 }
 
@@ -90,6 +92,7 @@ bool SockConnection::Send(const std::string& payload) {
   std::memset(&msg, 0, sizeof(msg));
   msg.msg_iov = iov;
   msg.msg_iovlen = 2;
+  const int saved_errno = errno;
   size_t left = sizeof(length) + payload.size();
   while (left > 0) {
     // MSG_NOSIGNAL: a peer that went away is an EPIPE failure, not a process-killing signal.
@@ -113,6 +116,7 @@ bool SockConnection::Send(const std::string& payload) {
       }
     }
   }
+  errno = saved_errno;
   return true;
 }
 
@@ -143,6 +147,7 @@ bool SockConnection::Recv(std::string& payload) {
     errno = ENOTCONN;
     return false;
   }
+  const int saved_errno = errno;
   uint32_t length = 0;
   if (!RecvExact(reinterpret_cast<char*>(&length), sizeof(length), reply_timeout_ms_)) {
     return false;
@@ -164,6 +169,7 @@ bool SockConnection::Recv(std::string& payload) {
     }
   }
   if (!payload.empty() && payload.back() == '\0') payload.pop_back();
+  errno = saved_errno;
   return true;
 }
 
