@@ -274,6 +274,13 @@ int QUIXRecycleUserHomePathIsExist(const char* path, int flags) {
 
 namespace {
 
+bool UserExists(const std::string& name) {
+  struct passwd pw;
+  struct passwd* found = nullptr;
+  std::vector<char> buf(16384);
+  return getpwnam_r(name.c_str(), &pw, buf.data(), buf.size(), &found) == 0 && found != nullptr;
+}
+
 // Users listed in the local account file; everyone else comes from a directory service.
 std::set<std::string> LocalUserNames() {
   std::set<std::string> names;
@@ -296,7 +303,7 @@ int EnumHomeRecycle(PSZLIST* list, int auth_type) {
   std::vector<std::string> found;
   while (struct dirent* entry = readdir(dir.get())) {
     const std::string user = entry->d_name;
-    if (user == "." || user == ".." || getpwnam(user.c_str()) == nullptr) continue;
+    if (user == "." || user == ".." || !UserExists(user)) continue;
     const int source = local.count(user) ? AUTH_LOCAL : (AUTH_DOMAIN | AUTH_LDAP);
     if ((source & auth_type) == 0) continue;
     const std::string bin = homes->path + "/" + user + "/#recycle";
@@ -315,7 +322,7 @@ int QUIXRecycleHomeEnumRecyclePath(PSZLIST* list) {
   return EnumHomeRecycle(list, AUTH_ALL);
 }
 
-int QUIXRecycleHomeEnumRecyclePathForAuthType(PSZLIST* list, int auth_type) {
+int QUIXRecycleHomeEnumRecyclePathForAuthType(PSZLIST* list, AUTH_TYPE auth_type) {
   PLATFORM_FAULT_POINT("QUIXRecycleHomeEnumRecyclePathForAuthType", nullptr);
   return EnumHomeRecycle(list, auth_type);
 }

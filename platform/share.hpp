@@ -84,14 +84,18 @@ constexpr int RECYCLE_HOME_CHECK_ENABLED = 0x08;   // ... and the "homes" recycl
 int QUIXRecycleUserHomePathIsExist(const char* path, int flags);
 
 // Account sources for the home recycle-bin enumeration.
-constexpr int AUTH_LOCAL = 0x01;
-constexpr int AUTH_DOMAIN = 0x02;
-constexpr int AUTH_LDAP = 0x04;
-constexpr int AUTH_ALL = AUTH_LOCAL | AUTH_DOMAIN | AUTH_LDAP;
+// Local accounts are those of /etc/passwd; every other account the system knows (through NSS)
+// counts as both a domain and a directory account, which Linux cannot tell apart.
+enum AUTH_TYPE : int {
+  AUTH_LOCAL = 0x01,
+  AUTH_DOMAIN = 0x02,
+  AUTH_LDAP = 0x04,
+  AUTH_ALL = AUTH_LOCAL | AUTH_DOMAIN | AUTH_LDAP,
+};
 // Appends the existing home recycle-bin folders of every user (or of the users of one account
 // source) to *list; returns how many, or -1 (no "homes" share, a listing failure).
 int QUIXRecycleHomeEnumRecyclePath(PSZLIST* list);
-int QUIXRecycleHomeEnumRecyclePathForAuthType(PSZLIST* list, int auth_type);
+int QUIXRecycleHomeEnumRecyclePathForAuthType(PSZLIST* list, AUTH_TYPE auth_type);
 
 }  // namespace platform
 }  // namespace orvane
