@@ -9,6 +9,7 @@
 
 #include "common/error.hpp"
 #include "common/sdk/share.hpp"
+#include "platform/config.hpp"
 #include "platform/fs.hpp"
 #include "platform/share.hpp"
 
@@ -103,6 +104,8 @@ bool IsSystemPreservedFileName(const string& name) {
 }
 
 bool CanFullPathBeIndexed(const string& full_path) {
+  // Every rule below judges against one view of the share configuration.
+  platform::ScopedConfigSnapshot config_snapshot;
   if (full_path.find(kSnapshotMarker) != string::npos) {
     int in_snapshot = 0;
     if (QLIBFhsPathInSnapshot(full_path.c_str(), &in_snapshot) == 0 && in_snapshot == 1) {
