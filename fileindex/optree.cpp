@@ -61,7 +61,9 @@ namespace {
 // Directories up to this size are searched linearly; larger ones get a hashed index.
 constexpr size_t kLinearChildren = 8;
 
-size_t HashName(std::string_view name) { return std::hash<std::string_view>()(name); }
+uint32_t HashName(std::string_view name) {
+  return static_cast<uint32_t>(std::hash<std::string_view>()(name));
+}
 
 }  // namespace
 
@@ -90,18 +92,22 @@ std::string OPNode::GetPath() const {
 }
 
 std::shared_ptr<OPNode> OPNode::GetChild(std::string_view name) {
+  const uint32_t hash = HashName(name);
   if (child_slots_.empty()) {
-    for (const auto& child : children) {
-      if (child->name == name) return child;
+    for (size_t i = 0; i < children.size(); ++i) {
+      if (child_hashes_[i] == hash && children[i]->name == name) return children[i];
     }
   } else {
     const size_t mask = child_slots_.size() - 1;
-    for (size_t i = HashName(name) & mask; child_slots_[i] != 0; i = (i + 1) & mask) {
-      const auto& child = children[child_slots_[i] - 1];
-      if (child->name == name) return child;
+    for (size_t i = hash & mask; child_slots_[i] != 0; i = (i + 1) & mask) {
+      const uint32_t position = child_slots_[i] - 1;
+      if (child_hashes_[position] == hash && children[position]->name == name) {
+        return children[position];
+      }
     }
   }
   children.push_back(std::make_shared<OPNode>(shared_from_this(), std::string(name)));
+  child_hashes_.push_back(hash);
   if (children.size() > kLinearChildren) IndexChild(static_cast<uint32_t>(children.size() - 1));
   return children.back();
 }
@@ -117,7 +123,7 @@ void OPNode::IndexChild(uint32_t position) {
     }
   }
   const size_t mask = child_slots_.size() - 1;
-  size_t i = HashName(children[position]->name) & mask;
+  size_t i = child_hashes_[position] & mask;
   while (child_slots_[i] != 0) i = (i + 1) & mask;
   child_slots_[i] = position + 1;
 }
@@ -250,6 +256,7 @@ size_t OPTree::ProcessOP(std::function<void(std::shared_ptr<OP>)> callback) {
 }
 
 std::shared_ptr<OPNode> OPTree::GetNodeByPath(const std::string& path) {
+  if (last_node_ && path == last_path_) return last_node_;
   ORVANE_THROW_IF(path.size() > PATH_MAX, kErrOPTreePath, "GetNodeByPath failed, path=" + path);
   std::shared_ptr<OPNode> node = root;
   for (size_t begin = 0; begin < path.size();) {
@@ -263,6 +270,8 @@ std::shared_ptr<OPNode> OPTree::GetNodeByPath(const std::string& path) {
   const bool spelled_back =
       path.empty() || (path[0] == '/' && path.back() != '/' && path.find("//") == std::string::npos);
   ORVANE_THROW_IF(!spelled_back, kErrOPTreePath, "GetNodeByPath failed, path=" + path);
+  last_path_ = path;
+  last_node_ = node;
   return node;
 }
 

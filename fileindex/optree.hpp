@@ -99,6 +99,9 @@ class OPNode : public std::enable_shared_from_this<OPNode> {
  private:
   void IndexChild(uint32_t position);
 
+  // Hashes of the children's names, by position: a scan compares these and touches a child
+  // only on a match, which keeps a walk down a large tree from missing the cache at every node.
+  std::vector<uint32_t> child_hashes_;
   // Open-addressed index of `children` (position + 1, 0 = empty), built once a directory has
   // more children than a linear scan handles well.
   std::vector<uint32_t> child_slots_;
@@ -147,6 +150,10 @@ class OPTree {
  private:
   void Accept(const std::shared_ptr<OPNode>& node, const std::shared_ptr<OP>& op);
   void LogInsertFailure(const std::string& line, int code, const char* reason);
+
+  // The last path resolved and its node: bursts of events on one file resolve it once.
+  std::string last_path_;
+  std::shared_ptr<OPNode> last_node_;
 };
 
 }  // namespace fileindex
