@@ -130,11 +130,11 @@ void RunOne(size_t lines) {
         std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
     road_secs = secs;
     const long peak_kib = PeakRssKiB();
-    std::printf("%9zu lines  %7.3f s  %8.0f lines/s  %6.0f ns/line  %7zu ops  %7zu paths  "
-                "tree %6.1f MiB = %4.0f B/path  process peak RSS %6.1f MiB\n",
-                lines, secs, lines / secs, secs * 1e9 / lines, callbacks, distinct,
-                tree_heap / 1048576.0, static_cast<double>(tree_heap) / distinct,
-                peak_kib / 1024.0);
+    std::printf(
+        "%9zu lines  %7.3f s  %8.0f lines/s  %6.0f ns/line  %7zu ops  %7zu paths  "
+        "tree %6.1f MiB = %4.0f B/path  process peak RSS %6.1f MiB\n",
+        lines, secs, lines / secs, secs * 1e9 / lines, callbacks, distinct, tree_heap / 1048576.0,
+        static_cast<double>(tree_heap) / distinct, peak_kib / 1024.0);
   }
   // The same lines parsed into events only, to show what the JSON parse alone costs.
   const auto parse_start = std::chrono::steady_clock::now();

@@ -15,9 +15,10 @@ FolderMgr::FolderMgr() : folders_(Json::arrayValue) {
   const std::string path = RootedPath(kFileIndexFoldersCfgPath);
   JsonValue folders;
   if (IsFileExist(path) && (!folders.fromFile(path) || !folders.isArray())) {
-    ThrowError(__FILE__, __LINE__, __func__,
-               "IsFileExist(kFileIndexFoldersCfgPath) && !folders.fromFile(kFileIndexFoldersCfgPath)",
-               kErrLoadConfig, "Cannot load json: " + path);
+    ThrowError(
+        __FILE__, __LINE__, __func__,
+        "IsFileExist(kFileIndexFoldersCfgPath) && !folders.fromFile(kFileIndexFoldersCfgPath)",
+        kErrLoadConfig, "Cannot load json: " + path);
   }
   if (folders.isArray()) folders_ = folders;
 }

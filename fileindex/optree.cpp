@@ -234,12 +234,15 @@ void OPTree::InsertLine(const std::string& line) {
 void OPTree::LogInsertFailure(const std::string& line, int code, const char* reason) {
   // Named after the reading loop: that is where an administrator looks for skipped lines.
   if (errno != 0) {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) InsertEvent failed, event_raw=%s, code=%d, reason=%s [err: %m]",
-        SourceName(__FILE__), __LINE__, getpid(), geteuid(), "BuildTree", line.c_str(), code, reason);
+    Log(LOG_ERR,
+        "%s:%d (%d, %u) (%s) InsertEvent failed, event_raw=%s, code=%d, reason=%s [err: %m]",
+        SourceName(__FILE__), __LINE__, getpid(), geteuid(), "BuildTree", line.c_str(), code,
+        reason);
     errno = 0;
   } else {
     Log(LOG_ERR, "%s:%d (%d, %u) (%s) InsertEvent failed, event_raw=%s, code=%d, reason=%s",
-        SourceName(__FILE__), __LINE__, getpid(), geteuid(), "BuildTree", line.c_str(), code, reason);
+        SourceName(__FILE__), __LINE__, getpid(), geteuid(), "BuildTree", line.c_str(), code,
+        reason);
   }
 }
 
@@ -267,8 +270,8 @@ std::shared_ptr<OPNode> OPTree::GetNodeByPath(const std::string& path) {
   }
   // The reached node spells `path` back exactly when the path is "" or "/"-led with no empty
   // component; checking that is the same test as comparing with GetPath(), without building it.
-  const bool spelled_back =
-      path.empty() || (path[0] == '/' && path.back() != '/' && path.find("//") == std::string::npos);
+  const bool spelled_back = path.empty() || (path[0] == '/' && path.back() != '/' &&
+                                             path.find("//") == std::string::npos);
   ORVANE_THROW_IF(!spelled_back, kErrOPTreePath, "GetNodeByPath failed, path=" + path);
   last_path_ = path;
   last_node_ = node;
@@ -380,9 +383,8 @@ void OPTree::HandleRename(std::shared_ptr<OPNode> node, std::shared_ptr<OP> op) 
       [&](std::shared_ptr<OPNode> descendant) {
         const std::string moved = new_path + descendant->GetPath().substr(old_path.size());
         std::shared_ptr<OPNode> target = GetNodeByPath(moved);
-        descendant->TraverseOP([&](std::shared_ptr<OP> pending) {
-          MoveOP(pending, descendant, target);
-        });
+        descendant->TraverseOP(
+            [&](std::shared_ptr<OP> pending) { MoveOP(pending, descendant, target); });
       },
       true);
   Accept(node, op);

@@ -59,8 +59,8 @@ TEST(OPTreeTest, CoalescingTableCellByCell) {
     FileIndexOP pending_after;
     bool new_kept;
   };
-  const FileIndexOP kinds[] = {kOPDelete, kOPUpsert, kOPAttr, kOPUpdateDirectory, kOPRename,
-                               kOPReindex, kOPNone, kOPCrash};
+  const FileIndexOP kinds[] = {kOPDelete, kOPUpsert,  kOPAttr, kOPUpdateDirectory,
+                               kOPRename, kOPReindex, kOPNone, kOPCrash};
   using Handler = void (OPTree::*)(std::shared_ptr<OPNode>, std::shared_ptr<OP>);
   struct Row {
     const char* name;
@@ -71,25 +71,72 @@ TEST(OPTreeTest, CoalescingTableCellByCell) {
   const Outcome keep_none = {kOPNone, true};
   const Outcome keep_crash = {kOPCrash, true};
   const Row rows[] = {
-      {"create", &OPTree::HandleCreate, kOPUpsert,
-       {{kOPUpsert, false}, {kOPUpsert, false}, {kOPUpsert, false}, {kOPUpdateDirectory, false},
-        {kOPRename, true}, {kOPReindex, false}, keep_none, keep_crash}},
-      {"modify", &OPTree::HandleModifyAndCloseWrite, kOPUpsert,
-       {{kOPDelete, false}, {kOPUpsert, false}, {kOPUpsert, false}, {kOPUpdateDirectory, false},
-        {kOPRename, true}, {kOPReindex, false}, keep_none, keep_crash}},
-      {"attr", &OPTree::HandleAttr, kOPAttr,
-       {{kOPDelete, false}, {kOPUpsert, false}, {kOPAttr, false}, {kOPUpdateDirectory, false},
-        {kOPRename, true}, {kOPReindex, false}, keep_none, keep_crash}},
-      {"delete", &OPTree::HandleDelete, kOPDelete,
-       {{kOPDelete, false}, {kOPDelete, false}, {kOPDelete, false}, {kOPUpdateDirectory, true},
-        {kOPRename, true}, {kOPReindex, true}, keep_none, keep_crash}},
-      {"update directory", &OPTree::HandleUpdateDirectory, kOPUpdateDirectory,
-       {{kOPDelete, false}, {kOPUpdateDirectory, false}, {kOPUpdateDirectory, false},
-        {kOPUpdateDirectory, false}, {kOPRename, true}, {kOPReindex, false}, keep_none,
+      {"create",
+       &OPTree::HandleCreate,
+       kOPUpsert,
+       {{kOPUpsert, false},
+        {kOPUpsert, false},
+        {kOPUpsert, false},
+        {kOPUpdateDirectory, false},
+        {kOPRename, true},
+        {kOPReindex, false},
+        keep_none,
         keep_crash}},
-      {"reindex", &OPTree::HandleReindex, kOPReindex,
-       {{kOPDelete, false}, {kOPReindex, false}, {kOPReindex, false}, {kOPReindex, false},
-        {kOPRename, true}, {kOPReindex, false}, keep_none, keep_crash}},
+      {"modify",
+       &OPTree::HandleModifyAndCloseWrite,
+       kOPUpsert,
+       {{kOPDelete, false},
+        {kOPUpsert, false},
+        {kOPUpsert, false},
+        {kOPUpdateDirectory, false},
+        {kOPRename, true},
+        {kOPReindex, false},
+        keep_none,
+        keep_crash}},
+      {"attr",
+       &OPTree::HandleAttr,
+       kOPAttr,
+       {{kOPDelete, false},
+        {kOPUpsert, false},
+        {kOPAttr, false},
+        {kOPUpdateDirectory, false},
+        {kOPRename, true},
+        {kOPReindex, false},
+        keep_none,
+        keep_crash}},
+      {"delete",
+       &OPTree::HandleDelete,
+       kOPDelete,
+       {{kOPDelete, false},
+        {kOPDelete, false},
+        {kOPDelete, false},
+        {kOPUpdateDirectory, true},
+        {kOPRename, true},
+        {kOPReindex, true},
+        keep_none,
+        keep_crash}},
+      {"update directory",
+       &OPTree::HandleUpdateDirectory,
+       kOPUpdateDirectory,
+       {{kOPDelete, false},
+        {kOPUpdateDirectory, false},
+        {kOPUpdateDirectory, false},
+        {kOPUpdateDirectory, false},
+        {kOPRename, true},
+        {kOPReindex, false},
+        keep_none,
+        keep_crash}},
+      {"reindex",
+       &OPTree::HandleReindex,
+       kOPReindex,
+       {{kOPDelete, false},
+        {kOPReindex, false},
+        {kOPReindex, false},
+        {kOPReindex, false},
+        {kOPRename, true},
+        {kOPReindex, false},
+        keep_none,
+        keep_crash}},
   };
   for (const Row& row : rows) {
     for (size_t k = 0; k < 8; ++k) {
@@ -140,7 +187,7 @@ TEST(OPTreeTest, BitsOfOneEventShareOneOperation) {
 
 TEST(OPTreeTest, DirectoryReindexCancelsPendingWorkBelowButKeepsRenames) {
   EXPECT_THAT(Drain(Create("/v/s/d/a") + Modify("/v/s/d/e/b") + Rename("/v/s/x", "/v/s/d/c") +
-                  CreateDir("/v/s/d") + Create("/v/s/other")),
+                    CreateDir("/v/s/d") + Create("/v/s/other")),
               ElementsAre("[05] /v/s/x -> /v/s/d/c", "[06] /v/s/d", "[02] /v/s/other"));
   // A deleted directory is re-indexed as well.
   EXPECT_THAT(Drain(Create("/v/s/d/a") + DeleteDir("/v/s/d")), ElementsAre("[06] /v/s/d"));
@@ -158,11 +205,10 @@ TEST(OPTreeTest, RenameMovesPendingWorkAndFollowsUp) {
   EXPECT_THAT(Drain(Modify("/v/s/b") + Rename("/v/s/a", "/v/s/b")),
               ElementsAre("[05] /v/s/a -> /v/s/b"));
   // A directory's whole subtree moves; a later change lands on the new path.
-  EXPECT_THAT(
-      Drain(Create("/v/s/d/x/1") + Settings("/v/s/d/x", R"({"photo":true})") +
-          Rename("/v/s/d", "/v/s/e") + Modify("/v/s/e/x/1") + Modify("/v/s/d/x/1")),
-      ElementsAre("[02] /v/s/e/x/1", "[04] /v/s/e/x, data={\"photo\":true}",
-                  "[05] /v/s/d -> /v/s/e", "[02] /v/s/d/x/1"));
+  EXPECT_THAT(Drain(Create("/v/s/d/x/1") + Settings("/v/s/d/x", R"({"photo":true})") +
+                    Rename("/v/s/d", "/v/s/e") + Modify("/v/s/e/x/1") + Modify("/v/s/d/x/1")),
+              ElementsAre("[02] /v/s/e/x/1", "[04] /v/s/e/x, data={\"photo\":true}",
+                          "[05] /v/s/d -> /v/s/e", "[02] /v/s/d/x/1"));
 }
 
 TEST(OPTreeTest, RenameIntoItsOwnSubtreeTerminates) {
@@ -175,7 +221,7 @@ TEST(OPTreeTest, RenameIntoItsOwnSubtreeTerminates) {
 TEST(OPTreeTest, FolderSettingsMergeByOr) {
   EXPECT_THAT(
       Drain(Settings("/v/s/d", R"({"document":true,"audio":false,"keep":1})") +
-          Settings("/v/s/d", R"({"audio":true,"video":"yes","basic":false})")),
+            Settings("/v/s/d", R"({"audio":true,"video":"yes","basic":false})")),
       ElementsAre(
           R"([04] /v/s/d, data={"audio":true,"basic":false,"document":true,"keep":1,"photo":false,"video":false})"));
   // Settings replace a pending upsert and carry the new data.
@@ -186,8 +232,8 @@ TEST(OPTreeTest, FolderSettingsMergeByOr) {
 TEST(OPTreeTest, CrashedQueueYieldsOneWholeShareOperation) {
   test::LogCapture log;
   test::TempDir dir;
-  const std::string queue = dir.Write("q", Create("/v/s/a") + Line(kEventCrash, "/v/s") +
-                                               "not even json\n" + Create("/v/s/b"));
+  const std::string queue = dir.Write(
+      "q", Create("/v/s/a") + Line(kEventCrash, "/v/s") + "not even json\n" + Create("/v/s/b"));
   OPTree tree(queue);
   EXPECT_TRUE(tree.crashed);
   std::vector<std::string> out;
@@ -207,8 +253,8 @@ TEST(OPTreeTest, EmptyAndCancelledQueues) {
   EXPECT_THAT(Drain("", &count), IsEmpty());
   EXPECT_EQ(count, 0u);
   EXPECT_THAT(Drain(Line(kEventCreate | kEventAttrib, "/v/f", ",\"is_dir\":false") +
-                      Line(kEventCreate | kEventModify, "/v/g", ",\"is_dir\":false"),
-                  &count),
+                        Line(kEventCreate | kEventModify, "/v/g", ",\"is_dir\":false"),
+                    &count),
               IsEmpty());
   EXPECT_EQ(count, 2u);
   // The last line needs no newline.
@@ -257,10 +303,12 @@ TEST(OPTreeTest, BadLinesAreLoggedAndSkipped) {
   }
   EXPECT_TRUE(found);
   EXPECT_TRUE(log.Contains("Failed [!data.fromString(event_raw)], reason: Orvane error, code=906"));
-  EXPECT_TRUE(log.Contains("code=9999, reason=Orvane error, code=9999, reason=[GetNodeByPath "
-                           "failed, path=/v//a]"));
-  EXPECT_TRUE(log.Contains("code=120, reason=Orvane error, code=120, reason=[Missing property: "
-                           "path, data={\"event\":2}]"));
+  EXPECT_TRUE(
+      log.Contains("code=9999, reason=Orvane error, code=9999, reason=[GetNodeByPath "
+                   "failed, path=/v//a]"));
+  EXPECT_TRUE(
+      log.Contains("code=120, reason=Orvane error, code=120, reason=[Missing property: "
+                   "path, data={\"event\":2}]"));
 }
 
 TEST(OPTreeTest, DebugLevelLogsEveryLine) {
@@ -306,8 +354,8 @@ TEST(OPNodeTest, ChildrenPathsAndPrinting) {
   dump << v;
   EXPECT_THAT(dump.str(), HasSubstr("Node[/volume1]"));
   // An operation whose node is gone prints its kind (and rename source) only.
-  auto orphan = std::make_shared<OP>(std::make_shared<OPNode>(nullptr, "x"), kOPRename, "/o",
-                                     Json::Value());
+  auto orphan =
+      std::make_shared<OP>(std::make_shared<OPNode>(nullptr, "x"), kOPRename, "/o", Json::Value());
   EXPECT_EQ(Str(orphan), "[05] /o -> ");
 }
 

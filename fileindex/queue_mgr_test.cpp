@@ -74,21 +74,31 @@ TEST_F(QueueMgrTest, LeftoverSideFileGoesFirstAndLiveQueueWaits) {
   EXPECT_TRUE(IsFileExist(queue_));
 }
 
+// An unprivileged daemon meeting a folder it may read but not change.
 TEST_F(QueueMgrTest, RenameFailureIs502AndLeavesTheQueue) {
-  if (geteuid() == 0) GTEST_SKIP() << "root may rename inside a read-only folder";
+  const std::string folder = dir_.Path("share/@eaDir/@fileindex");
   dir_.Write("share/@eaDir/@fileindex/queue", Line(2, "/v/s/a"));
-  chmod(dir_.Path("share/@eaDir/@fileindex").c_str(), 0555);
-  test::LogCapture log;
-  QueueMgr mgr(queue_);
-  try {
-    mgr.PrepareTmpQueue();
-    FAIL();
-  } catch (const Error& e) {
-    EXPECT_STREQ(e.what(), "Orvane error, code=502, reason=[rename failed, reason=Permission denied]");
-  }
-  EXPECT_TRUE(log.Contains("Failed [0 > rename(queue_path_.c_str(), queue_path_tmp_.c_str())]"));
-  chmod(dir_.Path("share/@eaDir/@fileindex").c_str(), 0755);
+  ASSERT_EQ(chmod(dir_.path().c_str(), 0755), 0);
+  ASSERT_EQ(chmod(folder.c_str(), 0555), 0);
+  const int result = test::RunAsUser("nobody", [this] {
+    test::LogCapture log;
+    QueueMgr mgr(queue_);
+    try {
+      mgr.PrepareTmpQueue();
+      return 1;
+    } catch (const Error& e) {
+      if (std::string(e.what()) !=
+          "Orvane error, code=502, reason=[rename failed, reason=Permission denied]") {
+        return 2;
+      }
+    }
+    return log.Contains("Failed [0 > rename(queue_path_.c_str(), queue_path_tmp_.c_str())]") ? 0
+                                                                                             : 3;
+  });
+  chmod(folder.c_str(), 0755);
+  EXPECT_EQ(result, 0);
   EXPECT_TRUE(IsFileExist(queue_));
+  EXPECT_FALSE(IsFileExist(queue_ + ".tmp"));
 }
 
 TEST_F(QueueMgrTest, RenameWaitsForTheWritersLock) {
@@ -103,12 +113,29 @@ TEST_F(QueueMgrTest, RenameWaitsForTheWritersLock) {
 }
 
 TEST_F(QueueMgrTest, UnreadableQueueIs502) {
-  if (geteuid() == 0) GTEST_SKIP() << "root reads any file";
   dir_.Write("share/@eaDir/@fileindex/queue.tmp", Line(2, "/v/s/a"));
-  chmod((queue_ + ".tmp").c_str(), 0);
-  QueueMgr mgr(queue_);
-  EXPECT_THROW(Paths(mgr, true), Error);
-  EXPECT_THROW(mgr.IsFullPathProcessing("/v/s/a"), Error);
+  ASSERT_EQ(chmod(dir_.path().c_str(), 0755), 0);
+  ASSERT_EQ(chmod((queue_ + ".tmp").c_str(), 0), 0);
+  const int result = test::RunAsUser("nobody", [this] {
+    test::LogCapture log;
+    const std::string expected =
+        "Orvane error, code=502, reason=[Failed to open queue, reason=Permission denied]";
+    QueueMgr mgr(queue_);
+    try {
+      mgr.ProcessOP([](std::shared_ptr<OP>) {}, true);
+      return 1;
+    } catch (const Error& e) {
+      if (e.what() != expected) return 2;
+    }
+    try {
+      mgr.IsFullPathProcessing("/v/s/a");
+      return 3;
+    } catch (const Error& e) {
+      if (e.what() != expected) return 4;
+    }
+    return log.Count("Failed [!input_stream]") == 2 ? 0 : 5;
+  });
+  EXPECT_EQ(result, 0);
 }
 
 TEST_F(QueueMgrTest, PendingPathQuestions) {
