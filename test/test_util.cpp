@@ -6,6 +6,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <fstream>
 #include <sstream>
@@ -44,6 +45,19 @@ std::string ReadFile(const std::string& path) {
   std::ostringstream out;
   out << in.rdbuf();
   return out.str();
+}
+
+std::string WritePlatformConfig(const std::string& root, const std::string& json_text) {
+  const std::string path = root + "/etc/orvane/platform.json";
+  MakeParentDirs(path);
+  // Written beside and renamed, so a reader never sees half a file and the inode changes.
+  const std::string tmp = path + ".tmp";
+  {
+    std::ofstream out(tmp, std::ios::binary | std::ios::trunc);
+    out << json_text;
+  }
+  if (rename(tmp.c_str(), path.c_str()) != 0) throw std::runtime_error("rename failed: " + path);
+  return path;
 }
 
 LogCapture::LogCapture()

@@ -37,6 +37,10 @@ class TempDir {
 // Reads a whole file; "" when it cannot be read.
 std::string ReadFile(const std::string& path);
 
+// Writes the platform configuration (shares, administrators group, ...) that the platform layer
+// reads under `root` (the test's ORVANE_ROOT): `root`/etc/orvane/platform.json. Returns its path.
+std::string WritePlatformConfig(const std::string& root, const std::string& json_text);
+
 // Captures every log line for its lifetime instead of sending it to syslog.
 class LogCapture {
  public:
