@@ -1,11 +1,15 @@
 #include "fileindex/queue_file.hpp"
 
 #include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+
+#include "common/root.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -58,6 +62,39 @@ bool QueueFileReader::ReadLine(std::string* line, size_t max_length) {
     }
     begin_ = end_;
     if (!Fill()) return any;
+  }
+}
+
+bool QueueFileAppend(const std::string& queue_path, const std::string& lines) {
+  MakeParentDirs(queue_path);
+  for (;;) {
+    UniqueFd fd(open(queue_path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644));
+    if (!fd.valid()) return false;
+    int rc;
+    while ((rc = flock(fd.get(), LOCK_EX)) != 0 && errno == EINTR) {
+    }
+    if (rc != 0) return false;
+    struct stat locked;
+    struct stat current;
+    if (fstat(fd.get(), &locked) != 0) return false;
+    if (stat(queue_path.c_str(), &current) != 0 || locked.st_ino != current.st_ino ||
+        locked.st_dev != current.st_dev) {
+      continue;  // renamed away under us: the next open creates the fresh live queue
+    }
+    size_t done = 0;
+    while (done < lines.size()) {
+      const ssize_t n = write(fd.get(), lines.data() + done, lines.size() - done);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) {
+        // Whatever part of a line got out would run into the next line: cut it off.
+        const int failure = errno;
+        if (done > 0) (void)!ftruncate(fd.get(), locked.st_size);
+        errno = failure;
+        return false;
+      }
+      done += static_cast<size_t>(n);
+    }
+    return true;
   }
 }
 

@@ -1,6 +1,6 @@
-// QueueFileReader reads a queue file line by line through its own buffer, with one bounded
-// line length so a corrupt file cannot make a line cost unbounded memory. Owns its descriptor;
-// not thread-safe.
+// Both ends of a queue file. QueueFileReader reads it line by line through its own buffer, with
+// one bounded line length so a corrupt file cannot make a line cost unbounded memory; it owns its
+// descriptor and is not thread-safe. QueueFileAppend is the writers' side.
 #ifndef ORVANE_FILEINDEX_QUEUE_FILE_HPP_
 #define ORVANE_FILEINDEX_QUEUE_FILE_HPP_
 
@@ -35,6 +35,13 @@ class QueueFileReader {
   size_t end_ = 0;
   bool eof_ = false;
 };
+
+// Appends `lines` (whole lines, each ending in "\n") to the queue at `queue_path` in one write,
+// creating the file and its folder if missing. It holds the queue's lock while writing, and
+// checks that the file it locked is still the live queue: the reader may have just renamed it to
+// the side file, and a line written there would miss the batch already being read. False (errno
+// set) when the queue cannot be opened, locked or written.
+bool QueueFileAppend(const std::string& queue_path, const std::string& lines);
 
 }  // namespace fileindex
 }  // namespace orvane
