@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <cstdint>
+#include <cstdlib>
 #include <random>
 #include <string>
 
@@ -55,8 +56,11 @@ std::string RandomQueue(std::mt19937& rng) {
 TEST(OPTreeFuzzTest, SeededRandomQueuesKeepTheTreeConsistent) {
   // The libFuzzer target runs the same entry point for as long as one likes; this is the short
   // run that every test pass makes.
+  // FILEINDEX_FUZZ_RUNS asks for a longer run.
+  const char* runs_env = std::getenv("FILEINDEX_FUZZ_RUNS");
+  const long runs = runs_env != nullptr ? std::atol(runs_env) : 20000;
   std::mt19937 rng(20261122);
-  for (int i = 0; i < 20000; ++i) {
+  for (long i = 0; i < runs; ++i) {
     const std::string text = RandomQueue(rng);
     LLVMFuzzerTestOneInput(reinterpret_cast<const uint8_t*>(text.data()), text.size());
   }
