@@ -145,6 +145,8 @@ struct Cache {
   std::shared_ptr<const PlatformConfig> config;
 };
 
+thread_local std::shared_ptr<const PlatformConfig> t_pinned;
+
 Cache& GetCache() {
   static Cache* cache = new Cache();  // outlives every static destructor that may still log
   return *cache;
@@ -248,6 +250,7 @@ std::shared_ptr<const PlatformConfig> LoadPlatformConfig() {
 }
 
 std::shared_ptr<const PlatformConfig> ConfigForCall() {
+  if (t_pinned) return t_pinned;
   try {
     return LoadPlatformConfig();
   } catch (const Error& e) {
@@ -257,6 +260,17 @@ std::shared_ptr<const PlatformConfig> ConfigForCall() {
     return nullptr;
   }
 }
+
+ScopedConfigSnapshot::ScopedConfigSnapshot() : previous_(t_pinned) {
+  if (t_pinned) return;
+  try {
+    t_pinned = LoadPlatformConfig();
+  } catch (const Error&) {
+    // Nothing pinned: each call meets the fault itself and reports it the platform way.
+  }
+}
+
+ScopedConfigSnapshot::~ScopedConfigSnapshot() { t_pinned = previous_; }
 
 }  // namespace platform
 }  // namespace orvane

@@ -66,6 +66,21 @@ std::shared_ptr<const PlatformConfig> ParsePlatformConfig(const std::string& tex
 // and the result is null.
 std::shared_ptr<const PlatformConfig> ConfigForCall();
 
+// Pins one view of the configuration for the platform calls that this thread makes during the
+// scope, so that a judgement made of several calls sees one consistent configuration and the file
+// is checked for changes once rather than on every call. Scopes nest; an unusable file pins
+// nothing (each call then reports it as usual). Not copyable.
+class ScopedConfigSnapshot {
+ public:
+  ScopedConfigSnapshot();
+  ~ScopedConfigSnapshot();
+  ScopedConfigSnapshot(const ScopedConfigSnapshot&) = delete;
+  ScopedConfigSnapshot& operator=(const ScopedConfigSnapshot&) = delete;
+
+ private:
+  std::shared_ptr<const PlatformConfig> previous_;
+};
+
 }  // namespace platform
 }  // namespace orvane
 

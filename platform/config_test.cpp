@@ -143,6 +143,31 @@ TEST(PlatformConfigTest, PlatformCallsReportAnUnusableFileAsAConfigurationError)
   EXPECT_EQ(QUIXShareNamePathGet("/a/x", name, sizeof(name), path, sizeof(path)), -1);
 }
 
+TEST(PlatformConfigTest, ASnapshotScopeSeesOneConfigurationAndChecksTheFileOnce) {
+  test::TempDir root;
+  test::ScopedRoot scoped(root.path());
+  test::WritePlatformConfig(root.path(), R"({"shares": [{"name": "a", "path": "/v/a"}]})");
+  PQUIXSHARE share = nullptr;
+  {
+    ScopedConfigSnapshot snapshot;
+    test::WritePlatformConfig(root.path(), R"({"shares": [{"name": "b", "path": "/v/b"}]})");
+    {
+      ScopedConfigSnapshot nested;
+      EXPECT_EQ(QUIXShareGet("a", &share), 0);
+      QUIXShareFree(share);
+    }
+    EXPECT_EQ(QUIXShareGet("b", &share), -1);
+  }
+  EXPECT_EQ(QUIXShareGet("b", &share), 0);
+  QUIXShareFree(share);
+
+  // An unusable file pins nothing; calls report it themselves.
+  test::WritePlatformConfig(root.path(), "{");
+  ScopedConfigSnapshot snapshot;
+  EXPECT_EQ(QUIXShareGet("b", &share), -1);
+  EXPECT_EQ(QLIBCErrGet(), kQErrConfig);
+}
+
 }  // namespace
 }  // namespace platform
 }  // namespace orvane

@@ -293,6 +293,12 @@ int QUIXFileCopy(const char* src, const char* dst, const QUIXCOPYARGS* args) {
   if (fstat(in.get(), &st) != 0) return PLATFORM_FAIL(-1, errno, kQErrSystem);
   if (!S_ISREG(st.st_mode)) return PLATFORM_FAIL(-1, S_ISDIR(st.st_mode) ? EISDIR : EINVAL, kQErrBadParam);
 
+  // Only a regular file is ever replaced: a device, folder or pipe in the destination's place
+  // is refused rather than swapped for a file.
+  struct stat dst_st;
+  if (lstat(dst, &dst_st) == 0 && !S_ISREG(dst_st.st_mode) && !S_ISLNK(dst_st.st_mode)) {
+    return PLATFORM_FAIL(-1, EEXIST, kQErrBadParam);
+  }
   // The copy is built beside the destination and renamed over it, so a reader never sees half
   // a file and a failure leaves the old destination as it was.
   std::string tmp = std::string(dst) + ".XXXXXX";
