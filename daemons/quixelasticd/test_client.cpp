@@ -17,7 +17,7 @@
 
 namespace orvane {
 namespace elasticd {
-namespace test {
+namespace tc {
 
 std::string Frame(const std::string& payload) {
   const uint32_t n = static_cast<uint32_t>(payload.size());
@@ -166,6 +166,6 @@ Json::Value FileMappings() {
   return m;
 }
 
-}  // namespace test
+}  // namespace tc
 }  // namespace elasticd
 }  // namespace orvane

@@ -12,7 +12,7 @@
 
 namespace orvane {
 namespace elasticd {
-namespace test {
+namespace tc {
 
 // Sends raw bytes to the socket and returns the raw reply payload ("" when the daemon closed
 // the connection without a reply). `as_uid` other than -1 runs the exchange in a child process
@@ -50,7 +50,7 @@ Json::Value Cmd(const std::string& command, const Json::Value& data);
 // The schema the library sends at index creation, reduced to the fields the tests use.
 Json::Value FileMappings();
 
-}  // namespace test
+}  // namespace tc
 }  // namespace elasticd
 }  // namespace orvane
 
