@@ -506,13 +506,17 @@ Json::Value Engine::RunCompound(const Json::Value& list, const Caller& caller) {
 
 Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data,
                              const Caller& caller, Session& session) {
-  // Lifecycle commands and commit work outside any batch transaction.
-  auto lifecycle = [&]() { session.FinishQuietly(); };
-  if (command == "index_create") return lifecycle(), IndexCreate(data);
-  if (command == "index_delete") return lifecycle(), IndexDelete(data);
-  if (command == "index_pause") return lifecycle(), IndexPause(data, true);
-  if (command == "index_resume") return lifecycle(), IndexPause(data, false);
-  if (command == "index_config_set") return lifecycle(), IndexConfigSet(data);
+  const bool batched = command == "update_term_suggestion" || command == "document_upsert_by_id" ||
+                       command == "document_set_by_id" || command == "document_del_by_id" ||
+                       command == "document_del_by_query" || command == "document_get_by_query";
+  // Every other command works outside the batch's transaction: it needs the index locks the
+  // batch may hold, or (searches) it reads committed data, which then includes the batch's.
+  if (!batched && command != "commit") session.FinishQuietly();
+  if (command == "index_create") return IndexCreate(data);
+  if (command == "index_delete") return IndexDelete(data);
+  if (command == "index_pause") return IndexPause(data, true);
+  if (command == "index_resume") return IndexPause(data, false);
+  if (command == "index_config_set") return IndexConfigSet(data);
   if (command == "index_list") return IndexList();
   if (command == "commit") return Commit(data, session);
   if (command == "list_term_sugg_db") return ListTermSuggDb();
@@ -532,10 +536,7 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
     sp.Release();
     return result;
   }
-  const bool known = command == "document_upsert_by_id" || command == "document_set_by_id" ||
-                     command == "document_del_by_id" || command == "document_del_by_query" ||
-                     command == "document_get_by_query";
-  if (!known) throw EngineError(kCodeUnknownCommand, "unknown command: " + command);
+  if (!batched) throw EngineError(kCodeUnknownCommand, "unknown command: " + command);
   const std::string id = RequireString(data, "id");
   IndexStore& store = session.Acquire(id);
   Savepoint sp(store.writer());
@@ -580,9 +581,21 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
   return result;
 }
 
+void Engine::CheckIndexPath(const std::string& path) const {
+  if ((path + "/").find("/../") != std::string::npos || (path + "/").find("/./") != std::string::npos) {
+    throw EngineError(kCodeInvalidParam, "index path must not hold . or .. components: " + path);
+  }
+  if (options_.index_root.empty()) return;
+  const std::string root = NormalizeDir(options_.index_root);
+  if (path.compare(0, root.size() + 1, root + "/") != 0) {
+    throw EngineError(kCodeInvalidParam, "index path must lie below " + root + ": " + path);
+  }
+}
+
 Json::Value Engine::IndexCreate(const Json::Value& data) {
   const std::string id = RequireString(data, "id");
   const std::string path = RequirePath(data, "path");
+  CheckIndexPath(path);
   const Json::Value& mappings = data["mappings"];
   if (!mappings.isObject()) throw EngineError(kCodeInvalidParam, "\"mappings\" must be an object");
   Schema::Parse(mappings);
@@ -691,6 +704,7 @@ Json::Value Engine::IndexConfigSet(const Json::Value& data) {
   if (!change.isObject()) throw EngineError(kCodeInvalidParam, "\"data\" must be an object");
   const std::string new_id = change.isMember("id") ? RequireString(change, "id") : id;
   const std::string new_path = change.isMember("path") ? RequirePath(change, "path") : "";
+  if (!new_path.empty()) CheckIndexPath(new_path);
   std::shared_ptr<Entry> e;
   {
     std::lock_guard<std::mutex> lock(registry_mu_);

@@ -41,6 +41,9 @@ struct EngineOptions {
   int max_write_backlog = 64;
   // Request bytes in flight plus the store's own memory beyond which requests are answered 1400.
   int64_t memory_limit_bytes = int64_t{1} << 30;
+  // When set, index folders must lie below it (a deployment that keeps every index database
+  // under one volume, and the fuzz harness).
+  std::string index_root;
   int64_t default_page_size = 1000;
   int64_t max_page_size = 10000;
 };
@@ -120,6 +123,7 @@ class Engine {
   Json::Value IndexList();
 
   std::shared_ptr<Entry> Find(const std::string& id);
+  void CheckIndexPath(const std::string& path) const;
   // Throws the code of a state other than ready.
   static void RequireReady(const Entry& e);
   // Marks an index damaged after its store reported corruption, and sets its files aside.

@@ -181,9 +181,17 @@ TEST_F(EngineTest, CompoundAnswersEachInOrderAndSeesItsOwnWrites) {
   EXPECT_THAT(HitPaths(Send(Query("prefix", "/v/share/"))),
               ::testing::ElementsAre("/v/share/a", "/v/share/b"));
 
-  Json::Value good;
-  good["compound"].append(Upsert("/v/share/c"));
-  EXPECT_EQ(Send(good)["has_fail"], false);
+  // Commands that need the index's lock, or read committed data, follow a batch's writes
+  // without waiting on the batch itself, and see them.
+  Json::Value mixed;
+  mixed["compound"].append(Upsert("/v/share/c"));
+  mixed["compound"].append(Cmd("list_term_sugg_db", Json::Value(Json::objectValue)));
+  mixed["compound"].append(Cmd("index_list", Json::Value(Json::objectValue)));
+  mixed["compound"].append(Upsert("/v/share/d"));
+  mixed["compound"].append(Obj(R"({"command":"search","data":{"name":"d"}})"));
+  const Json::Value m = Send(mixed);
+  EXPECT_EQ(m["has_fail"], false) << JsonToString(m);
+  EXPECT_EQ(m["data"][4]["data"]["total"], 1);
 }
 
 // The library's directory rename: one query per pass, then a batch of set_by_id requests that

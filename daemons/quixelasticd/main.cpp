@@ -30,7 +30,7 @@ const char kUsage[] =
     "usage: quixelasticd [--foreground] [--socket PATH] [--public-socket PATH|none]\n"
     "                    [--pid-file PATH] [--state-dir DIR] [--service-user NAME]\n"
     "                    [--max-frame-bytes N] [--memory-limit-mb N] [--max-write-backlog N]\n"
-    "                    [--max-connections N] [--io-timeout-s N]\n";
+    "                    [--max-connections N] [--io-timeout-s N] [--index-root DIR]\n";
 
 struct Flags {
   bool foreground = false;
@@ -39,6 +39,7 @@ struct Flags {
   std::string pid_file = "/var/run/quixelasticd.pid";
   std::string state_dir = "/var/lib/quixelasticd";
   std::string service_user = "fileindex";
+  std::string index_root;
   long long max_frame = 64LL << 20;
   long long memory_mb = 1024;
   long long backlog = 64;
@@ -76,6 +77,7 @@ bool ParseFlags(int argc, char** argv, Flags* f) {
     else if (arg == "--public-socket") ok = text(&f->public_socket);
     else if (arg == "--pid-file") ok = text(&f->pid_file);
     else if (arg == "--state-dir") ok = text(&f->state_dir);
+    else if (arg == "--index-root") ok = text(&f->index_root);
     else if (arg == "--service-user") ok = text(&f->service_user);
     else if (arg == "--max-frame-bytes") ok = number(16, &f->max_frame) && f->max_frame <= 0xFFFFFFFFLL;
     else if (arg == "--memory-limit-mb") ok = number(0, &f->memory_mb);
@@ -150,6 +152,7 @@ int main(int argc, char** argv) {
   engine_options.running_marker = state_dir + "/running";
   engine_options.memory_limit_bytes = flags.memory_mb << 20;
   engine_options.max_write_backlog = static_cast<int>(flags.backlog);
+  engine_options.index_root = flags.index_root;
   orvane::elasticd::ServerOptions server_options;
   server_options.socket_path = orvane::RootedPath(flags.socket);
   if (flags.public_socket != "none") {
