@@ -33,6 +33,18 @@ class DaemonTest : public ::testing::Test {
   void Launch(std::vector<std::string> args = {}) {
     daemon_ = std::make_unique<tc::DaemonProcess>(dir_.path(), std::move(args));
     ASSERT_TRUE(daemon_->WaitReady());
+    // After a restart the indexes open (and, after a crash, are checked) in the background;
+    // until then they answer 607 or 608, which the library waits out the same way.
+    for (int i = 0; i < 400; ++i) {
+      bool settled = true;
+      for (const Json::Value& index : Send(Cmd("index_list", Json::Value()))["data"]) {
+        const std::string state = index["state"].asString();
+        settled = settled && state != "opening" && state != "recovering";
+      }
+      if (settled) return;
+      std::this_thread::sleep_for(std::chrono::milliseconds(25));
+    }
+    FAIL() << "indexes did not open";
   }
   Json::Value Send(const Json::Value& req) { return Request(daemon_->socket(), req); }
   Json::Value CreateIndex() {
