@@ -5,6 +5,7 @@
 
 #include <cstdint>
 #include <deque>
+#include <functional>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -87,6 +88,11 @@ class FakeEnv : public Env {
   std::deque<int> rand_;
   Env* previous_;
 };
+
+// Runs `fn` in a child process as `user` (real and effective ids, no supplementary groups) and
+// returns what it returns, or -1 when the child could not switch or died. Unprivileged callers
+// cannot switch: `fn` then runs in a child as the caller, who is unprivileged already.
+int RunAsUser(const std::string& user, const std::function<int()>& fn);
 
 // Sets ORVANE_ROOT for its lifetime and restores the former value.
 class ScopedRoot {

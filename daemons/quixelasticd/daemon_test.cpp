@@ -1,0 +1,234 @@
+// The daemon binary itself, through its real sockets: framing, signals, crashes and the
+// identity of callers (root and nobody).
+#include <pwd.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+
+#include <cstring>
+#include <thread>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "common/json_util.hpp"
+#include "common/util.hpp"
+#include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/test_client.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace elasticd {
+namespace {
+
+using tc::Cmd;
+using tc::Request;
+
+const char kId[] = "fileindex_share";
+
+class DaemonTest : public ::testing::Test {
+ protected:
+  void SetUp() override { ::chmod(dir_.path().c_str(), 0755); }
+
+  void Launch(std::vector<std::string> args = {}) {
+    daemon_ = std::make_unique<tc::DaemonProcess>(dir_.path(), std::move(args));
+    ASSERT_TRUE(daemon_->WaitReady());
+    // After a restart the indexes open (and, after a crash, are checked) in the background;
+    // until then they answer 607 or 608, which the library waits out the same way.
+    for (int i = 0; i < 400; ++i) {
+      bool settled = true;
+      for (const Json::Value& index : Send(Cmd("index_list", Json::Value()))["data"]) {
+        const std::string state = index["state"].asString();
+        settled = settled && state != "opening" && state != "recovering";
+      }
+      if (settled) return;
+      std::this_thread::sleep_for(std::chrono::milliseconds(25));
+    }
+    FAIL() << "indexes did not open";
+  }
+  Json::Value Send(const Json::Value& req) { return Request(daemon_->socket(), req); }
+  Json::Value CreateIndex() {
+    Json::Value data;
+    data["id"] = kId;
+    data["path"] = dir_.Path("db");
+    data["mappings"] = tc::FileMappings();
+    return Send(Cmd("index_create", data));
+  }
+  static Json::Value FileDoc(const std::string& path) {
+    const size_t slash = path.find_last_of('/');
+    Json::Value d;
+    d["QUIXMDPath"] = path;
+    d["QUIXMDFSName"] = path.substr(slash + 1);
+    d["QUIXMDParent"] = path.substr(0, slash);
+    d["QUIXMDSearchFileName"] = path.substr(slash + 1);
+    d["QUIXMDSearchAncestor"] = path.substr(0, slash);
+    return d;
+  }
+  static Json::Value Batch(const std::string& dir, int first, int count) {
+    Json::Value req;
+    req["compound"] = Json::Value(Json::arrayValue);
+    for (int i = first; i < first + count; ++i) {
+      const std::string path = dir + "/file" + std::to_string(i) + ".txt";
+      Json::Value data;
+      data["id"] = kId;
+      data["doc_id"] = path;
+      data["data"] = FileDoc(path);
+      req["compound"].append(Cmd("document_upsert_by_id", data));
+    }
+    return req;
+  }
+  int64_t Count(const std::string& prefix) {
+    Json::Value data;
+    data["id"] = kId;
+    data["query"]["qsl"]["prefix"]["QUIXMDPath"] = prefix;
+    data["query"]["size"] = 10000;
+    return static_cast<int64_t>(Send(Cmd("document_get_by_query", data))["data"].size());
+  }
+  Json::Value IdOnly(const std::string& command) {
+    Json::Value data;
+    data["id"] = kId;
+    return Send(Cmd(command, data));
+  }
+
+  orvane::test::TempDir dir_;
+  std::unique_ptr<tc::DaemonProcess> daemon_;
+};
+
+TEST_F(DaemonTest, FramesOfEveryShapeGetAReplyOrAClose) {
+  Launch({"--max-frame-bytes", "4096"});
+  // A well-formed request; the reply is one frame whose payload is the JSON text and a NUL.
+  const std::string raw = tc::RawExchange(
+      daemon_->socket(), tc::Frame(std::string("{\"command\":\"index_list\",\"data\":{}}") + '\0'));
+  ASSERT_FALSE(raw.empty());
+  EXPECT_EQ(raw.back(), '\0');
+  // No trailing NUL is fine too.
+  EXPECT_EQ(Request(daemon_->socket(), Cmd("index_list", Json::Value()))["success"], true);
+
+  auto code_of = [](const std::string& payload) {
+    JsonValue v;
+    std::string text = payload;
+    while (!text.empty() && text.back() == '\0') text.pop_back();
+    return v.fromString(text) ? v["error"]["code"].asInt() : -1;
+  };
+  EXPECT_EQ(code_of(tc::RawExchange(daemon_->socket(), tc::Frame(""))), kCodeMalformed);
+  EXPECT_EQ(code_of(tc::RawExchange(daemon_->socket(), tc::Frame(std::string(5000, ' ')))),
+            kCodeTooLarge);
+  // A frame cut short, or only part of a length: the connection is closed without a reply.
+  EXPECT_EQ(tc::RawExchange(daemon_->socket(), tc::Frame("{\"command\"").substr(0, 9)), "");
+  EXPECT_EQ(tc::RawExchange(daemon_->socket(), std::string("\x10\x00", 2)), "");
+  EXPECT_EQ(tc::RawExchange(daemon_->socket(), ""), "");
+
+  // Many connections at once, each its own request.
+  ASSERT_EQ(CreateIndex()["success"], true);
+  std::vector<std::thread> threads;
+  std::atomic<int> ok{0};
+  for (int t = 0; t < 8; ++t) {
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < 5; ++i) {
+        if (Send(Batch("/v/share/t" + std::to_string(t), i * 3, 3))["has_fail"] == false) ++ok;
+      }
+    });
+  }
+  for (std::thread& t : threads) t.join();
+  EXPECT_EQ(ok.load(), 40);
+  EXPECT_EQ(Count("/v/share/"), 120);
+}
+
+TEST_F(DaemonTest, SigtermStopsCleanly) {
+  Launch();
+  ASSERT_EQ(CreateIndex()["success"], true);
+  ASSERT_EQ(Send(Batch("/v/share", 0, 10))["has_fail"], false);
+  EXPECT_TRUE(IsFileExist(dir_.Path("var/run/quixelasticd.pid")));
+  const int status = daemon_->Signal(SIGTERM);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+  EXPECT_FALSE(IsFileExist(dir_.Path("var/run/quixelasticd.pid")));
+  EXPECT_FALSE(IsFileExist(dir_.Path("var/run/quixelasticd.sock")));
+  EXPECT_FALSE(IsFileExist(dir_.Path("var/lib/quixelasticd/running")));
+  Launch();
+  EXPECT_EQ(Count("/v/share/"), 10);
+}
+
+TEST_F(DaemonTest, KillNineLosesNothingCommittedAndNoBatchHalfWay) {
+  Launch();
+  ASSERT_EQ(CreateIndex()["success"], true);
+  ASSERT_EQ(Send(Batch("/v/share/kept", 0, 500))["has_fail"], false);
+  ASSERT_EQ(IdOnly("commit")["success"], true);
+  daemon_->Signal(SIGKILL);
+  Launch();
+  EXPECT_EQ(Count("/v/share/kept/"), 500);
+
+  // Killed while a large batch is being written: after the restart the batch is either wholly
+  // there or wholly absent, and the index passed its check.
+  const Json::Value big = Batch("/v/share/big", 0, 8000);
+  std::thread writer([&] { Request(daemon_->socket(), big); });
+  std::this_thread::sleep_for(std::chrono::milliseconds(300));
+  daemon_->Signal(SIGKILL);
+  writer.join();
+  Launch();
+  const int64_t big_count = Count("/v/share/big/");
+  RecordProperty("big_count", static_cast<int>(big_count));
+  EXPECT_TRUE(big_count == 0 || big_count == 8000) << big_count;
+  EXPECT_EQ(Count("/v/share/kept/"), 500);
+  const Json::Value list = Send(Cmd("index_list", Json::Value()));
+  EXPECT_EQ(list["data"][0]["state"], "ready") << JsonToString(list);
+}
+
+TEST_F(DaemonTest, OrdinaryUsersOnlySearchAndOnlySeeWhatTheyCanOpen) {
+  struct passwd* nobody = ::getpwnam("nobody");
+  ASSERT_NE(nobody, nullptr);
+  const uid_t uid = nobody->pw_uid;
+  const gid_t gid = nobody->pw_gid;
+  // Real files: one readable, one unreadable, one in a folder nobody cannot enter.
+  const std::string open_file = dir_.Write("share/pub/report open.txt", "x");
+  const std::string closed_file = dir_.Write("share/pub/report closed.txt", "x");
+  const std::string hidden_file = dir_.Write("share/priv/report hidden.txt", "x");
+  ::chmod(dir_.Path("share").c_str(), 0755);
+  ::chmod(dir_.Path("share/pub").c_str(), 0755);
+  ::chmod(open_file.c_str(), 0644);
+  ::chmod(closed_file.c_str(), 0600);
+  ::chmod(dir_.Path("share/priv").c_str(), 0700);
+  ::chmod(hidden_file.c_str(), 0644);
+
+  Launch();
+  ASSERT_EQ(CreateIndex()["success"], true);
+  Json::Value batch;
+  for (const std::string& p : {open_file, closed_file, hidden_file}) {
+    Json::Value data;
+    data["id"] = kId;
+    data["doc_id"] = p;
+    data["data"] = FileDoc(p);
+    batch["compound"].append(Cmd("document_upsert_by_id", data));
+  }
+  ASSERT_EQ(Send(batch)["has_fail"], false);
+
+  // The main socket is closed to ordinary users; the public one takes searches only.
+  const Json::Value denied = tc::RequestAs(daemon_->socket(), Cmd("index_list", Json::Value()),
+                                           uid, gid);
+  EXPECT_TRUE(denied.isNull()) << JsonToString(denied);
+  const Json::Value upsert = tc::RequestAs(daemon_->public_socket(), batch, uid, gid);
+  EXPECT_EQ(upsert["data"][0]["error"]["code"], kCodePermissionDenied) << JsonToString(upsert);
+
+  Json::Value search;
+  search["command"] = "search";
+  search["data"]["name"] = "report";
+  const Json::Value mine = tc::RequestAs(daemon_->public_socket(), search, uid, gid);
+  ASSERT_EQ(mine["success"], true) << JsonToString(mine);
+  EXPECT_EQ(mine["data"]["total"], 1);
+  EXPECT_EQ(mine["data"]["hits"][0]["path"], open_file);
+  EXPECT_EQ(Send(search)["data"]["total"], 3);  // root sees everything
+
+  Json::Value suggest;
+  suggest["command"] = "suggest";
+  suggest["data"]["prefix"] = "o";
+  EXPECT_EQ(JsonToString(tc::RequestAs(daemon_->public_socket(), suggest, uid, gid)["data"]),
+            "{\"suggestions\":[\"open\"]}");
+  suggest["data"]["prefix"] = "hid";
+  EXPECT_EQ(tc::RequestAs(daemon_->public_socket(), suggest, uid, gid)["data"]["suggestions"].size(),
+            0u);
+  EXPECT_EQ(Send(suggest)["data"]["suggestions"].size(), 1u);
+}
+
+}  // namespace
+}  // namespace elasticd
+}  // namespace orvane

@@ -1,0 +1,197 @@
+// quixelasticd: the search-engine daemon. Serves "/var/run/quixelasticd.sock" (under
+// ORVANE_ROOT) until SIGTERM or SIGINT; see README.md for the commands and options.
+#include <fcntl.h>
+#include <grp.h>
+#include <pwd.h>
+#include <signal.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <iostream>
+#include <string>
+
+#include "common/error.hpp"
+#include "common/fd.hpp"
+#include "common/log.hpp"
+#include "common/root.hpp"
+#include "daemons/quixelasticd/engine.hpp"
+#include "daemons/quixelasticd/server.hpp"
+
+namespace {
+
+using orvane::Log;
+using orvane::SourceName;
+
+const char kUsage[] =
+    "usage: quixelasticd [--foreground] [--socket PATH] [--public-socket PATH|none]\n"
+    "                    [--pid-file PATH] [--state-dir DIR] [--service-user NAME]\n"
+    "                    [--max-frame-bytes N] [--memory-limit-mb N] [--max-write-backlog N]\n"
+    "                    [--max-connections N] [--io-timeout-s N] [--index-root DIR]\n";
+
+struct Flags {
+  bool foreground = false;
+  std::string socket = "/var/run/quixelasticd.sock";
+  std::string public_socket = "/var/run/quixelasticd.search.sock";
+  std::string pid_file = "/var/run/quixelasticd.pid";
+  std::string state_dir = "/var/lib/quixelasticd";
+  std::string service_user = "fileindex";
+  std::string index_root;
+  long long max_frame = 64LL << 20;
+  long long memory_mb = 1024;
+  long long backlog = 64;
+  long long connections = 256;
+  long long io_timeout_s = 30;
+};
+
+bool ParseNumber(const char* text, long long min, long long* out) {
+  char* end = nullptr;
+  errno = 0;
+  const long long v = std::strtoll(text, &end, 10);
+  if (errno != 0 || end == text || *end != '\0' || v < min) return false;
+  *out = v;
+  return true;
+}
+
+bool ParseFlags(int argc, char** argv, Flags* f) {
+  for (int i = 1; i < argc; ++i) {
+    const std::string arg = argv[i];
+    const char* next = i + 1 < argc ? argv[i + 1] : nullptr;
+    auto text = [&](std::string* out) {
+      if (next == nullptr) return false;
+      *out = next;
+      ++i;
+      return true;
+    };
+    auto number = [&](long long min, long long* out) {
+      if (next == nullptr || !ParseNumber(next, min, out)) return false;
+      ++i;
+      return true;
+    };
+    bool ok = true;
+    if (arg == "--foreground") f->foreground = true;
+    else if (arg == "--socket") ok = text(&f->socket);
+    else if (arg == "--public-socket") ok = text(&f->public_socket);
+    else if (arg == "--pid-file") ok = text(&f->pid_file);
+    else if (arg == "--state-dir") ok = text(&f->state_dir);
+    else if (arg == "--index-root") ok = text(&f->index_root);
+    else if (arg == "--service-user") ok = text(&f->service_user);
+    else if (arg == "--max-frame-bytes") ok = number(16, &f->max_frame) && f->max_frame <= 0xFFFFFFFFLL;
+    else if (arg == "--memory-limit-mb") ok = number(0, &f->memory_mb);
+    else if (arg == "--max-write-backlog") ok = number(0, &f->backlog);
+    else if (arg == "--max-connections") ok = number(1, &f->connections);
+    else if (arg == "--io-timeout-s") ok = number(1, &f->io_timeout_s);
+    else ok = false;
+    if (!ok) {
+      std::cerr << "quixelasticd: bad or incomplete option " << arg << "\n" << kUsage;
+      return false;
+    }
+  }
+  return true;
+}
+
+// Detaches from the terminal; the parent returns only after the child is on its own.
+void Daemonize() {
+  const pid_t pid = ::fork();
+  if (pid < 0) {
+    std::perror("quixelasticd: fork");
+    std::exit(1);
+  }
+  if (pid > 0) std::_Exit(0);
+  ::setsid();
+  if (::chdir("/") != 0) std::_Exit(1);
+  const int null = ::open("/dev/null", O_RDWR);
+  if (null >= 0) {
+    ::dup2(null, 0);
+    ::dup2(null, 1);
+    ::dup2(null, 2);
+    if (null > 2) ::close(null);
+  }
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Flags flags;
+  if (!ParseFlags(argc, argv, &flags)) return 2;
+  if (!flags.foreground) Daemonize();
+  orvane::SetLogSink(orvane::SyslogSink(flags.foreground));
+  ::openlog("quixelasticd", LOG_PID, LOG_DAEMON);
+
+  // Signals are taken by sigwait in this thread only; every thread started later inherits the
+  // mask, so none of them is interrupted by SIGTERM.
+  sigset_t stop_signals;
+  sigemptyset(&stop_signals);
+  sigaddset(&stop_signals, SIGTERM);
+  sigaddset(&stop_signals, SIGINT);
+  pthread_sigmask(SIG_BLOCK, &stop_signals, nullptr);
+  ::signal(SIGPIPE, SIG_IGN);
+
+  const std::string pid_path = orvane::RootedPathForWrite(flags.pid_file);
+  orvane::UniqueFd pid_fd(::open(pid_path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+  if (!pid_fd.valid() || ::flock(pid_fd.get(), LOCK_EX | LOCK_NB) != 0) {
+    Log(LOG_ERR, "%s:%d cannot lock the pid file %s (is another daemon running?) [err: %m]",
+        SourceName(__FILE__), __LINE__, pid_path.c_str());
+    return 1;
+  }
+  const std::string pid_text = std::to_string(::getpid()) + "\n";
+  if (::ftruncate(pid_fd.get(), 0) != 0 ||
+      ::pwrite(pid_fd.get(), pid_text.data(), pid_text.size(), 0) !=
+          static_cast<ssize_t>(pid_text.size())) {
+    Log(LOG_ERR, "%s:%d cannot write the pid file %s [err: %m]", SourceName(__FILE__), __LINE__,
+        pid_path.c_str());
+    return 1;
+  }
+
+  orvane::elasticd::EngineOptions engine_options;
+  const std::string state_dir = orvane::RootedPath(flags.state_dir);
+  engine_options.registry_file = state_dir + "/indexes.json";
+  engine_options.running_marker = state_dir + "/running";
+  engine_options.memory_limit_bytes = flags.memory_mb << 20;
+  engine_options.max_write_backlog = static_cast<int>(flags.backlog);
+  engine_options.index_root = flags.index_root;
+  orvane::elasticd::ServerOptions server_options;
+  server_options.socket_path = orvane::RootedPath(flags.socket);
+  if (flags.public_socket != "none") {
+    server_options.public_socket_path = orvane::RootedPath(flags.public_socket);
+  }
+  server_options.max_frame_bytes = static_cast<uint32_t>(flags.max_frame);
+  server_options.max_connections = static_cast<int>(flags.connections);
+  server_options.io_timeout_micros = flags.io_timeout_s * 1000000LL;
+  if (struct passwd* pw = ::getpwnam(flags.service_user.c_str())) {
+    server_options.service_uid = pw->pw_uid;
+    server_options.service_gid = pw->pw_gid;
+  } else {
+    Log(LOG_WARNING, "%s:%d service account %s not found: only root may change indexes",
+        SourceName(__FILE__), __LINE__, flags.service_user.c_str());
+  }
+
+  int status = 0;
+  {
+    orvane::elasticd::Engine engine(engine_options);
+    orvane::elasticd::Server server(engine, server_options);
+    try {
+      engine.Start();
+      server.Start();
+    } catch (const std::exception& e) {
+      Log(LOG_ERR, "%s:%d cannot start: %s", SourceName(__FILE__), __LINE__, e.what());
+      status = 1;
+    }
+    if (status == 0) {
+      Log(LOG_INFO, "%s:%d started, pid %d", SourceName(__FILE__), __LINE__,
+          static_cast<int>(::getpid()));
+      int sig = 0;
+      sigwait(&stop_signals, &sig);
+      Log(LOG_INFO, "%s:%d stopping on signal %d", SourceName(__FILE__), __LINE__, sig);
+    }
+    // Connections in flight finish first; then every index is synced and closed.
+    server.Stop();
+    engine.Shutdown();
+  }
+  ::unlink(pid_path.c_str());
+  Log(LOG_INFO, "%s:%d stopped", SourceName(__FILE__), __LINE__);
+  return status;
+}

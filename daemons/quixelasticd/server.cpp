@@ -1,0 +1,179 @@
+#include "daemons/quixelasticd/server.hpp"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <cstring>
+
+#include "common/env.hpp"
+#include "common/error.hpp"
+#include "common/json_util.hpp"
+#include "common/log.hpp"
+#include "common/root.hpp"
+#include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/frame.hpp"
+
+namespace orvane {
+namespace elasticd {
+
+Server::Server(Engine& engine, ServerOptions options)
+    : engine_(engine), options_(std::move(options)) {}
+
+Server::~Server() { Stop(); }
+
+UniqueFd Server::Listen(const std::string& path, mode_t mode) {
+  struct sockaddr_un addr;
+  std::memset(&addr, 0, sizeof(addr));
+  addr.sun_family = AF_UNIX;
+  ORVANE_THROW_IF(path.size() >= sizeof(addr.sun_path), kErrSystem, "socket path too long: " + path);
+  std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+  UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  ORVANE_THROW_IF(!fd.valid(), kErrSystem, "socket failed");
+  MakeParentDirs(path);
+  // A socket file left by a run that was killed would make bind fail; the pid file lock
+  // already guarantees that no other daemon owns it.
+  ::unlink(path.c_str());
+  // The umask closes the window between bind and chmod in which the file has wider rights.
+  const mode_t old_mask = ::umask(0777 & ~mode);
+  const int rc = ::bind(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr));
+  ::umask(old_mask);
+  ORVANE_THROW_IF(rc != 0, kErrSystem, "bind " + path + " failed");
+  ORVANE_THROW_IF(::chmod(path.c_str(), mode) != 0, kErrSystem, "chmod " + path + " failed");
+  if (options_.service_gid != static_cast<gid_t>(-1) && ::geteuid() == 0) {
+    ORVANE_LOG_IF(::chown(path.c_str(), 0, options_.service_gid) != 0);
+  }
+  ORVANE_THROW_IF(::listen(fd.get(), 128) != 0, kErrSystem, "listen " + path + " failed");
+  return fd;
+}
+
+void Server::Start() {
+  int pipe_fds[2];
+  ORVANE_THROW_IF(::pipe2(pipe_fds, O_CLOEXEC | O_NONBLOCK) != 0, kErrSystem, "pipe failed");
+  stop_read_.Reset(pipe_fds[0]);
+  stop_write_.Reset(pipe_fds[1]);
+  main_fd_ = Listen(options_.socket_path, 0660);
+  if (!options_.public_socket_path.empty()) public_fd_ = Listen(options_.public_socket_path, 0666);
+  started_ = true;
+  acceptor_ = std::thread([this] { AcceptLoop(); });
+  Log(LOG_INFO, "%s:%d listening on %s", SourceName(__FILE__), __LINE__,
+      options_.socket_path.c_str());
+}
+
+void Server::AcceptLoop() {
+  for (;;) {
+    struct pollfd fds[3] = {{stop_read_.get(), POLLIN, 0},
+                            {main_fd_.get(), POLLIN, 0},
+                            {public_fd_.valid() ? public_fd_.get() : -1, POLLIN, 0}};
+    const int rc = ::poll(fds, 3, -1);
+    if (rc < 0) {
+      if (errno == EINTR) continue;
+      Log(LOG_ERR, "%s:%d poll failed [err: %m]", SourceName(__FILE__), __LINE__);
+      return;
+    }
+    if (fds[0].revents != 0) return;
+    for (int i = 1; i < 3; ++i) {
+      if ((fds[i].revents & POLLIN) == 0) continue;
+      const int fd = ::accept4(fds[i].fd, nullptr, nullptr, SOCK_CLOEXEC);
+      if (fd < 0) {
+        if (errno != EINTR && errno != EAGAIN) {
+          Log(LOG_ERR, "%s:%d accept failed [err: %m]", SourceName(__FILE__), __LINE__);
+          // Out of descriptors: give connections in flight a moment to close some.
+          if (errno == EMFILE || errno == ENFILE) Env::Current()->SleepMicros(10000);
+        }
+        continue;
+      }
+      {
+        std::lock_guard<std::mutex> lock(mu_);
+        ++active_;
+      }
+      const bool is_public = i == 2;
+      std::thread([this, fd, is_public] {
+        Serve(fd, is_public);
+        ::close(fd);
+        std::lock_guard<std::mutex> lock(mu_);
+        if (--active_ == 0) idle_cv_.notify_all();
+      }).detach();
+    }
+  }
+}
+
+void Server::Serve(int fd, bool public_socket) {
+  const int64_t deadline = Env::Current()->NowMicros() + options_.io_timeout_micros;
+  auto reply = [&](const Json::Value& r) {
+    WriteFrame(fd, JsonToString(r), Env::Current()->NowMicros() + options_.io_timeout_micros);
+  };
+  uint32_t length = 0;
+  if (ReadFrameLength(fd, &length, deadline) != IoStatus::kOk) return;
+  if (length > options_.max_frame_bytes) {
+    // The payload is not read: answer and close, the peer sees the reply or a reset.
+    reply(Engine::ErrorReply(kCodeTooLarge, "request of " + std::to_string(length) +
+                                                 " bytes is longer than the limit of " +
+                                                 std::to_string(options_.max_frame_bytes)));
+    return;
+  }
+  bool busy;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    busy = active_ > options_.max_connections;
+  }
+  const int refused = busy ? static_cast<int>(kCodeOverloaded) : engine_.AdmitFrame(length);
+  if (refused != 0) {
+    if (Discard(fd, length, deadline) != IoStatus::kOk) return;
+    reply(Engine::ErrorReply(refused, refused == kCodeOutOfMemory
+                                          ? "the daemon is short of memory"
+                                          : "too many connections"));
+    return;
+  }
+  std::string payload(length, '\0');
+  const IoStatus st = length == 0 ? IoStatus::kOk : ReadExact(fd, &payload[0], length, deadline);
+  if (st != IoStatus::kOk) {
+    engine_.ReleaseFrame(length);
+    return;
+  }
+  Caller caller;
+  struct ucred cred;
+  socklen_t len = sizeof(cred);
+  if (::getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
+    engine_.ReleaseFrame(length);
+    reply(Engine::ErrorReply(kCodePermissionDenied, "the caller's identity is unknown"));
+    return;
+  }
+  caller.uid = cred.uid;
+  caller.gid = cred.gid;
+  caller.privileged = !public_socket && (cred.uid == 0 || cred.uid == options_.service_uid);
+  Json::Value result;
+  try {
+    result = engine_.Handle(payload, caller);
+  } catch (const std::bad_alloc&) {
+    result = Engine::ErrorReply(kCodeOutOfMemory, "out of memory");
+  } catch (const std::exception& e) {
+    Log(LOG_ERR, "%s:%d request failed: %s", SourceName(__FILE__), __LINE__, e.what());
+    result = Engine::ErrorReply(kCodeStorage, e.what());
+  }
+  payload.clear();
+  payload.shrink_to_fit();
+  engine_.ReleaseFrame(length);
+  reply(result);
+}
+
+void Server::Stop() {
+  if (!started_) return;
+  started_ = false;
+  const char byte = 0;
+  ORVANE_LOG_IF(::write(stop_write_.get(), &byte, 1) != 1);
+  if (acceptor_.joinable()) acceptor_.join();
+  main_fd_.Close();
+  public_fd_.Close();
+  ::unlink(options_.socket_path.c_str());
+  if (!options_.public_socket_path.empty()) ::unlink(options_.public_socket_path.c_str());
+  std::unique_lock<std::mutex> lock(mu_);
+  idle_cv_.wait(lock, [this] { return active_ == 0; });
+}
+
+}  // namespace elasticd
+}  // namespace orvane

@@ -1,0 +1,69 @@
+// Server: the daemon's Unix-domain sockets. One request frame and one reply frame per
+// connection, one thread per connection, the caller's identity from SO_PEERCRED.
+// The main socket (mode 0660, group of the service account) takes every command; the public
+// socket (mode 0666) takes only the people's commands "search" and "suggest".
+// Start() and Stop() are called from one thread; connections run on their own threads.
+#ifndef ORVANE_DAEMONS_QUIXELASTICD_SERVER_HPP_
+#define ORVANE_DAEMONS_QUIXELASTICD_SERVER_HPP_
+
+#include <sys/types.h>
+
+#include <condition_variable>
+#include <cstdint>
+#include <mutex>
+#include <string>
+#include <thread>
+
+#include "common/fd.hpp"
+#include "daemons/quixelasticd/engine.hpp"
+
+namespace orvane {
+namespace elasticd {
+
+struct ServerOptions {
+  std::string socket_path;
+  std::string public_socket_path;  // empty: no public socket
+  uint32_t max_frame_bytes = 64u << 20;
+  int64_t io_timeout_micros = 30 * 1000000LL;
+  int max_connections = 256;
+  // The service account, whose processes may run index and document commands like root.
+  uid_t service_uid = static_cast<uid_t>(-1);
+  gid_t service_gid = static_cast<gid_t>(-1);
+};
+
+class Server {
+ public:
+  Server(Engine& engine, ServerOptions options);
+  ~Server();
+  Server(const Server&) = delete;
+  Server& operator=(const Server&) = delete;
+
+  // Binds and listens on the sockets and starts accepting; throws Error (502) on failure.
+  void Start();
+  // Stops accepting, removes the socket files and waits for connections in flight to answer.
+  void Stop();
+
+  // Serves one accepted connection to the end (used by the accept loop and the fuzz harness).
+  void Serve(int fd, bool public_socket);
+
+ private:
+  UniqueFd Listen(const std::string& path, mode_t mode);
+  void AcceptLoop();
+
+  Engine& engine_;
+  ServerOptions options_;
+  UniqueFd main_fd_;
+  UniqueFd public_fd_;
+  UniqueFd stop_read_;
+  UniqueFd stop_write_;
+  std::thread acceptor_;
+  std::mutex mu_;
+  std::condition_variable idle_cv_;
+  int active_ = 0;
+  bool started_ = false;
+};
+
+}  // namespace elasticd
+}  // namespace orvane
+
+#endif  // ORVANE_DAEMONS_QUIXELASTICD_SERVER_HPP_

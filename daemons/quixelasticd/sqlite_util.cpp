@@ -1,0 +1,137 @@
+#include "daemons/quixelasticd/sqlite_util.hpp"
+
+#include "common/log.hpp"
+
+namespace orvane {
+namespace elasticd {
+
+Db::~Db() { Close(); }
+
+void Db::Open(const std::string& file, bool create, bool read_only) {
+  Close();
+  int flags = SQLITE_OPEN_NOMUTEX;
+  flags |= read_only ? SQLITE_OPEN_READONLY : SQLITE_OPEN_READWRITE;
+  if (create && !read_only) flags |= SQLITE_OPEN_CREATE;
+  const int rc = sqlite3_open_v2(file.c_str(), &db_, flags, nullptr);
+  if (rc != SQLITE_OK) {
+    const std::string msg = db_ != nullptr ? sqlite3_errmsg(db_) : sqlite3_errstr(rc);
+    Close();
+    throw StoreError(rc, "open " + file + ": " + msg);
+  }
+  sqlite3_extended_result_codes(db_, 1);
+  // Writers of one index are serialised by the daemon; the timeout only covers readers that
+  // hold the WAL briefly during a checkpoint.
+  sqlite3_busy_timeout(db_, 5000);
+}
+
+void Db::Close() {
+  if (db_ == nullptr) return;
+  // close_v2 defers the close until the last statement is finalised, so an owner that outlives
+  // a Stmt by mistake cannot leak the handle.
+  sqlite3_close_v2(db_);
+  db_ = nullptr;
+}
+
+void Db::Exec(const std::string& sql) {
+  char* err = nullptr;
+  const int rc = sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, &err);
+  if (rc != SQLITE_OK) {
+    const std::string msg = err != nullptr ? err : sqlite3_errstr(rc);
+    sqlite3_free(err);
+    throw StoreError(sqlite3_extended_errcode(db_), sql.substr(0, 60) + ": " + msg);
+  }
+}
+
+void Db::Fail(int rc, const std::string& context) const {
+  throw StoreError(db_ != nullptr ? sqlite3_extended_errcode(db_) : rc,
+                   context + ": " + (db_ != nullptr ? sqlite3_errmsg(db_) : sqlite3_errstr(rc)));
+}
+
+Stmt::Stmt(Db& db, const std::string& sql) : db_(db) {
+  const int rc = sqlite3_prepare_v2(db.get(), sql.c_str(), static_cast<int>(sql.size()), &stmt_,
+                                    nullptr);
+  if (rc != SQLITE_OK) db.Fail(rc, "prepare " + sql.substr(0, 60));
+}
+
+Stmt::~Stmt() { sqlite3_finalize(stmt_); }
+
+Stmt& Stmt::Bind(int index, const std::string& value) {
+  const int rc = sqlite3_bind_text(stmt_, index, value.data(), static_cast<int>(value.size()),
+                                   SQLITE_TRANSIENT);
+  if (rc != SQLITE_OK) db_.Fail(rc, "bind");
+  return *this;
+}
+
+Stmt& Stmt::Bind(int index, int64_t value) {
+  const int rc = sqlite3_bind_int64(stmt_, index, value);
+  if (rc != SQLITE_OK) db_.Fail(rc, "bind");
+  return *this;
+}
+
+Stmt& Stmt::Bind(int index, double value) {
+  const int rc = sqlite3_bind_double(stmt_, index, value);
+  if (rc != SQLITE_OK) db_.Fail(rc, "bind");
+  return *this;
+}
+
+Stmt& Stmt::BindNull(int index) {
+  const int rc = sqlite3_bind_null(stmt_, index);
+  if (rc != SQLITE_OK) db_.Fail(rc, "bind");
+  return *this;
+}
+
+bool Stmt::Step() {
+  const int rc = sqlite3_step(stmt_);
+  if (rc == SQLITE_ROW) return true;
+  if (rc == SQLITE_DONE) return false;
+  db_.Fail(rc, "step");
+}
+
+void Stmt::Run() {
+  while (Step()) {
+  }
+  Reset();
+}
+
+void Stmt::Reset() {
+  sqlite3_reset(stmt_);
+  sqlite3_clear_bindings(stmt_);
+}
+
+std::string Stmt::Text(int col) const {
+  const unsigned char* text = sqlite3_column_text(stmt_, col);
+  if (text == nullptr) return std::string();
+  return std::string(reinterpret_cast<const char*>(text), sqlite3_column_bytes(stmt_, col));
+}
+
+Transaction::Transaction(Db& db) : db_(db) { db_.Exec("BEGIN IMMEDIATE"); }
+
+Transaction::~Transaction() {
+  // SQLite may already have rolled back on its own (a full disk, an I/O error).
+  if (!open_ || sqlite3_get_autocommit(db_.get()) != 0) return;
+  char* err = nullptr;
+  if (sqlite3_exec(db_.get(), "ROLLBACK", nullptr, nullptr, &err) != SQLITE_OK) {
+    Log(3, "rollback failed: %s", err != nullptr ? err : "?");
+  }
+  sqlite3_free(err);
+}
+
+void Transaction::Commit() {
+  db_.Exec("COMMIT");
+  open_ = false;
+}
+
+Savepoint::Savepoint(Db& db) : db_(db) { db_.Exec("SAVEPOINT sub"); }
+
+Savepoint::~Savepoint() {
+  if (!open_ || sqlite3_get_autocommit(db_.get()) != 0) return;
+  sqlite3_exec(db_.get(), "ROLLBACK TO sub; RELEASE sub", nullptr, nullptr, nullptr);
+}
+
+void Savepoint::Release() {
+  db_.Exec("RELEASE sub");
+  open_ = false;
+}
+
+}  // namespace elasticd
+}  // namespace orvane

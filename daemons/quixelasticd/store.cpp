@@ -1,0 +1,721 @@
+#include "daemons/quixelasticd/store.hpp"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <set>
+
+#include "common/fd.hpp"
+#include "common/json_util.hpp"
+#include "common/root.hpp"
+#include "common/util.hpp"
+#include "daemons/quixelasticd/engine_error.hpp"
+
+namespace orvane {
+namespace elasticd {
+
+namespace {
+
+const char kSchemaSql[] =
+    "CREATE TABLE meta(key TEXT PRIMARY KEY, value TEXT NOT NULL) WITHOUT ROWID;"
+    "CREATE TABLE docs(rowid INTEGER PRIMARY KEY, path TEXT NOT NULL UNIQUE, parent TEXT,"
+    " name TEXT, ext TEXT, size INTEGER, mtime INTEGER, is_dir INTEGER, ancestor TEXT,"
+    " body TEXT NOT NULL);"
+    "CREATE TABLE sugg(term TEXT NOT NULL, doc INTEGER NOT NULL, PRIMARY KEY(term, doc))"
+    " WITHOUT ROWID;"
+    "CREATE INDEX sugg_doc ON sugg(doc);"
+    "CREATE VIRTUAL TABLE fts_all USING fts5(text, tokenize='unicode61 remove_diacritics 2');"
+    "CREATE VIRTUAL TABLE fts_name USING fts5(name, tokenize='trigram');";
+
+constexpr int kFormat = 1;
+
+// WAL with synchronous=NORMAL: a finished request survives the daemon being killed; "commit"
+// syncs the log so that it also survives a power loss.
+void ConfigureWriter(Db& db) {
+  db.Exec("PRAGMA journal_mode=WAL");
+  db.Exec("PRAGMA synchronous=NORMAL");
+  db.Exec("PRAGMA cache_size=-32768");
+  db.Exec("PRAGMA temp_store=MEMORY");
+}
+
+std::string FieldPath(const std::string& field) {
+  if (field.find('"') != std::string::npos || field.find('\\') != std::string::npos) {
+    throw EngineError(kCodeInvalidParam, "field name not allowed: " + field);
+  }
+  return "$.\"" + field + "\"";
+}
+
+// The WHERE clause and its bound texts for a document query.
+struct Where {
+  std::string sql;
+  std::vector<std::string> args;
+};
+
+Where WhereOf(const Schema& schema, const DocQuery& q) {
+  Where w;
+  const bool id_field = q.field == schema.property_id();
+  switch (q.kind) {
+    case DocQuery::Kind::kAll:
+      w.sql = "1";
+      break;
+    case DocQuery::Kind::kTerm:
+      if (id_field) {
+        w.sql = "path = ?";
+      } else {
+        w.sql = "json_extract(body, ?) = ?";
+        w.args.push_back(FieldPath(q.field));
+      }
+      w.args.push_back(q.value);
+      break;
+    case DocQuery::Kind::kPrefix: {
+      const std::optional<std::string> upper = PrefixUpperBound(q.value);
+      if (id_field) {
+        if (!upper) {
+          w.sql = "path >= ?";
+          w.args.push_back(q.value);
+        } else {
+          w.sql = "path >= ? AND path < ?";
+          w.args.push_back(q.value);
+          w.args.push_back(*upper);
+        }
+      } else {
+        w.sql = "substr(json_extract(body, ?), 1, ?) = ?";
+        w.args.push_back(FieldPath(q.field));
+        w.args.push_back(std::to_string(q.value.size()));
+        w.args.push_back(q.value);
+      }
+      break;
+    }
+  }
+  return w;
+}
+
+void BindWhere(Stmt& st, const Where& w, int first) {
+  for (size_t i = 0; i < w.args.size(); ++i) st.Bind(first + static_cast<int>(i), w.args[i]);
+}
+
+Json::Value ParseBody(const std::string& body) {
+  JsonValue v;
+  if (!v.fromString(body) || !v.isObject()) {
+    throw StoreError(SQLITE_CORRUPT, "stored document is not a JSON object");
+  }
+  return v;
+}
+
+void SyncFile(const std::string& path) {
+  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+  if (!fd.valid()) {
+    if (errno == ENOENT) return;
+    throw StoreError(SQLITE_IOERR, "open " + path + " for sync failed");
+  }
+  if (::fsync(fd.get()) != 0) throw StoreError(SQLITE_IOERR_FSYNC, "fsync " + path + " failed");
+}
+
+// A user's keywords as an FTS query: every word quoted (so that no word is read as an
+// operator) and all of them required; a trailing '*' keeps its prefix meaning.
+std::string MatchExpression(const std::string& keywords) {
+  std::string out;
+  size_t i = 0;
+  while (i < keywords.size()) {
+    while (i < keywords.size() && std::isspace(static_cast<unsigned char>(keywords[i]))) ++i;
+    size_t j = i;
+    while (j < keywords.size() && !std::isspace(static_cast<unsigned char>(keywords[j]))) ++j;
+    if (j > i) {
+      std::string word = keywords.substr(i, j - i);
+      bool prefix = false;
+      while (!word.empty() && word.back() == '*') {
+        word.pop_back();
+        prefix = true;
+      }
+      if (!word.empty()) {
+        std::string quoted = "\"";
+        for (char c : word) {
+          if (c == '"') quoted += '"';
+          quoted += c;
+        }
+        quoted += '"';
+        if (prefix) quoted += '*';
+        if (!out.empty()) out += ' ';
+        out += quoted;
+      }
+    }
+    i = j;
+  }
+  return out;
+}
+
+std::string EscapeLike(const std::string& s) {
+  std::string out;
+  for (char c : s) {
+    if (c == '%' || c == '_' || c == '\\') out += '\\';
+    out += c;
+  }
+  return out;
+}
+
+}  // namespace
+
+DocQuery DocQuery::Parse(const Json::Value& query) {
+  if (!query.isObject()) throw EngineError(kCodeInvalidParam, "query is not an object");
+  const Json::Value& qsl = query["qsl"];
+  if (!qsl.isObject() || qsl.size() != 1) {
+    throw EngineError(kCodeInvalidParam, "query qsl must hold exactly one of term, prefix, "
+                                         "match_all");
+  }
+  DocQuery q;
+  const std::string form = qsl.getMemberNames()[0];
+  if (form == "match_all") return q;
+  if (form != "term" && form != "prefix") {
+    throw EngineError(kCodeInvalidParam, "unknown query form: " + form);
+  }
+  const Json::Value& body = qsl[form];
+  if (!body.isObject() || body.size() != 1) {
+    throw EngineError(kCodeInvalidParam, "query " + form + " must name exactly one field");
+  }
+  q.kind = form == "term" ? Kind::kTerm : Kind::kPrefix;
+  q.field = body.getMemberNames()[0];
+  const Json::Value& v = body[q.field];
+  if (!v.isString() && !v.isNumeric() && !v.isBool()) {
+    throw EngineError(kCodeInvalidParam, "query value of " + q.field + " is not a scalar");
+  }
+  q.value = v.isString() ? v.asString() : ValueText(v);
+  return q;
+}
+
+std::optional<std::string> PrefixUpperBound(const std::string& prefix) {
+  std::string upper = prefix;
+  while (!upper.empty()) {
+    unsigned char last = static_cast<unsigned char>(upper.back());
+    if (last != 0xFF) {
+      upper.back() = static_cast<char>(last + 1);
+      return upper;
+    }
+    upper.pop_back();
+  }
+  return std::nullopt;
+}
+
+std::vector<std::string> SuggestionTerms(const std::string& name) {
+  std::set<std::string> terms;
+  std::string word;
+  auto flush = [&]() {
+    const bool digits = std::all_of(word.begin(), word.end(),
+                                    [](char c) { return c >= '0' && c <= '9'; });
+    if (word.size() >= 2 && !digits) terms.insert(word);
+    word.clear();
+  };
+  for (char c : AsciiLower(name)) {
+    const unsigned char u = static_cast<unsigned char>(c);
+    if (std::isalnum(u) || u >= 0x80) {
+      word += c;
+    } else {
+      flush();
+    }
+  }
+  flush();
+  return std::vector<std::string>(terms.begin(), terms.end());
+}
+
+IndexStore::IndexStore(std::string dir) : dir_(std::move(dir)), file_(dir_ + "/" + kDbFile) {}
+
+IndexStore::~IndexStore() {
+  cached_.clear();
+  readers_.clear();
+  writer_.Close();
+}
+
+bool IndexStore::ExistsIn(const std::string& dir) { return IsFileExist(dir + "/" + kDbFile); }
+
+Stmt& IndexStore::Cached(const char* sql) {
+  std::unique_ptr<Stmt>& st = cached_[sql];
+  if (!st) {
+    st = std::make_unique<Stmt>(writer_, sql);
+  } else {
+    st->Reset();
+  }
+  return *st;
+}
+
+void IndexStore::OpenWriter(bool create) {
+  writer_.Open(file_, create, false);
+  ConfigureWriter(writer_);
+}
+
+std::shared_ptr<IndexStore> IndexStore::Create(const std::string& dir, const std::string& id,
+                                               const Json::Value& mappings,
+                                               const Json::Value& settings,
+                                               const Json::Value& event_handler) {
+  Schema::Parse(mappings);  // refuse a bad schema before anything is written
+  if (!MakeParentDirs(dir + "/" + kDbFile)) {
+    throw StoreError(SQLITE_CANTOPEN, "cannot create folder " + dir);
+  }
+  if (ExistsIn(dir)) throw EngineError(kCodeIndexExists, "a store already exists in " + dir);
+  std::shared_ptr<IndexStore> s(new IndexStore(dir));
+  s->OpenWriter(true);
+  {
+    Transaction txn(s->writer_);
+    s->writer_.Exec(kSchemaSql);
+    Stmt put(s->writer_, "INSERT INTO meta(key, value) VALUES(?, ?)");
+    auto set = [&](const std::string& k, const std::string& v) {
+      put.Bind(1, k).Bind(2, v).Run();
+    };
+    set("format", std::to_string(kFormat));
+    set("id", id);
+    set("mappings", JsonToString(mappings));
+    set("settings", JsonToString(settings));
+    set("event_handler", JsonToString(event_handler));
+    set("term_sugg", "ready");
+    txn.Commit();
+  }
+  s->LoadSchema();
+  s->Sync();
+  // The folder entry of the new file must reach the disk too.
+  SyncFile(dir);
+  return s;
+}
+
+std::shared_ptr<IndexStore> IndexStore::Open(const std::string& dir) {
+  if (!ExistsIn(dir)) throw EngineError(kCodeIndexNotFound, "no store in " + dir);
+  std::shared_ptr<IndexStore> s(new IndexStore(dir));
+  s->OpenWriter(false);
+  s->LoadSchema();
+  return s;
+}
+
+void IndexStore::LoadSchema() {
+  const std::string format = Meta("format");
+  if (format != std::to_string(kFormat)) {
+    throw StoreError(SQLITE_NOTADB, "unknown store format '" + format + "' in " + file_);
+  }
+  JsonValue mappings;
+  if (!mappings.fromString(Meta("mappings"))) {
+    throw StoreError(SQLITE_CORRUPT, "stored mappings are not JSON in " + file_);
+  }
+  schema_ = Schema::Parse(mappings);
+}
+
+std::string IndexStore::Meta(const std::string& key) {
+  Stmt& st = Cached("SELECT value FROM meta WHERE key = ?");
+  st.Bind(1, key);
+  std::string value = st.Step() ? st.Text(0) : std::string();
+  st.Reset();
+  return value;
+}
+
+void IndexStore::SetMeta(const std::string& key, const std::string& value) {
+  Cached("INSERT OR REPLACE INTO meta(key, value) VALUES(?, ?)").Bind(1, key).Bind(2, value).Run();
+}
+
+void IndexStore::WriteRow(int64_t rowid, const DerivedDoc& d, const std::string& body,
+                          bool insert, const DerivedDoc* old) {
+  Stmt& st = insert ? Cached("INSERT INTO docs(path, parent, name, ext, size, mtime, is_dir,"
+                             " ancestor, body, rowid) VALUES(?,?,?,?,?,?,?,?,?,?)")
+                    : Cached("UPDATE docs SET path=?, parent=?, name=?, ext=?, size=?, mtime=?,"
+                             " is_dir=?, ancestor=?, body=? WHERE rowid=?");
+  st.Bind(1, d.path).Bind(2, d.parent).Bind(3, d.name).Bind(4, d.ext).Bind(5, d.size);
+  st.Bind(6, d.mtime).Bind(7, static_cast<int64_t>(d.is_dir)).Bind(8, d.ancestor).Bind(9, body);
+  if (insert && rowid == 0) {
+    st.BindNull(10);
+  } else {
+    st.Bind(10, rowid);
+  }
+  st.Run();
+  if (insert && rowid == 0) rowid = writer_.LastInsertRowid();
+  // Full-text rows are only rewritten when their text changed: re-pathing a directory's
+  // descendants leaves names and words alone and stays cheap.
+  if (old == nullptr || old->all_text != d.all_text) {
+    if (old != nullptr && !old->all_text.empty()) {
+      Cached("DELETE FROM fts_all WHERE rowid = ?").Bind(1, rowid).Run();
+    }
+    if (!d.all_text.empty()) {
+      Cached("INSERT INTO fts_all(rowid, text) VALUES(?, ?)").Bind(1, rowid).Bind(2, d.all_text)
+          .Run();
+    }
+  }
+  if (old == nullptr || old->name_text != d.name_text) {
+    if (old != nullptr && !old->name_text.empty()) {
+      Cached("DELETE FROM fts_name WHERE rowid = ?").Bind(1, rowid).Run();
+    }
+    if (!d.name_text.empty()) {
+      Cached("INSERT INTO fts_name(rowid, name) VALUES(?, ?)").Bind(1, rowid)
+          .Bind(2, d.name_text).Run();
+    }
+  }
+  if (old == nullptr || old->name != d.name) SetTerms(rowid, d.name);
+}
+
+void IndexStore::SetTerms(int64_t rowid, const std::string& name) {
+  Cached("DELETE FROM sugg WHERE doc = ?").Bind(1, rowid).Run();
+  for (const std::string& t : SuggestionTerms(name)) {
+    Cached("INSERT OR IGNORE INTO sugg(term, doc) VALUES(?, ?)").Bind(1, t).Bind(2, rowid).Run();
+  }
+}
+
+void IndexStore::DeleteRow(int64_t rowid, const DerivedDoc& old) {
+  if (!old.all_text.empty()) Cached("DELETE FROM fts_all WHERE rowid = ?").Bind(1, rowid).Run();
+  if (!old.name_text.empty()) Cached("DELETE FROM fts_name WHERE rowid = ?").Bind(1, rowid).Run();
+  Cached("DELETE FROM sugg WHERE doc = ?").Bind(1, rowid).Run();
+  Cached("DELETE FROM docs WHERE rowid = ?").Bind(1, rowid).Run();
+}
+
+void IndexStore::Upsert(const std::string& doc_id, Json::Value doc) {
+  if (!doc.isObject()) throw EngineError(kCodeDocInvalid, "document is not an object");
+  const std::string& pid = schema_.property_id();
+  if (!doc.isMember(pid) && !doc_id.empty()) doc[pid] = doc_id;
+  schema_.Validate(doc);
+  const DerivedDoc d = schema_.Derive(doc);
+  if (!doc_id.empty() && doc_id != d.path) Delete(doc_id);
+  Stmt& find = Cached("SELECT rowid, body FROM docs WHERE path = ?");
+  find.Bind(1, d.path);
+  if (find.Step()) {
+    const int64_t rowid = find.Int(0);
+    const DerivedDoc old = schema_.Derive(ParseBody(find.Text(1)));
+    find.Reset();
+    WriteRow(rowid, d, JsonToString(doc), false, &old);
+  } else {
+    find.Reset();
+    WriteRow(0, d, JsonToString(doc), true, nullptr);
+  }
+}
+
+void IndexStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
+  if (!fields.isObject()) throw EngineError(kCodeDocInvalid, "fields are not an object");
+  Stmt& find = Cached("SELECT rowid, body FROM docs WHERE path = ?");
+  find.Bind(1, doc_id);
+  if (!find.Step()) {
+    find.Reset();
+    throw EngineError(kCodeDocNotFound, "no document " + doc_id);
+  }
+  const int64_t rowid = find.Int(0);
+  Json::Value doc = ParseBody(find.Text(1));
+  find.Reset();
+  const DerivedDoc old = schema_.Derive(doc);
+  for (const std::string& k : fields.getMemberNames()) {
+    if (fields[k].isNull()) {
+      doc.removeMember(k);
+    } else {
+      doc[k] = fields[k];
+    }
+  }
+  schema_.Validate(doc);
+  const DerivedDoc d = schema_.Derive(doc);
+  if (d.path != old.path) {
+    // The file now lives where another document was: that file has been replaced.
+    Stmt& other = Cached("SELECT rowid, body FROM docs WHERE path = ?");
+    other.Bind(1, d.path);
+    if (other.Step()) {
+      const int64_t other_row = other.Int(0);
+      const DerivedDoc other_old = schema_.Derive(ParseBody(other.Text(1)));
+      other.Reset();
+      DeleteRow(other_row, other_old);
+    } else {
+      other.Reset();
+    }
+  }
+  WriteRow(rowid, d, JsonToString(doc), false, &old);
+}
+
+bool IndexStore::Delete(const std::string& doc_id) {
+  Stmt& find = Cached("SELECT rowid, body FROM docs WHERE path = ?");
+  find.Bind(1, doc_id);
+  if (!find.Step()) {
+    find.Reset();
+    return false;
+  }
+  const int64_t rowid = find.Int(0);
+  const DerivedDoc old = schema_.Derive(ParseBody(find.Text(1)));
+  find.Reset();
+  DeleteRow(rowid, old);
+  return true;
+}
+
+int64_t IndexStore::DeleteByQuery(const DocQuery& q) {
+  const Where w = WhereOf(schema_, q);
+  const std::string rows = "SELECT rowid FROM docs WHERE " + w.sql;
+  // Deleting rows whose text is empty from the full-text tables is a harmless no-op.
+  for (const char* table : {"fts_all", "fts_name"}) {
+    Stmt st(writer_, std::string("DELETE FROM ") + table + " WHERE rowid IN (" + rows + ")");
+    BindWhere(st, w, 1);
+    st.Run();
+  }
+  {
+    Stmt st(writer_, "DELETE FROM sugg WHERE doc IN (" + rows + ")");
+    BindWhere(st, w, 1);
+    st.Run();
+  }
+  Stmt st(writer_, "DELETE FROM docs WHERE " + w.sql);
+  BindWhere(st, w, 1);
+  st.Run();
+  return writer_.Changes();
+}
+
+Json::Value IndexStore::GetByQuery(const DocQuery& q, const std::vector<std::string>& load,
+                                   int64_t from, int64_t size) {
+  const Where w = WhereOf(schema_, q);
+  Stmt st(writer_, "SELECT body FROM docs WHERE " + w.sql + " ORDER BY path LIMIT ? OFFSET ?");
+  BindWhere(st, w, 1);
+  st.Bind(static_cast<int>(w.args.size()) + 1, size);
+  st.Bind(static_cast<int>(w.args.size()) + 2, from);
+  Json::Value hits(Json::arrayValue);
+  while (st.Step()) hits.append(schema_.Load(ParseBody(st.Text(0)), load));
+  return hits;
+}
+
+bool IndexStore::UpdateTermSuggestion(const std::string& doc_id) {
+  Stmt& find = Cached("SELECT rowid, name FROM docs WHERE path = ?");
+  find.Bind(1, doc_id);
+  if (!find.Step()) {
+    find.Reset();
+    return false;
+  }
+  const int64_t rowid = find.Int(0);
+  const std::string name = find.Text(1);
+  find.Reset();
+  SetTerms(rowid, name);
+  return true;
+}
+
+int64_t IndexStore::DocCount() {
+  Stmt& st = Cached("SELECT count(*) FROM docs");
+  const int64_t n = st.Step() ? st.Int(0) : 0;
+  st.Reset();
+  return n;
+}
+
+void IndexStore::Sync() {
+  // A passive checkpoint never waits for readers; whatever it could not copy stays in the log,
+  // which is synced below, so every committed transaction is on disk either way.
+  sqlite3_wal_checkpoint_v2(writer_.get(), nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+  SyncFile(file_ + "-wal");
+  SyncFile(file_);
+}
+
+bool IndexStore::QuickCheck(std::string* detail) {
+  try {
+    Stmt st(writer_, "PRAGMA quick_check");
+    std::string result;
+    while (st.Step()) {
+      if (!result.empty()) result += "; ";
+      result += st.Text(0);
+    }
+    if (result != "ok") {
+      *detail = result;
+      return false;
+    }
+    Stmt count(writer_, "SELECT count(*) FROM docs");
+    count.Step();
+    return true;
+  } catch (const StoreError& e) {
+    *detail = e.what();
+    return false;
+  }
+}
+
+std::unique_ptr<Db> IndexStore::TakeReader() {
+  {
+    std::lock_guard<std::mutex> lock(readers_mu_);
+    if (!readers_.empty()) {
+      std::unique_ptr<Db> db = std::move(readers_.back());
+      readers_.pop_back();
+      return db;
+    }
+  }
+  auto db = std::make_unique<Db>();
+  db->Open(file_, false, false);
+  db->Exec("PRAGMA query_only=1");
+  db->Exec("PRAGMA cache_size=-16384");
+  return db;
+}
+
+void IndexStore::GiveBackReader(std::unique_ptr<Db> db) {
+  std::lock_guard<std::mutex> lock(readers_mu_);
+  if (readers_.size() < 8) readers_.push_back(std::move(db));
+}
+
+namespace {
+
+// A bound value of a search statement, in the order of its '?' marks.
+struct Arg {
+  bool is_text;
+  std::string text;
+  int64_t number;
+};
+
+Json::Value HitOf(Stmt& st, bool has_keywords) {
+  Json::Value hit;
+  hit["path"] = st.Text(0);
+  hit["name"] = st.Text(1);
+  hit["size"] = static_cast<Json::Int64>(st.Int(2));
+  hit["mtime"] = static_cast<Json::Int64>(st.Int(3));
+  hit["is_dir"] = st.Int(4) != 0;
+  hit["ext"] = st.Text(5);
+  if (has_keywords) {
+    hit["snippet"] = st.Text(6);
+    hit["score"] = -st.Double(7);
+  }
+  return hit;
+}
+
+}  // namespace
+
+SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
+  const std::string match = MatchExpression(p.keywords);
+  const bool has_keywords = !match.empty();
+  const std::string name = AsciiLower(p.name);
+  std::vector<Arg> args;
+  auto text = [&](const std::string& v) { args.push_back({true, v, 0}); };
+  auto number = [&](int64_t v) { args.push_back({false, std::string(), v}); };
+
+  std::string sql = "SELECT d.path, d.name, d.size, d.mtime, d.is_dir, d.ext";
+  sql += has_keywords ? ", snippet(fts_all, 0, '<b>', '</b>', '...', 12), bm25(fts_all)" : "";
+  sql += " FROM docs d";
+  std::string where = " WHERE 1";
+  if (has_keywords) {
+    sql += " JOIN fts_all ON fts_all.rowid = d.rowid";
+    where += " AND fts_all MATCH ?";
+    text(match);
+  }
+  if (!name.empty()) {
+    sql += " JOIN fts_name ON fts_name.rowid = d.rowid";
+    // The trigram index answers substrings of three characters or more; shorter ones scan.
+    if (name.size() >= 3) {
+      std::string phrase = "\"";
+      for (char c : name) {
+        if (c == '"') phrase += '"';
+        phrase += c;
+      }
+      where += " AND fts_name MATCH ?";
+      text(phrase + "\"");
+    } else {
+      where += " AND fts_name.name LIKE ? ESCAPE '\\'";
+      text("%" + EscapeLike(name) + "%");
+    }
+  }
+  if (!p.folder.empty()) {
+    std::string folder = p.folder;
+    while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
+    const std::string under = folder == "/" ? "/" : folder + "/";
+    const std::string upper = *PrefixUpperBound(under);
+    // The path range uses the path index; the ancestor test is what scopes.
+    where += " AND d.path >= ? AND d.path < ? AND (d.ancestor = ? OR (d.ancestor >= ? AND"
+             " d.ancestor < ?))";
+    text(under);
+    text(upper);
+    text(folder);
+    text(under);
+    text(upper);
+  }
+  if (!p.exts.empty()) {
+    where += " AND d.ext IN (";
+    for (size_t i = 0; i < p.exts.size(); ++i) {
+      where += i == 0 ? "?" : ",?";
+      text(AsciiLower(p.exts[i]));
+    }
+    where += ")";
+  }
+  auto bound = [&](const std::optional<int64_t>& v, const char* cond) {
+    if (!v) return;
+    where += cond;
+    number(*v);
+  };
+  bound(p.size_min, " AND d.size >= ?");
+  bound(p.size_max, " AND d.size <= ?");
+  bound(p.mtime_min, " AND d.mtime >= ?");
+  bound(p.mtime_max, " AND d.mtime <= ?");
+  if (p.is_dir) where += *p.is_dir ? " AND d.is_dir = 1" : " AND d.is_dir = 0";
+  const std::string base = sql + where;
+  const char* dir = p.desc ? " DESC" : " ASC";
+  std::string order;
+  switch (p.sort) {
+    case SearchParams::Sort::kRelevance:
+      order = has_keywords ? std::string(" ORDER BY bm25(fts_all)") + (p.desc ? " DESC" : "")
+                           : " ORDER BY d.name COLLATE NOCASE, d.path";
+      break;
+    case SearchParams::Sort::kName:
+      order = std::string(" ORDER BY d.name COLLATE NOCASE") + dir + ", d.path";
+      break;
+    case SearchParams::Sort::kSize:
+      order = std::string(" ORDER BY d.size") + dir + ", d.path";
+      break;
+    case SearchParams::Sort::kMtime:
+      order = std::string(" ORDER BY d.mtime") + dir + ", d.path";
+      break;
+  }
+  auto bind_all = [&](Stmt& st) {
+    int i = 1;
+    for (const Arg& a : args) {
+      if (a.is_text) {
+        st.Bind(i++, a.text);
+      } else {
+        st.Bind(i++, a.number);
+      }
+    }
+    return i;
+  };
+
+  std::unique_ptr<Db> db = TakeReader();
+  SearchPage page;
+  if (!visible) {
+    Stmt count(*db, "SELECT count(*) FROM (" + base + ")");
+    bind_all(count);
+    if (count.Step()) page.total = count.Int(0);
+    Stmt st(*db, base + order + " LIMIT ? OFFSET ?");
+    const int next = bind_all(st);
+    st.Bind(next, p.size).Bind(next + 1, p.from);
+    while (st.Step()) page.hits.push_back(HitOf(st, has_keywords));
+  } else {
+    // Hits the user may not open are skipped before paging, so counts and pages only ever
+    // reflect what this user can see.
+    Stmt st(*db, base + order);
+    bind_all(st);
+    int64_t seen = 0;
+    int64_t inspected = 0;
+    while (st.Step()) {
+      ++inspected;
+      if (seen >= p.from + p.size && inspected > p.from + p.size + kFilteredScanLimit) {
+        page.total_exact = false;
+        break;
+      }
+      if (!visible(st.Text(0))) continue;
+      ++seen;
+      if (seen > p.from && seen <= p.from + p.size) page.hits.push_back(HitOf(st, has_keywords));
+    }
+    page.total = seen;
+  }
+  GiveBackReader(std::move(db));
+  return page;
+}
+
+std::vector<std::string> IndexStore::Suggest(const std::string& prefix, size_t limit,
+                                             const VisibleFn& visible) {
+  std::vector<std::string> out;
+  const std::string low = AsciiLower(prefix);
+  const std::optional<std::string> upper = PrefixUpperBound(low);
+  if (!upper) return out;
+  std::unique_ptr<Db> db = TakeReader();
+  {
+    Stmt st(*db, "SELECT term, count(*) AS n FROM sugg WHERE term >= ? AND term < ?"
+                 " GROUP BY term ORDER BY n DESC, term LIMIT 200");
+    st.Bind(1, low).Bind(2, *upper);
+    Stmt docs(*db, "SELECT d.path FROM sugg s JOIN docs d ON d.rowid = s.doc WHERE s.term = ?"
+                   " LIMIT 64");
+    while (out.size() < limit && st.Step()) {
+      const std::string term = st.Text(0);
+      bool shown = !visible;
+      if (!shown) {
+        docs.Reset();
+        docs.Bind(1, term);
+        while (!shown && docs.Step()) shown = visible(docs.Text(0));
+      }
+      if (shown) out.push_back(term);
+    }
+  }
+  GiveBackReader(std::move(db));
+  return out;
+}
+
+}  // namespace elasticd
+}  // namespace orvane

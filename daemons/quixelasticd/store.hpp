@@ -1,0 +1,157 @@
+// IndexStore: the documents of one index in one SQLite database (WAL mode) in the index's
+// folder: a table of documents keyed by their identifying field, a word index over the catch-all
+// text, a trigram index over the n-grammed file names, and the term-suggestion table.
+// Writes go through the one writer connection and must be serialised by the owner (the daemon
+// holds the index's write lock and an open WriteTxn); reads for people use pooled read-only
+// connections and may run from any thread at the same time as a writer.
+#ifndef ORVANE_DAEMONS_QUIXELASTICD_STORE_HPP_
+#define ORVANE_DAEMONS_QUIXELASTICD_STORE_HPP_
+
+#include <json/json.h>
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "daemons/quixelasticd/schema.hpp"
+#include "daemons/quixelasticd/sqlite_util.hpp"
+
+namespace orvane {
+namespace elasticd {
+
+// A document query of the library's forms: a whole value or a prefix of one field.
+struct DocQuery {
+  enum class Kind { kAll, kTerm, kPrefix };
+  Kind kind = Kind::kAll;
+  std::string field;
+  std::string value;
+  // Reads {"qsl": {"term"|"prefix": {field: value}}} or {"qsl": {"match_all": {}}};
+  // throws EngineError(kCodeInvalidParam).
+  static DocQuery Parse(const Json::Value& query);
+};
+
+struct SearchParams {
+  enum class Sort { kRelevance, kName, kSize, kMtime };
+  std::string keywords;
+  std::string name;
+  std::vector<std::string> exts;  // lower case
+  std::optional<bool> is_dir;
+  std::optional<int64_t> size_min, size_max, mtime_min, mtime_max;
+  std::string folder;
+  Sort sort = Sort::kRelevance;
+  bool desc = false;
+  int64_t from = 0;
+  int64_t size = 20;
+};
+
+struct SearchPage {
+  int64_t total = 0;
+  bool total_exact = true;
+  std::vector<Json::Value> hits;
+};
+
+// Decides whether the asking user may see the file at a full path.
+using VisibleFn = std::function<bool(const std::string& path)>;
+
+class IndexStore {
+ public:
+  static constexpr const char* kDbFile = "index.db";
+  // Rows a filtered search inspects beyond the requested page before it stops counting.
+  static constexpr int64_t kFilteredScanLimit = 20000;
+
+  // Creates a new, empty store in `dir` (made when missing). Throws StoreError or EngineError.
+  static std::shared_ptr<IndexStore> Create(const std::string& dir, const std::string& id,
+                                            const Json::Value& mappings,
+                                            const Json::Value& settings,
+                                            const Json::Value& event_handler);
+  // Opens the existing store in `dir`. Throws StoreError (damaged, unreadable) or EngineError.
+  static std::shared_ptr<IndexStore> Open(const std::string& dir);
+  static bool ExistsIn(const std::string& dir);
+
+  ~IndexStore();
+  IndexStore(const IndexStore&) = delete;
+  IndexStore& operator=(const IndexStore&) = delete;
+
+  const std::string& dir() const { return dir_; }
+  const Schema& schema() const { return schema_; }
+  std::string Meta(const std::string& key);
+  void SetMeta(const std::string& key, const std::string& value);  // inside a WriteTxn
+
+  // --- writer side: call only with the index's write lock held and a WriteTxn open.
+  Db& writer() { return writer_; }
+  // Adds or replaces a whole document. `doc_id` names the document it replaces; the document's
+  // identity is its property_id field (filled from `doc_id` when absent).
+  void Upsert(const std::string& doc_id, Json::Value doc);
+  // Merges `fields` into the existing document `doc_id`; throws EngineError(kCodeDocNotFound).
+  // Changing the identifying field re-keys it, replacing any document already under the new key.
+  void SetFields(const std::string& doc_id, const Json::Value& fields);
+  bool Delete(const std::string& doc_id);
+  int64_t DeleteByQuery(const DocQuery& q);
+  // Hits in identifier order, each the loaded stored fields.
+  Json::Value GetByQuery(const DocQuery& q, const std::vector<std::string>& load, int64_t from,
+                         int64_t size);
+  // (Re)computes the suggestion terms of one document; false when it does not exist.
+  bool UpdateTermSuggestion(const std::string& doc_id);
+  int64_t DocCount();
+
+  // Makes every committed transaction durable against power loss. No WriteTxn open.
+  void Sync();
+  // Checks the database structure; false with a detail when damaged.
+  bool QuickCheck(std::string* detail);
+
+  // --- reader side: any thread.
+  SearchPage Search(const SearchParams& p, const VisibleFn& visible);
+  // Completions of `prefix` (lower case), most used first.
+  std::vector<std::string> Suggest(const std::string& prefix, size_t limit,
+                                   const VisibleFn& visible);
+
+ private:
+  explicit IndexStore(std::string dir);
+  void OpenWriter(bool create);
+  void LoadSchema();
+  std::unique_ptr<Db> TakeReader();
+  void GiveBackReader(std::unique_ptr<Db> db);
+  void WriteRow(int64_t rowid, const DerivedDoc& d, const std::string& body, bool insert,
+                const DerivedDoc* old);
+  void DeleteRow(int64_t rowid, const DerivedDoc& old);
+  void SetTerms(int64_t rowid, const std::string& name);
+  // A prepared writer statement, reset and ready for binding.
+  Stmt& Cached(const char* sql);
+
+  std::string dir_;
+  std::string file_;
+  Schema schema_;
+  Db writer_;
+  std::map<const char*, std::unique_ptr<Stmt>> cached_;
+  std::mutex readers_mu_;
+  std::vector<std::unique_ptr<Db>> readers_;
+};
+
+// RAII write transaction on a store's writer connection: BEGIN IMMEDIATE, COMMIT on Commit(),
+// ROLLBACK otherwise.
+class WriteTxn {
+ public:
+  explicit WriteTxn(IndexStore& store) : txn_(store.writer()) {}
+  void Commit() { txn_.Commit(); }
+
+ private:
+  Transaction txn_;
+};
+
+// The words of a file name that feed suggestions: lower case, at least two characters, not
+// only digits.
+std::vector<std::string> SuggestionTerms(const std::string& name);
+
+// The smallest string greater than every string that starts with `prefix`; nullopt when there
+// is none (empty prefix or all bytes 0xFF).
+std::optional<std::string> PrefixUpperBound(const std::string& prefix);
+
+}  // namespace elasticd
+}  // namespace orvane
+
+#endif  // ORVANE_DAEMONS_QUIXELASTICD_STORE_HPP_

@@ -1,0 +1,171 @@
+#include "daemons/quixelasticd/test_client.hpp"
+
+#include <fcntl.h>
+#include <grp.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <thread>
+
+#include "common/fd.hpp"
+#include "common/json_util.hpp"
+
+namespace orvane {
+namespace elasticd {
+namespace tc {
+
+std::string Frame(const std::string& payload) {
+  const uint32_t n = static_cast<uint32_t>(payload.size());
+  std::string out(4, '\0');
+  std::memcpy(&out[0], &n, 4);
+  return out + payload;
+}
+
+std::string RawExchange(const std::string& socket, const std::string& bytes) {
+  UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  struct sockaddr_un addr;
+  std::memset(&addr, 0, sizeof(addr));
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, socket.c_str(), sizeof(addr.sun_path) - 1);
+  if (::connect(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0) {
+    return "<connect failed>";
+  }
+  size_t off = 0;
+  while (off < bytes.size()) {
+    const ssize_t n = ::send(fd.get(), bytes.data() + off, bytes.size() - off, MSG_NOSIGNAL);
+    if (n <= 0) break;
+    off += static_cast<size_t>(n);
+  }
+  ::shutdown(fd.get(), SHUT_WR);
+  std::string reply;
+  char buf[65536];
+  for (;;) {
+    const ssize_t n = ::recv(fd.get(), buf, sizeof(buf), 0);
+    if (n <= 0) break;
+    reply.append(buf, static_cast<size_t>(n));
+  }
+  if (reply.size() < 4) return std::string();
+  uint32_t len = 0;
+  std::memcpy(&len, reply.data(), 4);
+  if (reply.size() - 4 < len) return std::string();
+  return reply.substr(4, len);
+}
+
+Json::Value Request(const std::string& socket, const Json::Value& request) {
+  std::string payload = RawExchange(socket, Frame(JsonToString(request) + std::string(1, '\0')));
+  while (!payload.empty() && payload.back() == '\0') payload.pop_back();
+  JsonValue reply;
+  if (!reply.fromString(payload)) return Json::Value();
+  return reply;
+}
+
+Json::Value RequestAs(const std::string& socket, const Json::Value& request, uid_t uid,
+                      gid_t gid) {
+  int pipe_fds[2];
+  if (::pipe(pipe_fds) != 0) return Json::Value();
+  const pid_t pid = ::fork();
+  if (pid == 0) {
+    ::close(pipe_fds[0]);
+    if (::setgroups(0, nullptr) != 0 || ::setgid(gid) != 0 || ::setuid(uid) != 0) _exit(3);
+    const std::string text = JsonToString(Request(socket, request));
+    if (::write(pipe_fds[1], text.data(), text.size()) < 0) _exit(4);
+    _exit(0);
+  }
+  ::close(pipe_fds[1]);
+  std::string text;
+  char buf[4096];
+  for (;;) {
+    const ssize_t n = ::read(pipe_fds[0], buf, sizeof(buf));
+    if (n <= 0) break;
+    text.append(buf, static_cast<size_t>(n));
+  }
+  ::close(pipe_fds[0]);
+  int status = 0;
+  ::waitpid(pid, &status, 0);
+  JsonValue reply;
+  if (!reply.fromString(text)) return Json::Value();
+  return reply;
+}
+
+DaemonProcess::DaemonProcess(const std::string& root, std::vector<std::string> extra_args)
+    : root_(root) {
+  pid_ = ::fork();
+  if (pid_ == 0) {
+    ::setenv("ORVANE_ROOT", root.c_str(), 1);
+    std::vector<std::string> args = {QUIXELASTICD_BINARY, "--foreground", "--service-user",
+                                     "nobody-such-account"};
+    args.insert(args.end(), extra_args.begin(), extra_args.end());
+    std::vector<char*> argv;
+    for (std::string& a : args) argv.push_back(&a[0]);
+    argv.push_back(nullptr);
+    // The daemon's stderr log would drown the test output; syslog still has it.
+    const int null = ::open("/dev/null", O_WRONLY);
+    if (null >= 0) ::dup2(null, 2);
+    ::execv(argv[0], argv.data());
+    _exit(127);
+  }
+}
+
+DaemonProcess::~DaemonProcess() {
+  if (pid_ > 0) Signal(SIGKILL);
+}
+
+bool DaemonProcess::WaitReady() {
+  for (int i = 0; i < 400; ++i) {
+    Json::Value r = Request(socket(), Cmd("index_list", Json::Value(Json::objectValue)));
+    if (r.isObject() && r["success"].asBool()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(25));
+  }
+  return false;
+}
+
+int DaemonProcess::Signal(int sig) {
+  if (pid_ <= 0) return -1;
+  ::kill(pid_, sig);
+  int status = 0;
+  ::waitpid(pid_, &status, 0);
+  pid_ = -1;
+  return status;
+}
+
+Json::Value Cmd(const std::string& command, const Json::Value& data) {
+  Json::Value r;
+  r["command"] = command;
+  r["data"] = data;
+  return r;
+}
+
+Json::Value FileMappings() {
+  JsonValue m;
+  m.fromString(R"({
+    "property_id": "QUIXMDPath",
+    "default": {"type": "string", "analyzer": "quixstandard", "required": false, "stored": true,
+                "_all": true},
+    "properties": {
+      "QUIXMDPath": {"analyzer": "keyword", "required": true, "_all": false},
+      "QUIXMDFSName": {"analyzer": "keyword", "_all": false},
+      "QUIXMDIsDir": {"type": "bool", "_all": false},
+      "QUIXMDFSSize": {"type": "int"},
+      "QUIXMDFSContentChangeDate": {"type": "int"},
+      "QUIXMDTitle": {"type": "text"},
+      "QUIXMDParent": {"analyzer": "keyword", "_all": false},
+      "QUIXMDExtension": {"analyzer": "keyword", "_all": false},
+      "QUIXMDTextContent": {"type": "text"},
+      "QUIXMDSearchFileName": {"type": "text", "analyzer": "white space",
+                               "preprocess": ["tolower", "ngram"]},
+      "QUIXMDSearchAncestor": {"type": "text", "analyzer": "white space escaped", "_all": false,
+                               "preprocess": ["list_ancestor"]},
+      "QUIXMDSecret": {"stored": false}
+    }
+  })");
+  return m;
+}
+
+}  // namespace tc
+}  // namespace elasticd
+}  // namespace orvane

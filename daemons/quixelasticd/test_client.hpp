@@ -1,0 +1,57 @@
+// Test-only: a minimal client of the daemon's framing and a scoped daemon process, so that the
+// tests talk to the real daemon through its real socket. Not thread-safe.
+#ifndef ORVANE_DAEMONS_QUIXELASTICD_TEST_CLIENT_HPP_
+#define ORVANE_DAEMONS_QUIXELASTICD_TEST_CLIENT_HPP_
+
+#include <sys/types.h>
+
+#include <json/json.h>
+
+#include <string>
+#include <vector>
+
+namespace orvane {
+namespace elasticd {
+namespace tc {
+
+// Sends raw bytes to the socket and returns the raw reply payload ("" when the daemon closed
+// the connection without a reply). `as_uid` other than -1 runs the exchange in a child process
+// with that user's identity.
+std::string RawExchange(const std::string& socket, const std::string& bytes);
+// One request frame (JSON text + NUL) and its parsed reply; null on a closed connection.
+Json::Value Request(const std::string& socket, const Json::Value& request);
+// As Request(), from a child process running as `uid`/`gid`.
+Json::Value RequestAs(const std::string& socket, const Json::Value& request, uid_t uid, gid_t gid);
+std::string Frame(const std::string& payload);
+
+// The daemon binary run in the foreground under a scratch ORVANE_ROOT.
+class DaemonProcess {
+ public:
+  DaemonProcess(const std::string& root, std::vector<std::string> extra_args = {});
+  ~DaemonProcess();
+  DaemonProcess(const DaemonProcess&) = delete;
+  DaemonProcess& operator=(const DaemonProcess&) = delete;
+
+  // Waits until the socket answers; false after ~10 s.
+  bool WaitReady();
+  // Sends a signal and waits for the exit; returns the wait status.
+  int Signal(int sig);
+  pid_t pid() const { return pid_; }
+  std::string socket() const { return root_ + "/var/run/quixelasticd.sock"; }
+  std::string public_socket() const { return root_ + "/var/run/quixelasticd.search.sock"; }
+
+ private:
+  std::string root_;
+  pid_t pid_ = -1;
+};
+
+// A request {"command": command, "data": data}.
+Json::Value Cmd(const std::string& command, const Json::Value& data);
+// The schema the library sends at index creation, reduced to the fields the tests use.
+Json::Value FileMappings();
+
+}  // namespace tc
+}  // namespace elasticd
+}  // namespace orvane
+
+#endif  // ORVANE_DAEMONS_QUIXELASTICD_TEST_CLIENT_HPP_
