@@ -113,25 +113,25 @@ Json::Value PrefixQuery(const std::string& dir) {
   return query;
 }
 
-// Sends a query and checks that its reply carries the hits.
-void SendQuery(Json::Value& res, const Json::Value& req) {
+// Sends a query for the command `func` and checks that its reply carries the hits.
+void SendQuery(Json::Value& res, const Json::Value& req, const char* func) {
   SendRequest(res, req);
   if (!res.isObject() || !res.isMember("data") || !res["data"].isArray()) {
-    ThrowError(__FILE__, __LINE__, __func__, "!res.isMember(\"data\") || !res[\"data\"].isArray()",
+    ThrowError(__FILE__, __LINE__, func, "!res.isMember(\"data\") || !res[\"data\"].isArray()",
                kErrNoQueryData, JsonToString(res));
   }
 }
 
 // The document of `path` as extraction gives it, with the two fields the engine searches names
 // and folders by.
-Json::Value ParseDocument(const std::string& path, bool need_meta) {
+Json::Value ParseDocument(const std::string& path, bool need_meta, const char* func) {
   Json::Value config(Json::objectValue);
   config[ce::kKeyNeedMeta] = need_meta;
   Json::Value doc;
   try {
     ce::ParseFile(path, config, doc);
   } catch (...) {
-    ThrowError(__FILE__, __LINE__, "ParseFile", "ParseFile(path, config, doc)", kErrParseFile,
+    ThrowError(__FILE__, __LINE__, func, "ParseFile(path, config, doc)", kErrParseFile,
                "Parse failed, path=" + path);
   }
   doc[ce::QUIXMDSearchFileName] = doc[ce::QUIXMDFSName];
@@ -197,7 +197,7 @@ void ShareIndexMigrate(const std::string& share, const std::string& db_path) {
 void IndexUpsert(const std::string& share, const std::string& path, bool need_meta) {
   Json::Value req = Command("document_upsert_by_id", GetFileIndexID(share));
   req["data"]["doc_id"] = path;
-  req["data"]["data"] = ParseDocument(path, need_meta);
+  req["data"]["data"] = ParseDocument(path, need_meta, __func__);
   SendRequest(req);
 }
 
@@ -217,7 +217,7 @@ void IndexAttr(const std::string& share, const std::string& path) {
   if (!IsDocumentExists(share, path)) throw Error(kErrNoDocument);
   Json::Value req = Command("document_set_by_id", GetFileIndexID(share));
   req["data"]["doc_id"] = path;
-  req["data"]["data"] = ParseDocument(path, false);
+  req["data"]["data"] = ParseDocument(path, false, __func__);
   SendRequest(req);
 }
 
@@ -225,7 +225,7 @@ bool IsDocumentExists(const std::string& share, const std::string& path) {
   Json::Value req = Command("document_get_by_query", GetFileIndexID(share));
   req["data"]["query"]["qsl"]["term"][ce::QUIXMDPath] = path;
   Json::Value res;
-  SendQuery(res, req);
+  SendQuery(res, req, __func__);
   return !res["data"].empty();
 }
 
@@ -235,7 +235,7 @@ void IndexGetByPrefixPath(const std::string& db_name, const std::string& dir,
   req["data"]["query"] = PrefixQuery(dir);
   req["data"]["query"]["load_field"].append(ce::QUIXMDPath);
   Json::Value res;
-  SendQuery(res, req);
+  SendQuery(res, req, __func__);
   for (const Json::Value& hit : res["data"]) {
     if (!hit.isObject()) continue;
     const Json::Value* path = hit.find(ce::QUIXMDPath, ce::QUIXMDPath + sizeof(ce::QUIXMDPath) - 1);
@@ -290,7 +290,7 @@ void IndexRename(const std::string& share, const std::string& new_path,
     query["from"] = 0;
     query["size"] = kRenameBatchSize;
     Json::Value res;
-    SendQuery(res, req);
+    SendQuery(res, req, __func__);
     const Json::Value& hits = res["data"];
     if (hits.empty()) return;
 
