@@ -15,9 +15,9 @@ namespace CONTENT_EXTRACT {
 void ParseFile(const std::string& path, const Json::Value& config, Json::Value& doc) {
   struct statx st;
   std::memset(&st, 0, sizeof(st));
-  ORVANE_THROW_IF(0 != statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW,
-                             STATX_BASIC_STATS | STATX_BTIME, &st),
-                  orvane::kErrSystem, "statx failed, path=" + path + ", reason=" + strerror(errno));
+  ORVANE_THROW_IF(
+      0 != statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME, &st),
+      orvane::kErrSystem, "statx failed, path=" + path + ", reason=" + strerror(errno));
 
   Json::Value out(Json::objectValue);
   out[QUIXMDPath] = path;

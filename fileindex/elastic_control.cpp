@@ -364,8 +364,7 @@ void UpdateTermSuggestion() {
     sdk::SDKShare sdk_share(share);
     const std::string db = sdk_share.GetDBName();
     if (std::find(dbs.begin(), dbs.end(), db) == dbs.end()) continue;
-    Log(LOG_ERR, "%s:%d Start building term sugg [%s]", SourceName(__FILE__), __LINE__,
-        db.c_str());
+    Log(LOG_ERR, "%s:%d Start building term sugg [%s]", SourceName(__FILE__), __LINE__, db.c_str());
     const std::string term_sugg_running = sdk_share.GetDBPath() + kTermSuggRunningMarker;
     {
       std::ofstream ofs(term_sugg_running, std::ios::trunc);

@@ -26,8 +26,8 @@ class RealEngineTest : public ::testing::Test {
   RealEngineTest() : root_(dir_.path()) {
     chmod(dir_.path().c_str(), 0755);
     share_ = volume_.path() + "/photo";
-    test::WritePlatformConfig(dir_.path(), R"({"shares": [{"name": "photo", "path": ")" + share_ +
-                                               R"("}]})");
+    test::WritePlatformConfig(dir_.path(),
+                              R"({"shares": [{"name": "photo", "path": ")" + share_ + R"("}]})");
   }
   void SetUp() override {
     daemon_ = std::make_unique<elasticd::tc::DaemonProcess>(dir_.path());
@@ -50,9 +50,9 @@ class RealEngineTest : public ::testing::Test {
 
 TEST_F(RealEngineTest, DocumentsAreUpsertedRenamedAndDeleted) {
   const std::string trip = share_ + "/trip";
-  const std::vector<std::string> files = {
-      volume_.Write("photo/trip/a.JPG", "jpeg"), volume_.Write("photo/trip/sub/b \"q\"\n.txt", "t"),
-      volume_.Write("photo/tripx.txt", "x")};
+  const std::vector<std::string> files = {volume_.Write("photo/trip/a.JPG", "jpeg"),
+                                          volume_.Write("photo/trip/sub/b \"q\"\n.txt", "t"),
+                                          volume_.Write("photo/tripx.txt", "x")};
   ShareIndexCreate("photo");
   IndexUpsert("photo", trip, false);
   IndexUpsert("photo", trip + "/sub", false);

@@ -83,8 +83,9 @@ TEST_F(StatusMgrTest, MissingOrMalformedFile) {
     EXPECT_EQ(std::string(e.what()),
               "Orvane error, code=504, reason=[Cannot load json: " + StatusPath() + "]");
   }
-  EXPECT_TRUE(log.Contains("Failed [IsFileExist(kFileIndexStatusCfgPath) && "
-                           "!data_.fromFile(kFileIndexStatusCfgPath)]"));
+  EXPECT_TRUE(
+      log.Contains("Failed [IsFileExist(kFileIndexStatusCfgPath) && "
+                   "!data_.fromFile(kFileIndexStatusCfgPath)]"));
 }
 
 TEST_F(StatusMgrTest, NotificationsRunTheNotifierWithTheirArguments) {
