@@ -165,6 +165,27 @@ TEST_F(CommTest, FailureReplyCarriesTheDaemonsCodeAndMessageWithoutALogLine) {
   EXPECT_THAT(e.what(), HasSubstr("Missing property: msg, data={\"code\":609}"));
 }
 
+// Replies whose parts have unexpected types end in an Error or are passed over, never in a
+// crash or a JSON library exception.
+TEST_F(CommTest, OddlyTypedRepliesAreHandled) {
+  Json::Value compound_req;
+  compound_req["compound"].append(Req("sub"));
+  FakeDaemon engine(
+      SockPath(),
+      FakeDaemon::Replies(
+          {R"({"success":false,"error":"x"})",
+           R"({"success":false,"error":{"code":"1400","msg":"m"}})",
+           R"({"success":true,"has_fail":true,"data":{"a":1}})",
+           R"({"success":true,"has_fail":"yes","data":[{"success":false}]})",
+           R"({"success":true,"has_fail":true,"data":[1,{"success":"no"}]})",
+           R"({"success":true,"has_fail":true,"data":[{"success":false,"error":{}}]})"}));
+  EXPECT_THAT(ImplError(Req("commit")).what(), HasSubstr("Not an object, data=\"x\""));
+  EXPECT_THAT(ImplError(Req("commit")).what(), HasSubstr("Not a string"));
+  Json::Value res;
+  for (int i = 0; i < 3; ++i) SendRequestImpl(res, compound_req);
+  EXPECT_THAT(ImplError(compound_req).what(), HasSubstr("Missing property: code"));
+}
+
 TEST_F(CommTest, CompoundFailuresAreLoggedUnlessTheDaemonWasBusy) {
   Json::Value req;
   for (int i = 0; i < 3; ++i) req["compound"].append(Req("sub" + std::to_string(i)));
