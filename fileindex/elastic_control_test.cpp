@@ -8,6 +8,7 @@
 #include <functional>
 #include <map>
 #include <set>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -283,6 +284,37 @@ TEST_F(ElasticControlTest, ExtractionFailureIs914AndSendsNothing) {
   EXPECT_TRUE(engine.requests().empty());
   EXPECT_EQ(ErrorOf([&] { IndexAttr("photo", missing); }).code, kErrParseFile);
   EXPECT_EQ(engine.requests().size(), 1u);  // only the existence query
+}
+
+TEST_F(ElasticControlTest, ExtractionIsAskedForMetadataOnlyOnUpsertRequest) {
+  Engine engine(Sock(), [](const Json::Value&) { return Hits(Parse(R"([{"QUIXMDPath":"x"}])")); });
+  std::vector<Json::Value> configs;
+  bool fail = false;
+  const ParseFileFn previous =
+      SetParseFile([&](const std::string& path, const Json::Value& config, Json::Value& doc) {
+        configs.push_back(config);
+        if (fail) throw std::runtime_error("not an Error");
+        doc["QUIXMDFSName"] = "n";
+        doc["QUIXMDParent"] = "/p";
+      });
+  IndexUpsert("photo", "/p/n", false);
+  IndexUpsert("photo", "/p/n", true);
+  IndexAttr("photo", "/p/n");
+  fail = true;
+  EXPECT_STREQ(ErrorOf([] { IndexUpsert("photo", "/p/n", true); }).what(),
+               "Orvane error, code=914, reason=[Parse failed, path=/p/n]");
+  SetParseFile(previous);
+
+  EXPECT_THAT(configs,
+              ElementsAre(Parse(R"({"need_meta":false})"), Parse(R"({"need_meta":true})"),
+                          Parse(R"({"need_meta":false})"), Parse(R"({"need_meta":true})")));
+  const std::vector<Json::Value> sent = engine.requests();
+  ASSERT_EQ(sent.size(), 4u);
+  EXPECT_EQ(sent[0], Parse(R"({"command":"document_upsert_by_id","data":{"id":"fileindex_photo",
+      "doc_id":"/p/n","data":{"QUIXMDFSName":"n","QUIXMDParent":"/p",
+      "QUIXMDSearchFileName":"n","QUIXMDSearchAncestor":"/p"}}})"));
+  EXPECT_EQ(sent[1]["command"], "document_upsert_by_id");
+  EXPECT_EQ(sent[3]["command"], "document_set_by_id");
 }
 
 TEST_F(ElasticControlTest, QueryRepliesWithoutADataArrayAre916) {
