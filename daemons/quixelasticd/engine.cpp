@@ -991,7 +991,7 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller) {
           return p.desc ? a["score"].asDouble() < b["score"].asDouble()
                         : a["score"].asDouble() > b["score"].asDouble();
         }
-        return AsciiLower(a["name"].asString()) < AsciiLower(b["name"].asString());
+        return false;  // index order within each index, indexes one after the other
       case SearchParams::Sort::kName:
         return p.desc ? AsciiLower(a["name"].asString()) > AsciiLower(b["name"].asString())
                       : AsciiLower(a["name"].asString()) < AsciiLower(b["name"].asString());

@@ -39,6 +39,8 @@ void ConfigureWriter(Db& db) {
   db.Exec("PRAGMA synchronous=NORMAL");
   db.Exec("PRAGMA cache_size=-32768");
   db.Exec("PRAGMA temp_store=MEMORY");
+  db.Exec("PRAGMA mmap_size=268435456");
+  db.Exec("PRAGMA wal_autocheckpoint=4096");
 }
 
 std::string FieldPath(const std::string& field) {
@@ -344,11 +346,19 @@ void IndexStore::WriteRow(int64_t rowid, const DerivedDoc& d, const std::string&
           .Bind(2, d.name_text).Run();
     }
   }
-  if (old == nullptr || old->name != d.name) SetTerms(rowid, d.name);
+  if (old == nullptr) {
+    AddTerms(rowid, d.name);
+  } else if (old->name != d.name) {
+    SetTerms(rowid, d.name);
+  }
 }
 
 void IndexStore::SetTerms(int64_t rowid, const std::string& name) {
   Cached("DELETE FROM sugg WHERE doc = ?").Bind(1, rowid).Run();
+  AddTerms(rowid, name);
+}
+
+void IndexStore::AddTerms(int64_t rowid, const std::string& name) {
   for (const std::string& t : SuggestionTerms(name)) {
     Cached("INSERT OR IGNORE INTO sugg(term, doc) VALUES(?, ?)").Bind(1, t).Bind(2, rowid).Run();
   }
@@ -527,6 +537,7 @@ std::unique_ptr<Db> IndexStore::TakeReader() {
   db->Open(file_, false, false);
   db->Exec("PRAGMA query_only=1");
   db->Exec("PRAGMA cache_size=-16384");
+  db->Exec("PRAGMA mmap_size=268435456");
   return db;
 }
 
@@ -580,7 +591,8 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
   }
   if (!name.empty()) {
     sql += " JOIN fts_name ON fts_name.rowid = d.rowid";
-    // The trigram index answers substrings of three characters or more; shorter ones scan.
+    // The trigram index answers substrings of three characters or more as a phrase of
+    // trigrams, from positions alone; shorter ones scan the names.
     if (name.size() >= 3) {
       std::string phrase = "\"";
       for (char c : name) {
@@ -631,8 +643,9 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
   std::string order;
   switch (p.sort) {
     case SearchParams::Sort::kRelevance:
+      // Without keywords there is no score: hits come in index order, which costs no sort.
       order = has_keywords ? std::string(" ORDER BY bm25(fts_all)") + (p.desc ? " DESC" : "")
-                           : " ORDER BY d.name COLLATE NOCASE, d.path";
+                           : "";
       break;
     case SearchParams::Sort::kName:
       order = std::string(" ORDER BY d.name COLLATE NOCASE") + dir + ", d.path";
@@ -659,9 +672,15 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
   std::unique_ptr<Db> db = TakeReader();
   SearchPage page;
   if (!visible) {
-    Stmt count(*db, "SELECT count(*) FROM (" + base + ")");
+    // Counting stops at a bound, so that a one-letter search over a million names stays fast.
+    Stmt count(*db, "SELECT count(*) FROM (" + base + " LIMIT " +
+                        std::to_string(kCountLimit + 1) + ")");
     bind_all(count);
     if (count.Step()) page.total = count.Int(0);
+    if (page.total > kCountLimit) {
+      page.total = kCountLimit;
+      page.total_exact = false;
+    }
     Stmt st(*db, base + order + " LIMIT ? OFFSET ?");
     const int next = bind_all(st);
     st.Bind(next, p.size).Bind(next + 1, p.from);

@@ -63,6 +63,8 @@ class IndexStore {
   static constexpr const char* kDbFile = "index.db";
   // Rows a filtered search inspects beyond the requested page before it stops counting.
   static constexpr int64_t kFilteredScanLimit = 20000;
+  // Hits an unfiltered search counts before it reports the total as a lower bound.
+  static constexpr int64_t kCountLimit = 10000;
 
   // Creates a new, empty store in `dir` (made when missing). Throws StoreError or EngineError.
   static std::shared_ptr<IndexStore> Create(const std::string& dir, const std::string& id,
@@ -120,6 +122,7 @@ class IndexStore {
                 const DerivedDoc* old);
   void DeleteRow(int64_t rowid, const DerivedDoc& old);
   void SetTerms(int64_t rowid, const std::string& name);
+  void AddTerms(int64_t rowid, const std::string& name);
   // A prepared writer statement, reset and ready for binding.
   Stmt& Cached(const char* sql);
 
