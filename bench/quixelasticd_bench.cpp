@@ -217,6 +217,7 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "at least 130000 documents are needed\n");
     return 2;
   }
+  std::setvbuf(stdout, nullptr, _IOLBF, 0);
   orvane::SetLogSink([](int priority, const std::string& line) {
     if (priority <= 3) std::fprintf(stderr, "%s\n", line.c_str());
   });

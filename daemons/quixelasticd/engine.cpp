@@ -157,6 +157,7 @@ class Engine::Session {
     } catch (const StoreError& err) {
       txn_.reset();
       engine_.HandleStoreFailure(*entry_, err);
+      FailPending(err);
       Release();
       throw;
     }

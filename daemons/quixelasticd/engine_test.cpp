@@ -323,9 +323,10 @@ TEST_F(EngineTest, TermSuggestionStoreRebuild) {
   {
     sqlite3* db = nullptr;
     ASSERT_EQ(sqlite3_open(dir_.Path("db/index.db").c_str(), &db), SQLITE_OK);
-    ASSERT_EQ(sqlite3_exec(db, "UPDATE meta SET value='unavail' WHERE key='term_sugg';"
-                               "DELETE FROM sugg;", nullptr, nullptr, nullptr), SQLITE_OK);
+    const int rc = sqlite3_exec(db, "UPDATE meta SET value='unavail' WHERE key='term_sugg'",
+                                nullptr, nullptr, nullptr);
     sqlite3_close(db);
+    ASSERT_EQ(rc, SQLITE_OK);
   }
   const Json::Value listed = Send(Cmd("list_term_sugg_db", Json::Value(Json::objectValue)));
   ASSERT_EQ(listed["data"]["unavail"].size(), 1u);
