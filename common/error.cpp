@@ -21,13 +21,15 @@ std::string BuildMessage(ErrorCode code, const std::string& reason) {
 Error::Error(ErrorCode code) : Error(code, std::string()) {}
 
 Error::Error(ErrorCode code, const std::string& reason)
-    : std::runtime_error(BuildMessage(code, reason)), code(code), message(BuildMessage(code, reason)) {}
+    : std::runtime_error(BuildMessage(code, reason)),
+      code(code),
+      message(BuildMessage(code, reason)) {}
 
 Error::Error(const Error& other)
     : std::runtime_error(other), code(other.code), message(other.message) {}
 
-void ThrowError(const char* file, int line, const char* func, const char* condition,
-                ErrorCode code, const std::string& reason) {
+void ThrowError(const char* file, int line, const char* func, const char* condition, ErrorCode code,
+                const std::string& reason) {
   const int saved_errno = errno;
   Error error(code, reason);
   errno = saved_errno;

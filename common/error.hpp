@@ -57,8 +57,8 @@ void LogFailure(const char* file, int line, const char* func, const char* condit
 
 // Throws Error(code, reason), logged at the throw site, when `cond` holds. The condition's own
 // text is what the log line names, so write it as the failing test reads best.
-#define ORVANE_THROW_IF(cond, code, reason)                                             \
-  do {                                                                                  \
+#define ORVANE_THROW_IF(cond, code, reason)                                            \
+  do {                                                                                 \
     if (cond) ::orvane::ThrowError(__FILE__, __LINE__, __func__, #cond, code, reason); \
   } while (0)
 

@@ -108,7 +108,8 @@ bool JsonValue::toFile(const std::string& path) const {
   }
   // The rename is durable only once the folder itself is synced.
   const size_t slash = path.rfind('/');
-  const std::string dir = slash == std::string::npos ? "." : (slash == 0 ? "/" : path.substr(0, slash));
+  const std::string dir =
+      slash == std::string::npos ? "." : (slash == 0 ? "/" : path.substr(0, slash));
   UniqueFd dir_fd(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (dir_fd.valid()) fsync(dir_fd.get());
   errno = saved_errno;

@@ -80,7 +80,8 @@ TEST(JsonUtilTest, GetJsonValueTypeRules) {
 
 TEST(JsonUtilTest, ApplyChangesDeletesDescendsAndReplaces) {
   Json::Value dst = Parse(R"({"a":1,"b":2,"l":[1,2],"o":{"x":1,"y":2}})");
-  JsonApplyChanges(dst, Parse(R"({"a":null,"gone":null,"c":{"d":1},"l":[1],"o":{"y":null,"z":3}})"));
+  JsonApplyChanges(dst,
+                   Parse(R"({"a":null,"gone":null,"c":{"d":1},"l":[1],"o":{"y":null,"z":3}})"));
   EXPECT_EQ(JsonToString(dst), R"({"b":2,"c":{"d":1},"l":[1],"o":{"x":1,"z":3}})");
   JsonApplyChanges(dst, Parse("{}"));
   EXPECT_EQ(JsonToString(dst), R"({"b":2,"c":{"d":1},"l":[1],"o":{"x":1,"z":3}})");

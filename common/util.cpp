@@ -7,9 +7,94 @@
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
+#include <cstring>
 #include <memory>
 
+#include "common/error.hpp"
+#include "common/sdk/sdk_mutex.hpp"
+#include "platform/user.hpp"
+
 namespace orvane {
+
+using namespace orvane::platform;  // NOLINT: the platform calls read as the platform names them
+
+namespace {
+
+constexpr char kOrvaneUser[] = "Orvane";
+
+// Builds a User from a looked-up record; the caller holds SDKMutex().
+std::unique_ptr<sdk::User> UserOf(const QUIXUSER& info) {
+  const bool home_enabled = QUIXServiceUserHomeIsEnabled(info.szName) == 1;
+  return std::make_unique<sdk::User>(info.szName, info.uid, info.gid, home_enabled);
+}
+
+}  // namespace
+
+bool CheckACLPerm(const std::string& path, int mask) {
+  int perm = 0;
+  if (0 > QUIXACLPermGet(path.c_str(), &perm)) return false;
+  return (mask & perm) != 0;
+}
+
+bool IsMountPoint(const std::string& path) { return QUIXFSDirIsMntPoint(path.c_str()) > 0; }
+
+bool MVFileImpl(const std::string& src, const std::string& dst, QUIXCOPYARGS* args) {
+  return QUIXFileCopy(src.c_str(), dst.c_str(), args) == 0;
+}
+
+bool MVFile(const std::string& src, const std::string& dst) {
+  QUIXCOPYARGS args;
+  memset(&args, 0, sizeof(args));
+  args.fCopy = 1;
+  args.fRemoveSrc = 1;
+  return MVFileImpl(src, dst, &args);
+}
+
+bool CPFile(const std::string& src, const std::string& dst) {
+  QUIXCOPYARGS args;
+  memset(&args, 0, sizeof(args));
+  args.fCopy = 1;
+  return MVFileImpl(src, dst, &args);
+}
+
+bool ChownOrvane(const std::string& path) {
+  uid_t uid;
+  gid_t gid;
+  {
+    LockMutex lock(sdk::SDKMutex());
+    QUIXUSER* user_info = nullptr;
+    if (0 > QUIXUserGet(kOrvaneUser, &user_info) || !user_info) {
+      ThrowError(__FILE__, __LINE__, __func__, "0 > QUIXUserGet(kOrvaneUser, &user_info) || !user_info",
+                 kErrChown, std::string("QUIXUserGet failed, user=") + kOrvaneUser);
+    }
+    uid = user_info->uid;
+    gid = user_info->gid;
+    QUIXUserFree(user_info);
+  }
+  return chown(path.c_str(), uid, gid) == 0;
+}
+
+std::unique_ptr<sdk::User> GetUser(const std::string& name) {
+  LockMutex lock(sdk::SDKMutex());
+  QUIXUSER* user_info = nullptr;
+  if (0 > QUIXUserGet(name.c_str(), &user_info) || !user_info) {
+    ThrowError(__FILE__, __LINE__, __func__, "0 > QUIXUserGet(name.c_str(), &user_info) || !user_info",
+               kErrChown, "QUIXUserGet failed, user=" + name);
+  }
+  std::unique_ptr<QUIXUSER, void (*)(PQUIXUSER)> owned(user_info, QUIXUserFree);
+  return UserOf(*user_info);
+}
+
+std::unique_ptr<sdk::User> GetUserByUID(uid_t uid) {
+  LockMutex lock(sdk::SDKMutex());
+  QUIXUSER* user_info = nullptr;
+  if (0 > QUIXUserGetByUID(uid, &user_info) || !user_info) {
+    ThrowError(__FILE__, __LINE__, __func__, "0 > QUIXUserGetByUID(uid, &user_info) || !user_info",
+               kErrChown, "QUIXUserGetByUID failed, uid=" + std::to_string(uid));
+  }
+  std::unique_ptr<QUIXUSER, void (*)(PQUIXUSER)> owned(user_info, QUIXUserFree);
+  return UserOf(*user_info);
+}
 
 bool IsFileExist(const std::string& path) {
   struct stat st;

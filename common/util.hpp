@@ -5,9 +5,15 @@
 
 #include <dirent.h>
 
+#include <memory>
 #include <string>
 
+#include "common/sdk/user.hpp"
+#include "platform/fs.hpp"
+
 namespace orvane {
+
+using platform::QUIXCOPYARGS;
 
 // A regular file, not followed through a symbolic link.
 bool IsFileExist(const std::string& path);
@@ -29,6 +35,24 @@ std::string GetFileExtension(const std::string& path, bool to_lower);
 std::string RealPath(const std::string& path);
 // unlink(2) that counts a missing file as removed.
 bool Unlink(const std::string& path);
+
+// Whether the effective user has any of the access bits `mask` (platform::QUIX_ACL_*) on `path`,
+// POSIX ACLs included; false when the path cannot be examined.
+bool CheckACLPerm(const std::string& path, int mask);
+// Whether `path` is the root of a mount (bind mounts included).
+bool IsMountPoint(const std::string& path);
+// Copies a regular file keeping mode, owner and times, as `args` says (QUIXCOPYARGS).
+bool MVFileImpl(const std::string& src, const std::string& dst, QUIXCOPYARGS* args);
+// Copies, then removes the source.
+bool MVFile(const std::string& src, const std::string& dst);
+// Copies and keeps the source.
+bool CPFile(const std::string& src, const std::string& dst);
+// Hands `path` to the package's service account "Orvane" (its uid and primary group). Throws
+// Error 801 when that account does not exist; false when chown fails.
+bool ChownOrvane(const std::string& path);
+// The platform user `name` with its home-service flag. Throws Error 801 for an unknown user.
+std::unique_ptr<sdk::User> GetUser(const std::string& name);
+std::unique_ptr<sdk::User> GetUserByUID(uid_t uid);
 
 std::string RTrim(const std::string& s);
 std::string LTrim(const std::string& s);

@@ -1,9 +1,13 @@
 #include "common/util.hpp"
 
 #include <gtest/gtest.h>
+#include <pwd.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include "common/error.hpp"
 #include "common/root.hpp"
+#include "platform/fault.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -84,6 +88,55 @@ TEST(UtilTest, RootedPaths) {
   const std::string p = RootedPathForWrite("/var/packages/Orvane/etc/fileindex.folders");
   EXPECT_TRUE(IsDirExist(Dirname(p), false));
   EXPECT_FALSE(IsFileExist(p));
+}
+
+TEST(UtilTest, PlatformBackedFileHelpers) {
+  test::TempDir dir;
+  const std::string src = dir.Write("a", "content");
+  EXPECT_TRUE(CPFile(src, dir.Path("b")));
+  EXPECT_TRUE(IsFileExist(src));
+  EXPECT_TRUE(MVFile(dir.Path("b"), dir.Path("c")));
+  EXPECT_FALSE(IsFileExist(dir.Path("b")));
+  EXPECT_EQ(test::ReadFile(dir.Path("c")), "content");
+  EXPECT_FALSE(MVFile(dir.Path("missing"), dir.Path("d")));
+  {
+    platform::ScopedFaults faults;
+    faults.Arm("QUIXFileCopy", platform::Fault{-1, EIO});
+    EXPECT_FALSE(CPFile(src, dir.Path("e")));
+    faults.Arm("QUIXACLPermGet", platform::Fault{-1, EIO, 0, platform::QUIX_ACL_READ, true});
+    EXPECT_FALSE(CheckACLPerm(src, platform::QUIX_ACL_READ));
+  }
+
+  ASSERT_EQ(chmod(src.c_str(), 0400), 0);
+  EXPECT_TRUE(CheckACLPerm(src, platform::QUIX_ACL_READ));
+  EXPECT_TRUE(CheckACLPerm(src, platform::QUIX_ACL_READ | platform::QUIX_ACL_EXECUTE));
+  if (geteuid() != 0) EXPECT_FALSE(CheckACLPerm(src, platform::QUIX_ACL_WRITE));
+  EXPECT_FALSE(CheckACLPerm(src, platform::QUIX_ACL_EXECUTE));
+  EXPECT_FALSE(CheckACLPerm(dir.Path("missing"), platform::QUIX_ACL_READ));
+
+  EXPECT_TRUE(IsMountPoint("/"));
+  EXPECT_FALSE(IsMountPoint(dir.path()));
+  EXPECT_FALSE(IsMountPoint(dir.Path("missing")));
+}
+
+TEST(UtilTest, ChownOrvaneNeedsThePackageAccount) {
+  test::TempDir dir;
+  const std::string file = dir.Write("f", "x");
+  if (getpwnam("Orvane") == nullptr) {
+    test::LogCapture log;
+    try {
+      ChownOrvane(file);
+      ADD_FAILURE() << "no Error without the package account";
+    } catch (const Error& e) {
+      EXPECT_EQ(e.code, kErrChown);
+      EXPECT_EQ(e.message, "Orvane error, code=801, reason=[QUIXUserGet failed, user=Orvane]");
+    }
+    EXPECT_TRUE(log.Contains("Failed [0 > QUIXUserGet(kOrvaneUser, &user_info) || !user_info]"));
+    return;
+  }
+  // On a machine with the package installed the file goes to its account.
+  EXPECT_EQ(ChownOrvane(file), geteuid() == 0);
+  EXPECT_FALSE(ChownOrvane(dir.Path("missing")));
 }
 
 }  // namespace

@@ -1,8 +1,12 @@
 #include "test/test_util.hpp"
 
 #include <ftw.h>
+#include <grp.h>
+#include <pwd.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <fstream>
 #include <sstream>
@@ -15,8 +19,8 @@ namespace test {
 
 TempDir::TempDir() {
   const char* base = std::getenv("TMPDIR");
-  std::string tmpl = std::string(base != nullptr && base[0] != '\0' ? base : "/tmp") +
-                     "/fileindex-test-XXXXXX";
+  std::string tmpl =
+      std::string(base != nullptr && base[0] != '\0' ? base : "/tmp") + "/fileindex-test-XXXXXX";
   if (mkdtemp(tmpl.data()) == nullptr) throw std::runtime_error("mkdtemp failed");
   path_ = tmpl;
 }
@@ -41,6 +45,19 @@ std::string ReadFile(const std::string& path) {
   std::ostringstream out;
   out << in.rdbuf();
   return out.str();
+}
+
+std::string WritePlatformConfig(const std::string& root, const std::string& json_text) {
+  const std::string path = root + "/etc/orvane/platform.json";
+  MakeParentDirs(path);
+  // Written beside and renamed, so a reader never sees half a file and the inode changes.
+  const std::string tmp = path + ".tmp";
+  {
+    std::ofstream out(tmp, std::ios::binary | std::ios::trunc);
+    out << json_text;
+  }
+  if (rename(tmp.c_str(), path.c_str()) != 0) throw std::runtime_error("rename failed: " + path);
+  return path;
 }
 
 LogCapture::LogCapture()
@@ -112,6 +129,27 @@ int64_t FakeEnv::slept_micros() const {
   int64_t total = 0;
   for (int64_t s : sleeps_) total += s;
   return total;
+}
+
+int RunAsUser(const std::string& user, const std::function<int()>& fn) {
+  std::fflush(nullptr);
+  const pid_t pid = fork();
+  if (pid < 0) return -1;
+  if (pid == 0) {
+    if (geteuid() == 0) {
+      struct passwd* pw = getpwnam(user.c_str());
+      if (pw == nullptr || setgroups(0, nullptr) != 0 || setgid(pw->pw_gid) != 0 ||
+          setuid(pw->pw_uid) != 0) {
+        _exit(255);
+      }
+    }
+    _exit(fn() & 0xff);
+  }
+  int status = 0;
+  if (waitpid(pid, &status, 0) != pid || !WIFEXITED(status) || WEXITSTATUS(status) == 255) {
+    return -1;
+  }
+  return WEXITSTATUS(status);
 }
 
 ScopedRoot::ScopedRoot(const std::string& root) {

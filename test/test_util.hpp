@@ -5,6 +5,7 @@
 
 #include <cstdint>
 #include <deque>
+#include <functional>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -35,6 +36,10 @@ class TempDir {
 
 // Reads a whole file; "" when it cannot be read.
 std::string ReadFile(const std::string& path);
+
+// Writes the platform configuration (shares, administrators group, ...) that the platform layer
+// reads under `root` (the test's ORVANE_ROOT): `root`/etc/orvane/platform.json. Returns its path.
+std::string WritePlatformConfig(const std::string& root, const std::string& json_text);
 
 // Captures every log line for its lifetime instead of sending it to syslog.
 class LogCapture {
@@ -83,6 +88,11 @@ class FakeEnv : public Env {
   std::deque<int> rand_;
   Env* previous_;
 };
+
+// Runs `fn` in a child process as `user` (real and effective ids, no supplementary groups) and
+// returns what it returns, or -1 when the child could not switch or died. Unprivileged callers
+// cannot switch: `fn` then runs in a child as the caller, who is unprivileged already.
+int RunAsUser(const std::string& user, const std::function<int()>& fn);
 
 // Sets ORVANE_ROOT for its lifetime and restores the former value.
 class ScopedRoot {

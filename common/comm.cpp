@@ -1,0 +1,157 @@
+#include "common/comm.hpp"
+
+#include <syslog.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <string>
+
+#include "common/env.hpp"
+#include "common/error.hpp"
+#include "common/json_util.hpp"
+#include "common/log.hpp"
+#include "common/root.hpp"
+#include "fileindex/notify.hpp"
+#include "platform/daemon_sock.hpp"
+
+namespace orvane {
+namespace {
+
+constexpr int kSocketWaitRetries = 31;
+constexpr int64_t kSecond = 1000000;
+constexpr int64_t kNotReadySleep = 30 * kSecond;
+constexpr unsigned kBusyRetriesBeforeNotify = 10;
+
+bool IsBusy(int code) { return code == 1400 || code == 1401; }
+bool IsNotReady(int code) { return code == 607 || code == 608 || code == 610; }
+
+// A member's text for a log line: strings as they are, anything else as JSON.
+std::string MemberText(const Json::Value& value) {
+  if (value.isNull()) return "";
+  return value.isString() ? value.asString() : JsonToString(value);
+}
+
+void LogCompoundFailure(const char* file, int line, const char* func, const Json::Value& sub_req,
+                        int code, const std::string& msg) {
+  const std::string sub_text = JsonToString(sub_req);
+  if (errno != 0) {
+    Log(LOG_ERR, "%s:%d (%d, %u) (%s) Compound failed: %s (%d) %s [err: %m]", SourceName(file),
+        line, getpid(), geteuid(), func, sub_text.c_str(), code, msg.c_str());
+    errno = 0;
+  } else {
+    Log(LOG_ERR, "%s:%d (%d, %u) (%s) Compound failed: %s (%d) %s", SourceName(file), line,
+        getpid(), geteuid(), func, sub_text.c_str(), code, msg.c_str());
+  }
+}
+
+}  // namespace
+
+void SendRequestImpl(Json::Value& res_out, const Json::Value& req) {
+  const std::string sock_path = RootedPath(kElasticdSockPath);
+  Env* env = Env::Current();
+  const int saved_errno = errno;
+  // The daemon may be starting: give its socket half a minute to appear. After that the
+  // connect below fails and says so.
+  for (int failures = 1; access(sock_path.c_str(), F_OK) != 0; ++failures) {
+    if (failures > kSocketWaitRetries) break;
+    Log(LOG_ERR, "%s:%d elastic socket is not ready, retry ... %d", SourceName(__FILE__),
+        __LINE__, failures);
+    env->SleepMicros(kSecond);
+  }
+  errno = saved_errno;
+
+  quixdaemon::DomainSockConnection conn(sock_path);
+  ORVANE_THROW_IF(!conn.Connect(kElasticdConnectTimeout), kErrElastic, "Connect failed");
+  // The wire carries the compact text, which keeps every byte of a string (control characters
+  // escaped, other bytes as they are), so paths that are not valid UTF-8 survive.
+  if (!conn.Send(JsonToString(req))) {
+    ThrowError(__FILE__, __LINE__, __func__, "!conn.Send(req.toString())", kErrElastic,
+               "Send failed");
+  }
+
+  std::string resp_raw;
+  JsonValue res;
+  // A reply that parses to something other than an object cannot carry "success" either; it is
+  // tested first because member access on a non-object is a logic error in the JSON library.
+  if (!conn.Recv(resp_raw) || !res.fromString(resp_raw) || !res.isObject() ||
+      !res.isMember("success") || !res["success"].isBool()) {
+    ThrowError(__FILE__, __LINE__, __func__,
+               "!conn.Recv(resp_raw) || !res.fromString(resp_raw) || !res.isMember(\"success\") "
+               "|| !res[\"success\"].isBool()",
+               kErrElastic, "Recv failed, res=" + res.toString());
+  }
+  conn.Disconnect();
+
+  const Json::Value& reply = res;
+  if (!reply["success"].asBool()) {
+    int code = 0;
+    std::string msg;
+    GetJsonValue(code, reply["error"], "code", true);
+    GetJsonValue(msg, reply["error"], "msg", true);
+    throw Error(static_cast<ErrorCode>(code), "Request failed, msg=" + msg);
+  }
+
+  const bool compound = req.isObject() && req.isMember("compound");
+  const Json::Value& has_fail = reply["has_fail"];
+  if (compound && has_fail.isBool() && has_fail.asBool() && reply["data"].isArray()) {
+    const Json::Value& data = reply["data"];
+    for (Json::ArrayIndex i = 0; i < data.size(); ++i) {
+      const Json::Value& entry = data[i];
+      if (!entry.isObject() || !entry["success"].isBool() || entry["success"].asBool()) continue;
+      int code = 0;
+      std::string msg;
+      GetJsonValue(code, entry["error"], "code", true);
+      GetJsonValue(msg, entry["error"], "msg", false);
+      // A busy daemon dropped the request: the whole of it has to be sent again.
+      if (IsBusy(code)) throw Error(static_cast<ErrorCode>(code), msg);
+      const Json::Value& subs = req["compound"];
+      LogCompoundFailure(__FILE__, __LINE__, __func__,
+                         subs.isArray() ? subs[i] : Json::Value::nullSingleton(), code, msg);
+    }
+  }
+  res_out.swap(res);
+}
+
+namespace fileindex {
+namespace elastic {
+
+void SendRequest(Json::Value& res, const Json::Value& req) {
+  Env* env = Env::Current();
+  unsigned busy_retries = 0;
+  bool notified = false;
+  for (;;) {
+    try {
+      SendRequestImpl(res, req);
+      return;
+    } catch (const Error& e) {
+      if (IsNotReady(e.code)) {
+        Log(LOG_ERR, "%s:%d DB is not good yet, retry... (Error Code: %d)", SourceName(__FILE__),
+            __LINE__, static_cast<int>(e.code));
+        env->SleepMicros(kNotReadySleep);
+        continue;
+      }
+      if (!IsBusy(e.code)) throw Error(e);
+      const Json::Value& request = req;
+      const std::string command = request.isObject() ? MemberText(request["command"]) : "";
+      const std::string db =
+          request.isObject() && request["data"].isObject() ? MemberText(request["data"]["id"]) : "";
+      Log(LOG_ERR, "%s:%d Retry[%u] since quixelasticd is busy. Command: %s, db: %s",
+          SourceName(__FILE__), __LINE__, busy_retries, command.c_str(), db.c_str());
+      if (busy_retries + 1 > kBusyRetriesBeforeNotify && !notified) {
+        NotifyLackOfMemory();
+        notified = true;
+      }
+      env->SleepMicros((900 + 60 * static_cast<int64_t>(env->Rand() % 5)) * kSecond);
+      ++busy_retries;
+    }
+  }
+}
+
+void SendRequest(const Json::Value& req) {
+  Json::Value res;
+  SendRequest(res, req);
+}
+
+}  // namespace elastic
+}  // namespace fileindex
+}  // namespace orvane

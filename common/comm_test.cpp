@@ -1,0 +1,269 @@
+#include "common/comm.hpp"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <string>
+#include <vector>
+
+#include "common/error.hpp"
+#include "common/json_util.hpp"
+#include "test/fake_daemon.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using test::FakeDaemon;
+
+// A scratch ORVANE_ROOT with a fake clock, a log capture and a recording notifier program.
+class CommTest : public ::testing::Test {
+ protected:
+  CommTest() : root_(dir_.path()) {
+    const std::string notifier =
+        dir_.Write("usr/quix/bin/quixzrmnotify",
+                   "#!/bin/sh\necho \"$*\" >> \"$(dirname \"$0\")/notified\"\n");
+    chmod(notifier.c_str(), 0755);
+  }
+
+  std::string SockPath() const { return dir_.Path("var/run/quixelasticd.sock"); }
+  std::vector<std::string> Notified() const {
+    std::vector<std::string> lines;
+    std::string text = test::ReadFile(dir_.Path("usr/quix/bin/notified"));
+    for (size_t pos; (pos = text.find('\n')) != std::string::npos; text.erase(0, pos + 1)) {
+      lines.push_back(text.substr(0, pos));
+    }
+    return lines;
+  }
+
+  // Runs SendRequestImpl and returns the Error it throws.
+  Error ImplError(const Json::Value& req) {
+    Json::Value res;
+    try {
+      SendRequestImpl(res, req);
+    } catch (const Error& e) {
+      return e;
+    }
+    ADD_FAILURE() << "no Error";
+    return Error(kErrInvalidParam, "no error");
+  }
+
+  test::TempDir dir_;
+  test::ScopedRoot root_;
+  test::FakeEnv env_;
+  test::LogCapture log_;
+};
+
+Json::Value Req(const std::string& command) {
+  Json::Value req;
+  req["command"] = command;
+  req["data"]["id"] = "fileindex_photo";
+  return req;
+}
+
+TEST_F(CommTest, MissingSocketIsWaitedForThirtyOneSecondsThenConnectFails) {
+  const Error e = ImplError(Req("commit"));
+  EXPECT_EQ(e.code, kErrElastic);
+  EXPECT_STREQ(e.what(), "Orvane error, code=913, reason=[Connect failed]");
+  EXPECT_EQ(env_.sleeps(), std::vector<int64_t>(31, 1000000));
+  const std::vector<std::string> lines = log_.Lines();
+  ASSERT_EQ(lines.size(), 32u);
+  for (int i = 0; i < 31; ++i) {
+    EXPECT_THAT(lines[i], ::testing::EndsWith("elastic socket is not ready, retry ... " +
+                                              std::to_string(i + 1)));
+  }
+  EXPECT_THAT(lines[31], HasSubstr("(SendRequestImpl) Failed [!conn.Connect(kElasticdConnectTimeout)], "
+                                   "reason: Orvane error, code=913, reason=[Connect failed]"));
+}
+
+TEST_F(CommTest, SuccessfulExchangeReturnsTheWholeReplyAndKeepsEveryByteOfTheRequest) {
+  FakeDaemon engine(SockPath(), FakeDaemon::Replies({R"({"success":true,"data":[{"a":1}]})"}));
+  Json::Value req = Req("document_del_by_id");
+  // Quotes, backslashes, a newline, non-ASCII text and bytes that are not UTF-8 at all.
+  const std::string path = "/v/s/\"q\"\\b\nl\xC3\xA9\xE6\x97\xA5/\xFF\xC3(\x80";
+  req["data"]["doc_id"] = path;
+  Json::Value res;
+  SendRequestImpl(res, req);
+  EXPECT_TRUE(res["success"].asBool());
+  EXPECT_EQ(res["data"][0]["a"].asInt(), 1);
+  ASSERT_EQ(engine.json_requests().size(), 1u);
+  EXPECT_EQ(engine.json_requests()[0], req);
+  EXPECT_EQ(engine.json_requests()[0]["data"]["doc_id"].asString(), path);
+  EXPECT_TRUE(env_.sleeps().empty());
+  EXPECT_TRUE(log_.Lines().empty());
+}
+
+TEST_F(CommTest, BrokenRepliesAreError913WithTheParsedText) {
+  struct Case {
+    std::string reply;
+    std::string parsed;
+  };
+  const std::vector<Case> cases = {
+      {"garbage", "null"},
+      {"{\"success\":true", "null"},  // cut short
+      {"[true]", "[true]"},
+      {"\"success\"", "\"success\""},
+      {"{}", "{}"},
+      {R"({"success":"yes"})", R"({"success":"yes"})"},
+      {R"({"success":1,"error":{"code":5,"msg":"m"}})", R"({"error":{"code":5,"msg":"m"},"success":1})"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.reply);
+    FakeDaemon engine(SockPath(), FakeDaemon::Replies({c.reply}));
+    log_.Clear();
+    const Error e = ImplError(Req("commit"));
+    EXPECT_EQ(e.code, kErrElastic);
+    EXPECT_EQ(std::string(e.what()),
+              "Orvane error, code=913, reason=[Recv failed, res=" + c.parsed + "]");
+    ASSERT_EQ(log_.Lines().size(), 1u);
+    EXPECT_THAT(log_.Lines()[0],
+                HasSubstr("Failed [!conn.Recv(resp_raw) || !res.fromString(resp_raw) || "
+                          "!res.isMember(\"success\") || !res[\"success\"].isBool()]"));
+  }
+}
+
+TEST_F(CommTest, DaemonThatClosesOrCutsTheFrameIsError913) {
+  const std::vector<FakeDaemon::Handler> handlers = {
+      [](int, const std::string&) {},
+      [](int fd, const std::string&) { FakeDaemon::WriteAll(fd, std::string("\x40\x00\x00\x00{\"su", 8)); },
+      [](int fd, const std::string&) { FakeDaemon::WriteAll(fd, std::string("\xff\xff\xff\xff{}", 6)); },
+  };
+  for (const FakeDaemon::Handler& handler : handlers) {
+    FakeDaemon engine(SockPath(), handler);
+    const Error e = ImplError(Req("commit"));
+    EXPECT_STREQ(e.what(), "Orvane error, code=913, reason=[Recv failed, res=null]");
+  }
+  // A daemon that is gone by the time the request is written.
+  FakeDaemon engine(SockPath(), [](int, const std::string&) {}, /*read_request=*/false);
+  Json::Value big = Req("document_upsert_by_id");
+  big["data"]["data"]["QUIXMDTextContent"] = std::string(8 << 20, 't');
+  const Error e = ImplError(big);
+  EXPECT_EQ(e.code, kErrElastic);
+  EXPECT_THAT(e.what(), ::testing::AnyOf(HasSubstr("Send failed"), HasSubstr("Recv failed")));
+}
+
+TEST_F(CommTest, FailureReplyCarriesTheDaemonsCodeAndMessageWithoutALogLine) {
+  FakeDaemon engine(SockPath(),
+                    FakeDaemon::Replies({R"({"success":false,"error":{"code":1400,"msg":"x"}})",
+                                         R"({"success":false,"error":{"code":609}})"}));
+  Error e = ImplError(Req("commit"));
+  EXPECT_EQ(static_cast<int>(e.code), 1400);
+  EXPECT_STREQ(e.what(), "Orvane error, code=1400, reason=[Request failed, msg=x]");
+  EXPECT_TRUE(log_.Lines().empty());
+  e = ImplError(Req("commit"));  // no "msg": the JSON helper's own error
+  EXPECT_EQ(e.code, kErrInvalidParam);
+  EXPECT_THAT(e.what(), HasSubstr("Missing property: msg, data={\"code\":609}"));
+}
+
+TEST_F(CommTest, CompoundFailuresAreLoggedUnlessTheDaemonWasBusy) {
+  Json::Value req;
+  for (int i = 0; i < 3; ++i) req["compound"].append(Req("sub" + std::to_string(i)));
+  FakeDaemon engine(
+      SockPath(),
+      FakeDaemon::Replies(
+          {R"({"success":true,"has_fail":true,"data":[{"success":false,"error":{"code":5,"msg":"m0"}},
+               {"success":true},{"success":false,"error":{"code":7,"msg":"m2"}}]})",
+           R"({"success":true,"has_fail":true,"data":[{"success":false,"error":{"code":5,"msg":"m0"}},
+               {"success":false,"error":{"code":1401,"msg":"full"}},
+               {"success":false,"error":{"code":7,"msg":"m2"}}]})",
+           R"({"success":true,"has_fail":true,"data":[{"success":false,"error":{"code":5,"msg":"m0"}}]})"}));
+  Json::Value res;
+  errno = 0;  // the line gains " [err: ...]" only when errno is set
+  SendRequestImpl(res, req);
+  EXPECT_EQ(res["data"].size(), 3u);
+  ASSERT_EQ(log_.Lines().size(), 2u);
+  EXPECT_THAT(log_.Lines()[0],
+              ::testing::EndsWith("(SendRequestImpl) Compound failed: " +
+                                  JsonToString(req["compound"][0]) + " (5) m0"));
+  EXPECT_THAT(log_.Lines()[1], HasSubstr("Compound failed: " + JsonToString(req["compound"][2]) +
+                                         " (7) m2"));
+
+  log_.Clear();
+  const Error e = ImplError(req);  // entry 0 logged, entry 1 stops the walk
+  EXPECT_EQ(static_cast<int>(e.code), 1401);
+  EXPECT_STREQ(e.what(), "Orvane error, code=1401, reason=[full]");
+  EXPECT_EQ(log_.Lines().size(), 1u);
+
+  // "has_fail" means nothing for a request that is not compound.
+  log_.Clear();
+  SendRequestImpl(res, Req("commit"));
+  EXPECT_TRUE(log_.Lines().empty());
+}
+
+TEST_F(CommTest, NotReadyIsRetriedEveryThirtySecondsButNot609) {
+  FakeDaemon engine(SockPath(),
+                    FakeDaemon::Replies({R"({"success":false,"error":{"code":607,"msg":"a"}})",
+                                         R"({"success":false,"error":{"code":608,"msg":"b"}})",
+                                         R"({"success":false,"error":{"code":610,"msg":"c"}})",
+                                         R"({"success":true,"data":7})",
+                                         R"({"success":false,"error":{"code":609,"msg":"d"}})"}));
+  Json::Value res;
+  fileindex::elastic::SendRequest(res, Req("commit"));
+  EXPECT_EQ(res["data"].asInt(), 7);
+  EXPECT_EQ(env_.sleeps(), std::vector<int64_t>(3, 30000000));
+  EXPECT_EQ(log_.Count("DB is not good yet, retry... (Error Code: 60"), 2);
+  EXPECT_EQ(log_.Count("DB is not good yet, retry... (Error Code: 610)"), 1);
+  ASSERT_EQ(engine.requests().size(), 4u);
+  for (const Json::Value& sent : engine.json_requests()) EXPECT_EQ(sent, Req("commit"));
+
+  try {
+    fileindex::elastic::SendRequest(Req("commit"));
+    FAIL() << "609 was retried";
+  } catch (const Error& e) {
+    EXPECT_EQ(static_cast<int>(e.code), 609);
+    EXPECT_STREQ(e.what(), "Orvane error, code=609, reason=[Request failed, msg=d]");
+  }
+  EXPECT_EQ(env_.sleeps().size(), 3u);
+  EXPECT_EQ(engine.requests().size(), 5u);
+}
+
+TEST_F(CommTest, BusyIsRetriedForFifteenToNineteenMinutesAndNotifiesOncePerCall) {
+  const std::string busy = R"({"success":false,"error":{"code":1400,"msg":"oom"}})";
+  std::vector<std::string> replies(12, busy);  // twelve busy answers, then success
+  replies.push_back(R"({"success":true})");
+  replies.insert(replies.end(), 11, busy);  // the next call: eleven busy answers
+  replies.push_back(R"({"success":true})");
+  FakeDaemon engine(SockPath(), FakeDaemon::Replies(replies));
+  std::vector<int> rands;
+  for (int i = 0; i < 23; ++i) rands.push_back(i);
+  env_.QueueRand(rands);
+
+  fileindex::elastic::SendRequest(Req("document_upsert_by_id"));
+  std::vector<int64_t> expected;
+  for (int i = 0; i < 12; ++i) expected.push_back((900 + 60 * (i % 5)) * 1000000LL);
+  EXPECT_EQ(env_.sleeps(), expected);
+  for (int i = 0; i < 12; ++i) {
+    EXPECT_TRUE(log_.Contains("Retry[" + std::to_string(i) +
+                              "] since quixelasticd is busy. Command: document_upsert_by_id, "
+                              "db: fileindex_photo"));
+  }
+  EXPECT_THAT(Notified(),
+              ElementsAre("-c QUIX.Orvane.Application @administrators app:displayname "
+                          "error:lack_of_memory"));
+
+  // A new call counts from 0 again and notifies on its own eleventh busy answer.
+  fileindex::elastic::SendRequest(Req("document_upsert_by_id"));
+  EXPECT_EQ(env_.sleeps().size(), 23u);
+  EXPECT_EQ(Notified().size(), 2u);
+  EXPECT_EQ(engine.requests().size(), 25u);
+}
+
+TEST_F(CommTest, OtherErrorsPassThroughUnchanged) {
+  FakeDaemon engine(SockPath(),
+                    FakeDaemon::Replies({R"({"success":false,"error":{"code":5,"msg":"no"}})"}));
+  try {
+    fileindex::elastic::SendRequest(Req("commit"));
+    FAIL();
+  } catch (const Error& e) {
+    EXPECT_EQ(static_cast<int>(e.code), 5);
+    EXPECT_STREQ(e.what(), "Orvane error, code=5, reason=[Request failed, msg=no]");
+  }
+  EXPECT_TRUE(env_.sleeps().empty());
+}
+
+}  // namespace
+}  // namespace orvane

@@ -1,0 +1,149 @@
+#include "common/sdk/credentials.hpp"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "common/error.hpp"
+#include "platform/fault.hpp"
+#include "platform/user.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace sdk {
+namespace {
+
+using platform::Fault;
+using platform::ScopedFaults;
+
+constexpr uid_t kNobody = 65534;
+
+// Real switches of the process's identity: only root can make them.
+class SDKCredentialsTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (geteuid() != 0) GTEST_SKIP() << "credential switches need root; running as " << geteuid();
+    test::WritePlatformConfig(root_.path(), R"({"shares": [], "admin_group": "fi-no-such-group"})");
+    ASSERT_EQ(chmod(dir_.path().c_str(), 0777), 0);
+  }
+  void TearDown() override {
+    // Whatever a test did, the next one starts as root.
+    if (getuid() == 0 && geteuid() != 0) ASSERT_TRUE(platform::ResetCredentialsByName("root", true));
+  }
+
+  test::TempDir root_;
+  test::ScopedRoot scoped_{root_.path()};
+  test::TempDir dir_;
+};
+
+TEST_F(SDKCredentialsTest, SwitchToAUserAndBackWritesFilesAsThatUser) {
+  {
+    SDKCredentials saved;  // root, restored at scope end
+    saved.AsUser("nobody");
+    EXPECT_EQ(geteuid(), kNobody);
+    EXPECT_EQ(getegid(), static_cast<gid_t>(65534));
+    gid_t groups[8];
+    ASSERT_EQ(getgroups(8, groups), 1);
+    EXPECT_EQ(groups[0], static_cast<gid_t>(65534));
+    const std::string file = dir_.Path("by-nobody");
+    const int fd = open(file.c_str(), O_CREAT | O_WRONLY, 0644);
+    ASSERT_GE(fd, 0);
+    close(fd);
+    struct stat st;
+    ASSERT_EQ(stat(file.c_str(), &st), 0);
+    EXPECT_EQ(st.st_uid, kNobody);
+    // As nobody, root's files are out of reach.
+    EXPECT_LT(open("/etc/shadow", O_RDONLY), 0);
+  }
+  EXPECT_EQ(geteuid(), 0u);
+  EXPECT_EQ(getegid(), 0u);
+}
+
+TEST_F(SDKCredentialsTest, ANamedScopeReappliesItsNameAndOnlyYourselfIsReachableWithoutRoot) {
+  test::LogCapture log;
+  {
+    SDKCredentials as_nobody("nobody");
+    EXPECT_EQ(geteuid(), kNobody);
+    {
+      SDKCredentials inner;  // remembers nobody
+      // Not root any more: another user is refused, the real user (root) would not be asked here.
+      try {
+        inner.AsUser("daemon");
+        ADD_FAILURE() << "nobody became daemon";
+      } catch (const Error& e) {
+        EXPECT_EQ(e.code, kErrCredentials);
+        EXPECT_EQ(e.message, "Orvane error, code=503");
+      }
+      EXPECT_TRUE(log.Contains("Failed [!ResetCredentialsByName(target_username)]"));
+      EXPECT_EQ(geteuid(), kNobody);
+    }
+  }
+  // The named scope went back to "nobody", not to the root it found at construction.
+  EXPECT_EQ(geteuid(), kNobody);
+  ASSERT_TRUE(platform::ResetCredentialsByName("root", true));
+  EXPECT_EQ(geteuid(), 0u);
+}
+
+TEST_F(SDKCredentialsTest, AnAdministratorRunsAsRoot) {
+  test::WritePlatformConfig(root_.path(), R"({"shares": [], "admin_group": "nogroup"})");
+  SDKCredentials saved;
+  saved.AsUser("nobody");  // nobody's primary group is the administrators group now
+  EXPECT_EQ(geteuid(), 0u);
+  EXPECT_EQ(platform::QLIBGroupIsAdminGroupMem("nobody", 0), 1);
+  EXPECT_EQ(platform::QLIBGroupIsAdminGroupMem("root", 0), 0);
+  EXPECT_EQ(platform::QLIBGroupIsAdminGroupMem("no such user", 0), -1);
+}
+
+TEST_F(SDKCredentialsTest, FailedLookupsAndSwitchesAreErrorsOrLogLines) {
+  ScopedFaults faults;
+  test::LogCapture log;
+  // The failure text loses as many leading characters as the platform error number says.
+  faults.Arm("QUIXUserGetByUID", Fault{-1, ENOENT, 8});
+  try {
+    SDKCredentials saved;
+    ADD_FAILURE();
+  } catch (const Error& e) {
+    EXPECT_EQ(e.message, "Orvane error, code=503, reason=[GetByUID failed, err=]");
+  }
+  EXPECT_TRUE(log.Contains("Failed [0 > QUIXUserGetByUID(euid_, &user_info) || !user_info]"));
+  // A number past the end of the text gives an empty reason rather than a read outside it.
+  faults.Arm("QUIXUserGetByUID", Fault{-1, ENOENT, 0x1700});
+  try {
+    SDKCredentials saved;
+    ADD_FAILURE();
+  } catch (const Error& e) {
+    EXPECT_EQ(e.message, "Orvane error, code=503");
+  }
+
+  faults.Arm("ResetCredentialsByName", Fault{0, EPERM});
+  EXPECT_THROW(SDKCredentials("nobody"), Error);
+  EXPECT_EQ(geteuid(), 0u);
+
+  // The destructor only logs: the switch back fails and the process stays nobody.
+  {
+    SDKCredentials saved;
+    saved.AsUser("nobody");
+    faults.Arm("ResetCredentialsByName", Fault{0, EPERM});
+  }
+  EXPECT_TRUE(log.Contains("Failed [!ResetCredentialsByName(username_)] [err: Operation not permitted]"));
+  EXPECT_EQ(geteuid(), kNobody);
+}
+
+TEST(PlatformUserTest, LookupsByNameAndUid) {
+  platform::QUIXUSER* user = nullptr;
+  ASSERT_EQ(platform::QUIXUserGet("nobody", &user), 0);
+  EXPECT_EQ(user->uid, kNobody);
+  EXPECT_STREQ(user->szName, "nobody");
+  platform::QUIXUserFree(user);
+  ASSERT_EQ(platform::QUIXUserGetByUID(0, &user), 0);
+  EXPECT_STREQ(user->szName, "root");
+  platform::QUIXUserFree(user);
+  EXPECT_EQ(platform::QUIXUserGet("no such user/é", &user), -1);
+  EXPECT_EQ(user, nullptr);
+  EXPECT_EQ(platform::QUIXUserGetByUID(4012345678u, &user), -1);
+}
+
+}  // namespace
+}  // namespace sdk
+}  // namespace orvane

@@ -1,0 +1,12 @@
+#include "common/sdk/sdk_mutex.hpp"
+
+namespace orvane {
+namespace sdk {
+
+Mutex& SDKMutex() {
+  static Mutex mutex;
+  return mutex;
+}
+
+}  // namespace sdk
+}  // namespace orvane

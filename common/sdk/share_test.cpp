@@ -1,0 +1,163 @@
+#include "common/sdk/share.hpp"
+
+#include <gtest/gtest.h>
+
+#include "common/error.hpp"
+#include "platform/config.hpp"
+#include "platform/fault.hpp"
+#include "platform/platform_error.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace sdk {
+namespace {
+
+using platform::Fault;
+using platform::ScopedFaults;
+
+class SDKShareTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    vol_ = volume_.path();
+    test::WritePlatformConfig(root_.path(), R"({"shares": [
+      {"name": "music", "path": ")" + vol_ + R"(/music", "recycle_bin": true, "ftp_privilege": 5},
+      {"name": "vault", "path": ")" + vol_ + R"(/vault", "encrypted": true, "encryption": true},
+      {"name": "ro", "path": ")" + vol_ + R"(/ro", "readonly": true, "hide_unreadable": true},
+      {"name": "open", "path": ")" + vol_ + R"(/open", "encryption": true},
+      {"name": "my music é", "path": ")" + vol_ + R"(/my music é"}
+    ]})");
+  }
+
+  // Runs `fn`, expects an Error with `code` whose reason is `reason`.
+  template <typename Fn>
+  void ExpectError(Fn fn, ErrorCode code, const std::string& reason) {
+    try {
+      fn();
+      ADD_FAILURE() << "no Error for " << reason;
+    } catch (const Error& e) {
+      EXPECT_EQ(e.code, code);
+      EXPECT_EQ(e.message, "Orvane error, code=" + std::to_string(code) +
+                               (reason.empty() ? "" : ", reason=[" + reason + "]"));
+    }
+  }
+
+  test::TempDir root_;
+  test::ScopedRoot scoped_{root_.path()};
+  test::TempDir volume_;
+  std::string vol_;
+};
+
+TEST_F(SDKShareTest, LocationsAndFlagsOfAShare) {
+  SDKShare music("music");
+  EXPECT_EQ(music.GetName(), "music");
+  EXPECT_EQ(music.GetPath(), vol_ + "/music");
+  EXPECT_EQ(music.GetQueuePath(), vol_ + "/music/@eaDir/@fileindex/queue");
+  EXPECT_EQ(music.GetDBPath(), vol_ + "/music/@eaDir/@fileindex/db");
+  EXPECT_EQ(music.GetDBName(), "fileindex_music");
+  EXPECT_EQ(music.GetFTPPrivilege(), 5);
+  EXPECT_TRUE(music.CanBeIndexed());
+  EXPECT_TRUE(music.IsEnableRecycleBin());
+  EXPECT_FALSE(music.IsEncryption());
+  EXPECT_FALSE(music.IsHideUnReadable());
+
+  SDKShare vault("vault");
+  EXPECT_FALSE(vault.CanBeIndexed());
+  EXPECT_TRUE(vault.IsEncryption());
+  SDKShare ro("ro");
+  EXPECT_FALSE(ro.CanBeIndexed());
+  EXPECT_TRUE(ro.IsHideUnReadable());
+  SDKShare open("open");  // an unlocked encrypted share can be indexed
+  EXPECT_TRUE(open.CanBeIndexed());
+
+  SDKShare spaced("my music é");
+  EXPECT_EQ(spaced.GetQueuePath(), vol_ + "/my music é/@eaDir/@fileindex/queue");
+  EXPECT_EQ(spaced.GetDBName(), "fileindex_my music é");
+
+  EXPECT_EQ(SDKShare::Enum(),
+            (std::set<std::string>{"music", "my music é", "open", "ro", "vault"}));
+}
+
+TEST_F(SDKShareTest, UnknownShareOrUnusableConfigurationIsError800) {
+  test::LogCapture log;
+  ExpectError([] { SDKShare share("Music"); }, kErrShareGet, "Music");
+  ExpectError([] { SDKShare share("music/x"); }, kErrShareGet, "music/x");
+  ExpectError([] { SDKShare share(""); }, kErrShareGet, "");
+  EXPECT_TRUE(log.Contains(
+      "Failed [0 > QUIXShareGet(share_name.c_str(), &share_info_) || !share_info_], reason: "
+      "Orvane error, code=800, reason=[Music]"));
+  test::WritePlatformConfig(root_.path(), "{\"shares\": [{\"name\": \"music\"}]}");
+  ExpectError([] { SDKShare share("music"); }, kErrShareGet, "music");
+  EXPECT_TRUE(log.Contains("share \"music\" has no \"path\""));
+  ExpectError([] { SDKShare::Enum(); }, kErrShareEnum, "QLIBShareEnum failed");
+}
+
+TEST_F(SDKShareTest, PlatformFailuresBecomeErrors) {
+  ScopedFaults faults;
+  test::LogCapture log;
+  SDKShare music("music");
+  const Fault fail{-1, EIO};
+  faults.Arm("QLIBShareIsEncryptedGet", fail);
+  ExpectError([&] { music.CanBeIndexed(); }, kErrSystem, "QLIBShareis_encryptedGet failed, share=music");
+  EXPECT_TRUE(log.Contains("[err: Input/output error]"));
+  faults.Arm("QLIBShareIsReadOnlyGet", fail);
+  ExpectError([&] { music.CanBeIndexed(); }, kErrSystem, "QLIBShareis_readonlyGet failed, share=music");
+  faults.Arm("QLIBShareIsEncryptionGet", fail);
+  ExpectError([&] { music.IsEncryption(); }, kErrSystem, "QLIBShareIsEncryptionGet failed, share=music");
+  faults.Arm("QLIBShareRecycleStatusGet", fail);
+  ExpectError([&] { music.IsEnableRecycleBin(); }, kErrSystem,
+              "QLIBShareRecycleStatusGet failed, share=music");
+  faults.Arm("QLIBShareHideUnreadableGet", Fault{-1, EIO, 0, 1, true});
+  EXPECT_FALSE(music.IsHideUnReadable());
+
+  faults.Arm("FILEIDXQueuePathCompose", fail);
+  ExpectError([&] { music.GetQueuePath(); }, kErrSystem, "FILEIDXQueuePathCompose failed, share=music");
+  EXPECT_TRUE(log.Contains(
+      "Failed [0 > FILEIDXQueuePathCompose(share_info_->szPath, path, sizeof(path))]"));
+  faults.Arm("FILEIDXDBPathCompose", fail);
+  ExpectError([&] { music.GetDBPath(); }, kErrSystem, "FILEIDXDBPathCompose failed, share=music");
+  faults.Arm("FILEIDXGetIndexID", fail);
+  ExpectError([&] { music.GetDBName(); }, kErrSystem, "FILEIDXGetIndexID failed, share=music");
+  // Once known, a location is not asked again.
+  EXPECT_EQ(music.GetDBName(), "fileindex_music");
+  faults.Arm("FILEIDXGetIndexID", fail);
+  EXPECT_EQ(music.GetDBName(), "fileindex_music");
+
+  faults.Arm("QLIBCSzListAlloc", fail);
+  ExpectError([] { SDKShare::Enum(); }, kErrShareEnum, "QLIBCSzListAlloc failed");
+  EXPECT_TRUE(log.Contains("Failed [nullptr == (share_list = QLIBCSzListAlloc(BUFSIZ))]"));
+  faults.Arm("QLIBShareEnum", fail);
+  ExpectError([] { SDKShare::Enum(); }, kErrShareEnum, "QLIBShareEnum failed");
+  EXPECT_TRUE(log.Contains("Failed [0 > QLIBShareEnum(&share_list, &enum_func)]"));
+
+  faults.Arm("QUIXShareGet", Fault{0, 0});  // success without a record
+  ExpectError([] { SDKShare share("music"); }, kErrShareGet, "music");
+}
+
+TEST_F(SDKShareTest, OnlyAFullVolumeOrQuotaBlocksIndexing) {
+  ScopedFaults faults;
+  SDKShare music("music");
+  // The share's folder does not exist: the platform cannot tell, which never blocks.
+  EXPECT_TRUE(music.IsSpaceEnough());
+  faults.Arm("QUIXQuotaIsEnough", Fault{0, ENOSPC, platform::kQErrVolumeFull});
+  EXPECT_FALSE(music.IsSpaceEnough());
+  faults.Arm("QUIXQuotaIsEnough", Fault{0, EDQUOT, platform::kQErrQuotaExceeded});
+  EXPECT_FALSE(music.IsSpaceEnough());
+  faults.Arm("QUIXQuotaIsEnough", Fault{0, EIO, platform::kQErrSystem});
+  EXPECT_TRUE(music.IsSpaceEnough());
+  faults.Arm("QUIXQuotaIsEnough", Fault{-1, EIO, platform::kQErrVolumeFull});
+  EXPECT_TRUE(music.IsSpaceEnough());
+}
+
+TEST_F(SDKShareTest, PrivilegeIsAskedOncePerUser) {
+  ScopedFaults faults;
+  SDKShare music("music");
+  EXPECT_EQ(music.GetPrivilege("root"), platform::SHARE_READWRITE);
+  EXPECT_EQ(music.GetPrivilege("root"), platform::SHARE_READWRITE);
+  EXPECT_EQ(music.GetPrivilege("no such user"), -1);
+  EXPECT_EQ(music.GetPrivilege("no such user"), -1);
+  EXPECT_EQ(platform::CallCount("QUIXShareUserPrivCalc"), 2);
+}
+
+}  // namespace
+}  // namespace sdk
+}  // namespace orvane

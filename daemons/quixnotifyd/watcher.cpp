@@ -1,0 +1,305 @@
+#include "daemons/quixnotifyd/watcher.hpp"
+
+#include <dirent.h>
+#include <poll.h>
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include "common/error.hpp"
+#include "common/json_util.hpp"
+#include "common/log.hpp"
+#include "common/root.hpp"
+#include "common/util.hpp"
+#include "fileindex/queue_file.hpp"
+#include "platform/monitor_queue.hpp"
+
+namespace orvane {
+namespace quixnotifyd {
+
+using QUIX::QUIXNOTIFYD::MonitorQueue;
+
+namespace {
+
+constexpr uint32_t kDirEvents = IN_ATTRIB | IN_CLOSE_WRITE | IN_CREATE | IN_DELETE | IN_MOVED_FROM |
+                                IN_MOVED_TO | IN_DELETE_SELF | IN_ONLYDIR | IN_DONT_FOLLOW |
+                                IN_EXCL_UNLINK;
+
+// How long the first half of a rename waits for its second half before it counts as a move out
+// of the watched folders. The kernel queues both halves together, so this is rarely needed.
+constexpr int kMovePairMillis = 20;
+
+}  // namespace
+
+Watcher::Watcher() : fd_(inotify_init1(IN_NONBLOCK | IN_CLOEXEC)) {
+  ORVANE_THROW_IF(!fd_.valid(), kErrSystem,
+                  std::string("inotify_init1 failed, reason=") + std::strerror(errno));
+  const std::string registry = RootedPath(QUIX::QUIXNOTIFYD::kRegistrationDir);
+  MakeParentDirs(registry + "/");
+  registry_wd_ = inotify_add_watch(fd_.get(), registry.c_str(),
+                                   IN_CLOSE_WRITE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE);
+  ORVANE_THROW_IF(registry_wd_ < 0, kErrSystem,
+                  "cannot watch " + registry + ", reason=" + std::strerror(errno));
+  Reload();
+}
+
+void Watcher::Reload() {
+  reload_ = false;
+  for (const auto& [wd, dir] : dirs_) inotify_rm_watch(fd_.get(), wd);
+  dirs_.clear();
+  moves_.clear();
+  targets_.clear();
+  watch_mask_ = kDirEvents;
+  const std::vector<Json::Value> records = MonitorQueue::List();
+  for (const Json::Value& record : records) {
+    for (const Json::Value& entry : record["config"]) {
+      Target target;
+      target.queue = record["queue"].asString();
+      target.root = entry["path"].asString();
+      target.mask = entry["mask"].asUInt();
+      target.ignore = JsonArr2Vec<std::string>(entry["ignore"]);
+      if (target.mask & kModify) watch_mask_ |= IN_MODIFY;
+      targets_.push_back(std::move(target));
+    }
+  }
+  for (size_t i = 0; i < targets_.size(); ++i) WatchTree(targets_[i].root, {i}, true);
+  Log(LOG_INFO, "%s:%d watching %zu folders of %zu registrations in %zu directories",
+      SourceName(__FILE__), __LINE__, targets_.size(), records.size(), dirs_.size());
+}
+
+void Watcher::WatchTree(const std::string& root, const std::vector<size_t>& targets, bool is_root) {
+  std::vector<std::string> stack = {root};
+  while (!stack.empty()) {
+    const std::string path = std::move(stack.back());
+    stack.pop_back();
+    const int wd = inotify_add_watch(fd_.get(), path.c_str(), watch_mask_);
+    if (wd < 0) {
+      // A folder that vanished meanwhile is reported by its parent; a full watch table is not,
+      // and needs the administrator (fs.inotify.max_user_watches).
+      if (errno != ENOENT && errno != ENOTDIR) {
+        Log(LOG_ERR, "%s:%d cannot watch %s [err: %m]", SourceName(__FILE__), __LINE__,
+            path.c_str());
+      }
+      errno = 0;
+      continue;
+    }
+    Dir& dir = dirs_[wd];
+    dir.path = path;
+    dir.is_root = dir.is_root || (is_root && path == root);
+    for (size_t t : targets) {
+      if (std::find(dir.targets.begin(), dir.targets.end(), t) == dir.targets.end()) {
+        dir.targets.push_back(t);
+      }
+    }
+    DIR* d = opendir(path.c_str());
+    if (d == nullptr) continue;
+    while (struct dirent* entry = readdir(d)) {
+      const std::string name = entry->d_name;
+      if (name == "." || name == ".." || Ignored(targets, name)) continue;
+      const std::string child = path + "/" + name;
+      if (entry->d_type == DT_DIR || (entry->d_type == DT_UNKNOWN && IsDirExist(child, false))) {
+        stack.push_back(child);
+      }
+    }
+    closedir(d);
+  }
+}
+
+std::vector<int> Watcher::WatchesUnder(const std::string& path) const {
+  std::vector<int> found;
+  const std::string prefix = path + "/";
+  for (const auto& [wd, dir] : dirs_) {
+    if (dir.path == path || StringStartWith(dir.path, prefix)) found.push_back(wd);
+  }
+  return found;
+}
+
+void Watcher::UnwatchTree(const std::string& path) {
+  for (int wd : WatchesUnder(path)) {
+    inotify_rm_watch(fd_.get(), wd);
+    dirs_.erase(wd);
+  }
+}
+
+bool Watcher::Ignored(const std::vector<size_t>& targets, const std::string& name) const {
+  for (size_t t : targets) {
+    const auto& ignore = targets_[t].ignore;
+    if (std::find(ignore.begin(), ignore.end(), name) != ignore.end()) return true;
+  }
+  return false;
+}
+
+void Watcher::Emit(const std::vector<size_t>& targets, uint32_t bits, const std::string& path,
+                   const std::string& path_old, bool is_dir) {
+  std::vector<const std::string*> written;
+  for (size_t t : targets) {
+    const Target& target = targets_[t];
+    if ((target.mask & bits) == 0) continue;
+    // Nested folders of one registration share its queue: one line per queue.
+    if (std::any_of(written.begin(), written.end(),
+                    [&](const std::string* q) { return *q == target.queue; })) {
+      continue;
+    }
+    written.push_back(&target.queue);
+    Json::Value line(Json::objectValue);
+    line["event"] = bits;
+    line["path"] = path;
+    if (!path_old.empty()) line["path_old"] = path_old;
+    line["is_dir"] = is_dir;
+    std::string& pending = pending_[target.queue];
+    pending += JsonToString(line) + "\n";
+    if (pending.size() > kMaxPendingBytes) {
+      Json::Value overflow(Json::objectValue);
+      overflow["event"] = kOverflow;
+      overflow["path"] = target.root;
+      pending = JsonToString(overflow) + "\n";
+      Log(LOG_ERR, "%s:%d queue %s cannot be written: too many changes held, marked overflowed",
+          SourceName(__FILE__), __LINE__, target.queue.c_str());
+    }
+  }
+}
+
+void Watcher::Handle(const struct inotify_event& event) {
+  if (event.mask & IN_Q_OVERFLOW) {
+    // Changes were lost: every queue must be re-indexed whole.
+    for (size_t t = 0; t < targets_.size(); ++t) Emit({t}, kOverflow, targets_[t].root, "", true);
+    return;
+  }
+  if (event.wd == registry_wd_) {
+    reload_ = true;
+    return;
+  }
+  auto it = dirs_.find(event.wd);
+  if (it == dirs_.end()) return;
+  if (event.mask & IN_IGNORED) {
+    dirs_.erase(it);
+    return;
+  }
+  const Dir& dir = it->second;
+  const std::vector<size_t> targets = dir.targets;
+  if (event.mask & IN_DELETE_SELF) {
+    // A registered folder itself went away; any other folder is reported by its parent.
+    if (dir.is_root) Emit(targets, kDelete, dir.path, "", true);
+    return;
+  }
+  const std::string name = event.len > 0 ? event.name : "";
+  if (name.empty() || Ignored(targets, name)) return;
+  const std::string path = dir.path + "/" + name;
+  const bool is_dir = (event.mask & IN_ISDIR) != 0;
+
+  if (event.mask & IN_MOVED_FROM) {
+    moves_[event.cookie] = Move{path, is_dir, targets};
+    return;
+  }
+  if (event.mask & IN_MOVED_TO) {
+    auto from = moves_.find(event.cookie);
+    if (from == moves_.end()) {
+      // Moved in from outside the watched folders: new to us.
+      if (is_dir) WatchTree(path, targets, false);
+      Emit(targets, kCreate, path, "", is_dir);
+      return;
+    }
+    const Move move = std::move(from->second);
+    moves_.erase(from);
+    std::vector<size_t> both;
+    std::vector<size_t> only_from;
+    std::vector<size_t> only_to;
+    auto queue_in = [this](const std::vector<size_t>& set, size_t t) {
+      return std::any_of(set.begin(), set.end(),
+                         [&](size_t o) { return targets_[o].queue == targets_[t].queue; });
+    };
+    for (size_t t : targets) (queue_in(move.targets, t) ? both : only_to).push_back(t);
+    for (size_t t : move.targets) {
+      if (!queue_in(targets, t)) only_from.push_back(t);
+    }
+    if (is_dir) {
+      // The subtree keeps its watches (the kernel's watches follow the inodes) under the new
+      // names and the new folder's queues; events already queued for them then read right.
+      for (int wd : WatchesUnder(move.path)) {
+        Dir& moved = dirs_[wd];
+        moved.path = path + moved.path.substr(move.path.size());
+        moved.targets = targets;
+        moved.is_root = false;
+      }
+    }
+    Emit(both, kRename, path, move.path, is_dir);
+    Emit(only_from, kDelete, move.path, "", is_dir);
+    Emit(only_to, kCreate, path, "", is_dir);
+    return;
+  }
+  if (event.mask & IN_CREATE) {
+    // Entries made inside a new folder before its watch exists are found by the re-index that
+    // the folder's own create event causes.
+    if (is_dir) WatchTree(path, targets, false);
+    Emit(targets, kCreate, path, "", is_dir);
+  }
+  if (event.mask & IN_DELETE) Emit(targets, kDelete, path, "", is_dir);
+  if (event.mask & IN_ATTRIB) Emit(targets, kAttrib, path, "", is_dir);
+  if (event.mask & IN_MODIFY) Emit(targets, kModify, path, "", is_dir);
+  if (event.mask & IN_CLOSE_WRITE) Emit(targets, kCloseWrite, path, "", is_dir);
+}
+
+void Watcher::FinishMoves() {
+  // What was moved out of every watched folder is gone as far as the index is concerned.
+  for (auto& [cookie, move] : moves_) {
+    if (move.is_dir) UnwatchTree(move.path);
+    Emit(move.targets, kDelete, move.path, "", move.is_dir);
+  }
+  moves_.clear();
+}
+
+void Watcher::Flush() {
+  for (auto it = pending_.begin(); it != pending_.end();) {
+    if (it->second.empty() || fileindex::QueueFileAppend(it->first, it->second)) {
+      it = pending_.erase(it);
+      continue;
+    }
+    // Kept and tried again on the next pass; Emit() bounds what is kept.
+    Log(LOG_ERR, "%s:%d cannot append to queue %s [err: %m]", SourceName(__FILE__), __LINE__,
+        it->first.c_str());
+    errno = 0;
+    ++it;
+  }
+}
+
+bool Watcher::RunOnce(int timeout_ms) {
+  alignas(struct inotify_event) char buf[64 * 1024];
+  struct pollfd pfd = {fd_.get(), POLLIN, 0};
+  int wait = pending_.empty() ? timeout_ms : std::min(timeout_ms, 1000);
+  for (;;) {
+    const int ready = poll(&pfd, 1, wait);
+    if (ready < 0 && errno != EINTR) return false;
+    if (ready <= 0) break;
+    const ssize_t n = read(fd_.get(), buf, sizeof(buf));
+    if (n < 0 && errno != EAGAIN && errno != EINTR) return false;
+    for (ssize_t off = 0; off < n;) {
+      const auto* event = reinterpret_cast<const struct inotify_event*>(buf + off);
+      Handle(*event);
+      off += sizeof(struct inotify_event) + event->len;
+    }
+    // Half a rename may still be on its way; anything else is written now.
+    if (moves_.empty()) break;
+    wait = kMovePairMillis;
+  }
+  FinishMoves();
+  Flush();
+  if (reload_) Reload();
+  return true;
+}
+
+void Watcher::Run(const std::atomic<bool>& stop, int tick_ms) {
+  while (!stop.load()) {
+    if (!RunOnce(tick_ms)) {
+      Log(LOG_ERR, "%s:%d inotify failed [err: %m]", SourceName(__FILE__), __LINE__);
+      return;
+    }
+  }
+  Flush();
+}
+
+}  // namespace quixnotifyd
+}  // namespace orvane

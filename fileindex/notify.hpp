@@ -1,0 +1,18 @@
+// Desktop notifications to the administrators, sent through the platform's notifier program.
+// Stateless free functions; safe from any thread. The notifier's outcome is not checked: a lost
+// notification must never stop indexing.
+#ifndef ORVANE_FILEINDEX_NOTIFY_HPP_
+#define ORVANE_FILEINDEX_NOTIFY_HPP_
+
+namespace orvane {
+namespace fileindex {
+
+// The index has no space left on its volume.
+void SendZRMNotify();
+// The search engine lacks memory (it keeps answering that it is busy).
+void NotifyLackOfMemory();
+
+}  // namespace fileindex
+}  // namespace orvane
+
+#endif  // ORVANE_FILEINDEX_NOTIFY_HPP_

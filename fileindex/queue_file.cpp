@@ -1,0 +1,102 @@
+#include "fileindex/queue_file.hpp"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include "common/root.hpp"
+
+namespace orvane {
+namespace fileindex {
+namespace {
+
+constexpr size_t kBufferSize = 256 * 1024;
+
+}  // namespace
+
+QueueFileReader::QueueFileReader(const std::string& path)
+    : fd_(open(path.c_str(), O_RDONLY | O_CLOEXEC)) {
+  if (fd_.valid()) buf_.reset(new char[kBufferSize]);
+}
+
+bool QueueFileReader::Fill() {
+  if (eof_) return false;
+  if (begin_ > 0) {
+    std::memmove(buf_.get(), buf_.get() + begin_, end_ - begin_);
+    end_ -= begin_;
+    begin_ = 0;
+  }
+  for (;;) {
+    ssize_t n = read(fd_.get(), buf_.get() + end_, kBufferSize - end_);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) {
+      // A read error ends the file like its end does: what was read is still used.
+      eof_ = true;
+      return false;
+    }
+    end_ += static_cast<size_t>(n);
+    return true;
+  }
+}
+
+bool QueueFileReader::ReadLine(std::string* line, size_t max_length) {
+  if (!fd_.valid()) return false;
+  line->clear();
+  bool any = false;
+  for (;;) {
+    const char* start = buf_.get() + begin_;
+    const char* nl = static_cast<const char*>(std::memchr(start, '\n', end_ - begin_));
+    const size_t take = nl != nullptr ? static_cast<size_t>(nl - start) : end_ - begin_;
+    if (line->size() <= max_length) {
+      line->append(start, std::min(take, max_length + 1 - line->size()));
+    }
+    any = any || take > 0 || nl != nullptr;
+    if (nl != nullptr) {
+      begin_ += take + 1;
+      return true;
+    }
+    begin_ = end_;
+    if (!Fill()) return any;
+  }
+}
+
+bool QueueFileAppend(const std::string& queue_path, const std::string& lines) {
+  MakeParentDirs(queue_path);
+  for (;;) {
+    UniqueFd fd(open(queue_path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644));
+    if (!fd.valid()) return false;
+    int rc;
+    while ((rc = flock(fd.get(), LOCK_EX)) != 0 && errno == EINTR) {
+    }
+    if (rc != 0) return false;
+    struct stat locked;
+    struct stat current;
+    if (fstat(fd.get(), &locked) != 0) return false;
+    if (stat(queue_path.c_str(), &current) != 0 || locked.st_ino != current.st_ino ||
+        locked.st_dev != current.st_dev) {
+      continue;  // renamed away under us: the next open creates the fresh live queue
+    }
+    size_t done = 0;
+    while (done < lines.size()) {
+      const ssize_t n = write(fd.get(), lines.data() + done, lines.size() - done);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) {
+        // Whatever part of a line got out would run into the next line: cut it off.
+        const int failure = errno;
+        if (done > 0) (void)!ftruncate(fd.get(), locked.st_size);
+        errno = failure;
+        return false;
+      }
+      done += static_cast<size_t>(n);
+    }
+    return true;
+  }
+}
+
+}  // namespace fileindex
+}  // namespace orvane

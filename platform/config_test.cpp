@@ -1,0 +1,173 @@
+#include "platform/config.hpp"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include "common/error.hpp"
+#include "platform/platform_error.hpp"
+#include "platform/share.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace platform {
+namespace {
+
+// The fault text of the Error that loading `text` as the configuration throws ("" when none).
+std::string LoadFault(const test::TempDir& root, const std::string& text) {
+  test::WritePlatformConfig(root.path(), text);
+  try {
+    LoadPlatformConfig();
+  } catch (const Error& e) {
+    EXPECT_EQ(e.code, kErrLoadConfig);
+    return e.message;
+  }
+  return "";
+}
+
+TEST(PlatformConfigTest, ReadsSharesAndDefaults) {
+  test::TempDir root;
+  test::ScopedRoot scoped(root.path());
+  test::WritePlatformConfig(root.path(), R"({
+    "shares": [
+      {"name": "music", "path": "/srv/v1/music", "readonly": true, "recycle_bin": true,
+       "ftp_privilege": 3, "future_key": [1, 2],
+       "access": {"users": {"alice": "rw", "bob": "na"}, "groups": {"staff": "ro"}}},
+      {"name": "Fotos 2024 é", "path": "/srv/v1/Fotos 2024 é"}
+    ],
+    "services": {"samba": {"restart": ["/bin/true", "x"]}}
+  })");
+  auto config = LoadPlatformConfig();
+  ASSERT_EQ(config->shares.size(), 2u);
+  const ShareConfig* music = config->FindShare("music");
+  ASSERT_NE(music, nullptr);
+  EXPECT_EQ(music->path, "/srv/v1/music");
+  EXPECT_TRUE(music->readonly);
+  EXPECT_TRUE(music->recycle_bin);
+  EXPECT_FALSE(music->encrypted);
+  EXPECT_EQ(music->ftp_privilege, 3);
+  EXPECT_EQ(music->user_access.at("alice"), SHARE_READWRITE);
+  EXPECT_EQ(music->user_access.at("bob"), SHARE_NOACCESS);
+  EXPECT_EQ(music->group_access.at("staff"), SHARE_READONLY);
+  EXPECT_NE(config->FindShare("Fotos 2024 é"), nullptr);
+  EXPECT_EQ(config->FindShare("Music"), nullptr);
+  EXPECT_EQ(config->admin_group, "administrators");
+  EXPECT_EQ(config->samba_conf, "/etc/samba/smb.conf");
+  EXPECT_EQ(config->services.at("samba").restart.size(), 2u);
+  EXPECT_TRUE(config->services.at("samba").start.empty());
+
+  // Unchanged file: the same parsed value; a rewritten one is read again.
+  EXPECT_EQ(LoadPlatformConfig(), config);
+  test::WritePlatformConfig(root.path(), R"({"shares": [], "admin_group": "wheel"})");
+  auto reloaded = LoadPlatformConfig();
+  EXPECT_TRUE(reloaded->shares.empty());
+  EXPECT_EQ(reloaded->admin_group, "wheel");
+}
+
+TEST(PlatformConfigTest, EveryFaultIsAnErrorNamingTheFile) {
+  test::TempDir root;
+  test::ScopedRoot scoped(root.path());
+  const std::string file = root.path() + "/etc/orvane/platform.json";
+
+  try {
+    LoadPlatformConfig();
+    FAIL() << "a missing file loaded";
+  } catch (const Error& e) {
+    EXPECT_EQ(e.code, kErrLoadConfig);
+    EXPECT_NE(e.message.find(file + ": cannot be read: No such file or directory"),
+              std::string::npos)
+        << e.message;
+  }
+
+  const struct {
+    const char* text;
+    const char* fault;
+  } cases[] = {
+      {"{\"shares\": [", "malformed JSON"},
+      {"", "malformed JSON"},
+      {"[1]", "the top level is not a JSON object"},
+      {"{\"shares\": {}}", "\"shares\" is not an array"},
+      {"{\"shares\": [3]}", "share #1 is not an object"},
+      {"{\"shares\": [{\"path\": \"/a/b\"}]}", "share #1 has no \"name\""},
+      {"{\"shares\": [{\"name\": 5, \"path\": \"/a/b\"}]}", "share #1: \"name\" is not a string"},
+      {"{\"shares\": [{\"name\": \"\", \"path\": \"/a/b\"}]}", "share #1: invalid share name \"\""},
+      {"{\"shares\": [{\"name\": \"a/b\", \"path\": \"/v/a/b\"}]}", "invalid share name \"a/b\""},
+      {"{\"shares\": [{\"name\": \"..\", \"path\": \"/v/..\"}]}", "invalid share name \"..\""},
+      {"{\"shares\": [{\"name\": \"b\"}]}", "share \"b\" has no \"path\""},
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"a/b\"}]}", "is not a clean absolute path"},
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a//b\"}]}", "is not a clean absolute path"},
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/../b\"}]}", "is not a clean absolute path"},
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/b/\"}]}", "is not a clean absolute path"},
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/c\"}]}",
+       "the last component of \"path\" \"/a/c\" is not the share name"},
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/b\"}, {\"name\": \"b\", \"path\": \"/c/b\"}]}",
+       "two shares are named \"b\""},
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/b\", \"readonly\": \"yes\"}]}",
+       "share \"b\": \"readonly\" is not true or false"},
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/b\", \"access\": {\"users\": {\"x\": \"w\"}}}]}",
+       "access must be \"rw\", \"ro\" or \"na\""},
+      {"{\"admin_group\": 7}", "\"admin_group\" is not a non-empty string"},
+      {"{\"services\": {\"samba\": {\"start\": \"/bin/true\"}}}",
+       "service \"samba\": \"start\" is not a non-empty array of strings"},
+      {"{\"a\": 1, \"a\": 2}", "malformed JSON"},
+  };
+  for (const auto& c : cases) {
+    const std::string message = LoadFault(root, c.text);
+    EXPECT_NE(message.find(file + ": "), std::string::npos) << c.text << " -> " << message;
+    EXPECT_NE(message.find(c.fault), std::string::npos) << c.text << " -> " << message;
+  }
+
+  // A folder where the file should be.
+  ASSERT_EQ(unlink(file.c_str()), 0);
+  ASSERT_EQ(mkdir(file.c_str(), 0755), 0);
+  try {
+    LoadPlatformConfig();
+    FAIL() << "a folder loaded as the configuration";
+  } catch (const Error& e) {
+    EXPECT_NE(e.message.find(file + ": cannot be read: not a regular file"), std::string::npos);
+  }
+}
+
+TEST(PlatformConfigTest, PlatformCallsReportAnUnusableFileAsAConfigurationError) {
+  test::TempDir root;
+  test::ScopedRoot scoped(root.path());
+  test::LogCapture log;
+  test::WritePlatformConfig(root.path(), "{\"shares\": [{\"name\": \"x\"}]}");
+  PQUIXSHARE share = nullptr;
+  EXPECT_EQ(QUIXShareGet("x", &share), -1);
+  EXPECT_EQ(share, nullptr);
+  EXPECT_EQ(errno, EINVAL);
+  EXPECT_EQ(QLIBCErrGet(), kQErrConfig);
+  EXPECT_TRUE(log.Contains("platform.json: share \"x\" has no \"path\"")) << log.Lines().size();
+  char name[64];
+  char path[64];
+  EXPECT_EQ(QUIXShareNamePathGet("/a/x", name, sizeof(name), path, sizeof(path)), -1);
+}
+
+TEST(PlatformConfigTest, ASnapshotScopeSeesOneConfigurationAndChecksTheFileOnce) {
+  test::TempDir root;
+  test::ScopedRoot scoped(root.path());
+  test::WritePlatformConfig(root.path(), R"({"shares": [{"name": "a", "path": "/v/a"}]})");
+  PQUIXSHARE share = nullptr;
+  {
+    ScopedConfigSnapshot snapshot;
+    test::WritePlatformConfig(root.path(), R"({"shares": [{"name": "b", "path": "/v/b"}]})");
+    {
+      ScopedConfigSnapshot nested;
+      EXPECT_EQ(QUIXShareGet("a", &share), 0);
+      QUIXShareFree(share);
+    }
+    EXPECT_EQ(QUIXShareGet("b", &share), -1);
+  }
+  EXPECT_EQ(QUIXShareGet("b", &share), 0);
+  QUIXShareFree(share);
+
+  // An unusable file pins nothing; calls report it themselves.
+  test::WritePlatformConfig(root.path(), "{");
+  ScopedConfigSnapshot snapshot;
+  EXPECT_EQ(QUIXShareGet("b", &share), -1);
+  EXPECT_EQ(QLIBCErrGet(), kQErrConfig);
+}
+
+}  // namespace
+}  // namespace platform
+}  // namespace orvane

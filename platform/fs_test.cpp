@@ -1,0 +1,154 @@
+#include "platform/fs.hpp"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <dirent.h>
+#include <sys/acl.h>
+#include <sys/mount.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstring>
+
+#include "platform/fault.hpp"
+#include "platform/platform_error.hpp"
+#include "platform/user.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace platform {
+namespace {
+
+struct stat StatOf(const std::string& path) {
+  struct stat st = {};
+  EXPECT_EQ(stat(path.c_str(), &st), 0) << path;
+  return st;
+}
+
+QUIXCOPYARGS CopyArgs(bool remove_source) {
+  QUIXCOPYARGS args = {};
+  args.fCopy = 1;
+  args.fRemoveSrc = remove_source ? 1 : 0;
+  return args;
+}
+
+TEST(PlatformFileCopyTest, CopiesKeepModeOwnerAndTimes) {
+  test::TempDir dir;
+  const std::string src = dir.Write("src", std::string(300000, 'x') + "end");
+  ASSERT_EQ(chmod(src.c_str(), 0640), 0);
+  if (geteuid() == 0) ASSERT_EQ(chown(src.c_str(), 65534, 65534), 0);
+  const struct timespec times[2] = {{1000000000, 5}, {1200000000, 7}};
+  ASSERT_EQ(utimensat(AT_FDCWD, src.c_str(), times, 0), 0);
+
+  const QUIXCOPYARGS copy = CopyArgs(false);
+  const std::string dst = dir.Path("dst");
+  dir.Write("dst", "old content");
+  ASSERT_EQ(QUIXFileCopy(src.c_str(), dst.c_str(), &copy), 0);
+  EXPECT_EQ(test::ReadFile(dst), test::ReadFile(src));
+  const struct stat st = StatOf(dst);
+  EXPECT_EQ(st.st_mode & 07777, 0640u);
+  EXPECT_EQ(st.st_mtim.tv_sec, 1200000000);
+  EXPECT_EQ(st.st_mtim.tv_nsec, 7);
+  if (geteuid() == 0) EXPECT_EQ(st.st_uid, 65534u);
+  EXPECT_EQ(access(src.c_str(), F_OK), 0);
+
+  const QUIXCOPYARGS move = CopyArgs(true);
+  const std::string moved = dir.Path("moved");
+  ASSERT_EQ(QUIXFileCopy(dst.c_str(), moved.c_str(), &move), 0);
+  EXPECT_NE(access(dst.c_str(), F_OK), 0);
+  EXPECT_EQ(test::ReadFile(moved).size(), 300003u);
+}
+
+TEST(PlatformFileCopyTest, FailuresLeaveNoTracesAndKeepTheSource) {
+  test::TempDir dir;
+  const std::string src = dir.Write("src", "data");
+  const QUIXCOPYARGS move = CopyArgs(true);
+  EXPECT_EQ(QUIXFileCopy(src.c_str(), dir.Path("no/such/dir/dst").c_str(), &move), -1);
+  EXPECT_EQ(errno, ENOENT);
+  EXPECT_EQ(QUIXFileCopy(dir.Path("missing").c_str(), dir.Path("dst").c_str(), &move), -1);
+  EXPECT_EQ(QUIXFileCopy(dir.path().c_str(), dir.Path("dst").c_str(), &move), -1);
+  EXPECT_EQ(errno, EISDIR);
+  ASSERT_EQ(symlink(src.c_str(), dir.Path("link").c_str()), 0);
+  EXPECT_EQ(QUIXFileCopy(dir.Path("link").c_str(), dir.Path("dst").c_str(), &move), -1);
+  const QUIXCOPYARGS nothing = {};
+  EXPECT_EQ(QUIXFileCopy(src.c_str(), dir.Path("dst").c_str(), &nothing), -1);
+  EXPECT_EQ(errno, EINVAL);
+  // Something other than a regular file in the destination's place is never replaced.
+  EXPECT_EQ(QUIXFileCopy(src.c_str(), "/dev/null", &move), -1);
+  EXPECT_EQ(errno, EEXIST);
+  ASSERT_EQ(mkdir(dir.Path("folder").c_str(), 0755), 0);
+  EXPECT_EQ(QUIXFileCopy(src.c_str(), dir.Path("folder").c_str(), &move), -1);
+  EXPECT_EQ(test::ReadFile(src), "data");
+  EXPECT_EQ(access(dir.Path("dst").c_str(), F_OK), -1);
+  ScopedFaults faults;
+  faults.Arm("QUIXFileCopy", Fault{-1, ENOSPC, kQErrVolumeFull});
+  EXPECT_EQ(QUIXFileCopy(src.c_str(), dir.Path("dst").c_str(), &move), -1);
+  EXPECT_EQ(QLIBCErrGet(), kQErrVolumeFull);
+  EXPECT_EQ(test::ReadFile(src), "data");
+}
+
+TEST(PlatformFileCopyTest, AFullFileSystemLeavesNoPartialCopy) {
+  if (geteuid() != 0) GTEST_SKIP() << "mounting a small file system needs root";
+  test::TempDir dir;
+  const std::string src = dir.Write("src", std::string(256 * 1024, 'x'));
+  ASSERT_EQ(mkdir(dir.Path("small").c_str(), 0755), 0);
+  if (mount("fileindex-test", dir.Path("small").c_str(), "tmpfs", 0, "size=64k") != 0) {
+    GTEST_SKIP() << "this machine refuses a tmpfs mount: " << strerror(errno);
+  }
+  const QUIXCOPYARGS move = CopyArgs(true);
+  EXPECT_EQ(QUIXFileCopy(src.c_str(), dir.Path("small/dst").c_str(), &move), -1);
+  EXPECT_EQ(errno, ENOSPC);
+  EXPECT_EQ(QLIBCErrGet(), kQErrVolumeFull);
+  EXPECT_EQ(test::ReadFile(src).size(), 256u * 1024);
+  DIR* listing = opendir(dir.Path("small").c_str());
+  ASSERT_NE(listing, nullptr);
+  int entries = 0;
+  while (struct dirent* entry = readdir(listing)) entries += entry->d_name[0] != '.';
+  closedir(listing);
+  EXPECT_EQ(entries, 0);
+  umount2(dir.Path("small").c_str(), MNT_DETACH);
+}
+
+TEST(PlatformAccessTest, EffectiveAccessIncludesAcls) {
+  test::TempDir dir;
+  ASSERT_EQ(chmod(dir.path().c_str(), 0755), 0);
+  const std::string file = dir.Write("f", "x");
+  ASSERT_EQ(chmod(file.c_str(), 0600), 0);
+  int perm = -1;
+  ASSERT_EQ(QUIXACLPermGet(file.c_str(), &perm), 0);
+  EXPECT_EQ(perm & (QUIX_ACL_READ | QUIX_ACL_WRITE), QUIX_ACL_READ | QUIX_ACL_WRITE);
+  EXPECT_EQ(QUIXACLPermGet(dir.Path("missing").c_str(), &perm), -1);
+  if (geteuid() != 0) GTEST_SKIP() << "judging another user's access needs root";
+
+  acl_t acl = acl_from_text("u::rw-,u:nobody:r--,g::---,m::r--,o::---");
+  ASSERT_NE(acl, nullptr);
+  const int set = acl_set_file(file.c_str(), ACL_TYPE_ACCESS, acl);
+  acl_free(acl);
+  if (set != 0) GTEST_SKIP() << "this file system refuses POSIX ACLs: " << strerror(errno);
+  const std::string plain = dir.Write("plain", "x");
+  ASSERT_EQ(chmod(plain.c_str(), 0600), 0);
+
+  ASSERT_TRUE(ResetCredentialsByName("nobody", true));
+  int on_acl = -1;
+  int on_plain = -1;
+  const int rc_acl = QUIXACLPermGet(file.c_str(), &on_acl);
+  const int rc_plain = QUIXACLPermGet(plain.c_str(), &on_plain);
+  ASSERT_TRUE(ResetCredentialsByName("root", true));
+  EXPECT_EQ(rc_acl, 0);
+  EXPECT_EQ(on_acl, QUIX_ACL_READ);
+  EXPECT_EQ(rc_plain, 0);
+  EXPECT_EQ(on_plain, 0);
+}
+
+TEST(PlatformHiddenDirTest, MetadataFolders) {
+  EXPECT_EQ(QUIXEAIsHiddenDir("@eaDir"), 1);
+  EXPECT_EQ(QUIXEAIsHiddenDir("@tmp"), 1);
+  EXPECT_EQ(QUIXEAIsHiddenDir("@eadir"), 0);
+  EXPECT_EQ(QUIXEAIsHiddenDir("@eaDir2"), 0);
+  EXPECT_EQ(QUIXEAIsHiddenDir(""), 0);
+  EXPECT_EQ(QUIXEAIsHiddenDir(nullptr), 0);
+}
+
+}  // namespace
+}  // namespace platform
+}  // namespace orvane
