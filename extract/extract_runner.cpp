@@ -7,6 +7,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
 #include <chrono>
 #include <climits>
@@ -25,6 +26,8 @@ namespace extract {
 namespace {
 
 constexpr size_t kMaxErrorText = 512;
+
+std::atomic<uint64_t> g_failures{0};
 
 std::string DescribeStatus(int status) {
   if (WIFSIGNALED(status)) return std::string("killed by ") + strsignal(WTERMSIG(status));
@@ -139,8 +142,11 @@ bool RunExtractHelper(const std::string& path, Json::Value* fields, std::string*
     }
   }
   *error = failure;
+  g_failures.fetch_add(1, std::memory_order_relaxed);
   return false;
 }
+
+uint64_t ExtractFailureCount() { return g_failures.load(std::memory_order_relaxed); }
 
 }  // namespace extract
 }  // namespace orvane

@@ -8,6 +8,7 @@
 #include <json/json.h>
 
 #include <cstddef>
+#include <cstdint>
 #include <string>
 
 namespace orvane {
@@ -26,6 +27,9 @@ std::string ExtractHelperPath();
 // a one-line reason in `*error` (the helper failed, crashed, timed out or printed too much).
 bool RunExtractHelper(const std::string& path, Json::Value* fields, std::string* error,
                       const ExtractLimits& limits = ExtractLimits());
+
+// How many extractions have failed in this process, for the indexer's report.
+uint64_t ExtractFailureCount();
 
 }  // namespace extract
 }  // namespace orvane

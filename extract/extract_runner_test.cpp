@@ -6,6 +6,7 @@
 
 #include <chrono>
 
+#include "extract/content_extract.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -65,6 +66,31 @@ TEST_F(ExtractRunnerTest, MisbehavingHelpersAreContained) {
 
   EXPECT_FALSE(RunWith(dir_.Path("no-such-helper"), "/x", &fields, &error));
   EXPECT_NE(error.find("cannot start"), std::string::npos);
+}
+
+TEST_F(ExtractRunnerTest, ParseFileAddsContentOnlyWhenAsked) {
+  namespace ce = QUIX::CONTENT_EXTRACT;
+  setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BINARY, 1);
+  const std::string path = dir_.Write("notes.txt", "meeting notes");
+  Json::Value need_meta;
+  need_meta[ce::kKeyNeedMeta] = true;
+  Json::Value doc;
+  ce::ParseFile(path, need_meta, doc);
+  EXPECT_EQ(doc["QUIXMDTextContent"], "meeting notes");
+  EXPECT_EQ(doc[ce::QUIXMDFSName], "notes.txt");
+  ce::ParseFile(path, Json::Value(Json::objectValue), doc);
+  EXPECT_FALSE(doc.isMember("QUIXMDTextContent"));
+
+  // A helper that fails leaves the name and attributes indexed, logged and counted.
+  setenv("FILEINDEX_EXTRACT_HELPER", Script("fail", "exit 3").c_str(), 1);
+  test::LogCapture log;
+  const uint64_t failures = ExtractFailureCount();
+  ce::ParseFile(path, need_meta, doc);
+  unsetenv("FILEINDEX_EXTRACT_HELPER");
+  EXPECT_EQ(doc[ce::QUIXMDFSSize].asUInt64(), 13u);
+  EXPECT_FALSE(doc.isMember("QUIXMDTextContent"));
+  EXPECT_EQ(ExtractFailureCount(), failures + 1);
+  EXPECT_TRUE(log.Contains("content of " + path + " not extracted: exited with status 3"));
 }
 
 }  // namespace
