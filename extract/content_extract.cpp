@@ -6,8 +6,12 @@
 #include <cerrno>
 #include <cstring>
 
+#include <syslog.h>
+
 #include "common/error.hpp"
+#include "common/log.hpp"
 #include "common/util.hpp"
+#include "extract/extract_runner.hpp"
 
 namespace QUIX {
 namespace CONTENT_EXTRACT {
@@ -34,6 +38,21 @@ void ParseFile(const std::string& path, const Json::Value& config, Json::Value& 
   out[QUIXMDOwnerUserID] = std::to_string(st.stx_uid);
   out[QUIXMDOwnerGroupID] = std::to_string(st.stx_gid);
   out[QUIXMDExtension] = orvane::GetFileExtension(path, true);
+  // Contents are read by the helper process: a hostile file costs that process, not the indexer,
+  // and a file whose contents cannot be read is still indexed by name and attributes.
+  if (S_ISREG(st.stx_mode) && config.isObject() && config[kKeyNeedMeta].isBool() &&
+      config[kKeyNeedMeta].asBool()) {
+    Json::Value fields;
+    std::string error;
+    if (orvane::extract::RunExtractHelper(path, &fields, &error)) {
+      for (const std::string& key : fields.getMemberNames()) {
+        if (!out.isMember(key)) out[key] = fields[key];
+      }
+    } else {
+      orvane::Log(LOG_WARNING, "%s:%d content of %s not extracted: %s",
+                  orvane::SourceName(__FILE__), __LINE__, path.c_str(), error.c_str());
+    }
+  }
   doc.swap(out);
 }
 
