@@ -1,0 +1,101 @@
+// A scratch system for the tests of the folder configuration and the administration
+// operations: its own ORVANE_ROOT, a volume folder with the shares "photo", "music", "homes",
+// "ro" (read-only) and "Photos" (a name that differs from "photo" only in case), the platform
+// file naming them, and helpers to read and write the files the operations keep.
+#ifndef ORVANE_FILEINDEX_ADMIN_TEST_ENV_HPP_
+#define ORVANE_FILEINDEX_ADMIN_TEST_ENV_HPP_
+
+#include <gtest/gtest.h>
+#include <json/json.h>
+
+#include <string>
+
+#include "common/error.hpp"
+#include "common/json_util.hpp"
+#include "common/root.hpp"
+#include "common/util.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace fileindex {
+namespace testenv {
+
+class AdminTestEnv : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    vol_ = volume_.path();
+    for (const char* dir : {"photo/trips/2024", "photo/family", "photo/#recycle", "music/live",
+                            "homes/bob/docs", "homes/bobby", "ro/x", "Photos/a"}) {
+      ASSERT_TRUE(MakeParentDirs(vol_ + "/" + dir + "/x"));
+    }
+    test::WritePlatformConfig(root_.path(), R"({"shares": [
+      {"name": "photo", "path": ")" + vol_ + R"(/photo", "recycle_bin": true},
+      {"name": "music", "path": ")" + vol_ + R"(/music"},
+      {"name": "homes", "path": ")" + vol_ + R"(/homes", "recycle_bin": true},
+      {"name": "ro", "path": ")" + vol_ + R"(/ro", "readonly": true},
+      {"name": "Photos", "path": ")" + vol_ + R"(/Photos"}
+    ]})");
+  }
+
+  std::string Rooted(const std::string& fixed) const { return root_.path() + fixed; }
+  std::string Queue(const std::string& share) const {
+    return vol_ + "/" + share + "/@eaDir/@fileindex/queue";
+  }
+
+  static Json::Value Parse(const std::string& text) {
+    JsonValue v;
+    EXPECT_TRUE(v.fromString(text)) << text;
+    return std::move(v);
+  }
+  Json::Value ReadJson(const std::string& path) const { return Parse(test::ReadFile(path)); }
+  // The lines of a queue file, parsed.
+  std::vector<Json::Value> QueueLines(const std::string& share) const {
+    std::vector<Json::Value> lines;
+    const std::string text = test::ReadFile(Queue(share));
+    size_t pos = 0;
+    while (pos < text.size()) {
+      const size_t nl = text.find('\n', pos);
+      EXPECT_NE(nl, std::string::npos) << "unterminated queue line";
+      if (nl == std::string::npos) break;
+      lines.push_back(Parse(text.substr(pos, nl - pos)));
+      pos = nl + 1;
+    }
+    return lines;
+  }
+
+  // A folder record as a request or the folder file holds it.
+  static Json::Value FolderJson(const std::string& path, const std::string& name, bool document,
+                                bool audio, bool video, bool photo) {
+    Json::Value f(Json::objectValue);
+    f["path"] = path;
+    f["name"] = name;
+    f["document"] = document;
+    f["audio"] = audio;
+    f["video"] = video;
+    f["photo"] = photo;
+    return f;
+  }
+
+  test::TempDir root_;
+  test::TempDir volume_;
+  test::ScopedRoot scoped_{root_.path()};
+  std::string vol_;
+};
+
+// The Error that `fn` throws, or a test failure.
+template <typename Fn>
+Error ErrorOf(Fn fn) {
+  try {
+    fn();
+  } catch (const Error& e) {
+    return e;
+  }
+  ADD_FAILURE() << "no Error thrown";
+  return Error(kErrInvalidParam);
+}
+
+}  // namespace testenv
+}  // namespace fileindex
+}  // namespace orvane
+
+#endif  // ORVANE_FILEINDEX_ADMIN_TEST_ENV_HPP_

@@ -1,0 +1,120 @@
+#include "fileindex/status_mgr.hpp"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include "fileindex/admin_test_env.hpp"
+
+namespace orvane {
+namespace fileindex {
+namespace {
+
+using testenv::ErrorOf;
+
+class StatusMgrTest : public testenv::AdminTestEnv {
+ protected:
+  std::string StatusPath() const { return Rooted(kFileIndexStatusCfgPath); }
+};
+
+TEST_F(StatusMgrTest, NoFileRefusesQuestionsUntilCreated) {
+  StatusMgr empty;
+  EXPECT_TRUE(empty.data().isNull());
+  for (auto fn : std::vector<std::function<void()>>{
+           [&] { empty.GetPauseInfo(); }, [&] { empty.GetShareStatus("photo"); },
+           [&] { empty.SetShareStatus("photo", 1); }, [&] { empty.ClearShareStatus("photo"); }}) {
+    const Error e = ErrorOf(fn);
+    EXPECT_EQ(e.code, kErrInvalidParam);
+    EXPECT_EQ(e.message, "Orvane error, code=120, reason=[Not an object, data=null]");
+  }
+  EXPECT_FALSE(IsFileExist(StatusPath()));
+
+  StatusMgr::CreateIfMissing();
+  struct stat st;
+  ASSERT_EQ(stat(StatusPath().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0644u);
+  EXPECT_EQ(ReadJson(StatusPath()), Parse(R"({"share": {}})"));
+  StatusMgr status;
+  EXPECT_EQ(status.GetPauseInfo(), -1);
+  EXPECT_EQ(status.GetShareStatus("photo"), 0);
+
+  // An existing file is never replaced.
+  ASSERT_TRUE(JsonValue(Parse(R"({"resume_time": 0, "share": {"a": 4}})")).toFile(StatusPath()));
+  StatusMgr::CreateIfMissing();
+  EXPECT_EQ(StatusMgr().GetShareStatus("a"), 4);
+}
+
+TEST_F(StatusMgrTest, ShareFlagsAccumulateClearAndPersist) {
+  StatusMgr::CreateIfMissing();
+  StatusMgr().SetShareStatus("photo", 1);
+  StatusMgr().SetShareStatus("photo", 2);
+  EXPECT_EQ(StatusMgr().GetShareStatus("photo"), 3);
+  StatusMgr().UnsetShareStatus("photo", 1);
+  StatusMgr().UnsetShareStatus("music", 4);  // unknown share: kept with 0
+  EXPECT_EQ(ReadJson(StatusPath()), Parse(R"({"share": {"photo": 2, "music": 0}})"));
+  StatusMgr().ClearShareStatus("photo");
+  StatusMgr after;
+  EXPECT_EQ(after.GetShareStatus("photo"), 0);
+  EXPECT_FALSE(after.data()["share"].isMember("photo"));
+  EXPECT_TRUE(after.data()["share"].isMember("music"));
+
+  // Each writer changes the document it loaded: a stale manager overwrites a newer flag.
+  StatusMgr stale;
+  StatusMgr().SetShareStatus("photo", 1);
+  stale.SetShareStatus("music", 8);
+  EXPECT_EQ(StatusMgr().GetShareStatus("photo"), 0);
+  EXPECT_EQ(StatusMgr().GetShareStatus("music"), 8);
+}
+
+TEST_F(StatusMgrTest, DamagedFilesAreRefusedAndLeftAlone) {
+  test::LogCapture log;
+  for (const std::string text : {"", "{\"share\": {", "not json", "{} {}"}) {
+    ASSERT_TRUE(MakeParentDirs(StatusPath()));
+    volume_.Write("status", text);
+    ASSERT_EQ(rename(volume_.Path("status").c_str(), StatusPath().c_str()), 0);
+    const Error e = ErrorOf([] { StatusMgr status; });
+    EXPECT_EQ(e.code, kErrLoadConfig) << text;
+    EXPECT_EQ(e.message, "Orvane error, code=504, reason=[Cannot load json: " + StatusPath() + "]");
+    EXPECT_EQ(test::ReadFile(StatusPath()), text);
+  }
+  EXPECT_TRUE(log.Contains(
+      "Failed [IsFileExist(kFileIndexStatusCfgPath) && !data_.fromFile(kFileIndexStatusCfgPath)]"));
+
+  // Parsable but of the wrong shape: questions fail with 120, odd member types read as unset.
+  const std::string array_text = "[1, 2]\n";
+  volume_.Write("status", array_text);
+  ASSERT_EQ(rename(volume_.Path("status").c_str(), StatusPath().c_str()), 0);
+  StatusMgr array;
+  EXPECT_EQ(ErrorOf([&] { array.GetPauseInfo(); }).code, kErrInvalidParam);
+  EXPECT_EQ(ErrorOf([&] { array.GetShareStatus("photo"); }).code, kErrInvalidParam);
+  EXPECT_EQ(ErrorOf([&] { array.SetShareStatus("photo", 1); }).code, kErrInvalidParam);
+  EXPECT_EQ(test::ReadFile(StatusPath()), array_text);
+
+  ASSERT_TRUE(JsonValue(Parse(R"({"resume_time": "soon", "share": {"photo": "x", "music": -3}})"))
+                  .toFile(StatusPath()));
+  StatusMgr odd;
+  EXPECT_EQ(odd.GetPauseInfo(), -1);
+  EXPECT_EQ(odd.GetShareStatus("photo"), 0);
+  EXPECT_EQ(odd.GetShareStatus("music"), -3);
+  odd.SetShareStatus("music", 1);  // -3 is no unsigned number: read as 0
+  EXPECT_EQ(StatusMgr().GetShareStatus("music"), 1);
+}
+
+TEST_F(StatusMgrTest, SaveFailureIs505AndKeepsTheOldFile) {
+  StatusMgr::CreateIfMissing();
+  StatusMgr status;
+  // A folder in the file's place cannot be replaced by the rename.
+  ASSERT_EQ(unlink(StatusPath().c_str()), 0);
+  ASSERT_EQ(mkdir(StatusPath().c_str(), 0755), 0);
+  test::LogCapture log;
+  const Error e = ErrorOf([&] { status.SetShareStatus("photo", 1); });
+  EXPECT_EQ(e.code, kErrSaveConfig);
+  EXPECT_EQ(e.message,
+            "Orvane error, code=505, reason=[Failed to save json: " + StatusPath() + "]");
+  EXPECT_TRUE(log.Contains("status_mgr.cpp"));
+  EXPECT_TRUE(log.Contains("Failed [!data_.toFile(kFileIndexStatusCfgPath)]"));
+  EXPECT_TRUE(IsDirExist(StatusPath(), false));
+}
+
+}  // namespace
+}  // namespace fileindex
+}  // namespace orvane
