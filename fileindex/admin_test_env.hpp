@@ -28,7 +28,20 @@ class AdminTestEnv : public ::testing::Test {
                             "homes/bob/docs", "homes/bobby", "ro/x", "Photos/a"}) {
       ASSERT_TRUE(MakeParentDirs(vol_ + "/" + dir + "/x"));
     }
-    test::WritePlatformConfig(root_.path(), R"({"shares": [
+    actions_ = scratch_.Path("actions");
+    const std::string record = R"(["/bin/sh", "-c", "echo $0 >> )" + actions_ + R"(", )";
+    test::WritePlatformConfig(root_.path(), R"({
+    "samba_conf": ")" + scratch_.Path("smb.conf") +
+                                                R"(",
+    "services": {
+      "quixcontentextractd": {"start": )" + record +
+                                                R"("start-ce"]},
+      "pkg-Orvane-fileindexd": {"start": )" + record +
+                                                R"("start-fi"], "stop": )" + record +
+                                                R"("stop-fi"]},
+      "samba": {"restart": )" + record + R"("restart-smb"]}
+    },
+    "shares": [
       {"name": "photo", "path": ")" + vol_ + R"(/photo", "recycle_bin": true},
       {"name": "music", "path": ")" + vol_ + R"(/music"},
       {"name": "homes", "path": ")" + vol_ + R"(/homes", "recycle_bin": true},
@@ -76,8 +89,13 @@ class AdminTestEnv : public ::testing::Test {
     return f;
   }
 
+  // The services started, stopped and restarted, one per line.
+  std::string Actions() const { return test::ReadFile(actions_); }
+
   test::TempDir root_;
   test::TempDir volume_;
+  test::TempDir scratch_;
+  std::string actions_;
   test::ScopedRoot scoped_{root_.path()};
   std::string vol_;
 };
