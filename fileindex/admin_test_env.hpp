@@ -8,12 +8,15 @@
 #include <gtest/gtest.h>
 #include <json/json.h>
 
+#include <memory>
 #include <string>
+#include <vector>
 
 #include "common/error.hpp"
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
+#include "test/fake_daemon.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -89,6 +92,30 @@ class AdminTestEnv : public ::testing::Test {
     return f;
   }
 
+  // In-test indexing daemon and search engine on their real socket paths, each recording what
+  // it receives and answering success.
+  void StartDaemons() {
+    indexd_ = std::make_unique<test::FakeDaemon>(Rooted("/var/run/fileindexd.sock"),
+                                                 test::FakeDaemon::Replies({"{}"}));
+    engine_ = std::make_unique<test::FakeDaemon>(
+        Rooted("/var/run/quixelasticd.sock"), test::FakeDaemon::Replies({R"({"success":true})"}));
+  }
+  // The indexing daemon's commands as compact {"type", "data"} texts, in order.
+  std::vector<std::string> IndexdCommands() const {
+    std::vector<std::string> out;
+    for (const Json::Value& r : indexd_->json_requests()) out.push_back(JsonToString(r));
+    return out;
+  }
+  // The engine's requests as "<command> <data.id>", in order.
+  std::vector<std::string> EngineCommands() const {
+    std::vector<std::string> out;
+    for (const Json::Value& r : engine_->json_requests()) {
+      out.push_back(r["command"].asString() + " " + r["data"]["id"].asString());
+    }
+    return out;
+  }
+  std::vector<Json::Value> EngineRequests() const { return engine_->json_requests(); }
+
   // The services started, stopped and restarted, one per line.
   std::string Actions() const { return test::ReadFile(actions_); }
 
@@ -96,6 +123,8 @@ class AdminTestEnv : public ::testing::Test {
   test::TempDir volume_;
   test::TempDir scratch_;
   std::string actions_;
+  std::unique_ptr<test::FakeDaemon> indexd_;
+  std::unique_ptr<test::FakeDaemon> engine_;
   test::ScopedRoot scoped_{root_.path()};
   std::string vol_;
 };

@@ -5,11 +5,13 @@
 #include <cerrno>
 #include <cstring>
 
+#include "common/env.hpp"
 #include "common/error.hpp"
 #include "common/lock_file.hpp"
 #include "common/root.hpp"
 #include "common/sdk/credentials.hpp"
 #include "common/util.hpp"
+#include "fileindex/communication.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -50,6 +52,34 @@ int StatusMgr::GetShareStatus(const std::string& share) const {
   // A missing "share" member reads as null and is refused as "Not an object".
   GetJsonValue(bits, SharesOf(data_), share, false);
   return bits;
+}
+
+void StatusMgr::Pause(int hours) {
+  LockFile lock(RootedPathForWrite(kStatusCfgLockPath), true);
+  ORVANE_THROW_IF(hours < 0, kErrInvalidParam, "Pause length should NOT be negative");
+  ORVANE_THROW_IF(!data_.isNull() && !data_.isObject(), kErrInvalidParam,
+                  "Not an object" + AppendData(data_));
+  long long resume_time = 0;
+  if (hours != 0) {
+    // The resume time has always been computed in 32 bits; the sum is wrapped the way that
+    // arithmetic wraps rather than overflowing, and then widened with its sign.
+    const int64_t wide = static_cast<int64_t>(Env::Current()->Now()) + int64_t{hours} * 3600;
+    resume_time = static_cast<int32_t>(static_cast<uint32_t>(wide));
+  }
+  data_["resume_time"] = Json::Int64(resume_time);
+  Save();
+  Json::Value data(Json::objectValue);
+  data["resume_time"] = Json::Int64(resume_time);
+  SendCommandToDaemon("pause", data);
+}
+
+void StatusMgr::Resume() {
+  LockFile lock(RootedPathForWrite(kStatusCfgLockPath), true);
+  ORVANE_THROW_IF(!data_.isNull() && !data_.isObject(), kErrInvalidParam,
+                  "Not an object" + AppendData(data_));
+  data_["resume_time"] = Json::Int64(-1);
+  Save();
+  SendCommandToDaemon("resume", Json::Value());
 }
 
 unsigned int StatusMgr::StoredShareBits(const std::string& share) const {

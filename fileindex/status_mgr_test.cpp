@@ -118,3 +118,51 @@ TEST_F(StatusMgrTest, SaveFailureIs505AndKeepsTheOldFile) {
 }  // namespace
 }  // namespace fileindex
 }  // namespace orvane
+
+namespace orvane {
+namespace fileindex {
+namespace {
+
+TEST_F(StatusMgrTest, PauseAndResumeTellTheIndexingDaemon) {
+  StartDaemons();
+  test::FakeEnv env;
+  const long long now = env.Now();
+  StatusMgr::CreateIfMissing();
+  StatusMgr().SetShareStatus("photo", 2);
+  StatusMgr().Pause(2);
+  EXPECT_EQ(StatusMgr().GetPauseInfo(), now + 7200);
+  StatusMgr().Pause(0);
+  EXPECT_EQ(StatusMgr().GetPauseInfo(), 0);
+  StatusMgr().Resume();
+  StatusMgr().Resume();  // not paused: written and told again
+  EXPECT_EQ(ReadJson(StatusPath()), Parse(R"({"resume_time": -1, "share": {"photo": 2}})"));
+  EXPECT_EQ(IndexdCommands(),
+            (std::vector<std::string>{
+                R"({"data":{"resume_time":)" + std::to_string(now + 7200) + R"(},"type":"pause"})",
+                R"({"data":{"resume_time":0},"type":"pause"})", R"({"data":null,"type":"resume"})",
+                R"({"data":null,"type":"resume"})"}));
+
+  // A negative length changes nothing and tells nobody.
+  test::LogCapture log;
+  const std::string before = test::ReadFile(StatusPath());
+  const Error e = ErrorOf([] { StatusMgr().Pause(-1); });
+  EXPECT_EQ(e.message, "Orvane error, code=120, reason=[Pause length should NOT be negative]");
+  EXPECT_TRUE(log.Contains("status_mgr.cpp"));
+  EXPECT_EQ(test::ReadFile(StatusPath()), before);
+  EXPECT_EQ(IndexdCommands().size(), 4u);
+
+  // The resume time wraps in 32 bits the way it always has.
+  env.Advance((0x7FFFFFFFLL - now - 1800) * 1000000);
+  StatusMgr().Pause(1);
+  EXPECT_EQ(StatusMgr().GetPauseInfo(), 0x7FFFFFFFLL + 1800 - 0x100000000LL);
+
+  // With the daemon gone, the new state stays on disk and the failure reaches the caller.
+  indexd_.reset();
+  const Error down = ErrorOf([] { StatusMgr().Pause(0); });
+  EXPECT_EQ(down.code, kErrSystem);
+  EXPECT_EQ(StatusMgr().GetPauseInfo(), 0);
+}
+
+}  // namespace
+}  // namespace fileindex
+}  // namespace orvane

@@ -5,7 +5,9 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cstdio>
+#include <thread>
 
 #include "common/error.hpp"
 #include "common/root.hpp"
@@ -267,6 +269,27 @@ TEST_F(IndexRulesTest, RealMountPointsAndSnapshots) {
   EXPECT_EQ(in_snapshot, 1);
   EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/#snapshot/daily"));
   EXPECT_EQ(platform::QUIXGetFSType((vol_ + "/music/live").c_str(), 0), platform::FS_TYPE_TMPFS);
+}
+
+TEST_F(IndexRulesTest, ConcurrentJudgementsWhileTheConfigurationIsRewritten) {
+  std::atomic<int> refused{0};
+  std::atomic<bool> done{false};
+  std::vector<std::thread> readers;
+  for (int t = 0; t < 3; ++t) {
+    readers.emplace_back([&] {
+      for (int i = 0; i < 150; ++i) {
+        refused += !CanFullPathBeIndexed(vol_ + "/music/live");
+        refused += CanFullPathBeIndexed(vol_ + "/music/.git/objects");
+      }
+    });
+  }
+  std::thread writer([&] {
+    for (int i = 0; i < 40 && !done; ++i) WriteConfig("");  // same shares, a new file each time
+  });
+  for (std::thread& reader : readers) reader.join();
+  done = true;
+  writer.join();
+  EXPECT_EQ(refused, 0);
 }
 
 TEST(PlatformFsTest, FileSystemKinds) {

@@ -88,6 +88,22 @@ int AccessFromFolder(const std::string& path, const struct passwd& pw,
   return (bits & 2) ? SHARE_READWRITE : SHARE_READONLY;
 }
 
+std::unique_ptr<QUIXSHARE> MakeRecord(const ShareConfig& config) {
+  auto record = std::make_unique<QUIXSHARE>();
+  // The configuration bounds both lengths, so these copies always fit.
+  CopyOut(config.name, record->szName, sizeof(record->szName));
+  CopyOut(config.path, record->szPath, sizeof(record->szPath));
+  record->fFTPPrivilege = config.ftp_privilege;
+  record->fReadOnly = config.readonly;
+  record->fEncrypted = config.encrypted;
+  record->fEncryption = config.encryption;
+  record->fRecycleBin = config.recycle_bin;
+  record->fHideUnreadable = config.hide_unreadable;
+  record->user_access = config.user_access;
+  record->group_access = config.group_access;
+  return record;
+}
+
 }  // namespace
 
 int QUIXShareGet(const char* name, PQUIXSHARE* share) {
@@ -98,18 +114,7 @@ int QUIXShareGet(const char* name, PQUIXSHARE* share) {
   if (!config) return -1;
   const ShareConfig* found = config->FindShare(name);
   if (found == nullptr) return PLATFORM_FAIL(-1, ENOENT, kQErrNoSuchShare);
-  auto record = std::make_unique<QUIXSHARE>();
-  // The configuration bounds both lengths, so these copies always fit.
-  CopyOut(found->name, record->szName, sizeof(record->szName));
-  CopyOut(found->path, record->szPath, sizeof(record->szPath));
-  record->fFTPPrivilege = found->ftp_privilege;
-  record->fReadOnly = found->readonly;
-  record->fEncrypted = found->encrypted;
-  record->fEncryption = found->encryption;
-  record->fRecycleBin = found->recycle_bin;
-  record->fHideUnreadable = found->hide_unreadable;
-  record->user_access = found->user_access;
-  record->group_access = found->group_access;
+  auto record = MakeRecord(*found);
   *share = record.release();
   return 0;
 }
@@ -157,12 +162,8 @@ int QLIBShareEnum(PSZLIST* list, QLIBShareEnumFunc filter) {
   if (!config) return -1;
   int added = 0;
   for (const ShareConfig& share : config->shares) {
-    if (filter != nullptr) {
-      PQUIXSHARE record = nullptr;
-      if (QUIXShareGet(share.name.c_str(), &record) < 0) return -1;
-      std::unique_ptr<QUIXSHARE, void (*)(PQUIXSHARE)> owned(record, QUIXShareFree);
-      if (filter(record) != 0) continue;
-    }
+    // The filter sees records of the same configuration that is being listed.
+    if (filter != nullptr && filter(MakeRecord(share).get()) != 0) continue;
     (*list)->items.push_back(share.name);
     ++added;
   }

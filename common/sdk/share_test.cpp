@@ -23,7 +23,8 @@ class SDKShareTest : public ::testing::Test {
       {"name": "music", "path": ")" + vol_ + R"(/music", "recycle_bin": true, "ftp_privilege": 5},
       {"name": "vault", "path": ")" + vol_ + R"(/vault", "encrypted": true, "encryption": true},
       {"name": "ro", "path": ")" + vol_ + R"(/ro", "readonly": true, "hide_unreadable": true},
-      {"name": "open", "path": ")" + vol_ + R"(/open", "encryption": true}
+      {"name": "open", "path": ")" + vol_ + R"(/open", "encryption": true},
+      {"name": "my music é", "path": ")" + vol_ + R"(/my music é"}
     ]})");
   }
 
@@ -35,7 +36,8 @@ class SDKShareTest : public ::testing::Test {
       ADD_FAILURE() << "no Error for " << reason;
     } catch (const Error& e) {
       EXPECT_EQ(e.code, code);
-      EXPECT_EQ(e.message, "Orvane error, code=" + std::to_string(code) + ", reason=[" + reason + "]");
+      EXPECT_EQ(e.message, "Orvane error, code=" + std::to_string(code) +
+                               (reason.empty() ? "" : ", reason=[" + reason + "]"));
     }
   }
 
@@ -67,12 +69,19 @@ TEST_F(SDKShareTest, LocationsAndFlagsOfAShare) {
   SDKShare open("open");  // an unlocked encrypted share can be indexed
   EXPECT_TRUE(open.CanBeIndexed());
 
-  EXPECT_EQ(SDKShare::Enum(), (std::set<std::string>{"music", "open", "ro", "vault"}));
+  SDKShare spaced("my music é");
+  EXPECT_EQ(spaced.GetQueuePath(), vol_ + "/my music é/@eaDir/@fileindex/queue");
+  EXPECT_EQ(spaced.GetDBName(), "fileindex_my music é");
+
+  EXPECT_EQ(SDKShare::Enum(),
+            (std::set<std::string>{"music", "my music é", "open", "ro", "vault"}));
 }
 
 TEST_F(SDKShareTest, UnknownShareOrUnusableConfigurationIsError800) {
   test::LogCapture log;
   ExpectError([] { SDKShare share("Music"); }, kErrShareGet, "Music");
+  ExpectError([] { SDKShare share("music/x"); }, kErrShareGet, "music/x");
+  ExpectError([] { SDKShare share(""); }, kErrShareGet, "");
   EXPECT_TRUE(log.Contains(
       "Failed [0 > QUIXShareGet(share_name.c_str(), &share_info_) || !share_info_], reason: "
       "Orvane error, code=800, reason=[Music]"));

@@ -1,0 +1,41 @@
+#include "extract/content_extract.hpp"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "common/error.hpp"
+#include "common/util.hpp"
+
+namespace QUIX {
+namespace CONTENT_EXTRACT {
+
+void ParseFile(const std::string& path, const Json::Value& config, Json::Value& doc) {
+  struct statx st;
+  std::memset(&st, 0, sizeof(st));
+  ORVANE_THROW_IF(0 != statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW,
+                             STATX_BASIC_STATS | STATX_BTIME, &st),
+                  orvane::kErrSystem, "statx failed, path=" + path + ", reason=" + strerror(errno));
+
+  Json::Value out(Json::objectValue);
+  out[QUIXMDPath] = path;
+  out[QUIXMDFSName] = orvane::Basename(path);
+  out[QUIXMDParent] = orvane::Dirname(path);
+  out[QUIXMDIsDir] = S_ISDIR(st.stx_mode);
+  out[QUIXMDFSSize] = static_cast<Json::UInt64>(st.stx_size);
+  out[QUIXMDFSContentChangeDate] = static_cast<Json::Int64>(st.stx_mtime.tv_sec);
+  out[QUIXMDAttributeChangeDate] = static_cast<Json::Int64>(st.stx_ctime.tv_sec);
+  // Not every file system records a birth time; a made-up one would mislead date searches.
+  if (st.stx_mask & STATX_BTIME) {
+    out[QUIXMDFSCreationDate] = static_cast<Json::Int64>(st.stx_btime.tv_sec);
+  }
+  out[QUIXMDOwnerUserID] = std::to_string(st.stx_uid);
+  out[QUIXMDOwnerGroupID] = std::to_string(st.stx_gid);
+  out[QUIXMDExtension] = orvane::GetFileExtension(path, true);
+  doc.swap(out);
+}
+
+}  // namespace CONTENT_EXTRACT
+}  // namespace QUIX

@@ -1,0 +1,161 @@
+#include "fileindex/communication.hpp"
+
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/time.h>
+#include <sys/un.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdint>
+#include <cstring>
+#include <vector>
+
+#include "common/env.hpp"
+#include "common/error.hpp"
+#include "common/fd.hpp"
+#include "common/json_util.hpp"
+#include "common/log.hpp"
+#include "common/root.hpp"
+
+namespace orvane {
+namespace fileindex {
+namespace {
+
+constexpr int kConnectAttempts = 5;
+constexpr int64_t kConnectRetrySleep = 1000000;
+constexpr unsigned int kChunk = 1024;
+constexpr int kInterruptBudget = 10;
+// Reads of 0 (the peer has closed) tried before the transfer is given up.
+constexpr int kClosedReadBudget = 10;
+
+BufferIo& Io() {
+  static BufferIo io;
+  return io;
+}
+
+ssize_t DoWrite(int fd, const void* buf, size_t size) {
+  const BufferIo& io = Io();
+  return io.write ? io.write(fd, buf, size) : write(fd, buf, size);
+}
+
+ssize_t DoRead(int fd, void* buf, size_t size) {
+  const BufferIo& io = Io();
+  return io.read ? io.read(fd, buf, size) : read(fd, buf, size);
+}
+
+std::string Reason(const char* what) { return std::string(what) + strerror(errno); }
+
+}  // namespace
+
+BufferIo SetBufferIo(BufferIo io) {
+  std::swap(Io(), io);
+  return io;
+}
+
+void BufferWrite(int fd, unsigned int size, const unsigned char* buf) {
+  if (size == 0) return;
+  int budget = kInterruptBudget;
+  unsigned int done = 0;
+  while (done < size) {
+    const ssize_t n = DoWrite(fd, buf + done, std::min(size - done, kChunk));
+    if (n > 0) {
+      done += static_cast<unsigned int>(n);
+      continue;
+    }
+    if (errno == EINTR && budget > 0) {
+      --budget;
+      continue;
+    }
+    throw Error(kErrSystem, Reason("write failed, reason="));
+  }
+}
+
+void BufferRead(int fd, unsigned int size, unsigned char* buf) {
+  if (size == 0) return;
+  int budget = kInterruptBudget;
+  int closed_budget = kClosedReadBudget;
+  unsigned int done = 0;
+  while (done < size) {
+    const ssize_t n = DoRead(fd, buf + done, std::min(size - done, kChunk));
+    if (n > 0) {
+      done += static_cast<unsigned int>(n);
+      continue;
+    }
+    if (n == 0) {
+      // The daemon answers before it closes, so an end of stream here is read again; but a
+      // closed socket never yields more, and waiting on it for ever would hang the caller.
+      if (closed_budget-- > 0) continue;
+      errno = ECONNRESET;
+      throw Error(kErrSystem, Reason("read failed, reason="));
+    }
+    if (errno == EINTR && budget > 0) {
+      --budget;
+      continue;
+    }
+    throw Error(kErrSystem, Reason("read failed, reason="));
+  }
+}
+
+void SendCommandToDaemon(const std::string& cmd, const Json::Value& data) {
+  // A write to a daemon that went away must fail, not kill the caller.
+  signal(SIGPIPE, SIG_IGN);
+  const int saved_errno = errno;
+
+  int fd_socket = -1;
+  ORVANE_THROW_IF(0 > (fd_socket = socket(PF_UNIX, SOCK_STREAM, 0)), kErrSystem,
+                  Reason("socket failed, reason="));
+  UniqueFd socket_fd(fd_socket);
+
+  const std::string path = RootedPath(kFileIndexdSockPath);
+  struct sockaddr_un addr;
+  std::memset(&addr, 0, sizeof(addr));
+  addr.sun_family = AF_UNIX;
+  if (path.size() < sizeof(addr.sun_path)) {
+    std::memcpy(addr.sun_path, path.c_str(), path.size() + 1);
+    // Only a missing socket file is worth waiting for: the daemon may be starting. Whatever the
+    // outcome, an unconnected socket makes the first write fail and say why.
+    for (int attempt = 1; attempt <= kConnectAttempts; ++attempt) {
+      if (connect(fd_socket, reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) == 0) break;
+      if (errno != ENOENT || attempt == kConnectAttempts) break;
+      Env::Current()->SleepMicros(kConnectRetrySleep);
+    }
+  } else {
+    Log(LOG_ERR, "%s:%d socket path too long: %s", SourceName(__FILE__), __LINE__, path.c_str());
+  }
+
+  struct timeval tv = {1, 0};
+  ORVANE_THROW_IF(0 > setsockopt(fd_socket, SOL_SOCKET, SO_SNDTIMEO, &tv, sizeof(tv)), kErrSystem,
+                  Reason("setsockopt failed, reason="));
+  // Without a receive time-out a daemon that never answers would hold the caller for ever.
+  struct timeval rtv = {kDaemonReplyTimeoutSec, 0};
+  ORVANE_THROW_IF(0 > setsockopt(fd_socket, SOL_SOCKET, SO_RCVTIMEO, &rtv, sizeof(rtv)),
+                  kErrSystem, Reason("setsockopt failed, reason="));
+
+  Json::Value message(Json::objectValue);
+  message["type"] = cmd;
+  message["data"] = data;
+  const std::string text = JsonToString(message);
+  if (text.size() >= UINT32_MAX) {
+    errno = EMSGSIZE;
+    throw Error(kErrSystem, Reason("write failed, reason="));
+  }
+  // The terminating NUL travels too: the payload is the text as a C string.
+  unsigned int length = static_cast<unsigned int>(text.size() + 1);
+  BufferWrite(fd_socket, sizeof(length), reinterpret_cast<const unsigned char*>(&length));
+  BufferWrite(fd_socket, length, reinterpret_cast<const unsigned char*>(text.c_str()));
+
+  BufferRead(fd_socket, sizeof(length), reinterpret_cast<unsigned char*>(&length));
+  if (length > kMaxDaemonReplyBytes) {
+    errno = EMSGSIZE;
+    throw Error(kErrSystem, Reason("read failed, reason="));
+  }
+  std::vector<unsigned char> reply(length);
+  BufferRead(fd_socket, length, reply.data());
+  errno = saved_errno;  // failed connect attempts that came to nothing leave no trace
+}
+
+}  // namespace fileindex
+}  // namespace orvane
