@@ -95,10 +95,19 @@ class AdminTestEnv : public ::testing::Test {
   // In-test indexing daemon and search engine on their real socket paths, each recording what
   // it receives and answering success.
   void StartDaemons() {
+    // The old ones first: a daemon removes its socket file when it goes.
+    indexd_.reset();
+    engine_.reset();
     indexd_ = std::make_unique<test::FakeDaemon>(Rooted("/var/run/fileindexd.sock"),
                                                  test::FakeDaemon::Replies({"{}"}));
     engine_ = std::make_unique<test::FakeDaemon>(
         Rooted("/var/run/quixelasticd.sock"), test::FakeDaemon::Replies({R"({"success":true})"}));
+  }
+  // Replaces the engine with one that gives `replies` in turn (the last one repeated).
+  void StartEngine(std::vector<std::string> replies) {
+    engine_.reset();
+    engine_ = std::make_unique<test::FakeDaemon>(Rooted("/var/run/quixelasticd.sock"),
+                                                 test::FakeDaemon::Replies(std::move(replies)));
   }
   // The indexing daemon's commands as compact {"type", "data"} texts, in order.
   std::vector<std::string> IndexdCommands() const {
