@@ -8,6 +8,7 @@
 #include <gtest/gtest.h>
 #include <json/json.h>
 
+#include <algorithm>
 #include <memory>
 #include <string>
 #include <vector>
@@ -16,6 +17,8 @@
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
+#include "fileindex/folder_mgr.hpp"
+#include "platform/monitor_queue.hpp"
 #include "test/fake_daemon.hpp"
 #include "test/test_util.hpp"
 
@@ -32,6 +35,25 @@ class AdminTestEnv : public ::testing::Test {
       ASSERT_TRUE(MakeParentDirs(vol_ + "/" + dir + "/x"));
     }
     actions_ = scratch_.Path("actions");
+    WritePlatform(DefaultShares());
+  }
+
+  // The shares of the scratch volume, as the platform file lists them.
+  std::string DefaultShares() const {
+    return R"(
+      {"name": "photo", "path": ")" +
+           vol_ + R"(/photo", "recycle_bin": true},
+      {"name": "music", "path": ")" +
+           vol_ + R"(/music"},
+      {"name": "homes", "path": ")" +
+           vol_ + R"(/homes", "recycle_bin": true},
+      {"name": "ro", "path": ")" +
+           vol_ + R"(/ro", "readonly": true},
+      {"name": "Photos", "path": ")" +
+           vol_ + R"(/Photos"})";
+  }
+  // Writes the platform file with `shares` (the text of the array's elements).
+  void WritePlatform(const std::string& shares) {
     const std::string record = R"(["/bin/sh", "-c", "echo $0 >> )" + actions_ + R"(", )";
     test::WritePlatformConfig(root_.path(), R"({
     "samba_conf": ")" + scratch_.Path("smb.conf") +
@@ -44,13 +66,7 @@ class AdminTestEnv : public ::testing::Test {
                                                 R"("stop-fi"]},
       "samba": {"restart": )" + record + R"("restart-smb"]}
     },
-    "shares": [
-      {"name": "photo", "path": ")" + vol_ + R"(/photo", "recycle_bin": true},
-      {"name": "music", "path": ")" + vol_ + R"(/music"},
-      {"name": "homes", "path": ")" + vol_ + R"(/homes", "recycle_bin": true},
-      {"name": "ro", "path": ")" + vol_ + R"(/ro", "readonly": true},
-      {"name": "Photos", "path": ")" + vol_ + R"(/Photos"}
-    ]})");
+    "shares": [)" + shares + "]}");
   }
 
   std::string Rooted(const std::string& fixed) const { return root_.path() + fixed; }
@@ -136,6 +152,64 @@ class AdminTestEnv : public ::testing::Test {
   std::unique_ptr<test::FakeDaemon> engine_;
   test::ScopedRoot scoped_{root_.path()};
   std::string vol_;
+};
+
+using Strings = std::vector<std::string>;
+
+// The same with the fake daemons running and views of what the operations left behind.
+class AdminOpsTest : public AdminTestEnv {
+ protected:
+  void SetUp() override {
+    AdminTestEnv::SetUp();
+    StartDaemons();
+  }
+  std::string FoldersPath() const { return Rooted(kFileIndexFoldersCfgPath); }
+  Json::Value Folders() const { return ReadJson(FoldersPath()); }
+  // The paths of the folder file, in order.
+  Strings FolderPaths() const {
+    Strings paths;
+    for (const auto& f : Folders()) paths.push_back(f["path"].asString());
+    return paths;
+  }
+  // Each registered queue's share and the folders it watches, as "share: path path".
+  Strings Registrations() const {
+    Strings out;
+    for (const Json::Value& r : QUIX::QUIXNOTIFYD::MonitorQueue::List()) {
+      std::string line = r["queue"].asString().substr(vol_.size() + 1);
+      line = line.substr(0, line.find('/')) + ":";
+      for (const auto& c : r["config"]) line += " " + c["path"].asString().substr(vol_.size());
+      out.push_back(line);
+    }
+    std::sort(out.begin(), out.end());
+    return out;
+  }
+  static std::string Notify(const std::string& share, bool upsert) {
+    return R"({"data":{"is_upsert":)" + std::string(upsert ? "true" : "false") +
+           R"(,"share_name":")" + share + R"("},"type":"notify_setting_changed"})";
+  }
+  static std::string Worker(const std::string& type, const std::string& share) {
+    return R"({"data":{"share_name":")" + share + R"("},"type":")" + type + R"("})";
+  }
+  // The queue lines of a share as "<event> <path below the volume> <data>".
+  Strings Events(const std::string& share) const {
+    Strings out;
+    for (const Json::Value& e : QueueLines(share)) {
+      std::string line =
+          std::to_string(e["event"].asUInt()) + " " + e["path"].asString().substr(vol_.size());
+      if (!e["path_old"].asString().empty()) {
+        line += " <- " + e["path_old"].asString().substr(vol_.size());
+      }
+      if (!e["data"].isNull()) line += " " + JsonToString(e["data"]);
+      out.push_back(line);
+    }
+    return out;
+  }
+  static Json::Value List(std::vector<Json::Value> folders) {
+    Json::Value list(Json::arrayValue);
+    for (auto& f : folders) list.append(f);
+    return list;
+  }
+  static constexpr const char* kAll = R"({"audio":true,"document":true,"photo":true,"video":true})";
 };
 
 // The Error that `fn` throws, or a test failure.

@@ -15,66 +15,11 @@ namespace orvane {
 namespace fileindex {
 namespace {
 
+using IndexMgrTest = testenv::AdminOpsTest;
 using platform::Fault;
 using platform::ScopedFaults;
-using QUIX::QUIXNOTIFYD::MonitorQueue;
 using testenv::ErrorOf;
-using Strings = std::vector<std::string>;
-
-class IndexMgrTest : public testenv::AdminTestEnv {
- protected:
-  void SetUp() override {
-    AdminTestEnv::SetUp();
-    StartDaemons();
-  }
-  std::string FoldersPath() const { return Rooted(kFileIndexFoldersCfgPath); }
-  Json::Value Folders() const { return ReadJson(FoldersPath()); }
-  // The paths of the folder file, in order.
-  Strings FolderPaths() const {
-    Strings paths;
-    for (const auto& f : Folders()) paths.push_back(f["path"].asString());
-    return paths;
-  }
-  // Each registered queue's share and the folders it watches, as "share: path path".
-  Strings Registrations() const {
-    Strings out;
-    for (const Json::Value& r : MonitorQueue::List()) {
-      std::string line = r["queue"].asString().substr(vol_.size() + 1);
-      line = line.substr(0, line.find('/')) + ":";
-      for (const auto& c : r["config"]) line += " " + c["path"].asString().substr(vol_.size());
-      out.push_back(line);
-    }
-    std::sort(out.begin(), out.end());
-    return out;
-  }
-  static std::string Notify(const std::string& share, bool upsert) {
-    return R"({"data":{"is_upsert":)" + std::string(upsert ? "true" : "false") +
-           R"(,"share_name":")" + share + R"("},"type":"notify_setting_changed"})";
-  }
-  static std::string Worker(const std::string& type, const std::string& share) {
-    return R"({"data":{"share_name":")" + share + R"("},"type":")" + type + R"("})";
-  }
-  // The queue lines of a share as "<event> <path below the volume> <data>".
-  Strings Events(const std::string& share) const {
-    Strings out;
-    for (const Json::Value& e : QueueLines(share)) {
-      std::string line =
-          std::to_string(e["event"].asUInt()) + " " + e["path"].asString().substr(vol_.size());
-      if (!e["path_old"].asString().empty()) {
-        line += " <- " + e["path_old"].asString().substr(vol_.size());
-      }
-      if (!e["data"].isNull()) line += " " + JsonToString(e["data"]);
-      out.push_back(line);
-    }
-    return out;
-  }
-  static Json::Value List(std::vector<Json::Value> folders) {
-    Json::Value list(Json::arrayValue);
-    for (auto& f : folders) list.append(f);
-    return list;
-  }
-  static constexpr char kAll[] = R"({"audio":true,"document":true,"photo":true,"video":true})";
-};
+using testenv::Strings;
 
 TEST_F(IndexMgrTest, AddThenSetKeepsIndexRegistrationAndQueueInStep) {
   FolderAdd(List({FolderJson("/photo/trips", "Trips", true, true, true, true),
