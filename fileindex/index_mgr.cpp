@@ -383,7 +383,7 @@ Json::Value FolderList(const Json::Value& request) {
                     "Unknown additioal: " + JsonToString(it));
   }
   for (const auto& folder : folders) out.append(folder->GetDataWithAdditional(additionals));
-  result["total"] = total;
+  result["total"] = Json::Int64{total};
   return result;
 }
 
@@ -410,7 +410,7 @@ Json::Value FolderSummary() {
   const long long now = static_cast<long long>(Env::Current()->Now());
 
   Json::Value summary(Json::objectValue);
-  summary["folder_count"] = static_cast<Json::UInt>(folder_mgr.folders().size());
+  summary["folder_count"] = static_cast<Json::Int64>(folder_mgr.folders().size());
   summary["resume_time"] = Json::Int64(resume_time);
   summary["paused"] = resume_time == 0 || resume_time > now;
   Json::Value& shares = summary["shares"] = Json::Value(Json::arrayValue);
@@ -420,11 +420,11 @@ Json::Value FolderSummary() {
     const int bits = has_status ? status.GetShareStatus(share) : 0;
     Json::Value entry(Json::objectValue);
     entry["share"] = share;
-    entry["folder_count"] = static_cast<Json::UInt>(
+    entry["folder_count"] = static_cast<Json::Int64>(
         std::count_if(folder_mgr.folders().begin(), folder_mgr.folders().end(),
                       [&](const auto& f) { return f->GetShare() == share; }));
     entry["queue_length"] =
-        static_cast<Json::UInt64>(CountQueueLines(queue) + CountQueueLines(queue + ".tmp"));
+        static_cast<Json::Int64>(CountQueueLines(queue) + CountQueueLines(queue + ".tmp"));
     entry["status"] = bits;
     entry["need_reindex"] = (bits & kShareStatusNeedReindex) != 0;
     entry["volume_paused"] = (bits & kShareStatusVolumePaused) != 0;

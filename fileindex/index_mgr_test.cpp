@@ -4,6 +4,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <map>
+#include <set>
+#include <sstream>
+
 #include "fileindex/admin_test_env.hpp"
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/status_mgr.hpp"
@@ -163,6 +167,191 @@ TEST_F(IndexMgrTest, FailuresAfterTheChecksAreNotRolledBack) {
             kErrSystem);
   EXPECT_EQ(FolderPaths(), (Strings{"/music"}));
   EXPECT_EQ(StatusMgr().GetShareStatus("music"), kShareStatusNeedReindex);
+}
+
+TEST_F(IndexMgrTest, DeleteKeepsRegistrationIndexAndServicesInStep) {
+  FolderAdd(List({FolderJson("/photo", "Photo", true, true, true, true),
+                  FolderJson("/photo/trips", "Trips", true, true, false, true),
+                  FolderJson("/music", "Music", true, true, false, false)}),
+            false);
+  const size_t engine = EngineCommands().size();
+  const std::string folders = test::ReadFile(FoldersPath());
+
+  // Refusals first: nothing changes, nothing is sent.
+  test::LogCapture log;
+  EXPECT_EQ(ErrorOf([] { FolderDelete(Parse(R"("/music")")); }).message,
+            "Orvane error, code=120, reason=[\"/music\"]");
+  EXPECT_EQ(ErrorOf([] { FolderDelete(Parse(R"(["/music", 3])")); }).message,
+            "Orvane error, code=120, reason=[3]");
+  EXPECT_EQ(ErrorOf([] { FolderDelete(Parse(R"(["/music", "/photo/family"])")); }).message,
+            "Orvane error, code=902, reason=[/photo/family]");
+  EXPECT_EQ(ErrorOf([] { FolderDelete(Parse(R"(["/music", "/music"])")); }).code,
+            kErrFolderNotFound);
+  EXPECT_EQ(test::ReadFile(FoldersPath()), folders);
+  EXPECT_EQ(EngineCommands().size(), engine);
+  EXPECT_EQ(IndexdCommands().size(), 2u);
+
+  // The trips fall back to the photo share's settings: video flips for them.
+  FolderDelete(Parse(R"(["/photo/trips"])"));
+  EXPECT_EQ(FolderPaths(), (Strings{"/photo", "/music"}));
+  EXPECT_EQ(Registrations(), (Strings{"music: /music", "photo: /photo"}));
+  EXPECT_EQ(Events("photo").back(),
+            R"(131072 /photo/trips {"audio":false,"document":false,"photo":false,"video":true})");
+  EXPECT_EQ(IndexdCommands().back(), Notify("photo", false));
+  EXPECT_EQ(EngineCommands().size(), engine);
+
+  // The last folder of a share takes its index and registration with it, and no event.
+  const size_t music_events = Events("music").size();
+  FolderDelete(Parse(R"(["/music"])"));
+  EXPECT_EQ(EngineCommands().back(), "index_delete fileindex_music");
+  EXPECT_EQ(Registrations(), (Strings{"photo: /photo"}));
+  EXPECT_EQ(Events("music").size(), music_events);
+  EXPECT_EQ(Actions(), "start-ce\nstart-fi\n");
+  FolderDelete(Parse(R"(["/photo"])"));
+  EXPECT_EQ(Actions(), "start-ce\nstart-fi\nstop-fi\n");
+  EXPECT_EQ(Folders(), Json::Value(Json::arrayValue));
+  EXPECT_TRUE(Registrations().empty());
+}
+
+TEST_F(IndexMgrTest, ReindexRebuildsOnlyWholeShares) {
+  FolderAdd(List({FolderJson("/photo/trips", "Trips", true, true, true, true),
+                  FolderJson("/photo/family", "Family", true, true, true, true),
+                  FolderJson("/music", "Music", true, true, true, true)}),
+            false);
+  StatusMgr().SetShareStatus("photo", kShareStatusNeedReindex | 4);
+  const size_t engine = EngineCommands().size();
+  FolderReindex(Parse(R"(["/photo/trips"])"));
+  EXPECT_EQ(Events("photo").back(), "65536 /photo/trips");
+  EXPECT_EQ(EngineCommands().size(), engine);
+
+  FolderReindex(Parse(R"(["/photo/family", "/photo/trips", "/music"])"));
+  const Strings all_engine = EngineCommands();
+  EXPECT_EQ(Strings(all_engine.begin() + engine, all_engine.end()),
+            (Strings{"index_delete fileindex_music", "index_create fileindex_music",
+                     "index_delete fileindex_photo", "index_create fileindex_photo"}));
+  // The trips' re-index is still queued, so only the family is added.
+  Strings photo = Events("photo");
+  EXPECT_EQ(Strings(photo.end() - 2, photo.end()),
+            (Strings{"65536 /photo/trips", "65536 /photo/family"}));
+  EXPECT_EQ(Events("music").back(), "65536 /music");
+  const Strings all_indexd = IndexdCommands();
+  EXPECT_EQ(Strings(all_indexd.end() - 2, all_indexd.end()),
+            (Strings{Worker("worker_create", "music"), Worker("worker_create", "photo")}));
+  EXPECT_EQ(StatusMgr().GetShareStatus("photo"), 4);
+  EXPECT_EQ(ErrorOf([] { FolderReindex(Parse(R"(["/photo"])")); }).code, kErrFolderNotFound);
+  EXPECT_EQ(ErrorOf([] { FolderReindex(Parse(R"({})")); }).code, kErrInvalidParam);
+}
+
+TEST_F(IndexMgrTest, ListingGetGroupsSummaryAndProcessingStatus) {
+  Json::Value staff = FolderJson("/photo/trips", "Trips", true, true, true, true);
+  staff["group"] = "staff";
+  FolderAdd(List({staff, FolderJson("/photo/family", "family", true, true, true, true),
+                  FolderJson("/music", "Music", true, true, true, true)}),
+            false);
+  Json::Value list = FolderList(Parse(R"({"sort_by": "name", "sort_direction": "desc",
+                                          "offset": 1, "limit": 1, "additional": ["status"]})"));
+  EXPECT_EQ(list["total"], 3);
+  ASSERT_EQ(list["folders"].size(), 1u);
+  EXPECT_EQ(list["folders"][0]["name"], "Music");
+  // Every new folder has its folder-settings event waiting, and nothing is paused.
+  EXPECT_EQ(list["folders"][0]["additional"]["status"]["text"], "processing");
+  list = FolderList(Parse(R"({"group": "staff", "keyword": "TRI"})"));
+  EXPECT_EQ(list["total"], 1);
+  EXPECT_EQ(list["folders"][0], Folder(staff).GetData());
+  EXPECT_EQ(FolderList(Parse("{}"))["total"], 3);
+  for (const char* bad :
+       {R"({"offset": -1})", R"({"limit": "2"})", R"({"sort_by": 1})", R"({"group": null})",
+        R"({"additional": "status"})", R"({"additional": ["size"], "keyword": "none"})", "[]"}) {
+    EXPECT_EQ(ErrorOf([&] { FolderList(Parse(bad)); }).code, kErrInvalidParam) << bad;
+  }
+
+  EXPECT_EQ(FolderGet("/music", Json::Value(Json::arrayValue))["name"], "Music");
+  EXPECT_EQ(ErrorOf([] { FolderGet("/music/live", Json::Value(Json::arrayValue)); }).code,
+            kErrFolderNotFound);
+  EXPECT_EQ(FolderListGroups(), Parse(R"(["staff"])"));
+
+  StatusMgr().Pause(0);
+  Json::Value processing = FolderGetProcessingStatus("/photo/family");
+  EXPECT_EQ(processing, Parse(R"({"path": "/photo/family", "text": "paused", "pending": true})"));
+  StatusMgr().SetShareStatus("music", kShareStatusNeedReindex);
+  Json::Value summary = FolderSummary();
+  EXPECT_EQ(summary, Parse(R"({"folder_count": 3, "resume_time": 0, "paused": true, "shares": [
+      {"share": "music", "folder_count": 1, "queue_length": 1, "status": 1,
+       "need_reindex": true, "volume_paused": false},
+      {"share": "photo", "folder_count": 2, "queue_length": 2, "status": 0,
+       "need_reindex": false, "volume_paused": false}]})"));
+}
+
+TEST_F(IndexMgrTest, ConcurrentAdministratorsLoseNothing) {
+  // Each process adds its own folders one by one, renames some and deletes others; the folder
+  // file must end up as exactly what each was told succeeded.
+  constexpr int kProcs = 4;
+  constexpr int kFolders = 6;
+  for (int p = 0; p < kProcs; ++p) {
+    for (int i = 0; i < kFolders; ++i) {
+      ASSERT_TRUE(
+          MakeParentDirs(vol_ + "/music/p" + std::to_string(p) + "/f" + std::to_string(i) + "/x"));
+    }
+  }
+  std::vector<pid_t> children;
+  std::vector<std::string> results;
+  for (int p = 0; p < kProcs; ++p) {
+    const std::string result = scratch_.Path("result" + std::to_string(p));
+    results.push_back(result);
+    const pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+      std::string done;
+      for (int i = 0; i < kFolders; ++i) {
+        const std::string path = "/music/p" + std::to_string(p) + "/f" + std::to_string(i);
+        try {
+          FolderAdd(List({FolderJson(path, "n", true, true, true, true)}), false);
+          if (i % 3 == 1) {
+            FolderSet(List({FolderJson(path, "renamed", true, false, true, true)}), false);
+            done += "set " + path + "\n";
+          } else if (i % 3 == 2) {
+            FolderDelete(List({Json::Value(path)}));
+          } else {
+            done += "add " + path + "\n";
+          }
+        } catch (const Error&) {
+          // Told it failed: whatever it left is checked against the file below.
+          done += "failed " + path + "\n";
+        }
+      }
+      FILE* f = fopen(result.c_str(), "w");
+      if (f != nullptr) {
+        fputs(done.c_str(), f);
+        fclose(f);
+      }
+      _exit(0);
+    }
+    children.push_back(pid);
+  }
+  for (pid_t pid : children) {
+    int status = 0;
+    ASSERT_EQ(waitpid(pid, &status, 0), pid);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  }
+  std::map<std::string, std::string> expected;  // path -> name
+  std::set<std::string> uncertain;
+  for (const std::string& result : results) {
+    std::istringstream in(test::ReadFile(result));
+    std::string op, path;
+    while (in >> op >> path) {
+      if (op == "failed") uncertain.insert(path);
+      if (op == "add") expected[path] = "n";
+      if (op == "set") expected[path] = "renamed";
+    }
+  }
+  FolderMgr folders;  // parses, so the file is valid
+  std::map<std::string, std::string> actual;
+  for (const auto& f : folders.folders()) {
+    EXPECT_TRUE(actual.emplace(f->GetPath(), f->GetName()).second) << f->GetPath();
+  }
+  for (const auto& path : uncertain) actual.erase(path);
+  EXPECT_EQ(actual, expected);
+  EXPECT_GE(expected.size(), static_cast<size_t>(kProcs * kFolders / 3));
 }
 
 }  // namespace
