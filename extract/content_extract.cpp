@@ -6,8 +6,12 @@
 #include <cerrno>
 #include <cstring>
 
+#include <syslog.h>
+
 #include "common/error.hpp"
+#include "common/log.hpp"
 #include "common/util.hpp"
+#include "extract/extract_runner.hpp"
 
 namespace QUIX {
 namespace CONTENT_EXTRACT {
@@ -15,9 +19,9 @@ namespace CONTENT_EXTRACT {
 void ParseFile(const std::string& path, const Json::Value& config, Json::Value& doc) {
   struct statx st;
   std::memset(&st, 0, sizeof(st));
-  ORVANE_THROW_IF(0 != statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW,
-                             STATX_BASIC_STATS | STATX_BTIME, &st),
-                  orvane::kErrSystem, "statx failed, path=" + path + ", reason=" + strerror(errno));
+  ORVANE_THROW_IF(
+      0 != statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME, &st),
+      orvane::kErrSystem, "statx failed, path=" + path + ", reason=" + strerror(errno));
 
   Json::Value out(Json::objectValue);
   out[QUIXMDPath] = path;
@@ -34,6 +38,21 @@ void ParseFile(const std::string& path, const Json::Value& config, Json::Value& 
   out[QUIXMDOwnerUserID] = std::to_string(st.stx_uid);
   out[QUIXMDOwnerGroupID] = std::to_string(st.stx_gid);
   out[QUIXMDExtension] = orvane::GetFileExtension(path, true);
+  // Contents are read by the helper process: a hostile file costs that process, not the indexer,
+  // and a file whose contents cannot be read is still indexed by name and attributes.
+  if (S_ISREG(st.stx_mode) && config.isObject() && config[kKeyNeedMeta].isBool() &&
+      config[kKeyNeedMeta].asBool()) {
+    Json::Value fields;
+    std::string error;
+    if (orvane::extract::RunExtractHelper(path, &fields, &error)) {
+      for (const std::string& key : fields.getMemberNames()) {
+        if (!out.isMember(key)) out[key] = fields[key];
+      }
+    } else {
+      orvane::Log(LOG_WARNING, "%s:%d content of %s not extracted: %s",
+                  orvane::SourceName(__FILE__), __LINE__, path.c_str(), error.c_str());
+    }
+  }
   doc.swap(out);
 }
 

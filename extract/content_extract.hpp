@@ -44,7 +44,10 @@ constexpr char QUIXMDSearchAncestor[] = "QUIXMDSearchAncestor";
 // its name and parent, whether it is a directory, its size, its content-change, attribute-change
 // and creation times (seconds since the epoch; the creation time only where the file system
 // records one), its owner's user and group ids (as text) and its lower-cased extension. A
-// symbolic link is described as itself. Throws orvane::Error 502 when the path cannot be stat'ed.
+// symbolic link is described as itself. With "need_meta" true in `config`, a regular file's
+// contents and media fields are added by the extraction helper; when that fails the file keeps
+// its file-system fields, the failure is logged and counted (ExtractFailureCount()).
+// Throws orvane::Error 502 when the path cannot be stat'ed.
 void ParseFile(const std::string& path, const Json::Value& config, Json::Value& doc);
 
 }  // namespace CONTENT_EXTRACT

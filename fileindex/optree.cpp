@@ -12,6 +12,7 @@
 #include "common/error.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
+#include "common/util.hpp"
 #include "fileindex/queue_file.hpp"
 
 namespace orvane {
@@ -280,9 +281,15 @@ std::shared_ptr<OPNode> OPTree::GetNodeByPath(const std::string& path) {
 
 void OPTree::InsertEvent(std::shared_ptr<Event> event) {
   const uint32_t bits = event->event;
-  // An empty former path would name the root and move every pending operation of the share.
-  if ((bits & kEventRename) && event->path_old.empty()) {
-    throw Error(kErrInvalidParam, "Missing property: path_old");
+  if (bits & kEventRename) {
+    // An empty former path would name the root and move every pending operation of the share;
+    // a folder cannot be moved into itself, and replaying such a line would copy the subtree
+    // into itself on every repetition.
+    if (event->path_old.empty()) throw Error(kErrInvalidParam, "Missing property: path_old");
+    if (StringStartWith(event->path, event->path_old + "/")) {
+      throw Error(kErrInvalidParam,
+                  "Rename into its own subtree: " + event->path_old + " -> " + event->path);
+    }
   }
   std::shared_ptr<OPNode> node = GetNodeByPath(event->path);
   auto op = std::make_shared<OP>(node, kOPNone, "", Json::Value());

@@ -149,6 +149,42 @@ TEST_F(DaemonTest, SigtermStopsCleanly) {
   EXPECT_EQ(Count("/v/share/"), 10);
 }
 
+TEST_F(DaemonTest, RunsAsAServiceWithAPidFile) {
+  const pid_t launcher = ::fork();
+  if (launcher == 0) {
+    ::setenv("ORVANE_ROOT", dir_.path().c_str(), 1);
+    ::execl(QUIXELASTICD_BINARY, QUIXELASTICD_BINARY, "--service-user", "nobody-such-account",
+            static_cast<char*>(nullptr));
+    _exit(127);
+  }
+  int status = 0;
+  ASSERT_EQ(::waitpid(launcher, &status, 0), launcher);
+  ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);  // the parent returns at once
+  const std::string pid_file = dir_.Path("var/run/quixelasticd.pid");
+  pid_t pid = 0;
+  for (int i = 0; i < 400 && pid == 0; ++i) {
+    pid = static_cast<pid_t>(std::atoi(orvane::test::ReadFile(pid_file).c_str()));
+    if (pid == 0) std::this_thread::sleep_for(std::chrono::milliseconds(25));
+  }
+  ASSERT_GT(pid, 0);
+  EXPECT_NE(pid, launcher);
+  bool answered = false;
+  for (int i = 0; i < 400 && !answered; ++i) {
+    answered = Request(dir_.Path("var/run/quixelasticd.sock"),
+                       Cmd("index_list", Json::Value()))["success"].asBool();
+    if (!answered) std::this_thread::sleep_for(std::chrono::milliseconds(25));
+  }
+  EXPECT_TRUE(answered);
+  // A second daemon on the same root refuses to start while the first holds the pid file.
+  tc::DaemonProcess second(dir_.path());
+  EXPECT_EQ(second.Signal(0), 1 << 8);
+  ::kill(pid, SIGTERM);
+  for (int i = 0; i < 400 && IsFileExist(pid_file); ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(25));
+  }
+  EXPECT_FALSE(IsFileExist(pid_file));
+}
+
 TEST_F(DaemonTest, KillNineLosesNothingCommittedAndNoBatchHalfWay) {
   Launch();
   ASSERT_EQ(CreateIndex()["success"], true);

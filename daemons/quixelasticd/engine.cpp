@@ -56,6 +56,9 @@ int64_t OptionalInt(const Json::Value& obj, const char* key, int64_t fallback) {
   return v->asLargestInt();
 }
 
+// Deepest page a search may ask for; deeper paging is a sign of a runaway client.
+constexpr int64_t kMaxSearchFrom = 1000000;
+
 bool IsPublicCommand(const std::string& command) {
   return command == "search" || command == "suggest";
 }
@@ -154,6 +157,7 @@ class Engine::Session {
     } catch (const StoreError& err) {
       txn_.reset();
       engine_.HandleStoreFailure(*entry_, err);
+      FailPending(err);
       Release();
       throw;
     }
@@ -212,7 +216,11 @@ class Engine::Session {
   LostFn lost_;
 };
 
-Engine::Engine(EngineOptions options) : options_(std::move(options)) {}
+Engine::Engine(EngineOptions options) : options_(std::move(options)) {
+  // SQLite gives back cached pages as it nears half the limit, so that caches never push the
+  // daemon into refusing requests for memory; the other half is for requests in flight.
+  sqlite3_soft_heap_limit64(options_.memory_limit_bytes / 2);
+}
 
 Engine::~Engine() { Shutdown(); }
 
@@ -414,7 +422,10 @@ Json::Value Engine::HandleValue(const Json::Value& request, const Caller& caller
   bool writes = false;
   if (compound) {
     for (const Json::Value& sub : request["compound"]) {
-      if (!sub.isObject() || !IsPublicCommand(sub["command"].asString())) writes = true;
+      if (!sub.isObject() || !sub["command"].isString() ||
+          !IsPublicCommand(sub["command"].asString())) {
+        writes = true;
+      }
     }
   } else {
     writes = !request["command"].isString() || !IsPublicCommand(request["command"].asString());
@@ -958,6 +969,9 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller) {
   }
   p.desc = order == "desc";
   p.from = OptionalInt(d, "from", 0);
+  if (p.from > kMaxSearchFrom) {
+    throw EngineError(kCodeInvalidParam, "\"from\" is beyond " + std::to_string(kMaxSearchFrom));
+  }
   p.size = std::min<int64_t>(OptionalInt(d, "size", 20), 1000);
   if (p.keywords.empty() && p.name.empty() && p.folder.empty() && p.exts.empty() && !p.is_dir &&
       !p.size_min && !p.size_max && !p.mtime_min && !p.mtime_max) {
@@ -991,7 +1005,7 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller) {
           return p.desc ? a["score"].asDouble() < b["score"].asDouble()
                         : a["score"].asDouble() > b["score"].asDouble();
         }
-        return AsciiLower(a["name"].asString()) < AsciiLower(b["name"].asString());
+        return false;  // index order within each index, indexes one after the other
       case SearchParams::Sort::kName:
         return p.desc ? AsciiLower(a["name"].asString()) > AsciiLower(b["name"].asString())
                       : AsciiLower(a["name"].asString()) < AsciiLower(b["name"].asString());

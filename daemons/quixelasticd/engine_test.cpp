@@ -239,6 +239,47 @@ TEST_F(EngineTest, RenameLoopRequestsWithLeftoverMembersWork) {
   EXPECT_EQ(Send(Query("prefix", "/v/share/bb/x/"))["data"].size(), 30u);
 }
 
+TEST_F(EngineTest, SearchMergesIndexesAndRefusesBadParameters) {
+  ASSERT_EQ(CodeOf(Create()), 0);
+  ASSERT_EQ(CodeOf(Create("fileindex_two", "db2")), 0);
+  Json::Value batch;
+  int64_t size = 1;
+  for (const char* p : {"/v/share/song.mp3", "/v/share/talk.mp3", "/v/share/notes.txt"}) {
+    Json::Value req = Upsert(p);
+    req["data"]["data"]["QUIXMDFSSize"] = static_cast<Json::Int64>(size *= 10);
+    req["data"]["data"]["QUIXMDExtension"] = std::string(p).substr(std::string(p).size() - 3);
+    batch["compound"].append(req);
+  }
+  Json::Value other = Upsert("/v/two/tune.mp3", "fileindex_two");
+  other["data"]["data"]["QUIXMDFSSize"] = 500;
+  other["data"]["data"]["QUIXMDExtension"] = "mp3";
+  batch["compound"].append(other);
+  ASSERT_EQ(Send(batch)["has_fail"], false);
+
+  const Json::Value r = Send(Obj(
+      R"({"command":"search","data":{"file_type":"audio","sort":"size","order":"desc","size":2}})"));
+  ASSERT_EQ(CodeOf(r), 0) << JsonToString(r);
+  EXPECT_EQ(r["data"]["total"], 3);
+  ASSERT_EQ(r["data"]["hits"].size(), 2u);
+  EXPECT_EQ(r["data"]["hits"][0]["name"], "tune.mp3");
+  EXPECT_EQ(r["data"]["hits"][1]["name"], "talk.mp3");
+  const Json::Value one = Send(Obj(R"({"command":"search","data":{"id":"fileindex_two","ext":"MP3"}})"));
+  EXPECT_EQ(one["data"]["total"], 1);
+
+  for (const char* bad : {R"({"command":"search","data":{}})",
+                          R"({"command":"search","data":{"name":"a","sort":"colour"}})",
+                          R"({"command":"search","data":{"name":"a","file_type":"spreadsheet"}})",
+                          R"({"command":"search","data":{"name":"a","size_range":{"gte":"1"}}})",
+                          R"({"command":"search","data":{"name":"a","from":-1}})",
+                          R"({"command":"search","data":{"name":"a","from":9223372036854775807}})",
+                          R"({"command":"search","data":{"name":7}})",
+                          R"({"command":"suggest","data":{}})"}) {
+    EXPECT_EQ(CodeOf(Send(Obj(bad))), kCodeInvalidParam) << bad;
+  }
+  EXPECT_EQ(CodeOf(Send(Obj(R"({"command":"search","data":{"id":"fileindex_none","name":"a"}})"))),
+            kCodeIndexNotFound);
+}
+
 TEST_F(EngineTest, OnlyPrivilegedCallersChangeIndexes) {
   ASSERT_EQ(CodeOf(Create()), 0);
   ASSERT_EQ(CodeOf(Send(Upsert("/v/share/a.txt"))), 0);
@@ -282,9 +323,10 @@ TEST_F(EngineTest, TermSuggestionStoreRebuild) {
   {
     sqlite3* db = nullptr;
     ASSERT_EQ(sqlite3_open(dir_.Path("db/index.db").c_str(), &db), SQLITE_OK);
-    ASSERT_EQ(sqlite3_exec(db, "UPDATE meta SET value='unavail' WHERE key='term_sugg';"
-                               "DELETE FROM sugg;", nullptr, nullptr, nullptr), SQLITE_OK);
+    const int rc = sqlite3_exec(db, "UPDATE meta SET value='unavail' WHERE key='term_sugg'",
+                                nullptr, nullptr, nullptr);
     sqlite3_close(db);
+    ASSERT_EQ(rc, SQLITE_OK);
   }
   const Json::Value listed = Send(Cmd("list_term_sugg_db", Json::Value(Json::objectValue)));
   ASSERT_EQ(listed["data"]["unavail"].size(), 1u);

@@ -1,5 +1,6 @@
 #include "daemons/quixelasticd/schema.hpp"
 
+#include <algorithm>
 #include <cmath>
 #include <cstring>
 
@@ -200,24 +201,21 @@ DerivedDoc Schema::Derive(const Json::Value& doc) const {
     if (!d.name_text.empty() && !t.empty()) d.name_text += '\n';
     d.name_text += t;
   }
+  // Numbers and flags are filtered by range, not searched as words. A value already in the
+  // text (the display name repeats the file name) is not indexed twice.
+  std::vector<std::string> parts;
+  std::vector<std::string> folded;
   for (auto it = doc.begin(); it != doc.end(); ++it) {
     const FieldSpec& spec = Field(it.name());
-    // Numbers and flags are filtered by range, not searched as words.
-    if (!spec.all || !IsTextual(spec) || spec.ngram) continue;
+    if (!spec.all || !IsTextual(spec)) continue;
     std::string t = ValueText(*it);
-    if (t.empty()) continue;
     if (spec.tolower) t = AsciiLower(t);
-    if (!d.all_text.empty()) d.all_text += '\n';
-    d.all_text += t;
+    std::string low = AsciiLower(t);
+    if (t.empty() || std::find(folded.begin(), folded.end(), low) != folded.end()) continue;
+    parts.push_back(std::move(t));
+    folded.push_back(std::move(low));
   }
-  // The n-grammed name also takes part in the catch-all text as whole words, so that a keyword
-  // search finds a file by the words of its name.
-  for (const std::string& f : ngram_fields_) {
-    if (!Field(f).all) continue;
-    const Json::Value* v = doc.find(f.data(), f.data() + f.size());
-    if (v == nullptr) continue;
-    const std::string t = ValueText(*v);
-    if (t.empty()) continue;
+  for (const std::string& t : parts) {
     if (!d.all_text.empty()) d.all_text += '\n';
     d.all_text += t;
   }

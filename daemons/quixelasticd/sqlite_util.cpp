@@ -26,6 +26,8 @@ void Db::Open(const std::string& file, bool create, bool read_only) {
 
 void Db::Close() {
   if (db_ == nullptr) return;
+  for (auto& [sql, stmt] : cached_) sqlite3_finalize(stmt);
+  cached_.clear();
   // close_v2 defers the close until the last statement is finalised, so an owner that outlives
   // a Stmt by mistake cannot leak the handle.
   sqlite3_close_v2(db_);
@@ -40,6 +42,20 @@ void Db::Exec(const std::string& sql) {
     sqlite3_free(err);
     throw StoreError(sqlite3_extended_errcode(db_), sql.substr(0, 60) + ": " + msg);
   }
+}
+
+void Db::ExecCached(const char* sql) {
+  sqlite3_stmt*& stmt = cached_[sql];
+  if (stmt == nullptr) {
+    const int rc = sqlite3_prepare_v2(db_, sql, -1, &stmt, nullptr);
+    if (rc != SQLITE_OK) {
+      cached_.erase(sql);
+      Fail(rc, std::string("prepare ") + sql);
+    }
+  }
+  const int rc = sqlite3_step(stmt);
+  sqlite3_reset(stmt);
+  if (rc != SQLITE_DONE && rc != SQLITE_ROW) Fail(rc, sql);
 }
 
 void Db::Fail(int rc, const std::string& context) const {
@@ -121,15 +137,20 @@ void Transaction::Commit() {
   open_ = false;
 }
 
-Savepoint::Savepoint(Db& db) : db_(db) { db_.Exec("SAVEPOINT sub"); }
+Savepoint::Savepoint(Db& db) : db_(db) { db_.ExecCached("SAVEPOINT sub"); }
 
 Savepoint::~Savepoint() {
   if (!open_ || sqlite3_get_autocommit(db_.get()) != 0) return;
-  sqlite3_exec(db_.get(), "ROLLBACK TO sub; RELEASE sub", nullptr, nullptr, nullptr);
+  try {
+    db_.ExecCached("ROLLBACK TO sub");
+    db_.ExecCached("RELEASE sub");
+  } catch (const StoreError& e) {
+    Log(3, "rollback to savepoint failed: %s", e.what());
+  }
 }
 
 void Savepoint::Release() {
-  db_.Exec("RELEASE sub");
+  db_.ExecCached("RELEASE sub");
   open_ = false;
 }
 

@@ -7,6 +7,7 @@
 #include <sqlite3.h>
 
 #include <cstdint>
+#include <map>
 #include <stdexcept>
 #include <string>
 
@@ -42,12 +43,15 @@ class Db {
   sqlite3* get() const { return db_; }
 
   void Exec(const std::string& sql);
+  // Exec() of a constant statement run often (savepoints), prepared once per connection.
+  void ExecCached(const char* sql);
   int64_t LastInsertRowid() const { return sqlite3_last_insert_rowid(db_); }
   int Changes() const { return sqlite3_changes(db_); }
   [[noreturn]] void Fail(int rc, const std::string& context) const;
 
  private:
   sqlite3* db_ = nullptr;
+  std::map<const char*, sqlite3_stmt*> cached_;
 };
 
 class Stmt {

@@ -24,11 +24,11 @@ const char kSchemaSql[] =
     "CREATE TABLE docs(rowid INTEGER PRIMARY KEY, path TEXT NOT NULL UNIQUE, parent TEXT,"
     " name TEXT, ext TEXT, size INTEGER, mtime INTEGER, is_dir INTEGER, ancestor TEXT,"
     " body TEXT NOT NULL);"
-    "CREATE TABLE sugg(term TEXT NOT NULL, doc INTEGER NOT NULL, PRIMARY KEY(term, doc))"
-    " WITHOUT ROWID;"
-    "CREATE INDEX sugg_doc ON sugg(doc);"
     "CREATE VIRTUAL TABLE fts_all USING fts5(text, tokenize='unicode61 remove_diacritics 2');"
-    "CREATE VIRTUAL TABLE fts_name USING fts5(name, tokenize='trigram');";
+    "CREATE VIRTUAL TABLE fts_name USING fts5(name, tokenize='trigram');"
+    // The suggestion store: the vocabulary of the catch-all index with its document counts,
+    // always in step with the documents at no cost to writes.
+    "CREATE VIRTUAL TABLE sugg USING fts5vocab(fts_all, 'row');";
 
 constexpr int kFormat = 1;
 
@@ -39,6 +39,8 @@ void ConfigureWriter(Db& db) {
   db.Exec("PRAGMA synchronous=NORMAL");
   db.Exec("PRAGMA cache_size=-32768");
   db.Exec("PRAGMA temp_store=MEMORY");
+  db.Exec("PRAGMA mmap_size=268435456");
+  db.Exec("PRAGMA wal_autocheckpoint=4096");
 }
 
 std::string FieldPath(const std::string& field) {
@@ -198,25 +200,10 @@ std::optional<std::string> PrefixUpperBound(const std::string& prefix) {
   return std::nullopt;
 }
 
-std::vector<std::string> SuggestionTerms(const std::string& name) {
-  std::set<std::string> terms;
-  std::string word;
-  auto flush = [&]() {
-    const bool digits = std::all_of(word.begin(), word.end(),
-                                    [](char c) { return c >= '0' && c <= '9'; });
-    if (word.size() >= 2 && !digits) terms.insert(word);
-    word.clear();
-  };
-  for (char c : AsciiLower(name)) {
-    const unsigned char u = static_cast<unsigned char>(c);
-    if (std::isalnum(u) || u >= 0x80) {
-      word += c;
-    } else {
-      flush();
-    }
-  }
-  flush();
-  return std::vector<std::string>(terms.begin(), terms.end());
+bool IsSuggestible(const std::string& term) {
+  const bool digits =
+      std::all_of(term.begin(), term.end(), [](char c) { return c >= '0' && c <= '9'; });
+  return term.size() >= 2 && !digits && term.find('"') == std::string::npos;
 }
 
 IndexStore::IndexStore(std::string dir) : dir_(std::move(dir)), file_(dir_ + "/" + kDbFile) {}
@@ -344,20 +331,11 @@ void IndexStore::WriteRow(int64_t rowid, const DerivedDoc& d, const std::string&
           .Bind(2, d.name_text).Run();
     }
   }
-  if (old == nullptr || old->name != d.name) SetTerms(rowid, d.name);
-}
-
-void IndexStore::SetTerms(int64_t rowid, const std::string& name) {
-  Cached("DELETE FROM sugg WHERE doc = ?").Bind(1, rowid).Run();
-  for (const std::string& t : SuggestionTerms(name)) {
-    Cached("INSERT OR IGNORE INTO sugg(term, doc) VALUES(?, ?)").Bind(1, t).Bind(2, rowid).Run();
-  }
 }
 
 void IndexStore::DeleteRow(int64_t rowid, const DerivedDoc& old) {
   if (!old.all_text.empty()) Cached("DELETE FROM fts_all WHERE rowid = ?").Bind(1, rowid).Run();
   if (!old.name_text.empty()) Cached("DELETE FROM fts_name WHERE rowid = ?").Bind(1, rowid).Run();
-  Cached("DELETE FROM sugg WHERE doc = ?").Bind(1, rowid).Run();
   Cached("DELETE FROM docs WHERE rowid = ?").Bind(1, rowid).Run();
 }
 
@@ -441,11 +419,6 @@ int64_t IndexStore::DeleteByQuery(const DocQuery& q) {
     BindWhere(st, w, 1);
     st.Run();
   }
-  {
-    Stmt st(writer_, "DELETE FROM sugg WHERE doc IN (" + rows + ")");
-    BindWhere(st, w, 1);
-    st.Run();
-  }
   Stmt st(writer_, "DELETE FROM docs WHERE " + w.sql);
   BindWhere(st, w, 1);
   st.Run();
@@ -465,16 +438,15 @@ Json::Value IndexStore::GetByQuery(const DocQuery& q, const std::vector<std::str
 }
 
 bool IndexStore::UpdateTermSuggestion(const std::string& doc_id) {
-  Stmt& find = Cached("SELECT rowid, name FROM docs WHERE path = ?");
+  Stmt& find = Cached("SELECT 1 FROM docs WHERE path = ?");
   find.Bind(1, doc_id);
   if (!find.Step()) {
     find.Reset();
     return false;
   }
-  const int64_t rowid = find.Int(0);
-  const std::string name = find.Text(1);
   find.Reset();
-  SetTerms(rowid, name);
+  // The suggestion vocabulary is derived from the documents in the same transaction, so a
+  // document that exists already contributes its words.
   return true;
 }
 
@@ -527,6 +499,7 @@ std::unique_ptr<Db> IndexStore::TakeReader() {
   db->Open(file_, false, false);
   db->Exec("PRAGMA query_only=1");
   db->Exec("PRAGMA cache_size=-16384");
+  db->Exec("PRAGMA mmap_size=268435456");
   return db;
 }
 
@@ -580,7 +553,8 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
   }
   if (!name.empty()) {
     sql += " JOIN fts_name ON fts_name.rowid = d.rowid";
-    // The trigram index answers substrings of three characters or more; shorter ones scan.
+    // The trigram index answers substrings of three characters or more as a phrase of
+    // trigrams, from positions alone; shorter ones scan the names.
     if (name.size() >= 3) {
       std::string phrase = "\"";
       for (char c : name) {
@@ -631,8 +605,9 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
   std::string order;
   switch (p.sort) {
     case SearchParams::Sort::kRelevance:
+      // Without keywords there is no score: hits come in index order, which costs no sort.
       order = has_keywords ? std::string(" ORDER BY bm25(fts_all)") + (p.desc ? " DESC" : "")
-                           : " ORDER BY d.name COLLATE NOCASE, d.path";
+                           : "";
       break;
     case SearchParams::Sort::kName:
       order = std::string(" ORDER BY d.name COLLATE NOCASE") + dir + ", d.path";
@@ -659,9 +634,15 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
   std::unique_ptr<Db> db = TakeReader();
   SearchPage page;
   if (!visible) {
-    Stmt count(*db, "SELECT count(*) FROM (" + base + ")");
+    // Counting stops at a bound, so that a one-letter search over a million names stays fast.
+    Stmt count(*db, "SELECT count(*) FROM (" + base + " LIMIT " +
+                        std::to_string(kCountLimit + 1) + ")");
     bind_all(count);
     if (count.Step()) page.total = count.Int(0);
+    if (page.total > kCountLimit) {
+      page.total = kCountLimit;
+      page.total_exact = false;
+    }
     Stmt st(*db, base + order + " LIMIT ? OFFSET ?");
     const int next = bind_all(st);
     st.Bind(next, p.size).Bind(next + 1, p.from);
@@ -697,17 +678,24 @@ std::vector<std::string> IndexStore::Suggest(const std::string& prefix, size_t l
   if (!upper) return out;
   std::unique_ptr<Db> db = TakeReader();
   {
-    Stmt st(*db, "SELECT term, count(*) AS n FROM sugg WHERE term >= ? AND term < ?"
-                 " GROUP BY term ORDER BY n DESC, term LIMIT 200");
+    std::vector<std::pair<int64_t, std::string>> candidates;
+    Stmt st(*db, "SELECT term, doc FROM sugg WHERE term >= ? AND term < ?");
     st.Bind(1, low).Bind(2, *upper);
-    Stmt docs(*db, "SELECT d.path FROM sugg s JOIN docs d ON d.rowid = s.doc WHERE s.term = ?"
-                   " LIMIT 64");
-    while (out.size() < limit && st.Step()) {
-      const std::string term = st.Text(0);
+    for (int scanned = 0; scanned < kSuggestScanLimit && st.Step(); ++scanned) {
+      std::string term = st.Text(0);
+      if (IsSuggestible(term)) candidates.emplace_back(st.Int(1), std::move(term));
+    }
+    std::stable_sort(candidates.begin(), candidates.end(),
+                     [](const auto& a, const auto& b) { return a.first > b.first; });
+    Stmt docs(*db, "SELECT d.path FROM fts_all JOIN docs d ON d.rowid = fts_all.rowid"
+                   " WHERE fts_all MATCH ? LIMIT 64");
+    size_t checked = 0;
+    for (const auto& [count, term] : candidates) {
+      if (out.size() >= limit || ++checked > 200) break;
       bool shown = !visible;
       if (!shown) {
         docs.Reset();
-        docs.Bind(1, term);
+        docs.Bind(1, "\"" + term + "\"");
         while (!shown && docs.Step()) shown = visible(docs.Text(0));
       }
       if (shown) out.push_back(term);

@@ -1,6 +1,7 @@
 // IndexStore: the documents of one index in one SQLite database (WAL mode) in the index's
 // folder: a table of documents keyed by their identifying field, a word index over the catch-all
-// text, a trigram index over the n-grammed file names, and the term-suggestion table.
+// text (whose vocabulary is the term-suggestion store), and a trigram index over the n-grammed
+// file names.
 // Writes go through the one writer connection and must be serialised by the owner (the daemon
 // holds the index's write lock and an open WriteTxn); reads for people use pooled read-only
 // connections and may run from any thread at the same time as a writer.
@@ -63,6 +64,10 @@ class IndexStore {
   static constexpr const char* kDbFile = "index.db";
   // Rows a filtered search inspects beyond the requested page before it stops counting.
   static constexpr int64_t kFilteredScanLimit = 20000;
+  // Hits an unfiltered search counts before it reports the total as a lower bound.
+  static constexpr int64_t kCountLimit = 10000;
+  // Vocabulary entries a suggestion looks at for one prefix.
+  static constexpr int kSuggestScanLimit = 20000;
 
   // Creates a new, empty store in `dir` (made when missing). Throws StoreError or EngineError.
   static std::shared_ptr<IndexStore> Create(const std::string& dir, const std::string& id,
@@ -119,7 +124,6 @@ class IndexStore {
   void WriteRow(int64_t rowid, const DerivedDoc& d, const std::string& body, bool insert,
                 const DerivedDoc* old);
   void DeleteRow(int64_t rowid, const DerivedDoc& old);
-  void SetTerms(int64_t rowid, const std::string& name);
   // A prepared writer statement, reset and ready for binding.
   Stmt& Cached(const char* sql);
 
@@ -143,9 +147,9 @@ class WriteTxn {
   Transaction txn_;
 };
 
-// The words of a file name that feed suggestions: lower case, at least two characters, not
-// only digits.
-std::vector<std::string> SuggestionTerms(const std::string& name);
+// Whether a word of the vocabulary is offered as a suggestion: two characters or more, not only
+// digits.
+bool IsSuggestible(const std::string& term);
 
 // The smallest string greater than every string that starts with `prefix`; nullopt when there
 // is none (empty prefix or all bytes 0xFF).
