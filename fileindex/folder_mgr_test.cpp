@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include "fileindex/admin_test_env.hpp"
 
@@ -224,6 +225,28 @@ TEST_F(FolderMgrTest, ListFiltersSortsAndPages) {
   for (size_t i = 0; i < out.size(); ++i) EXPECT_EQ(out[i]->IsDocument(), i >= 3) << i;
   mgr.List(out, total, 0, 10, "Document", "desc", "all", "");  // the key is case-sensitive
   EXPECT_EQ(names().front(), "Émile");
+}
+
+TEST_F(FolderMgrTest, UnprivilegedWriterGetsAnErrorAndTheFileStays) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to run a process as nobody";
+  WriteFolders(Parse("[" + JsonToString(FolderJson("/music", "M", true, true, true, true)) + "]"));
+  const std::string before = test::ReadFile(FoldersPath());
+  ASSERT_EQ(chmod(root_.path().c_str(), 0755), 0);
+  // Saving needs root; a process that cannot become root is refused before writing anything.
+  const int code = test::RunAsUser("nobody", [] {
+    try {
+      FolderMgr mgr;
+      if (mgr.folders().size() != 1) return 1;
+      std::shared_ptr<Folder> diff;
+      mgr.Upsert(diff, std::make_shared<Folder>(FolderJson("/photo", "P", true, true, true, true)));
+      mgr.Save();
+    } catch (const Error& e) {
+      return e.code == kErrCredentials ? 0 : 2;
+    }
+    return 3;
+  });
+  EXPECT_EQ(code, 0);
+  EXPECT_EQ(test::ReadFile(FoldersPath()), before);
 }
 
 }  // namespace
