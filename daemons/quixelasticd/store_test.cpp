@@ -151,6 +151,10 @@ TEST_F(StoreTest, PrefixQueriesStopAtTheFolderBoundary) {
   by_parent.field = "QUIXMDParent";
   by_parent.kind = DocQuery::Kind::kTerm;
   EXPECT_THAT(Paths(by_parent), ElementsAre("/v/s/a/x.txt"));
+  // The ancestor field matches a folder and everything below it.
+  DocQuery by_ancestor = by_parent;
+  by_ancestor.field = "QUIXMDSearchAncestor";
+  EXPECT_THAT(Paths(by_ancestor), ElementsAre("/v/s/a/x.txt", "/v/s/a/y/z.txt"));
 
   WriteTxn txn(*store_);
   EXPECT_EQ(store_->DeleteByQuery(Prefix("/v/s/a/")), 2);
