@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include "fileindex/admin_test_env.hpp"
+#include "platform/unicode.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -225,6 +226,23 @@ TEST_F(FolderMgrTest, ListFiltersSortsAndPages) {
   for (size_t i = 0; i < out.size(); ++i) EXPECT_EQ(out[i]->IsDocument(), i >= 3) << i;
   mgr.List(out, total, 0, 10, "Document", "desc", "all", "");  // the key is case-sensitive
   EXPECT_EQ(names().front(), "Émile");
+}
+
+TEST(CaseBlindCompareTest, Utf8TextsOrderWithoutCase) {
+  auto cmp = [](const char* a, const char* b) {
+    return platform::QLIBCUnicodeUTF8StrCaseCmp(a, b);
+  };
+  EXPECT_EQ(cmp("ÉCOLE Ünïcode", "école ünÏcode"), 0);
+  EXPECT_LT(cmp("abc", "ABD"), 0);
+  EXPECT_LT(cmp("ab", "AbC"), 0);  // a prefix first
+  EXPECT_GT(cmp("é", "z"), 0);     // by code point, not by any collation
+  EXPECT_LT(cmp("Ωmega", "ωMEGA2"), 0);
+  // Bytes that begin no valid sequence sort after every character, and never read past the end.
+  EXPECT_GT(cmp("a\xff", "a\xf4\x8f\xbf\xbf"), 0);
+  EXPECT_GT(cmp("\xc3", "z"), 0);
+  EXPECT_GT(cmp("\xe0\x80\xaf", "z"), 0);  // overlong "/"
+  EXPECT_NE(cmp("\xc3", "\xc4"), 0);
+  EXPECT_EQ(cmp(nullptr, ""), 0);
 }
 
 TEST_F(FolderMgrTest, UnprivilegedWriterGetsAnErrorAndTheFileStays) {
