@@ -123,11 +123,6 @@ void FolderSet(const Json::Value& folder_list, bool updater_mode) {
   FolderUpsert(folder_list, false, updater_mode);
 }
 
-}  // namespace fileindex
-}  // namespace orvane
-
-namespace orvane {
-namespace fileindex {
 namespace {
 
 void SendWorkerCommand(const std::string& cmd, const std::string& share) {
