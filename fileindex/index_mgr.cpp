@@ -328,6 +328,9 @@ void FolderDelete(const Json::Value& path_list) {
 }
 
 void FolderReindex(const Json::Value& path_list) {
+  // Nothing is saved, but the index rebuild must not interleave with another operation's
+  // changes to the same share.
+  FolderCfgLock lock;
   FolderMgr folder_mgr;
   const std::vector<std::shared_ptr<Folder>> requested = RequestedFolders(folder_mgr, path_list);
   std::map<std::string, std::set<std::string>> asked;
