@@ -303,7 +303,7 @@ TEST_F(EngineTest, OnlyPrivilegedCallersChangeIndexes) {
 TEST_F(EngineTest, RefusesWorkBeyondItsLimits) {
   EngineOptions options;
   options.max_write_backlog = 0;
-  options.memory_limit_bytes = 1 << 20;
+  options.memory_limit_bytes = 8 << 20;
   engine_.reset();
   StartEngine(options);
   EXPECT_EQ(CodeOf(IdOnly("commit")), kCodeOverloaded);
