@@ -309,7 +309,7 @@ TEST_F(EngineTest, RefusesWorkBeyondItsLimits) {
   EXPECT_EQ(CodeOf(IdOnly("commit")), kCodeOverloaded);
   // People's searches are not writes and still pass.
   EXPECT_EQ(CodeOf(Send(Obj(R"({"command":"search","data":{"name":"abc"}})"))), 0);
-  EXPECT_EQ(engine_->AdmitFrame(2 << 20), kCodeOutOfMemory);
+  EXPECT_EQ(engine_->AdmitFrame(3 << 20), kCodeOutOfMemory);
   EXPECT_EQ(engine_->AdmitFrame(1000), 0);
   engine_->ReleaseFrame(1000);
 }
