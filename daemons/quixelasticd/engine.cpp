@@ -56,6 +56,9 @@ int64_t OptionalInt(const Json::Value& obj, const char* key, int64_t fallback) {
   return v->asLargestInt();
 }
 
+// How many times its size a request is counted against the memory limit while it runs.
+constexpr int64_t kParsedWeight = 4;
+
 // Deepest page a search may ask for; deeper paging is a sign of a runaway client.
 constexpr int64_t kMaxSearchFrom = 1000000;
 
@@ -398,15 +401,18 @@ void Engine::SaveRegistry() {
 }
 
 int Engine::AdmitFrame(int64_t bytes) {
-  const int64_t in_flight = frame_bytes_.fetch_add(bytes) + bytes;
+  // A request is held as text and as parsed values at once; the values take several times the
+  // text's size.
+  const int64_t weight = bytes * kParsedWeight;
+  const int64_t in_flight = frame_bytes_.fetch_add(weight) + weight;
   if (in_flight + sqlite3_memory_used() > options_.memory_limit_bytes) {
-    frame_bytes_.fetch_sub(bytes);
+    frame_bytes_.fetch_sub(weight);
     return kCodeOutOfMemory;
   }
   return 0;
 }
 
-void Engine::ReleaseFrame(int64_t bytes) { frame_bytes_.fetch_sub(bytes); }
+void Engine::ReleaseFrame(int64_t bytes) { frame_bytes_.fetch_sub(bytes * kParsedWeight); }
 
 Json::Value Engine::Handle(const std::string& payload, const Caller& caller) {
   std::string text = payload;

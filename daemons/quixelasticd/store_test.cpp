@@ -94,7 +94,7 @@ TEST(PrefixUpperBoundTest, IncrementsTheLastByteThatCan) {
   EXPECT_FALSE(PrefixUpperBound(std::string("\xff\xff", 2)).has_value());
 }
 
-TEST(SuggestionTermsTest, KeepsWordsNotNumbers) {
+TEST(SuggestionTest, OffersWordsNotNumbersOrSingleCharacters) {
   EXPECT_TRUE(IsSuggestible("beach"));
   EXPECT_FALSE(IsSuggestible("2024"));
   EXPECT_FALSE(IsSuggestible("a"));
