@@ -352,12 +352,7 @@ void UpdateTermSuggestion() {
   FolderMgr folders;
   std::vector<std::string> dbs;
   elastic::ListUnAvailTermSuggDB(dbs);
-  std::set<std::string> shares;
-  for (const Json::Value& folder : folders.folders()) {
-    if (folder.isObject() && folder["path"].isString()) {
-      shares.insert(GetShareNameByPath(folder["path"].asString()));
-    }
-  }
+  const std::set<std::string> shares = folders.GetIndexedShares();
 
   std::vector<std::string> paths;
   for (const std::string& share : shares) {

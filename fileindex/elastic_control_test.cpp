@@ -445,8 +445,8 @@ class TermSuggestionDriverTest : public ElasticControlTest {
  protected:
   TermSuggestionDriverTest() {
     dir_.Write("var/packages/Orvane/etc/fileindex.folders", R"([
-      {"path":"/c/docs","name":"c"},{"path":"/b","name":"b"},{"path":"/a/x","name":"a1"},
-      {"path":"/a/y","name":"a2"}])");
+      {"path":"/c/docs","name":"c","document":true,"audio":true,"video":true,"photo":true},{"path":"/b","name":"b","document":true,"audio":true,"video":true,"photo":true},
+      {"path":"/a/x","name":"a1","document":true,"audio":true,"video":true,"photo":true},{"path":"/a/y","name":"a2","document":true,"audio":true,"video":true,"photo":true}])");
     for (const char* share : {"a", "b", "c"}) EXPECT_TRUE(MakeParentDirs(Marker(share)));
   }
   std::string Marker(const std::string& share) const {
@@ -515,7 +515,8 @@ TEST_F(TermSuggestionDriverTest, NothingUnavailableTouchesNothingAndAFailureLeav
     if (req["command"] == "list_term_sugg_db") return Hits(Parse(R"({"unavail":["fileindex_photo"]})"));
     return Hits(Json::Value(Json::arrayValue));
   });
-  dir_.Write("var/packages/Orvane/etc/fileindex.folders", R"([{"path":"/photo","name":"p"}])");
+  dir_.Write("var/packages/Orvane/etc/fileindex.folders", R"([{"path":"/photo","name":"p")"
+             R"(,"document":true,"audio":true,"video":true,"photo":true}])");
   log_.Clear();
   fileindex::UpdateTermSuggestion();
   EXPECT_TRUE(log_.Contains("(UpdateTermSuggestion) Failed [!ofs]"));

@@ -1,13 +1,13 @@
-// StatusMgr holds the status file: the global pause of indexing and per-share status flags
-// (bit 1: the share's index must be rebuilt; bit values of other owners are kept as they are).
-// A short-lived value loaded when constructed; writers serialise on the status lock file, readers
-// take no lock. Not thread-safe.
+// StatusMgr holds the status file: the global pause of indexing (a resume time) and a small set
+// of flag bits per share, and tells the indexing daemon when indexing is paused or resumed. A
+// short-lived value: construct it (loading the file) at the start of an operation. Writers
+// serialise on the status lock file; readers take no lock. Not thread-safe.
 #ifndef ORVANE_FILEINDEX_STATUS_MGR_HPP_
 #define ORVANE_FILEINDEX_STATUS_MGR_HPP_
 
-#include <json/json.h>
-
 #include <string>
+
+#include "common/json_util.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -16,24 +16,50 @@ namespace fileindex {
 extern const char kFileIndexStatusCfgPath[];
 extern const char kStatusCfgLockPath[];
 
+// Share flag: the share's index must be rebuilt.
+constexpr int kShareStatusNeedReindex = 1;
+
 class StatusMgr {
  public:
-  // Loads the status file; a missing file is no error, a malformed one throws Error 504.
+  // Loads the status file; a missing file leaves the document null, an unparsable one throws
+  // Error 504.
   StatusMgr();
+  ~StatusMgr() = default;
   StatusMgr(const StatusMgr&) = delete;
   StatusMgr& operator=(const StatusMgr&) = delete;
 
-  // The flags of `share`, 0 when it has none. Throws Error 120 when the file has no "share"
-  // object.
+  // The stored resume time: -1 not paused, 0 paused with no end, else paused until then.
+  // Throws Error 120 when the document is not an object (no status file).
+  long long GetPauseInfo() const;
+  // The flag bits of `share`, 0 when none are stored. Throws Error 120 when the document has no
+  // "share" object.
   int GetShareStatus(const std::string& share) const;
-  // Adds `bits` to the flags of `share` and saves, under the status lock. Throws Error 120 when
-  // the file has no "share" object, and the errors of Save().
+
+  // Pauses indexing for `hours` (0: until resumed), saves, and sends "pause" to the indexing
+  // daemon. Error 120 for a negative length, before anything is written.
+  void Pause(int hours);
+  // Clears the pause, saves, and sends "resume".
+  void Resume();
+
+  // Set, clear or drop a share's flag bits under the status lock, then save.
   void SetShareStatus(const std::string& share, int bits);
-  // Writes the file as root, mode 0644. Throws Error 505 (write) or 502 (chmod).
+  void UnsetShareStatus(const std::string& share, int bits);
+  void ClearShareStatus(const std::string& share);
+
+  // Writes the document as root with mode 0644 (Error 505 / 502).
   void Save();
 
+  // Writes an empty status file ({"share": {}}) under the status lock when there is none, so
+  // that status questions and flags work on a system that never paused.
+  static void CreateIfMissing();
+
+  const Json::Value& data() const { return data_; }
+
  private:
-  Json::Value data_;
+  // The stored flags of `share`, read the way the setters read them.
+  unsigned int StoredShareBits(const std::string& share) const;
+
+  JsonValue data_;
 };
 
 }  // namespace fileindex

@@ -1,0 +1,359 @@
+#include "fileindex/index_mgr.hpp"
+
+#include <gtest/gtest.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <map>
+#include <set>
+#include <sstream>
+
+#include "fileindex/admin_test_env.hpp"
+#include "fileindex/folder_mgr.hpp"
+#include "fileindex/status_mgr.hpp"
+#include "platform/fault.hpp"
+#include "platform/monitor_queue.hpp"
+#include "platform/platform_error.hpp"
+
+namespace orvane {
+namespace fileindex {
+namespace {
+
+using IndexMgrTest = testenv::AdminOpsTest;
+using platform::Fault;
+using platform::ScopedFaults;
+using testenv::ErrorOf;
+using testenv::Strings;
+
+TEST_F(IndexMgrTest, AddThenSetKeepsIndexRegistrationAndQueueInStep) {
+  FolderAdd(List({FolderJson("/photo/trips", "Trips", true, true, true, true),
+                  FolderJson("/music", "Music", true, true, false, false),
+                  FolderJson("/photo/family", "Family", true, false, false, false)}),
+            false);
+  EXPECT_EQ(FolderPaths(), (Strings{"/photo/trips", "/music", "/photo/family"}));
+  EXPECT_EQ(EngineCommands(),
+            (Strings{"index_create fileindex_music", "index_create fileindex_photo"}));
+  EXPECT_EQ(Registrations(), (Strings{"music: /music", "photo: /photo/trips /photo/family"}));
+  EXPECT_EQ(IndexdCommands(), (Strings{Notify("music", true), Notify("photo", true)}));
+  EXPECT_EQ(Events("photo"), (Strings{std::string("131072 /photo/trips ") + kAll,
+                                      std::string("131072 /photo/family ") + kAll}));
+  EXPECT_EQ(Events("music"), (Strings{std::string("131072 /music ") + kAll}));
+  EXPECT_EQ(Actions(), "start-ce\nstart-fi\n");
+  EXPECT_EQ(StatusMgr().GetShareStatus("photo"), 0);  // the status file now exists
+
+  // Audio off for the trips: one event with only audio, the record moved to the end, no index
+  // created again. A record that changes nothing but its name queues nothing.
+  FolderSet(List({FolderJson("/photo/trips", "Trips", true, false, true, true),
+                  FolderJson("/music", "Tunes", true, true, false, false)}),
+            false);
+  EXPECT_EQ(FolderPaths(), (Strings{"/photo/family", "/photo/trips", "/music"}));
+  EXPECT_EQ(Folders()[2]["name"], "Tunes");
+  EXPECT_EQ(EngineCommands().size(), 2u);
+  EXPECT_EQ(Events("photo").back(),
+            R"(131072 /photo/trips {"audio":true,"document":false,"photo":false,"video":false})");
+  EXPECT_EQ(Events("music").size(), 1u);
+  EXPECT_EQ(IndexdCommands().size(), 4u);
+
+  // A sub-folder differs from its parent only in video; in updater mode nothing is queued.
+  FolderAdd(List({FolderJson("/photo/trips/2024", "2024", true, false, false, true)}), false);
+  EXPECT_EQ(
+      Events("photo").back(),
+      R"(131072 /photo/trips/2024 {"audio":false,"document":false,"photo":false,"video":true})");
+  const size_t events = Events("photo").size();
+  FolderSet(List({FolderJson("/photo/family", "F", false, false, false, false)}), true);
+  EXPECT_EQ(Events("photo").size(), events);
+  EXPECT_EQ(Registrations(),
+            (Strings{"music: /music", "photo: /photo/trips /photo/trips/2024 /photo/family"}));
+
+  // Setting a path of a share that had no folder adds it; only an add creates the index.
+  FolderSet(List({FolderJson("/homes/bob", "Bob", true, true, true, true)}), false);
+  EXPECT_EQ(EngineCommands().size(), 2u);
+  EXPECT_EQ(FolderPaths().back(), "/homes/bob");
+}
+
+TEST_F(IndexMgrTest, RefusedRequestsChangeNothing) {
+  FolderAdd(List({FolderJson("/photo/trips", "Trips", true, true, true, true)}), false);
+  const std::string folders = test::ReadFile(FoldersPath());
+  const std::string queue = test::ReadFile(Queue("photo"));
+  const size_t engine = EngineCommands().size();
+  const size_t indexd = IndexdCommands().size();
+  const Strings registrations = Registrations();
+  const Json::Value good = FolderJson("/music", "Music", true, true, true, true);
+
+  test::LogCapture log;
+  auto refused = [&](const Json::Value& request, bool create, int code, const std::string& reason) {
+    const Error e =
+        ErrorOf([&] { create ? FolderAdd(request, false) : FolderSet(request, false); });
+    EXPECT_EQ(e.code, code) << JsonToString(request);
+    if (!reason.empty()) {
+      EXPECT_EQ(e.message,
+                "Orvane error, code=" + std::to_string(code) + ", reason=[" + reason + "]");
+    }
+  };
+  refused(Parse(R"({"path": "/music"})"), true, 120, R"({"path":"/music"})");
+  EXPECT_TRUE(log.Contains("Failed [!folder_list.isArray()]"));
+  refused(List({good, Json::Value("x")}), true, 120, "Not an object, data=\"x\"");
+  Json::Value all = good;
+  all["group"] = "all";
+  refused(List({good, all}), false, 120, "\"all\" is reserved group name");
+  Json::Value no_photo = good;
+  no_photo.removeMember("photo");
+  refused(List({no_photo}), true, 120, "Missing property: photo, data=" + JsonToString(no_photo));
+  refused(List({good, FolderJson("/photo/trips", "T", true, true, true, true)}), true, 901,
+          "Duplicated ID: /photo/trips");
+  EXPECT_TRUE(log.Contains("Failed [create && folder_mgr.HasFolder(folder_new->GetPath())]"));
+  refused(List({good, FolderJson("/photo/#recycle", "Bin", true, true, true, true)}), false, 903,
+          "Path cannot index: /photo/#recycle");
+  EXPECT_TRUE(log.Contains("Failed [!CanPathBeIndexed(folder_new->GetPath()) && !updater_mode]"));
+  refused(List({FolderJson("/ro/x", "RO", true, true, true, true)}), true, 903, "");
+  refused(List({FolderJson("/nosuch/x", "N", true, true, true, true)}), true, 800, "");
+  refused(List({FolderJson("music", "N", true, true, true, true)}), true, 120, "");
+  {
+    ScopedFaults faults;
+    faults.Arm("QUIXQuotaIsEnough", Fault{0, 0, platform::kQErrVolumeFull});
+    refused(List({good}), true, 1003, "Share (music) space not enough");
+    EXPECT_TRUE(log.Contains("Failed [!share.IsSpaceEnough()]"));
+  }
+
+  EXPECT_EQ(test::ReadFile(FoldersPath()), folders);
+  EXPECT_EQ(test::ReadFile(Queue("photo")), queue);
+  EXPECT_FALSE(IsFileExist(Queue("music")));
+  EXPECT_EQ(EngineCommands().size(), engine);
+  EXPECT_EQ(IndexdCommands().size(), indexd);
+  EXPECT_EQ(Registrations(), registrations);
+
+  // The updater re-applies stored records without the indexability test or events.
+  FolderAdd(List({FolderJson("/photo/#recycle", "Bin", true, true, true, true)}), true);
+  EXPECT_EQ(FolderPaths().back(), "/photo/#recycle");
+  EXPECT_EQ(test::ReadFile(Queue("photo")), queue);
+}
+
+TEST_F(IndexMgrTest, EmptyRequestOnlySwitchesServicesOn) {
+  FolderAdd(Json::Value(Json::arrayValue), false);
+  EXPECT_EQ(Folders(), Json::Value(Json::arrayValue));
+  EXPECT_EQ(Actions(), "start-ce\nstart-fi\n");
+  EXPECT_TRUE(EngineCommands().empty());
+  EXPECT_TRUE(IndexdCommands().empty());
+  EXPECT_TRUE(Registrations().empty());
+}
+
+TEST_F(IndexMgrTest, FailuresAfterTheChecksAreNotRolledBack) {
+  // The engine refuses the index: nothing is saved, the services are already on.
+  StartEngine({R"({"success":false,"error":{"code":700}})"});
+  EXPECT_NE(ErrorOf([&] {
+              FolderAdd(List({FolderJson("/music", "M", true, true, true, true)}), false);
+            }).code,
+            0);
+  EXPECT_FALSE(IsFileExist(FoldersPath()));
+  StartDaemons();
+
+  // The registration fails after the index was made: the index stays, nothing is saved.
+  {
+    ScopedFaults faults;
+    faults.Arm("MonitorQueue::Upsert", Fault{0, EIO});
+    EXPECT_EQ(ErrorOf([&] {
+                FolderAdd(List({FolderJson("/music", "M", true, true, true, true)}), false);
+              }).code,
+              kErrSystem);
+  }
+  EXPECT_EQ(EngineCommands(), (Strings{"index_create fileindex_music"}));
+  EXPECT_FALSE(IsFileExist(FoldersPath()));
+
+  // The queue cannot be written: the configuration is saved, the share flagged, the error out.
+  ASSERT_TRUE(MakeParentDirs(Queue("music") + "/x"));
+  EXPECT_EQ(ErrorOf([&] {
+              FolderAdd(List({FolderJson("/music", "M", true, true, true, true)}), false);
+            }).code,
+            kErrSystem);
+  EXPECT_EQ(FolderPaths(), (Strings{"/music"}));
+  EXPECT_EQ(StatusMgr().GetShareStatus("music"), kShareStatusNeedReindex);
+}
+
+TEST_F(IndexMgrTest, DeleteKeepsRegistrationIndexAndServicesInStep) {
+  FolderAdd(List({FolderJson("/photo", "Photo", true, true, true, true),
+                  FolderJson("/photo/trips", "Trips", true, true, false, true),
+                  FolderJson("/music", "Music", true, true, false, false)}),
+            false);
+  const size_t engine = EngineCommands().size();
+  const std::string folders = test::ReadFile(FoldersPath());
+
+  // Refusals first: nothing changes, nothing is sent.
+  test::LogCapture log;
+  EXPECT_EQ(ErrorOf([] { FolderDelete(Parse(R"("/music")")); }).message,
+            "Orvane error, code=120, reason=[\"/music\"]");
+  EXPECT_EQ(ErrorOf([] { FolderDelete(Parse(R"(["/music", 3])")); }).message,
+            "Orvane error, code=120, reason=[3]");
+  EXPECT_EQ(ErrorOf([] { FolderDelete(Parse(R"(["/music", "/photo/family"])")); }).message,
+            "Orvane error, code=902, reason=[/photo/family]");
+  EXPECT_EQ(ErrorOf([] { FolderDelete(Parse(R"(["/music", "/music"])")); }).code,
+            kErrFolderNotFound);
+  EXPECT_EQ(test::ReadFile(FoldersPath()), folders);
+  EXPECT_EQ(EngineCommands().size(), engine);
+  EXPECT_EQ(IndexdCommands().size(), 2u);
+
+  // The trips fall back to the photo share's settings: video flips for them.
+  FolderDelete(Parse(R"(["/photo/trips"])"));
+  EXPECT_EQ(FolderPaths(), (Strings{"/photo", "/music"}));
+  EXPECT_EQ(Registrations(), (Strings{"music: /music", "photo: /photo"}));
+  EXPECT_EQ(Events("photo").back(),
+            R"(131072 /photo/trips {"audio":false,"document":false,"photo":false,"video":true})");
+  EXPECT_EQ(IndexdCommands().back(), Notify("photo", false));
+  EXPECT_EQ(EngineCommands().size(), engine);
+
+  // The last folder of a share takes its index and registration with it, and no event.
+  const size_t music_events = Events("music").size();
+  FolderDelete(Parse(R"(["/music"])"));
+  EXPECT_EQ(EngineCommands().back(), "index_delete fileindex_music");
+  EXPECT_EQ(Registrations(), (Strings{"photo: /photo"}));
+  EXPECT_EQ(Events("music").size(), music_events);
+  EXPECT_EQ(Actions(), "start-ce\nstart-fi\n");
+  FolderDelete(Parse(R"(["/photo"])"));
+  EXPECT_EQ(Actions(), "start-ce\nstart-fi\nstop-fi\n");
+  EXPECT_EQ(Folders(), Json::Value(Json::arrayValue));
+  EXPECT_TRUE(Registrations().empty());
+}
+
+TEST_F(IndexMgrTest, ReindexRebuildsOnlyWholeShares) {
+  FolderAdd(List({FolderJson("/photo/trips", "Trips", true, true, true, true),
+                  FolderJson("/photo/family", "Family", true, true, true, true),
+                  FolderJson("/music", "Music", true, true, true, true)}),
+            false);
+  StatusMgr().SetShareStatus("photo", kShareStatusNeedReindex | 4);
+  const size_t engine = EngineCommands().size();
+  FolderReindex(Parse(R"(["/photo/trips"])"));
+  EXPECT_EQ(Events("photo").back(), "65536 /photo/trips");
+  EXPECT_EQ(EngineCommands().size(), engine);
+
+  FolderReindex(Parse(R"(["/photo/family", "/photo/trips", "/music"])"));
+  const Strings all_engine = EngineCommands();
+  EXPECT_EQ(Strings(all_engine.begin() + engine, all_engine.end()),
+            (Strings{"index_delete fileindex_music", "index_create fileindex_music",
+                     "index_delete fileindex_photo", "index_create fileindex_photo"}));
+  // The trips' re-index is still queued, so only the family is added.
+  Strings photo = Events("photo");
+  EXPECT_EQ(Strings(photo.end() - 2, photo.end()),
+            (Strings{"65536 /photo/trips", "65536 /photo/family"}));
+  EXPECT_EQ(Events("music").back(), "65536 /music");
+  const Strings all_indexd = IndexdCommands();
+  EXPECT_EQ(Strings(all_indexd.end() - 2, all_indexd.end()),
+            (Strings{Worker("worker_create", "music"), Worker("worker_create", "photo")}));
+  EXPECT_EQ(StatusMgr().GetShareStatus("photo"), 4);
+  EXPECT_EQ(ErrorOf([] { FolderReindex(Parse(R"(["/photo"])")); }).code, kErrFolderNotFound);
+  EXPECT_EQ(ErrorOf([] { FolderReindex(Parse(R"({})")); }).code, kErrInvalidParam);
+}
+
+TEST_F(IndexMgrTest, ListingGetGroupsSummaryAndProcessingStatus) {
+  Json::Value staff = FolderJson("/photo/trips", "Trips", true, true, true, true);
+  staff["group"] = "staff";
+  FolderAdd(List({staff, FolderJson("/photo/family", "family", true, true, true, true),
+                  FolderJson("/music", "Music", true, true, true, true)}),
+            false);
+  Json::Value list = FolderList(Parse(R"({"sort_by": "name", "sort_direction": "desc",
+                                          "offset": 1, "limit": 1, "additional": ["status"]})"));
+  EXPECT_EQ(list["total"], 3);
+  ASSERT_EQ(list["folders"].size(), 1u);
+  EXPECT_EQ(list["folders"][0]["name"], "Music");
+  // Every new folder has its folder-settings event waiting, and nothing is paused.
+  EXPECT_EQ(list["folders"][0]["additional"]["status"]["text"], "processing");
+  list = FolderList(Parse(R"({"group": "staff", "keyword": "TRI"})"));
+  EXPECT_EQ(list["total"], 1);
+  EXPECT_EQ(list["folders"][0], Folder(staff).GetData());
+  EXPECT_EQ(FolderList(Parse("{}"))["total"], 3);
+  for (const char* bad :
+       {R"({"offset": -1})", R"({"limit": "2"})", R"({"sort_by": 1})", R"({"group": null})",
+        R"({"additional": "status"})", R"({"additional": ["size"], "keyword": "none"})", "[]"}) {
+    EXPECT_EQ(ErrorOf([&] { FolderList(Parse(bad)); }).code, kErrInvalidParam) << bad;
+  }
+
+  EXPECT_EQ(FolderGet("/music", Json::Value(Json::arrayValue))["name"], "Music");
+  EXPECT_EQ(ErrorOf([] { FolderGet("/music/live", Json::Value(Json::arrayValue)); }).code,
+            kErrFolderNotFound);
+  EXPECT_EQ(FolderListGroups(), Parse(R"(["staff"])"));
+
+  StatusMgr().Pause(0);
+  Json::Value processing = FolderGetProcessingStatus("/photo/family");
+  EXPECT_EQ(processing, Parse(R"({"path": "/photo/family", "text": "paused", "pending": true})"));
+  StatusMgr().SetShareStatus("music", kShareStatusNeedReindex);
+  Json::Value summary = FolderSummary();
+  EXPECT_EQ(summary, Parse(R"({"folder_count": 3, "resume_time": 0, "paused": true, "shares": [
+      {"share": "music", "folder_count": 1, "queue_length": 1, "status": 1,
+       "need_reindex": true, "volume_paused": false},
+      {"share": "photo", "folder_count": 2, "queue_length": 2, "status": 0,
+       "need_reindex": false, "volume_paused": false}]})"));
+}
+
+TEST_F(IndexMgrTest, ConcurrentAdministratorsLoseNothing) {
+  // Each process adds its own folders one by one, renames some and deletes others; the folder
+  // file must end up as exactly what each was told succeeded.
+  constexpr int kProcs = 4;
+  constexpr int kFolders = 6;
+  for (int p = 0; p < kProcs; ++p) {
+    for (int i = 0; i < kFolders; ++i) {
+      ASSERT_TRUE(
+          MakeParentDirs(vol_ + "/music/p" + std::to_string(p) + "/f" + std::to_string(i) + "/x"));
+    }
+  }
+  std::vector<pid_t> children;
+  std::vector<std::string> results;
+  for (int p = 0; p < kProcs; ++p) {
+    const std::string result = scratch_.Path("result" + std::to_string(p));
+    results.push_back(result);
+    const pid_t pid = fork();
+    ASSERT_GE(pid, 0);
+    if (pid == 0) {
+      std::string done;
+      for (int i = 0; i < kFolders; ++i) {
+        const std::string path = "/music/p" + std::to_string(p) + "/f" + std::to_string(i);
+        try {
+          FolderAdd(List({FolderJson(path, "n", true, true, true, true)}), false);
+          if (i % 3 == 1) {
+            FolderSet(List({FolderJson(path, "renamed", true, false, true, true)}), false);
+            done += "set " + path + "\n";
+          } else if (i % 3 == 2) {
+            FolderDelete(List({Json::Value(path)}));
+          } else {
+            done += "add " + path + "\n";
+          }
+        } catch (const Error&) {
+          // Told it failed: whatever it left is checked against the file below.
+          done += "failed " + path + "\n";
+        }
+      }
+      FILE* f = fopen(result.c_str(), "w");
+      if (f != nullptr) {
+        fputs(done.c_str(), f);
+        fclose(f);
+      }
+      _exit(0);
+    }
+    children.push_back(pid);
+  }
+  for (pid_t pid : children) {
+    int status = 0;
+    ASSERT_EQ(waitpid(pid, &status, 0), pid);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  }
+  std::map<std::string, std::string> expected;  // path -> name
+  std::set<std::string> uncertain;
+  for (const std::string& result : results) {
+    std::istringstream in(test::ReadFile(result));
+    std::string op, path;
+    while (in >> op >> path) {
+      if (op == "failed") uncertain.insert(path);
+      if (op == "add") expected[path] = "n";
+      if (op == "set") expected[path] = "renamed";
+    }
+  }
+  FolderMgr folders;  // parses, so the file is valid
+  std::map<std::string, std::string> actual;
+  for (const auto& f : folders.folders()) {
+    EXPECT_TRUE(actual.emplace(f->GetPath(), f->GetName()).second) << f->GetPath();
+  }
+  for (const auto& path : uncertain) actual.erase(path);
+  EXPECT_EQ(actual, expected);
+  EXPECT_GE(expected.size(), static_cast<size_t>(kProcs * kFolders / 3));
+}
+
+}  // namespace
+}  // namespace fileindex
+}  // namespace orvane
