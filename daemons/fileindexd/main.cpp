@@ -66,8 +66,9 @@ int main(int argc, char** argv) {
     orvane::fileindexd::CommandServer server(
         orvane::RootedPath(orvane::fileindexd::kFileIndexdSockPath),
         [&daemon](const Json::Value& command, uid_t uid) { return daemon.Handle(command, uid); });
-    server.Start();
+    // Workers first, so that whoever reaches the socket sees them.
     daemon.Start();
+    server.Start();
     orvane::Log(LOG_INFO, "fileindexd: ready");
     for (;;) {
       int sig = 0;

@@ -29,13 +29,17 @@ ChildProcess::ChildProcess(const std::string& root, std::vector<std::string> arg
     std::vector<char*> args;
     for (std::string& a : argv) args.push_back(&a[0]);
     args.push_back(nullptr);
-    // Their logs go to syslog; on the test's output they would drown the failures.
-    const int null = open("/dev/null", O_WRONLY);
-    if (null >= 0) dup2(null, 2);
+    // Their logs go to syslog; on the test's output they would drown the failures, unless asked
+    // for while a test is being debugged.
+    if (getenv("FILEINDEXD_TEST_STDERR") == nullptr) {
+      const int null = open("/dev/null", O_WRONLY);
+      if (null >= 0) dup2(null, 2);
+    }
     execv(args[0], args.data());
     _exit(127);
   }
 }
+
 
 ChildProcess::~ChildProcess() { Signal(SIGKILL); }
 
@@ -46,6 +50,14 @@ int ChildProcess::Signal(int sig) {
   waitpid(pid_, &status, 0);
   pid_ = -1;
   return status;
+}
+
+bool ChildProcess::Exited(int timeout_ms) {
+  if (pid_ <= 0) return true;
+  int status = 0;
+  const bool gone = WaitFor([&] { return waitpid(pid_, &status, WNOHANG) == pid_; }, timeout_ms);
+  if (gone) pid_ = -1;
+  return gone;
 }
 
 bool WaitFor(const std::function<bool()>& pred, int timeout_ms) {

@@ -28,6 +28,8 @@ class ChildProcess {
   ChildProcess& operator=(const ChildProcess&) = delete;
   // Sends `sig` and waits for the exit; returns the wait status (-1 when not running).
   int Signal(int sig);
+  // Waits up to `timeout_ms` for the process to end by itself; true when it did (it is reaped).
+  bool Exited(int timeout_ms);
   pid_t pid() const { return pid_; }
 
  private:

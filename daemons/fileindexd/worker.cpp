@@ -130,7 +130,8 @@ void Worker::Run() {
     if (stop_.load()) break;
     if (done) {
       backoff = kPassRetryMicros;
-      Wait(kIdleWaitMillis);
+      // A pass that finished a batch left behind did not take the live queue yet.
+      if (!IsFileExist(queue_path_)) Wait(kIdleWaitMillis);
     } else {
       Backoff(backoff);
       backoff = std::min(backoff * 2, kPassRetryMaxMicros);
