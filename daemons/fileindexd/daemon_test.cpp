@@ -1,0 +1,161 @@
+// The daemon binary on its real socket: its commands, who may send them, following a queue
+// without being told, the pause, a batch left behind by a killed daemon, and a clean stop.
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <fstream>
+
+#include "common/json_util.hpp"
+#include "common/root.hpp"
+#include "common/util.hpp"
+#include "daemons/fileindexd/test_system.hpp"
+#include "fileindex/elastic_control.hpp"
+#include "fileindex/queue_file.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace fileindexd {
+namespace {
+
+using test::Command;
+using test::System;
+using test::WaitFor;
+
+std::string CreateLine(const std::string& path) {
+  return R"({"event": 64, "is_dir": false, "path": ")" + path + "\"}\n";
+}
+
+class DaemonTest : public ::testing::Test {
+ protected:
+  DaemonTest() : sys_({"docs", "music"}) {}
+
+  void SetUp() override {
+    setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BIN, 1);
+    Json::Value folders(Json::arrayValue);
+    folders.append(System::Folder("/docs/a", false));
+    Json::Value paused = System::Folder("/music", false);
+    paused["paused"] = true;
+    folders.append(paused);
+    sys_.WriteFolders(folders);
+    MakeParentDirs(V("a/x"));
+    engine_ = sys_.StartEngine();
+    fileindex::elastic::ShareIndexCreate("docs");
+  }
+  std::string V(const std::string& rel) const { return sys_.Vol("docs/" + rel); }
+  bool Indexed(const std::string& rel) const { return sys_.Documents("docs").count(V(rel)) > 0; }
+  static Json::Value Share(const std::string& name) {
+    Json::Value d(Json::objectValue);
+    d["share_name"] = name;
+    return d;
+  }
+  static std::set<std::string> Running() {
+    std::set<std::string> shares;
+    const Json::Value status = Command("status", Json::Value());
+    for (const auto& s : status["data"]["shares"]) {
+      shares.insert(s["share"].asString());
+    }
+    return shares;
+  }
+
+  System sys_;
+  std::unique_ptr<test::ChildProcess> engine_;
+};
+
+TEST_F(DaemonTest, FollowsTheQueueAndAnswersItsCommands) {
+  auto indexd = sys_.StartIndexd();
+  // Only the share whose folders are not all paused has a worker.
+  EXPECT_EQ(std::set<std::string>{"docs"}, Running());
+
+  std::ofstream(V("a/one.txt")) << "1";
+  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), CreateLine(V("a/one.txt"))));
+  EXPECT_TRUE(WaitFor([&] { return Indexed("a/one.txt"); }, 5000));
+
+  EXPECT_TRUE(Command("worker_create", Share("music"))["success"].asBool());
+  EXPECT_EQ((std::set<std::string>{"docs", "music"}), Running());
+  EXPECT_TRUE(Command("worker_delete", Share("music"))["success"].asBool());
+  EXPECT_EQ(std::set<std::string>{"docs"}, Running());
+
+  // Paused with no end: the queue waits; resumed: it is drained.
+  Json::Value pause(Json::objectValue);
+  pause["resume_time"] = 0;
+  EXPECT_TRUE(Command("pause", pause)["success"].asBool());
+  Json::Value status = Command("status", Json::Value())["data"];
+  EXPECT_TRUE(status["paused"].asBool());
+  std::ofstream(V("a/two.txt")) << "2";
+  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), CreateLine(V("a/two.txt"))));
+  EXPECT_FALSE(WaitFor([&] { return Indexed("a/two.txt"); }, 1500));
+  EXPECT_EQ(1u, Command("status", Json::Value())["data"]["shares"][0]["queue_length"].asUInt());
+  EXPECT_TRUE(Command("resume", Json::Value())["success"].asBool());
+  EXPECT_TRUE(WaitFor([&] { return Indexed("a/two.txt"); }, 5000));
+
+  const Json::Value report = Command("status", Json::Value())["data"]["shares"][0];
+  EXPECT_EQ("docs", report["share"].asString());
+  EXPECT_EQ(2u, report["ops_done"].asUInt());
+  for (const char* key : {"queue_length", "ops_pending", "documents_written", "last_pass",
+                          "errors", "paused"}) {
+    EXPECT_TRUE(report.isMember(key)) << key;
+  }
+
+  // Bad input gets an error reply, never a crash.
+  EXPECT_EQ(101, Command("reboot", Json::Value())["error"]["code"].asInt());
+  EXPECT_EQ(120, Command("worker_create", Json::Value())["error"]["code"].asInt());
+  EXPECT_EQ(120, Command("pause", Json::Value(Json::objectValue))["error"]["code"].asInt());
+  const std::string junk = "not json";
+  const uint32_t junk_len = junk.size();
+  EXPECT_NE(std::string::npos,
+            test::RawCommand(std::string(reinterpret_cast<const char*>(&junk_len), 4) + junk)
+                .find("\"code\":100"));
+  const uint32_t huge = 1u << 30;
+  EXPECT_NE(std::string::npos,
+            test::RawCommand(std::string(reinterpret_cast<const char*>(&huge), 4)).find("104"));
+  EXPECT_EQ("", test::RawCommand("ab"));  // cut short: closed without a reply
+  EXPECT_TRUE(Command("status", Json::Value())["success"].asBool());
+
+  // A clean stop removes the socket and the pid file.
+  const int wstatus = indexd->Signal(SIGTERM);
+  EXPECT_TRUE(WIFEXITED(wstatus) && WEXITSTATUS(wstatus) == 0) << wstatus;
+  EXPECT_FALSE(IsFileExist(RootedPath("/var/run/fileindexd.sock")));
+  EXPECT_FALSE(IsFileExist(RootedPath("/var/run/fileindexd.pid")));
+}
+
+TEST_F(DaemonTest, OnlyRootAndItsOwnUserControlIt) {
+  // The scratch root must be reachable for another user to reach the socket at all.
+  for (const std::string& dir : {sys_.root(), sys_.root() + "/var", sys_.root() + "/var/run"}) {
+    MakeParentDirs(dir + "/x");
+    chmod(dir.c_str(), 0755);
+  }
+  auto indexd = sys_.StartIndexd();
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act as another user";
+  const int status_ok = orvane::test::RunAsUser("nobody", [] {
+    return Command("status", Json::Value())["success"].asBool() ? 1 : 0;
+  });
+  EXPECT_EQ(1, status_ok);
+  const int refused = orvane::test::RunAsUser("nobody", [] {
+    return Command("worker_delete", Share("docs"))["error"]["code"].asInt();
+  });
+  EXPECT_EQ(103, refused);
+  EXPECT_EQ(std::set<std::string>{"docs"}, Running());
+}
+
+TEST_F(DaemonTest, ABatchLeftByAKilledDaemonIsFinishedFirst) {
+  std::ofstream(V("a/left.txt")) << "l";
+  std::ofstream(V("a/new.txt")) << "n";
+  // The side file a killed pass leaves, and new lines queued after it.
+  MakeParentDirs(sys_.Queue("docs"));
+  std::ofstream(sys_.Queue("docs") + ".tmp") << CreateLine(V("a/left.txt"));
+  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), CreateLine(V("a/new.txt"))));
+  auto indexd = sys_.StartIndexd();
+  EXPECT_TRUE(WaitFor([&] { return Indexed("a/left.txt") && Indexed("a/new.txt"); }, 5000));
+  EXPECT_TRUE(WaitFor([&] { return !IsFileExist(sys_.Queue("docs") + ".tmp"); }, 5000));
+  // A second daemon refuses to start beside it.
+  test::ChildProcess second(sys_.root(), {FILEINDEXD_BIN});
+  EXPECT_TRUE(second.Exited(5000));
+  EXPECT_TRUE(Command("status", Json::Value())["success"].asBool());
+}
+
+}  // namespace
+}  // namespace fileindexd
+}  // namespace orvane

@@ -1,0 +1,229 @@
+// The whole system in a scratch root: the search engine, the file-change daemon and the
+// indexing daemon as real processes, folders added through the administration operations, and
+// real work on disk. After each round the index must hold exactly what a walk of the disk says
+// is indexable, with the right names, parents and sizes.
+#include <dirent.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <map>
+
+#include "common/json_util.hpp"
+#include "common/root.hpp"
+#include "common/util.hpp"
+#include "daemons/fileindexd/test_system.hpp"
+#include "fileindex/index_mgr.hpp"
+#include "fileindex/util.hpp"
+
+namespace orvane {
+namespace fileindexd {
+namespace {
+
+using test::System;
+using test::WaitFor;
+
+// What a document must say about its file.
+struct Entry {
+  std::string name;
+  std::string parent;
+  int64_t size;
+  bool operator==(const Entry& o) const {
+    return name == o.name && parent == o.parent && size == o.size;
+  }
+};
+using Listing = std::map<std::string, Entry>;
+
+std::ostream& operator<<(std::ostream& out, const Listing& l) {
+  for (const auto& [path, e] : l) out << "\n  " << path << " (" << e.size << ")";
+  return out;
+}
+
+void Write(const std::string& path, const std::string& text) {
+  MakeParentDirs(path);
+  std::ofstream(path) << text;
+}
+
+int Shell(const std::string& cmd) { return std::system(cmd.c_str()); }
+
+class EndToEndTest : public ::testing::Test {
+ protected:
+  EndToEndTest() : sys_({"docs", "media"}) {}
+
+  void SetUp() override {
+    setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BIN, 1);
+    sys_.WriteFolders(Json::Value(Json::arrayValue));
+    engine_ = sys_.StartEngine();
+    notifyd_ = sys_.StartNotifyd();
+    indexd_ = sys_.StartIndexd();
+  }
+
+  std::string D(const std::string& rel) const { return sys_.Vol("docs/" + rel); }
+  std::string M(const std::string& rel) const { return sys_.Vol("media/" + rel); }
+
+  // What the disk says the index of `share` must hold below the folders `roots`.
+  Listing Walk(const std::vector<std::string>& roots) const {
+    Listing out;
+    for (const auto& root : roots) WalkInto(root, &out);
+    return out;
+  }
+  void WalkInto(const std::string& path, Listing* out) const {
+    struct stat st;
+    if (lstat(path.c_str(), &st) != 0) return;
+    const std::string name = Basename(path);
+    if (fileindex::IsSystemPreservedFileName(name) || name == "#recycle") return;
+    if (!S_ISDIR(st.st_mode) && !S_ISREG(st.st_mode)) return;
+    (*out)[path] = Entry{name, Dirname(path), S_ISDIR(st.st_mode) ? -1 : int64_t(st.st_size)};
+    if (!S_ISDIR(st.st_mode)) return;
+    DIR* dir = opendir(path.c_str());
+    if (dir == nullptr) return;
+    while (struct dirent* e = readdir(dir)) {
+      const std::string child = e->d_name;
+      if (child != "." && child != "..") WalkInto(path + "/" + child, out);
+    }
+    closedir(dir);
+  }
+  // What the index of `share` holds.
+  static Listing Index(const std::string& share) {
+    Listing out;
+    Json::Value q(Json::objectValue);
+    q["id"] = "fileindex_" + share;
+    q["query"]["qsl"]["match_all"] = Json::Value(Json::objectValue);
+    for (const char* f : {"QUIXMDPath", "QUIXMDFSName", "QUIXMDParent", "QUIXMDFSSize",
+                          "QUIXMDIsDir"}) {
+      q["query"]["load_field"].append(f);
+    }
+    q["size"] = 10000;
+    for (int from = 0;; from += 10000) {
+      q["from"] = from;
+      Json::Value res;
+      try {
+        res = System::Engine("document_get_by_query", q);
+      } catch (const std::exception&) {
+        return out;
+      }
+      for (const auto& hit : res["data"]) {
+        const bool dir = hit["QUIXMDIsDir"].asBool();
+        out[hit["QUIXMDPath"].asString()] =
+            Entry{hit["QUIXMDFSName"].asString(), hit["QUIXMDParent"].asString(),
+                  dir ? -1 : hit["QUIXMDFSSize"].asInt64()};
+      }
+      if (res["data"].size() < 10000) break;
+    }
+    return out;
+  }
+  static int64_t EngineCount(const std::string& share) {
+    const Json::Value list = System::Engine("index_list", Json::Value());
+    for (const auto& index : list["data"]) {
+      if (index["id"] == "fileindex_" + share) return index["documents"].asInt64();
+    }
+    return -1;
+  }
+  // Waits until the index of `share` matches the walk of `roots`, then checks it.
+  void ExpectSettled(const std::string& share, const std::vector<std::string>& roots,
+                     int timeout_ms = 30000) {
+    WaitFor([&] { return Index(share) == Walk(roots); }, timeout_ms);
+    const Listing want = Walk(roots);
+    const Listing got = Index(share);
+    EXPECT_TRUE(want == got) << "disk:" << want << "\nindex:" << got;
+    EXPECT_EQ(int64_t(got.size()), EngineCount(share)) << "a document is doubled";
+  }
+  static Json::Value Folder(const std::string& path, bool meta) {
+    Json::Value list(Json::arrayValue);
+    list.append(System::Folder(path, meta));
+    return list;
+  }
+  static int Search(const std::string& word) {
+    Json::Value q(Json::objectValue);
+    q["keyword"] = word;
+    return System::Engine("search", q)["data"]["total"].asInt();
+  }
+
+  System sys_;
+  std::unique_ptr<test::ChildProcess> engine_;
+  std::unique_ptr<test::ChildProcess> notifyd_;
+  std::unique_ptr<test::ChildProcess> indexd_;
+};
+
+TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
+  // Files there before the folders are added, and files no folder covers.
+  Write(D("proj/readme.txt"), "hello");
+  Write(D("proj/src/main.c"), "int main() { return 0; }");
+  Write(D("proj/@eaDir/thumb.jpg"), "not ours");
+  Write(D("outside/notes.txt"), "not indexed");
+  Write(M("song.mp3"), "not really audio");
+  Write(M("#recycle/deleted.txt"), "in the recycle bin");
+  fileindex::FolderAdd(Folder("/docs/proj", false), false);
+  fileindex::FolderAdd(Folder("/media", false), false);
+  ExpectSettled("docs", {D("proj")});
+  ExpectSettled("media", {sys_.Vol("media")});
+
+  // Creates, writes, renames of files and directories, deletes, moves in and out.
+  Write(D("proj/new.txt"), "new");
+  Write(D("proj/readme.txt"), "hello again, now longer");
+  ASSERT_EQ(0, rename(D("proj/new.txt").c_str(), D("proj/renamed.txt").c_str()));
+  ASSERT_EQ(0, rename(D("proj/src").c_str(), D("proj/source").c_str()));
+  Write(D("proj/source/lib/util.c"), "void f(void) {}");
+  ASSERT_EQ(0, unlink(D("proj/source/main.c").c_str()));
+  Write(D("outside/incoming/a.txt"), "moved in");
+  ASSERT_EQ(0, rename(D("outside/incoming").c_str(), D("proj/incoming").c_str()));
+  ASSERT_EQ(0, rename(D("proj/renamed.txt").c_str(), D("outside/left.txt").c_str()));
+  ASSERT_EQ(0, chmod(D("proj/readme.txt").c_str(), 0600));
+  ExpectSettled("docs", {D("proj")});
+
+  // A tar archive extracted into the folder, then a tree removed with rm -rf.
+  const std::string src = sys_.root() + "/tarsrc";
+  for (int i = 0; i < 40; ++i) {
+    Write(src + "/pkg/dir" + std::to_string(i % 5) + "/f" + std::to_string(i) + ".txt",
+          std::string(i, 'x'));
+  }
+  ASSERT_EQ(0, Shell("tar -C " + src + " -cf " + sys_.root() + "/pkg.tar pkg"));
+  ASSERT_EQ(0, Shell("tar -C " + D("proj") + " -xf " + sys_.root() + "/pkg.tar"));
+  ExpectSettled("docs", {D("proj")});
+  ASSERT_EQ(0, Shell("rm -rf " + D("proj/pkg")));
+  ExpectSettled("docs", {D("proj")});
+
+  // A re-index, and a setting change that switches document contents on.
+  Json::Value reindex(Json::arrayValue);
+  reindex.append("/docs/proj");
+  fileindex::FolderReindex(reindex);
+  ExpectSettled("docs", {D("proj")});
+  EXPECT_EQ(0, Search("hello"));
+  fileindex::FolderSet(Folder("/docs/proj", true), false);
+  EXPECT_TRUE(WaitFor([] { return Search("hello") == 1; }, 20000));
+  ExpectSettled("docs", {D("proj")});
+  ExpectSettled("media", {sys_.Vol("media")});
+}
+
+TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
+  Write(D("proj/seed.txt"), "s");
+  fileindex::FolderAdd(Folder("/docs/proj", false), false);
+  ExpectSettled("docs", {D("proj")});
+
+  // A large batch; the indexing daemon is killed while it works on it.
+  for (int i = 0; i < 3000; ++i) {
+    Write(D("proj/big/d" + std::to_string(i % 30) + "/f" + std::to_string(i) + ".txt"), "b");
+  }
+  WaitFor([&] { return IsFileExist(sys_.Queue("docs") + ".tmp"); }, 10000);
+  indexd_->Signal(SIGKILL);
+  indexd_ = sys_.StartIndexd();
+  ExpectSettled("docs", {D("proj")}, 60000);
+
+  // The file-change daemon killed and started again goes on watching.
+  notifyd_->Signal(SIGKILL);
+  notifyd_ = sys_.StartNotifyd();
+  WaitFor([&] {
+    Write(D("proj/probe.txt"), "p");
+    return Index("docs").count(D("proj/probe.txt")) > 0;
+  }, 20000);
+  Write(D("proj/after/restart.txt"), "after");
+  ASSERT_EQ(0, Shell("rm -rf " + D("proj/big/d7")));
+  ExpectSettled("docs", {D("proj")});
+}
+
+}  // namespace
+}  // namespace fileindexd
+}  // namespace orvane

@@ -1,0 +1,339 @@
+#include "daemons/fileindexd/indexer.hpp"
+
+#include <dirent.h>
+#include <sys/stat.h>
+#include <syslog.h>
+
+#include <cerrno>
+#include <cstring>
+#include <utility>
+
+#include "common/comm.hpp"
+#include "common/error.hpp"
+#include "common/json_util.hpp"
+#include "common/log.hpp"
+#include "common/util.hpp"
+#include "extract/content_extract.hpp"
+#include "fileindex/elastic_control.hpp"
+#include "fileindex/folder.hpp"
+#include "fileindex/util.hpp"
+
+namespace orvane {
+namespace fileindexd {
+
+namespace el = fileindex::elastic;
+using fileindex::OP;
+
+namespace {
+
+bool IsSubPath(const std::string& path, const std::string& dir) {
+  return StringStartWith(path + "/", dir + "/");
+}
+
+Json::Value Command(const char* name, Json::Value data) {
+  Json::Value req(Json::objectValue);
+  req["command"] = name;
+  req["data"] = std::move(data);
+  return req;
+}
+
+}  // namespace
+
+// Collects document commands and sends them as compound requests, so a crawl of many files
+// costs one engine transaction per batch rather than one connection per file.
+class Indexer::Batch {
+ public:
+  explicit Batch(Indexer* owner)
+      : owner_(owner), id_(el::GetFileIndexID(owner->share_)), reqs_(Json::arrayValue) {}
+  Batch(const Batch&) = delete;
+  Batch& operator=(const Batch&) = delete;
+
+  // A file whose attributes cannot be read any more is simply not indexed: it went away while
+  // the crawl ran, and its delete event follows.
+  void Upsert(const std::string& path, bool need_meta) {
+    Json::Value config(Json::objectValue);
+    config["need_meta"] = need_meta;
+    Json::Value doc;
+    try {
+      QUIX::CONTENT_EXTRACT::ParseFile(path, config, doc);
+    } catch (const std::exception& e) {
+      Log(LOG_WARNING, "fileindexd: %s not indexed: %s", path.c_str(), e.what());
+      return;
+    }
+    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchFileName] = doc[QUIX::CONTENT_EXTRACT::QUIXMDFSName];
+    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchAncestor] = doc[QUIX::CONTENT_EXTRACT::QUIXMDParent];
+    Json::Value data(Json::objectValue);
+    data["id"] = id_;
+    data["doc_id"] = path;
+    data["data"] = std::move(doc);
+    Add(Command("document_upsert_by_id", std::move(data)));
+    ++owner_->documents_written_;
+  }
+  void Delete(const std::string& path) {
+    Json::Value data(Json::objectValue);
+    data["id"] = id_;
+    data["doc_id"] = path;
+    Add(Command("document_del_by_id", std::move(data)));
+    ++owner_->documents_deleted_;
+  }
+  void Flush() {
+    if (reqs_.empty()) return;
+    Json::Value req(Json::objectValue);
+    req["compound"] = std::move(reqs_);
+    reqs_ = Json::Value(Json::arrayValue);
+    el::SendRequest(req);
+  }
+
+ private:
+  void Add(Json::Value req) {
+    reqs_.append(std::move(req));
+    if (reqs_.size() >= kCrawlBatchSize) Flush();
+  }
+
+  Indexer* owner_;
+  std::string id_;
+  Json::Value reqs_;
+};
+
+Indexer::Indexer(const std::string& share, const std::atomic<bool>* stop)
+    : share_(share), stop_(stop) {}
+
+void Indexer::BeginPass() { folders_ = std::make_unique<fileindex::FolderMgr>(); }
+
+void Indexer::Apply(const OP& op) {
+  if (!folders_) BeginPass();
+  const auto node = op.node.lock();
+  ORVANE_THROW_IF(!node, kErrOPTreePath, "operation without a node");
+  const std::string path = node->GetPath();
+  switch (op.op) {
+    case fileindex::kOPNone:
+      break;
+    case fileindex::kOPDelete:
+      el::IndexDel(share_, path);
+      el::IndexDelDir(share_, path);
+      documents_deleted_ += 1;
+      break;
+    case fileindex::kOPUpsert:
+      Upsert(path);
+      break;
+    case fileindex::kOPAttr:
+      Attr(path);
+      break;
+    case fileindex::kOPUpdateDirectory: {
+      CrawlMode mode;
+      mode.all = false;
+      mode.kinds = op.data;
+      Crawl(path, mode, true);
+      break;
+    }
+    case fileindex::kOPRename:
+      Rename(path, op.path);
+      break;
+    case fileindex::kOPReindex:
+      Crawl(path, CrawlMode(), true);
+      break;
+    case fileindex::kOPCrash:
+      // Whatever the lost events said, the indexed folders themselves are the truth.
+      for (const auto& folder : folders_->folders()) {
+        if (folder->GetShare() != share_) continue;
+        Crawl(folder->GetFullPath(), CrawlMode(), true);
+        if (Stopping()) break;
+      }
+      break;
+  }
+}
+
+void Indexer::Upsert(const std::string& path) {
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0) return;  // gone again; its delete is queued
+  const auto cfg = folders_->GetMostSuitableCfg(path);
+  if (!cfg || !fileindex::CanFullPathBeIndexed(path)) return;
+  if (S_ISDIR(st.st_mode)) {
+    Crawl(path, CrawlMode(), false);
+    return;
+  }
+  if (!S_ISREG(st.st_mode)) return;
+  el::IndexUpsert(share_, path, NeedMeta(*cfg, path));
+  ++documents_written_;
+}
+
+void Indexer::Attr(const std::string& path) {
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0) return;
+  if (!folders_->GetMostSuitableCfg(path) || !fileindex::CanFullPathBeIndexed(path)) return;
+  try {
+    el::IndexAttr(share_, path);
+    ++documents_written_;
+  } catch (const Error& e) {
+    if (e.code != kErrNoDocument) throw;
+    Upsert(path);
+  }
+}
+
+void Indexer::Rename(const std::string& path, const std::string& old_path) {
+  // A move to a place no folder covers (or that the rules refuse) is a delete of the old name.
+  struct stat st;
+  const bool indexable = lstat(path.c_str(), &st) == 0 && folders_->GetMostSuitableCfg(path) &&
+                         fileindex::CanFullPathBeIndexed(path);
+  if (!indexable) {
+    el::IndexDel(share_, old_path);
+    el::IndexDelDir(share_, old_path);
+    return;
+  }
+  try {
+    el::IndexRename(share_, path, old_path);
+    ++documents_written_;
+  } catch (const Error& e) {
+    if (e.code != kErrNoDocument) throw;
+    // The documents below the old name may still exist even when its own does not.
+    el::IndexDelDir(share_, old_path);
+    Crawl(path, CrawlMode(), false);
+    return;
+  }
+  // Rules and settings may differ at the new place: settle the subtree there.
+  if (S_ISDIR(st.st_mode)) {
+    CrawlMode mode;
+    mode.all = false;
+    mode.kinds = Json::Value(Json::objectValue);
+    Crawl(path, mode, true);
+  } else if (!IsSubPath(path, Dirname(old_path)) ||
+             GetFileExtension(path, true) != GetFileExtension(old_path, true)) {
+    Upsert(path);
+  }
+}
+
+std::unordered_set<std::string> Indexer::ListDocuments(const std::string& share,
+                                                       const std::string& dir) {
+  std::unordered_set<std::string> paths;
+  Json::Value data(Json::objectValue);
+  data["id"] = el::GetFileIndexID(share);
+  data["query"]["load_field"].append(QUIX::CONTENT_EXTRACT::QUIXMDPath);
+  data["size"] = kListPageSize;
+  {
+    data["query"]["qsl"]["term"][QUIX::CONTENT_EXTRACT::QUIXMDPath] = dir;
+    data["from"] = 0;
+    Json::Value res;
+    el::SendRequest(res, Command("document_get_by_query", data));
+    if (res["data"].isArray() && !res["data"].empty()) paths.insert(dir);
+  }
+  data["query"]["qsl"] = Json::Value(Json::objectValue);
+  data["query"]["qsl"]["prefix"][QUIX::CONTENT_EXTRACT::QUIXMDPath] = dir + "/";
+  for (unsigned int from = 0;; from += kListPageSize) {
+    data["from"] = from;
+    Json::Value res;
+    el::SendRequest(res, Command("document_get_by_query", data));
+    const Json::Value& hits = res["data"];
+    ORVANE_THROW_IF(!hits.isArray(), kErrNoQueryData, JsonToString(res));
+    for (const auto& hit : hits) {
+      const Json::Value& p = hit[QUIX::CONTENT_EXTRACT::QUIXMDPath];
+      if (p.isString()) paths.insert(p.asString());
+    }
+    if (hits.size() < kListPageSize) break;
+  }
+  return paths;
+}
+
+void Indexer::Crawl(const std::string& root, const CrawlMode& mode, bool reconcile) {
+  std::unordered_set<std::string> stale;
+  if (reconcile) stale = ListDocuments(share_, root);
+  Batch batch(this);
+  struct stat st;
+  if (lstat(root.c_str(), &st) == 0) {
+    if (S_ISDIR(st.st_mode)) {
+      CrawlDir(root, st.st_dev, mode, batch, reconcile ? &stale : nullptr);
+    } else if (S_ISREG(st.st_mode)) {
+      const auto cfg = folders_->GetMostSuitableCfg(root);
+      if (cfg && fileindex::CanFullPathBeIndexed(root)) {
+        stale.erase(root);
+        batch.Upsert(root, NeedMeta(*cfg, root));
+      }
+    }
+  }
+  // A stopped crawl saw only part of the tree: what it did not reach is not stale.
+  if (reconcile && !Stopping()) {
+    for (const auto& path : stale) batch.Delete(path);
+  }
+  batch.Flush();
+}
+
+void Indexer::CrawlDir(const std::string& dir, dev_t dev, const CrawlMode& mode, Batch& batch,
+                       std::unordered_set<std::string>* stale) {
+  if (Stopping()) return;
+  // The rules are judged once here for every entry of the directory.
+  const auto cfg = folders_->GetMostSuitableCfg(dir);
+  const bool indexable = cfg && fileindex::CanFullPathBeIndexed(dir);
+  if (!indexable && !HasFolderBelow(dir)) return;
+
+  DIR* raw = opendir(dir.c_str());
+  if (raw == nullptr) {
+    Log(LOG_WARNING, "fileindexd: cannot read %s: %s", dir.c_str(), strerror(errno));
+    // Unreadable now is not gone: keep what the index holds below it.
+    if (stale != nullptr) {
+      for (auto it = stale->begin(); it != stale->end();) {
+        it = (*it == dir || IsSubPath(*it, dir)) ? stale->erase(it) : std::next(it);
+      }
+    }
+    return;
+  }
+  std::unique_ptr<DIR, int (*)(DIR*)> closer(raw, closedir);
+  if (indexable) {
+    const bool missing = stale != nullptr && stale->count(dir) == 0;
+    if (stale != nullptr) stale->erase(dir);
+    if (mode.all || missing) batch.Upsert(dir, false);
+  }
+  std::vector<std::string> subdirs;
+  while (struct dirent* entry = readdir(raw)) {
+    const std::string name = entry->d_name;
+    if (name == "." || name == "..") continue;
+    const std::string path = dir + "/" + name;
+    struct stat st;
+    if (lstat(path.c_str(), &st) != 0) continue;
+    if (S_ISDIR(st.st_mode)) {
+      // Other file systems mounted below are not ours to index.
+      if (st.st_dev == dev) subdirs.push_back(path);
+      continue;
+    }
+    if (!indexable || !S_ISREG(st.st_mode)) continue;
+    if (fileindex::IsSystemPreservedFileName(name)) continue;
+    bool missing = false;
+    if (stale != nullptr) missing = stale->erase(path) == 0;
+    if (mode.all || missing || KindSwitched(mode, path)) batch.Upsert(path, NeedMeta(*cfg, path));
+  }
+  closer.reset();
+  for (const auto& sub : subdirs) CrawlDir(sub, dev, mode, batch, stale);
+}
+
+bool Indexer::HasFolderBelow(const std::string& dir) const {
+  for (const auto& folder : folders_->folders()) {
+    const std::string full = folder->GetFullPath();
+    if (full != dir && IsSubPath(full, dir)) return true;
+  }
+  return false;
+}
+
+bool Indexer::NeedMeta(const fileindex::Folder& cfg, const std::string& path) const {
+  switch (fileindex::GetFileTypeByFullPath(path)) {
+    case fileindex::kDocument:
+      return cfg.IsDocument();
+    case fileindex::kAudio:
+      return cfg.IsAudio();
+    case fileindex::kVideo:
+      return cfg.IsVideo();
+    case fileindex::kPhoto:
+      return cfg.IsPhoto();
+    default:
+      return true;
+  }
+}
+
+bool Indexer::KindSwitched(const CrawlMode& mode, const std::string& path) const {
+  if (!mode.kinds.isObject()) return false;
+  static const char* const kKinds[] = {"document", "audio", "video", "photo"};
+  const int type = fileindex::GetFileTypeByFullPath(path);
+  if (type < 0 || type > 3) return false;
+  const Json::Value& on = mode.kinds[kKinds[type]];
+  return on.isBool() && on.asBool();
+}
+
+}  // namespace fileindexd
+}  // namespace orvane

@@ -1,0 +1,80 @@
+// Indexer turns the coalesced operations of one share's queue into document commands for the
+// search engine, and crawls directories when an operation stands for a whole subtree. It reads
+// the folder configuration once per pass (BeginPass) and judges the path rules once per
+// directory. One per worker; not thread-safe. A stop flag, when given, ends a crawl early.
+#ifndef ORVANE_DAEMONS_FILEINDEXD_INDEXER_HPP_
+#define ORVANE_DAEMONS_FILEINDEXD_INDEXER_HPP_
+
+#include <json/json.h>
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <unordered_set>
+#include <vector>
+
+#include "fileindex/folder_mgr.hpp"
+#include "fileindex/optree.hpp"
+
+namespace orvane {
+namespace fileindexd {
+
+// Upserts and deletes a crawl sends per compound request.
+constexpr size_t kCrawlBatchSize = 512;
+// Documents asked for per page when listing what the index holds below a directory.
+constexpr unsigned int kListPageSize = 10000;
+
+class Indexer {
+ public:
+  Indexer(const std::string& share, const std::atomic<bool>* stop);
+  Indexer(const Indexer&) = delete;
+  Indexer& operator=(const Indexer&) = delete;
+
+  // Re-reads the folder configuration; called before the operations of a pass.
+  void BeginPass();
+  // Sends the commands of one operation. Throws the Error of the failing command.
+  void Apply(const fileindex::OP& op);
+
+  // The document commands the indexer sent, for the status report.
+  uint64_t documents_written() const { return documents_written_; }
+  uint64_t documents_deleted() const { return documents_deleted_; }
+
+  // The paths of every document at or below `dir` in `share`'s index, paged.
+  static std::unordered_set<std::string> ListDocuments(const std::string& share,
+                                                       const std::string& dir);
+
+ private:
+  // What a crawl upserts: everything, or only files that have no document yet or whose kind of
+  // content was switched (`kinds`: the "document", "audio", "video", "photo" switches).
+  struct CrawlMode {
+    bool all = true;
+    Json::Value kinds;
+  };
+  class Batch;
+
+  void Upsert(const std::string& path);
+  void Attr(const std::string& path);
+  void Rename(const std::string& path, const std::string& old_path);
+  // Indexes what exists below `root` (and `root` itself); with `reconcile`, also deletes the
+  // documents at or below `root` that the walk did not meet.
+  void Crawl(const std::string& root, const CrawlMode& mode, bool reconcile);
+  void CrawlDir(const std::string& dir, dev_t dev, const CrawlMode& mode, Batch& batch,
+                std::unordered_set<std::string>* stale);
+  // Whether some configured folder lies strictly below `dir`.
+  bool HasFolderBelow(const std::string& dir) const;
+  bool NeedMeta(const fileindex::Folder& cfg, const std::string& path) const;
+  bool KindSwitched(const CrawlMode& mode, const std::string& path) const;
+  bool Stopping() const { return stop_ != nullptr && stop_->load(); }
+
+  std::string share_;
+  const std::atomic<bool>* stop_;
+  std::unique_ptr<fileindex::FolderMgr> folders_;
+  uint64_t documents_written_ = 0;
+  uint64_t documents_deleted_ = 0;
+};
+
+}  // namespace fileindexd
+}  // namespace orvane
+
+#endif  // ORVANE_DAEMONS_FILEINDEXD_INDEXER_HPP_

@@ -1,0 +1,177 @@
+#include "daemons/fileindexd/test_system.hpp"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <thread>
+
+#include "common/comm.hpp"
+#include "common/json_util.hpp"
+#include "common/root.hpp"
+#include "common/util.hpp"
+#include "daemons/fileindexd/index_daemon.hpp"
+#include "daemons/fileindexd/indexer.hpp"
+
+namespace orvane {
+namespace fileindexd {
+namespace test {
+
+ChildProcess::ChildProcess(const std::string& root, std::vector<std::string> argv) {
+  pid_ = fork();
+  if (pid_ == 0) {
+    setenv("ORVANE_ROOT", root.c_str(), 1);
+    std::vector<char*> args;
+    for (std::string& a : argv) args.push_back(&a[0]);
+    args.push_back(nullptr);
+    // Their logs go to syslog; on the test's output they would drown the failures, unless asked
+    // for while a test is being debugged.
+    if (getenv("FILEINDEXD_TEST_STDERR") == nullptr) {
+      const int null = open("/dev/null", O_WRONLY);
+      if (null >= 0) dup2(null, 2);
+    }
+    execv(args[0], args.data());
+    _exit(127);
+  }
+}
+
+
+ChildProcess::~ChildProcess() { Signal(SIGKILL); }
+
+int ChildProcess::Signal(int sig) {
+  if (pid_ <= 0) return -1;
+  kill(pid_, sig);
+  int status = 0;
+  waitpid(pid_, &status, 0);
+  pid_ = -1;
+  return status;
+}
+
+bool ChildProcess::Exited(int timeout_ms) {
+  if (pid_ <= 0) return true;
+  int status = 0;
+  const bool gone = WaitFor([&] { return waitpid(pid_, &status, WNOHANG) == pid_; }, timeout_ms);
+  if (gone) pid_ = -1;
+  return gone;
+}
+
+bool WaitFor(const std::function<bool()>& pred, int timeout_ms) {
+  const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeout_ms);
+  while (std::chrono::steady_clock::now() < end) {
+    if (pred()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  return pred();
+}
+
+System::System(const std::vector<std::string>& shares) : scoped_root_(root_.path()) {
+  std::string list;
+  for (const auto& share : shares) {
+    MakeParentDirs(Vol(share + "/x"));
+    if (!list.empty()) list += ",";
+    list += R"({"name": ")" + share + R"(", "path": ")" + Vol(share) + R"(", "recycle_bin": true})";
+  }
+  orvane::test::WritePlatformConfig(root(), R"({"shares": [)" + list + "]}");
+}
+
+std::string System::Queue(const std::string& share) const {
+  return Vol(share + "/@eaDir/@fileindex/queue");
+}
+
+void System::WriteFolders(const Json::Value& folders) const {
+  JsonValue value(folders);
+  MakeParentDirs(RootedPath("/var/packages/Orvane/etc/fileindex.folders"));
+  value.toFile(RootedPath("/var/packages/Orvane/etc/fileindex.folders"));
+}
+
+Json::Value System::Folder(const std::string& share_path, bool meta) {
+  Json::Value f(Json::objectValue);
+  f["path"] = share_path;
+  f["name"] = Basename(share_path);
+  for (const char* kind : {"document", "audio", "video", "photo"}) f[kind] = meta;
+  return f;
+}
+
+std::unique_ptr<ChildProcess> System::StartEngine() const {
+  auto p = std::make_unique<ChildProcess>(
+      root(), std::vector<std::string>{QUIXELASTICD_BIN, "--foreground"});
+  WaitFor(
+      [] {
+        try {
+          Engine("index_list", Json::Value(Json::objectValue));
+          return true;
+        } catch (const std::exception&) {
+          return false;
+        }
+      },
+      20000);
+  return p;
+}
+
+std::unique_ptr<ChildProcess> System::StartNotifyd() const {
+  return std::make_unique<ChildProcess>(root(), std::vector<std::string>{QUIXNOTIFYD_BIN});
+}
+
+std::unique_ptr<ChildProcess> System::StartIndexd() const {
+  auto p = std::make_unique<ChildProcess>(root(), std::vector<std::string>{FILEINDEXD_BIN});
+  WaitFor([] { return Command("status", Json::Value()).isObject(); }, 20000);
+  return p;
+}
+
+std::set<std::string> System::Documents(const std::string& share) const {
+  const auto docs = Indexer::ListDocuments(share, Vol(share));
+  return std::set<std::string>(docs.begin(), docs.end());
+}
+
+Json::Value System::Engine(const std::string& command, const Json::Value& data) {
+  Json::Value req(Json::objectValue);
+  req["command"] = command;
+  req["data"] = data;
+  Json::Value res;
+  SendRequestImpl(res, req);
+  return res;
+}
+
+std::string RawCommand(const std::string& bytes) {
+  const std::string path = RootedPath(kFileIndexdSockPath);
+  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) return "";
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
+  std::string reply;
+  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) == 0 &&
+      send(fd, bytes.data(), bytes.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size())) {
+    uint32_t len = 0;
+    if (recv(fd, &len, sizeof(len), MSG_WAITALL) == sizeof(len) && len < (1u << 24)) {
+      reply.resize(len);
+      if (recv(fd, &reply[0], len, MSG_WAITALL) != static_cast<ssize_t>(len)) reply.clear();
+    }
+  }
+  close(fd);
+  return reply;
+}
+
+Json::Value Command(const std::string& type, const Json::Value& data) {
+  Json::Value cmd(Json::objectValue);
+  cmd["type"] = type;
+  cmd["data"] = data;
+  std::string text = JsonToString(cmd);
+  text.push_back('\0');
+  const uint32_t len = static_cast<uint32_t>(text.size());
+  std::string frame(reinterpret_cast<const char*>(&len), sizeof(len));
+  std::string reply = RawCommand(frame + text);
+  while (!reply.empty() && reply.back() == '\0') reply.pop_back();
+  JsonValue value;
+  if (reply.empty() || !value.fromString(reply)) return Json::Value();
+  return std::move(value);
+}
+
+}  // namespace test
+}  // namespace fileindexd
+}  // namespace orvane

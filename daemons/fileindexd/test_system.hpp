@@ -1,0 +1,84 @@
+// Test-only: a scratch system for the indexing daemon's tests: its own ORVANE_ROOT, a volume
+// folder with shares, the platform and folder files, and the daemons as real child processes.
+// Not thread-safe.
+#ifndef ORVANE_DAEMONS_FILEINDEXD_TEST_SYSTEM_HPP_
+#define ORVANE_DAEMONS_FILEINDEXD_TEST_SYSTEM_HPP_
+
+#include <sys/types.h>
+#include <json/json.h>
+
+#include <functional>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace fileindexd {
+namespace test {
+
+// A program run in a child process under `root` as ORVANE_ROOT; killed (SIGKILL) at scope end
+// unless stopped before.
+class ChildProcess {
+ public:
+  ChildProcess(const std::string& root, std::vector<std::string> argv);
+  ~ChildProcess();
+  ChildProcess(const ChildProcess&) = delete;
+  ChildProcess& operator=(const ChildProcess&) = delete;
+  // Sends `sig` and waits for the exit; returns the wait status (-1 when not running).
+  int Signal(int sig);
+  // Waits up to `timeout_ms` for the process to end by itself; true when it did (it is reaped).
+  bool Exited(int timeout_ms);
+  pid_t pid() const { return pid_; }
+
+ private:
+  pid_t pid_ = -1;
+};
+
+// Polls `pred` every 20 ms until it holds or `timeout_ms` passes; returns its last answer.
+bool WaitFor(const std::function<bool()>& pred, int timeout_ms);
+
+class System {
+ public:
+  // Makes the volume with the folders of `shares` and writes the platform file.
+  explicit System(const std::vector<std::string>& shares);
+  System(const System&) = delete;
+  System& operator=(const System&) = delete;
+
+  const std::string& root() const { return root_.path(); }
+  // <volume>/<rel>.
+  std::string Vol(const std::string& rel) const { return volume_.Path(rel); }
+  std::string Queue(const std::string& share) const;
+  // Replaces the folder file with these folders ({"path", "name", "document", ...} each).
+  void WriteFolders(const Json::Value& folders) const;
+  static Json::Value Folder(const std::string& share_path, bool meta);
+
+  // The search engine (waits until it answers) and the two other daemons.
+  std::unique_ptr<ChildProcess> StartEngine() const;
+  std::unique_ptr<ChildProcess> StartNotifyd() const;
+  // Waits until the daemon's socket answers "status".
+  std::unique_ptr<ChildProcess> StartIndexd() const;
+
+  // The paths of every document of `share`'s index below its path (the share folder included).
+  std::set<std::string> Documents(const std::string& share) const;
+  // One request to the engine, its reply.
+  static Json::Value Engine(const std::string& command, const Json::Value& data);
+
+ private:
+  orvane::test::TempDir root_;
+  orvane::test::TempDir volume_;
+  orvane::test::ScopedRoot scoped_root_;
+};
+
+// {"type": type, "data": data} to the daemon's socket, as the calling process; the reply, null
+// when the daemon closed the connection without one.
+Json::Value Command(const std::string& type, const Json::Value& data);
+// Raw bytes to the daemon's socket; the raw reply payload.
+std::string RawCommand(const std::string& bytes);
+
+}  // namespace test
+}  // namespace fileindexd
+}  // namespace orvane
+
+#endif  // ORVANE_DAEMONS_FILEINDEXD_TEST_SYSTEM_HPP_

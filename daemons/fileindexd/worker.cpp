@@ -1,0 +1,255 @@
+#include "daemons/fileindexd/worker.hpp"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <sys/inotify.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <fstream>
+#include <memory>
+#include <sstream>
+
+#include "common/env.hpp"
+#include "common/error.hpp"
+#include "common/log.hpp"
+#include "common/root.hpp"
+#include "common/util.hpp"
+#include "daemons/fileindexd/indexer.hpp"
+#include "fileindex/elastic_control.hpp"
+#include "fileindex/notify.hpp"
+#include "fileindex/queue_mgr.hpp"
+
+namespace orvane {
+namespace fileindexd {
+
+namespace {
+
+// Thrown from the operation callback to end a pass without dropping its batch.
+struct PassAborted {
+  bool retry;  // false: the worker is stopping
+  std::string why;
+};
+
+// Failures that are about the engine or the volume, not about one file: skipping the operation
+// would lose it, so the whole batch waits instead.
+bool IsPassFailure(const Error& e) {
+  return e.code == kErrElastic || e.code == kErrSpaceNotEnough;
+}
+
+uint64_t CountLines(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  if (!in) return 0;
+  return static_cast<uint64_t>(std::count(std::istreambuf_iterator<char>(in),
+                                          std::istreambuf_iterator<char>(), '\n'));
+}
+
+}  // namespace
+
+Worker::Worker(const std::string& share, const std::string& queue_path, PauseGate gate)
+    : share_(share), queue_path_(queue_path), gate_(std::move(gate)) {}
+
+Worker::~Worker() { Stop(); }
+
+void Worker::Start() {
+  int fds[2];
+  ORVANE_THROW_IF(pipe2(fds, O_CLOEXEC | O_NONBLOCK) != 0, kErrSystem, "pipe2 failed");
+  wake_read_.Reset(fds[0]);
+  wake_write_.Reset(fds[1]);
+  inotify_.Reset(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
+  ORVANE_THROW_IF(!inotify_.valid(), kErrSystem, "inotify_init1 failed");
+  // The queue's folder is watched rather than the file: the file is renamed away on every pass
+  // and created again by the next append.
+  MakeParentDirs(queue_path_);
+  if (inotify_add_watch(inotify_.get(), Dirname(queue_path_).c_str(),
+                        IN_MODIFY | IN_CLOSE_WRITE | IN_CREATE | IN_MOVED_TO) < 0) {
+    Log(LOG_WARNING, "fileindexd: cannot watch the queue folder of %s: %m; polling it",
+        share_.c_str());
+  }
+  stop_.store(false);
+  thread_ = std::thread([this] { Run(); });
+}
+
+void Worker::Stop() {
+  stop_.store(true);
+  Wake();
+  if (thread_.joinable()) thread_.join();
+}
+
+void Worker::Wake() {
+  if (!wake_write_.valid()) return;
+  const char byte = 1;
+  // A full pipe already holds a wake-up.
+  (void)!write(wake_write_.get(), &byte, 1);
+}
+
+Json::Value Worker::Report() const {
+  Json::Value r(Json::objectValue);
+  r["share"] = share_;
+  r["queue_length"] = Json::UInt64(CountLines(queue_path_) + CountLines(queue_path_ + ".tmp"));
+  std::lock_guard<std::mutex> lock(mu_);
+  r["ops_pending"] = Json::UInt64(ops_pending_);
+  r["ops_done"] = Json::UInt64(ops_done_);
+  r["documents_written"] = Json::UInt64(documents_written_);
+  r["documents_deleted"] = Json::UInt64(documents_deleted_);
+  r["last_pass"] = Json::Int64(last_pass_);
+  r["errors"] = Json::UInt64(errors_);
+  r["last_error"] = last_error_;
+  r["paused"] = gate_.paused ? gate_.paused() : false;
+  r["out_of_space"] = out_of_space_;
+  return r;
+}
+
+void Worker::Run() {
+  int64_t backoff = kPassRetryMicros;
+  while (!stop_.load()) {
+    if (gate_.paused && gate_.paused()) {
+      int wait = kIdleWaitMillis;
+      const time_t until = gate_.resume_at ? gate_.resume_at() : 0;
+      if (until > 0) {
+        const int64_t left = (static_cast<int64_t>(until) - Env::Current()->Now()) * 1000 + 50;
+        wait = static_cast<int>(std::clamp<int64_t>(left, 10, kIdleWaitMillis));
+      }
+      Wait(wait);
+      continue;
+    }
+    // Events that arrive from here on wake the next wait, so none is missed between the drain
+    // and the pass.
+    Wait(0);
+    bool done = false;
+    try {
+      done = RunPass();
+    } catch (const Error& e) {
+      RecordError(e.what());
+    } catch (const std::exception& e) {
+      RecordError(e.what());
+    }
+    if (stop_.load()) break;
+    if (done) {
+      backoff = kPassRetryMicros;
+      // A pass that finished a batch left behind did not take the live queue yet.
+      if (!IsFileExist(queue_path_)) Wait(kIdleWaitMillis);
+    } else {
+      Backoff(backoff);
+      backoff = std::min(backoff * 2, kPassRetryMaxMicros);
+    }
+  }
+}
+
+bool Worker::RunPass() {
+  if (!IsFileExist(queue_path_) && !IsFileExist(queue_path_ + ".tmp")) return true;
+  Indexer indexer(share_, &stop_);
+  indexer.BeginPass();
+  fileindex::QueueMgr mgr(queue_path_);
+  mgr.PrepareTmpQueue();
+  if (!IsFileExist(queue_path_ + ".tmp")) return true;
+  {
+    const auto tree = mgr.GetOPTreeTmp();
+    std::lock_guard<std::mutex> lock(mu_);
+    ops_pending_ = tree->crashed ? 1 : tree->ops.size();
+  }
+  const uint64_t written_before = indexer.documents_written();
+  const uint64_t deleted_before = indexer.documents_deleted();
+  auto account = [&] {
+    std::lock_guard<std::mutex> lock(mu_);
+    documents_written_ += indexer.documents_written() - written_before;
+    documents_deleted_ += indexer.documents_deleted() - deleted_before;
+  };
+  size_t handed = 0;
+  try {
+    handed = mgr.ProcessOP(
+        [&](std::shared_ptr<fileindex::OP> op) {
+          int64_t delay = kOpRetryMicros;
+          for (int attempt = 1;; ++attempt) {
+            if (stop_.load()) throw PassAborted{false, ""};
+            try {
+              indexer.Apply(*op);
+              break;
+            } catch (const Error& e) {
+              if (IsPassFailure(e)) throw PassAborted{true, e.what()};
+              std::ostringstream what;
+              what << op;
+              if (attempt >= kOpAttempts) {
+                RecordError("skipped " + what.str() + ": " + e.what());
+                break;
+              }
+              Log(LOG_WARNING, "fileindexd: %s failed (attempt %d of %d): %s", what.str().c_str(),
+                  attempt, kOpAttempts, e.what());
+              Backoff(delay);
+              delay *= 2;
+            }
+          }
+          // A crawl stopped half-way is not done: the batch is kept for the next start.
+          if (stop_.load()) throw PassAborted{false, ""};
+          std::lock_guard<std::mutex> lock(mu_);
+          ++ops_done_;
+          if (ops_pending_ > 0) --ops_pending_;
+        },
+        true);
+  } catch (const PassAborted& aborted) {
+    account();
+    if (aborted.retry) RecordError("batch kept for a later pass: " + aborted.why);
+    return !aborted.retry;
+  }
+  account();
+  if (handed > 0) {
+    try {
+      fileindex::elastic::IndexCommit(share_);
+    } catch (const Error& e) {
+      if (e.code == kErrSpaceNotEnough) {
+        bool first = false;
+        {
+          std::lock_guard<std::mutex> lock(mu_);
+          first = !out_of_space_;
+          out_of_space_ = true;
+        }
+        // One notification per spell of full disk, not one per retried pass.
+        if (first) fileindex::SendZRMNotify();
+      }
+      RecordError(std::string("commit: ") + e.what());
+      return false;
+    }
+  }
+  mgr.DeleteTmp();
+  std::lock_guard<std::mutex> lock(mu_);
+  out_of_space_ = false;
+  ops_pending_ = 0;
+  last_pass_ = Env::Current()->Now();
+  return true;
+}
+
+void Worker::Wait(int timeout_ms) {
+  struct pollfd fds[2] = {{wake_read_.get(), POLLIN, 0}, {inotify_.get(), POLLIN, 0}};
+  if (poll(fds, 2, timeout_ms) < 0 && errno != EINTR) {
+    Log(LOG_ERR, "fileindexd: poll failed: %m");
+  }
+  // Drain both: one pass answers every event so far.
+  char buf[4096];
+  while (read(wake_read_.get(), buf, sizeof(buf)) > 0) {
+  }
+  while (read(inotify_.get(), buf, sizeof(buf)) > 0) {
+  }
+}
+
+void Worker::Backoff(int64_t micros) {
+  // In slices, so that a stop does not wait out a long back-off.
+  constexpr int64_t kSlice = 200000;
+  while (micros > 0 && !stop_.load()) {
+    const int64_t step = std::min(micros, kSlice);
+    Env::Current()->SleepMicros(step);
+    micros -= step;
+  }
+}
+
+void Worker::RecordError(const std::string& text) {
+  Log(LOG_ERR, "fileindexd: share %s: %s", share_.c_str(), text.c_str());
+  std::lock_guard<std::mutex> lock(mu_);
+  ++errors_;
+  last_error_ = text;
+}
+
+}  // namespace fileindexd
+}  // namespace orvane

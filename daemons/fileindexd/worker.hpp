@@ -1,0 +1,93 @@
+// Worker drains one share's queue into the search engine on its own thread: a pass takes the
+// queued batch (or the batch a crash left behind), applies its operations through an Indexer,
+// commits and only then drops the batch, so a batch is never lost half-done. Between passes it
+// sleeps on inotify of the queue's folder and a wake pipe. Start/Stop/Wake/Report may be called
+// from any thread.
+#ifndef ORVANE_DAEMONS_FILEINDEXD_WORKER_HPP_
+#define ORVANE_DAEMONS_FILEINDEXD_WORKER_HPP_
+
+#include <json/json.h>
+
+#include <atomic>
+#include <cstdint>
+#include <ctime>
+#include <functional>
+#include <mutex>
+#include <string>
+#include <thread>
+
+#include "common/fd.hpp"
+
+namespace orvane {
+namespace fileindexd {
+
+// How often a failing operation is tried before it is recorded and skipped, and the first
+// back-off (doubled after every failure).
+constexpr int kOpAttempts = 4;
+constexpr int64_t kOpRetryMicros = 1000000;
+// Back-off of a pass the engine could not take (unreachable, volume full): doubled up to the cap.
+constexpr int64_t kPassRetryMicros = 2000000;
+constexpr int64_t kPassRetryMaxMicros = 60000000;
+// The longest sleep between passes when nothing wakes the worker.
+constexpr int kIdleWaitMillis = 30000;
+
+class Worker {
+ public:
+  // `paused` answers, at the time asked, whether indexing is globally paused; `resume_at` when
+  // a timed pause ends (0: no end known).
+  struct PauseGate {
+    std::function<bool()> paused;
+    std::function<time_t()> resume_at;
+  };
+
+  Worker(const std::string& share, const std::string& queue_path, PauseGate gate);
+  ~Worker();
+  Worker(const Worker&) = delete;
+  Worker& operator=(const Worker&) = delete;
+
+  // Starts the thread. Throws Error 502 when the wake pipe or inotify cannot be set up.
+  void Start();
+  // Ends the current operation early and joins the thread; a batch not finished stays queued.
+  void Stop();
+  // Makes the worker look at its queue (and the pause) now.
+  void Wake();
+  // {"share", "queue_length", "ops_pending", "ops_done", "documents_written",
+  //  "documents_deleted", "last_pass", "errors", "last_error", "paused", "out_of_space"}.
+  Json::Value Report() const;
+  const std::string& share() const { return share_; }
+
+  // One pass on the caller's thread (the worker's loop calls it too); false when the engine or
+  // the volume could not take the batch and it must be tried again later. Throws the queue's
+  // and the folder file's Errors.
+  bool RunPass();
+
+ private:
+  void Run();
+  void Wait(int timeout_ms);
+  void Backoff(int64_t micros);
+  void RecordError(const std::string& text);
+
+  const std::string share_;
+  const std::string queue_path_;
+  PauseGate gate_;
+  UniqueFd wake_read_;
+  UniqueFd wake_write_;
+  UniqueFd inotify_;
+  std::atomic<bool> stop_{false};
+  std::thread thread_;
+
+  mutable std::mutex mu_;  // guards the figures below
+  uint64_t ops_pending_ = 0;
+  uint64_t ops_done_ = 0;
+  uint64_t documents_written_ = 0;
+  uint64_t documents_deleted_ = 0;
+  uint64_t errors_ = 0;
+  std::string last_error_;
+  time_t last_pass_ = 0;
+  bool out_of_space_ = false;
+};
+
+}  // namespace fileindexd
+}  // namespace orvane
+
+#endif  // ORVANE_DAEMONS_FILEINDEXD_WORKER_HPP_
