@@ -70,7 +70,7 @@ if ! ctl folder get "/$share" >/dev/null 2>&1; then
 fi
 ctl status --wait --timeout 900
 
-sub=$(find "$folder" -mindepth 1 -maxdepth 1 -type d | sort | head -n 1)
+sub=$(find "$folder" -mindepth 1 -maxdepth 1 -type d | sort | sed -n 1p)
 echo
 echo "== file names containing \"read\""
 ctl search --name read --size 5

@@ -328,6 +328,7 @@ std::string PlainSnippet(std::string text) {
     for (size_t pos; (pos = text.find(tag)) != std::string::npos;)
       text.replace(pos, strlen(tag), "*");
   }
+  std::replace(text.begin(), text.end(), '\n', ' ');
   return text;
 }
 
