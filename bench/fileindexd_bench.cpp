@@ -14,6 +14,8 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
+#include <iterator>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -51,6 +53,22 @@ long PeakKb(pid_t pid) {
     if (line.rfind("VmHWM:", 0) == 0) return std::strtol(line.c_str() + 6, nullptr, 10);
   }
   return -1;
+}
+
+// User plus system CPU seconds the process has used so far.
+double CpuSeconds(pid_t pid) {
+  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  const size_t close = text.rfind(')');
+  if (close == std::string::npos) return -1;
+  std::istringstream rest(text.substr(close + 2));
+  std::string field;
+  unsigned long long utime = 0, stime = 0;
+  for (int i = 3; i <= 15 && rest >> field; ++i) {
+    if (i == 14) utime = std::stoull(field);
+    if (i == 15) stime = std::stoull(field);
+  }
+  return double(utime + stime) / sysconf(_SC_CLK_TCK);
 }
 
 bool Searchable(const std::string& name) {
@@ -93,6 +111,8 @@ int main(int argc, char** argv) {
   const double first = Seconds(t0, Clock::now());
   std::printf("first indexing: %d files (+%d folders) in %.2f s = %.0f files/s\n", files, dirs,
               first, files / first);
+  std::printf("  CPU seconds so far: quixelasticd %.2f, quixnotifyd %.2f, fileindexd %.2f\n",
+              CpuSeconds(engine->pid()), CpuSeconds(notifyd->pid()), CpuSeconds(indexd->pid()));
 
   // 2. Close-write to searchable.
   std::vector<double> delays;
