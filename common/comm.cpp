@@ -54,8 +54,8 @@ void SendRequestImpl(Json::Value& res_out, const Json::Value& req) {
   // connect below fails and says so.
   for (int failures = 1; access(sock_path.c_str(), F_OK) != 0; ++failures) {
     if (failures > kSocketWaitRetries) break;
-    Log(LOG_ERR, "%s:%d elastic socket is not ready, retry ... %d", SourceName(__FILE__),
-        __LINE__, failures);
+    Log(LOG_ERR, "%s:%d elastic socket is not ready, retry ... %d", SourceName(__FILE__), __LINE__,
+        failures);
     env->SleepMicros(kSecond);
   }
   errno = saved_errno;

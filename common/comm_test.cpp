@@ -16,17 +16,16 @@
 namespace orvane {
 namespace {
 
+using test::FakeDaemon;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
-using test::FakeDaemon;
 
 // A scratch ORVANE_ROOT with a fake clock, a log capture and a recording notifier program.
 class CommTest : public ::testing::Test {
  protected:
   CommTest() : root_(dir_.path()) {
-    const std::string notifier =
-        dir_.Write("usr/quix/bin/quixzrmnotify",
-                   "#!/bin/sh\necho \"$*\" >> \"$(dirname \"$0\")/notified\"\n");
+    const std::string notifier = dir_.Write(
+        "usr/quix/bin/quixzrmnotify", "#!/bin/sh\necho \"$*\" >> \"$(dirname \"$0\")/notified\"\n");
     chmod(notifier.c_str(), 0755);
   }
 
@@ -76,8 +75,9 @@ TEST_F(CommTest, MissingSocketIsWaitedForThirtyOneSecondsThenConnectFails) {
     EXPECT_THAT(lines[i], ::testing::EndsWith("elastic socket is not ready, retry ... " +
                                               std::to_string(i + 1)));
   }
-  EXPECT_THAT(lines[31], HasSubstr("(SendRequestImpl) Failed [!conn.Connect(kElasticdConnectTimeout)], "
-                                   "reason: Orvane error, code=913, reason=[Connect failed]"));
+  EXPECT_THAT(lines[31],
+              HasSubstr("(SendRequestImpl) Failed [!conn.Connect(kElasticdConnectTimeout)], "
+                        "reason: Orvane error, code=913, reason=[Connect failed]"));
 }
 
 TEST_F(CommTest, SuccessfulExchangeReturnsTheWholeReplyAndKeepsEveryByteOfTheRequest) {
@@ -109,7 +109,8 @@ TEST_F(CommTest, BrokenRepliesAreError913WithTheParsedText) {
       {"\"success\"", "\"success\""},
       {"{}", "{}"},
       {R"({"success":"yes"})", R"({"success":"yes"})"},
-      {R"({"success":1,"error":{"code":5,"msg":"m"}})", R"({"error":{"code":5,"msg":"m"},"success":1})"},
+      {R"({"success":1,"error":{"code":5,"msg":"m"}})",
+       R"({"error":{"code":5,"msg":"m"},"success":1})"},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.reply);
@@ -129,8 +130,12 @@ TEST_F(CommTest, BrokenRepliesAreError913WithTheParsedText) {
 TEST_F(CommTest, DaemonThatClosesOrCutsTheFrameIsError913) {
   const std::vector<FakeDaemon::Handler> handlers = {
       [](int, const std::string&) {},
-      [](int fd, const std::string&) { FakeDaemon::WriteAll(fd, std::string("\x40\x00\x00\x00{\"su", 8)); },
-      [](int fd, const std::string&) { FakeDaemon::WriteAll(fd, std::string("\xff\xff\xff\xff{}", 6)); },
+      [](int fd, const std::string&) {
+        FakeDaemon::WriteAll(fd, std::string("\x40\x00\x00\x00{\"su", 8));
+      },
+      [](int fd, const std::string&) {
+        FakeDaemon::WriteAll(fd, std::string("\xff\xff\xff\xff{}", 6));
+      },
   };
   for (const FakeDaemon::Handler& handler : handlers) {
     FakeDaemon engine(SockPath(), handler);
@@ -138,7 +143,8 @@ TEST_F(CommTest, DaemonThatClosesOrCutsTheFrameIsError913) {
     EXPECT_STREQ(e.what(), "Orvane error, code=913, reason=[Recv failed, res=null]");
   }
   // A daemon that is gone by the time the request is written.
-  FakeDaemon engine(SockPath(), [](int, const std::string&) {}, /*read_request=*/false);
+  FakeDaemon engine(
+      SockPath(), [](int, const std::string&) {}, /*read_request=*/false);
   Json::Value big = Req("document_upsert_by_id");
   big["data"]["data"]["QUIXMDTextContent"] = std::string(8 << 20, 't');
   const Error e = ImplError(big);
@@ -159,6 +165,27 @@ TEST_F(CommTest, FailureReplyCarriesTheDaemonsCodeAndMessageWithoutALogLine) {
   EXPECT_THAT(e.what(), HasSubstr("Missing property: msg, data={\"code\":609}"));
 }
 
+// Replies whose parts have unexpected types end in an Error or are passed over, never in a
+// crash or a JSON library exception.
+TEST_F(CommTest, OddlyTypedRepliesAreHandled) {
+  Json::Value compound_req;
+  compound_req["compound"].append(Req("sub"));
+  FakeDaemon engine(
+      SockPath(),
+      FakeDaemon::Replies(
+          {R"({"success":false,"error":"x"})",
+           R"({"success":false,"error":{"code":"1400","msg":"m"}})",
+           R"({"success":true,"has_fail":true,"data":{"a":1}})",
+           R"({"success":true,"has_fail":"yes","data":[{"success":false}]})",
+           R"({"success":true,"has_fail":true,"data":[1,{"success":"no"}]})",
+           R"({"success":true,"has_fail":true,"data":[{"success":false,"error":{}}]})"}));
+  EXPECT_THAT(ImplError(Req("commit")).what(), HasSubstr("Not an object, data=\"x\""));
+  EXPECT_THAT(ImplError(Req("commit")).what(), HasSubstr("Not a string"));
+  Json::Value res;
+  for (int i = 0; i < 3; ++i) SendRequestImpl(res, compound_req);
+  EXPECT_THAT(ImplError(compound_req).what(), HasSubstr("Missing property: code"));
+}
+
 TEST_F(CommTest, CompoundFailuresAreLoggedUnlessTheDaemonWasBusy) {
   Json::Value req;
   for (int i = 0; i < 3; ++i) req["compound"].append(Req("sub" + std::to_string(i)));
@@ -176,11 +203,10 @@ TEST_F(CommTest, CompoundFailuresAreLoggedUnlessTheDaemonWasBusy) {
   SendRequestImpl(res, req);
   EXPECT_EQ(res["data"].size(), 3u);
   ASSERT_EQ(log_.Lines().size(), 2u);
-  EXPECT_THAT(log_.Lines()[0],
-              ::testing::EndsWith("(SendRequestImpl) Compound failed: " +
-                                  JsonToString(req["compound"][0]) + " (5) m0"));
-  EXPECT_THAT(log_.Lines()[1], HasSubstr("Compound failed: " + JsonToString(req["compound"][2]) +
-                                         " (7) m2"));
+  EXPECT_THAT(log_.Lines()[0], ::testing::EndsWith("(SendRequestImpl) Compound failed: " +
+                                                   JsonToString(req["compound"][0]) + " (5) m0"));
+  EXPECT_THAT(log_.Lines()[1],
+              HasSubstr("Compound failed: " + JsonToString(req["compound"][2]) + " (7) m2"));
 
   log_.Clear();
   const Error e = ImplError(req);  // entry 0 logged, entry 1 stops the walk
@@ -241,9 +267,8 @@ TEST_F(CommTest, BusyIsRetriedForFifteenToNineteenMinutesAndNotifiesOncePerCall)
                               "] since quixelasticd is busy. Command: document_upsert_by_id, "
                               "db: fileindex_photo"));
   }
-  EXPECT_THAT(Notified(),
-              ElementsAre("-c QUIX.Orvane.Application @administrators app:displayname "
-                          "error:lack_of_memory"));
+  EXPECT_THAT(Notified(), ElementsAre("-c QUIX.Orvane.Application @administrators app:displayname "
+                                      "error:lack_of_memory"));
 
   // A new call counts from 0 again and notifies on its own eleventh busy answer.
   fileindex::elastic::SendRequest(Req("document_upsert_by_id"));

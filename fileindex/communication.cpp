@@ -131,8 +131,8 @@ void SendCommandToDaemon(const std::string& cmd, const Json::Value& data) {
                   Reason("setsockopt failed, reason="));
   // Without a receive time-out a daemon that never answers would hold the caller for ever.
   struct timeval rtv = {kDaemonReplyTimeoutSec, 0};
-  ORVANE_THROW_IF(0 > setsockopt(fd_socket, SOL_SOCKET, SO_RCVTIMEO, &rtv, sizeof(rtv)),
-                  kErrSystem, Reason("setsockopt failed, reason="));
+  ORVANE_THROW_IF(0 > setsockopt(fd_socket, SOL_SOCKET, SO_RCVTIMEO, &rtv, sizeof(rtv)), kErrSystem,
+                  Reason("setsockopt failed, reason="));
 
   Json::Value message(Json::objectValue);
   message["type"] = cmd;

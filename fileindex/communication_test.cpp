@@ -24,8 +24,8 @@ namespace orvane {
 namespace fileindex {
 namespace {
 
-using ::testing::ElementsAre;
 using test::FakeDaemon;
+using ::testing::ElementsAre;
 
 class CommandChannelTest : public ::testing::Test {
  protected:
@@ -185,7 +185,8 @@ TEST(BufferTransferTest, TenInterruptionsPerTransferAreToleratedNotEleven) {
     BufferWrite(a.get(), out.size(), out.data());
     ADD_FAILURE() << "the eleventh interruption was retried";
   } catch (const Error& e) {
-    EXPECT_STREQ(e.what(), "Orvane error, code=502, reason=[write failed, reason=Interrupted system call]");
+    EXPECT_STREQ(e.what(),
+                 "Orvane error, code=502, reason=[write failed, reason=Interrupted system call]");
   }
   std::vector<unsigned char> drain(10 * 1024);  // what went out before the failure
   BufferRead(b.get(), drain.size(), drain.data());
@@ -214,7 +215,8 @@ TEST(BufferTransferTest, ReadFromAClosedPeerEndsAfterAFewTries) {
     BufferRead(b.get(), sizeof(buf), buf);
     ADD_FAILURE() << "no Error";
   } catch (const Error& e) {
-    EXPECT_STREQ(e.what(), "Orvane error, code=502, reason=[read failed, reason=Connection reset by peer]");
+    EXPECT_STREQ(e.what(),
+                 "Orvane error, code=502, reason=[read failed, reason=Connection reset by peer]");
   }
   EXPECT_EQ(reads, 12);  // the two bytes, the first end of stream and ten more tries
   EXPECT_EQ(std::string(buf, buf + 2), "ab");

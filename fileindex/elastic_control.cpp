@@ -122,6 +122,11 @@ void SendQuery(Json::Value& res, const Json::Value& req, const char* func) {
   }
 }
 
+ParseFileFn& ParseFileOverride() {
+  static ParseFileFn parse_file;
+  return parse_file;
+}
+
 // The document of `path` as extraction gives it, with the two fields the engine searches names
 // and folders by.
 Json::Value ParseDocument(const std::string& path, bool need_meta, const char* func) {
@@ -129,7 +134,12 @@ Json::Value ParseDocument(const std::string& path, bool need_meta, const char* f
   config[ce::kKeyNeedMeta] = need_meta;
   Json::Value doc;
   try {
-    ce::ParseFile(path, config, doc);
+    const ParseFileFn& parse_file = ParseFileOverride();
+    if (parse_file) {
+      parse_file(path, config, doc);
+    } else {
+      ce::ParseFile(path, config, doc);
+    }
   } catch (...) {
     ThrowError(__FILE__, __LINE__, func, "ParseFile(path, config, doc)", kErrParseFile,
                "Parse failed, path=" + path);
@@ -140,6 +150,11 @@ Json::Value ParseDocument(const std::string& path, bool need_meta, const char* f
 }
 
 }  // namespace
+
+ParseFileFn SetParseFile(ParseFileFn parse_file) {
+  std::swap(ParseFileOverride(), parse_file);
+  return parse_file;
+}
 
 std::string GetFileIndexID(const std::string& share) { return "fileindex_" + share; }
 
@@ -359,8 +374,7 @@ void UpdateTermSuggestion() {
     sdk::SDKShare sdk_share(share);
     const std::string db = sdk_share.GetDBName();
     if (std::find(dbs.begin(), dbs.end(), db) == dbs.end()) continue;
-    Log(LOG_ERR, "%s:%d Start building term sugg [%s]", SourceName(__FILE__), __LINE__,
-        db.c_str());
+    Log(LOG_ERR, "%s:%d Start building term sugg [%s]", SourceName(__FILE__), __LINE__, db.c_str());
     const std::string term_sugg_running = sdk_share.GetDBPath() + kTermSuggRunningMarker;
     {
       std::ofstream ofs(term_sugg_running, std::ios::trunc);

@@ -7,6 +7,7 @@
 
 #include <json/json.h>
 
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -69,6 +70,13 @@ void ListUnAvailTermSuggDB(std::vector<std::string>& dbs);
 // Asks the engine to update the suggestions of `db_name` from the documents `paths`, in one
 // compound request.
 void UpdateTermSuggestion(const std::string& db_name, const std::vector<std::string>& paths);
+
+// The content extraction the document commands call (the platform's ParseFile unless replaced).
+// Tests replace it to see the configuration passed and to make extraction fail; swap it only
+// while no command runs. An empty function restores the platform's. Returns the one replaced.
+using ParseFileFn =
+    std::function<void(const std::string& path, const Json::Value& config, Json::Value& doc)>;
+ParseFileFn SetParseFile(ParseFileFn parse_file);
 
 }  // namespace elastic
 

@@ -8,6 +8,7 @@
 #include <functional>
 #include <map>
 #include <set>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -25,9 +26,9 @@ namespace fileindex {
 namespace elastic {
 namespace {
 
+using test::FakeDaemon;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
-using test::FakeDaemon;
 
 Json::Value Parse(const std::string& text) { return FakeDaemon::Parse(text); }
 
@@ -69,10 +70,14 @@ class ElasticControlTest : public ::testing::Test {
  protected:
   ElasticControlTest() : root_(dir_.path()) {
     test::WritePlatformConfig(dir_.path(), R"({"shares": [
-      {"name": "photo", "path": ")" + volume_.path() + R"(/photo"},
-      {"name": "a", "path": ")" + volume_.path() + R"(/a"},
-      {"name": "b", "path": ")" + volume_.path() + R"(/b"},
-      {"name": "c", "path": ")" + volume_.path() + R"(/c"}]})");
+      {"name": "photo", "path": ")" + volume_.path() +
+                                               R"(/photo"},
+      {"name": "a", "path": ")" + volume_.path() +
+                                               R"(/a"},
+      {"name": "b", "path": ")" + volume_.path() +
+                                               R"(/b"},
+      {"name": "c", "path": ")" + volume_.path() +
+                                               R"(/c"}]})");
   }
   std::string Sock() const { return dir_.Path("var/run/quixelasticd.sock"); }
 
@@ -98,25 +103,66 @@ TEST(SchemaTest, FiftyFiveFieldsOverTheDefaults) {
   const Json::Value mappings = GetFileIndexMappings();
   EXPECT_EQ(mappings.size(), 3u);
   EXPECT_EQ(mappings["property_id"].asString(), "QUIXMDPath");
-  EXPECT_EQ(mappings["default"],
-            Parse(R"({"type":"string","analyzer":"quixstandard","required":false,"stored":true,"_all":true})"));
+  EXPECT_EQ(
+      mappings["default"],
+      Parse(
+          R"({"type":"string","analyzer":"quixstandard","required":false,"stored":true,"_all":true})"));
   const Json::Value& props = mappings["properties"];
-  const std::vector<std::string> names = {
-      "QUIXMDPath", "QUIXMDFSName", "QUIXMDPrivilege", "QUIXMDIsDir", "QUIXMDOwnerUserID",
-      "QUIXMDOwnerGroupID", "QUIXMDFSSize", "QUIXMDFSContentChangeDate",
-      "QUIXMDAttributeChangeDate", "QUIXMDFSCreationDate", "QUIXMDContentModificationDate",
-      "QUIXMDLastUsedDate", "QUIXMDContentCreationDate", "QUIXMDAuthors", "QUIXMDTitle",
-      "QUIXMDAlbum", "QUIXMDIdentifier", "QUIXMDAudioTrackNumber", "QUIXMDRecordingYear",
-      "QUIXMDCreator", "QUIXMDMusicalGenre", "QUIXMDComposer", "QUIXMDComment",
-      "QUIXMDDurationSecond", "QUIXMDAudioBitRate", "QUIXMDTotalBitRate", "QUIXMDVideoBitRate",
-      "QUIXMDAudioSampleRate", "QUIXMDAudioChannelCount", "QUIXMDISOSpeed", "QUIXMDCodecs",
-      "QUIXMDDescription", "QUIXMDAcquisitionMake", "QUIXMDAcquisitionModel",
-      "QUIXMDExposureTimeString", "QUIXMDAperture", "QUIXMDResolutionWidthDPI",
-      "QUIXMDResolutionHeightDPI", "QUIXMDMediaTypes", "QUIXMDParent", "QUIXMDExtension",
-      "QUIXMDTextContent", "QUIXMDKeywords", "QUIXMDFinderLabel", "QUIXMDGroupId",
-      "QUIXMDFinderOpenDate", "QUIXMDLogicalSize", "QUIXMDPhysicalSize", "QUIXMDDateAdded",
-      "QUIXMDSearchFileName", "QUIXMDSearchAncestor", "QUIXMDStarRating", "_QUIXMDUserTags",
-      "QUIXMDSpotlightBoost", "QUIXMDIsEncrypted"};
+  const std::vector<std::string> names = {"QUIXMDPath",
+                                          "QUIXMDFSName",
+                                          "QUIXMDPrivilege",
+                                          "QUIXMDIsDir",
+                                          "QUIXMDOwnerUserID",
+                                          "QUIXMDOwnerGroupID",
+                                          "QUIXMDFSSize",
+                                          "QUIXMDFSContentChangeDate",
+                                          "QUIXMDAttributeChangeDate",
+                                          "QUIXMDFSCreationDate",
+                                          "QUIXMDContentModificationDate",
+                                          "QUIXMDLastUsedDate",
+                                          "QUIXMDContentCreationDate",
+                                          "QUIXMDAuthors",
+                                          "QUIXMDTitle",
+                                          "QUIXMDAlbum",
+                                          "QUIXMDIdentifier",
+                                          "QUIXMDAudioTrackNumber",
+                                          "QUIXMDRecordingYear",
+                                          "QUIXMDCreator",
+                                          "QUIXMDMusicalGenre",
+                                          "QUIXMDComposer",
+                                          "QUIXMDComment",
+                                          "QUIXMDDurationSecond",
+                                          "QUIXMDAudioBitRate",
+                                          "QUIXMDTotalBitRate",
+                                          "QUIXMDVideoBitRate",
+                                          "QUIXMDAudioSampleRate",
+                                          "QUIXMDAudioChannelCount",
+                                          "QUIXMDISOSpeed",
+                                          "QUIXMDCodecs",
+                                          "QUIXMDDescription",
+                                          "QUIXMDAcquisitionMake",
+                                          "QUIXMDAcquisitionModel",
+                                          "QUIXMDExposureTimeString",
+                                          "QUIXMDAperture",
+                                          "QUIXMDResolutionWidthDPI",
+                                          "QUIXMDResolutionHeightDPI",
+                                          "QUIXMDMediaTypes",
+                                          "QUIXMDParent",
+                                          "QUIXMDExtension",
+                                          "QUIXMDTextContent",
+                                          "QUIXMDKeywords",
+                                          "QUIXMDFinderLabel",
+                                          "QUIXMDGroupId",
+                                          "QUIXMDFinderOpenDate",
+                                          "QUIXMDLogicalSize",
+                                          "QUIXMDPhysicalSize",
+                                          "QUIXMDDateAdded",
+                                          "QUIXMDSearchFileName",
+                                          "QUIXMDSearchAncestor",
+                                          "QUIXMDStarRating",
+                                          "_QUIXMDUserTags",
+                                          "QUIXMDSpotlightBoost",
+                                          "QUIXMDIsEncrypted"};
   ASSERT_EQ(names.size(), 55u);
   std::vector<std::string> have = props.getMemberNames();
   std::vector<std::string> want = names;
@@ -130,16 +176,19 @@ TEST(SchemaTest, FiftyFiveFieldsOverTheDefaults) {
   EXPECT_EQ(props["QUIXMDPath"], Parse(R"({"analyzer":"keyword","required":true,"_all":false})"));
   EXPECT_EQ(props["QUIXMDSearchFileName"],
             Parse(R"({"type":"text","analyzer":"white space","preprocess":["tolower","ngram"]})"));
-  EXPECT_EQ(props["QUIXMDSearchAncestor"],
-            Parse(R"({"type":"text","analyzer":"white space escaped","_all":false,"preprocess":["list_ancestor"]})"));
+  EXPECT_EQ(
+      props["QUIXMDSearchAncestor"],
+      Parse(
+          R"({"type":"text","analyzer":"white space escaped","_all":false,"preprocess":["list_ancestor"]})"));
   EXPECT_EQ(props["QUIXMDKeywords"], Json::Value(Json::objectValue));
   EXPECT_EQ(props["QUIXMDDurationSecond"], Parse(R"({"type":"double"})"));
   EXPECT_EQ(props["QUIXMDIsEncrypted"], Parse(R"({"type":"bool","_all":false})"));
   EXPECT_EQ(props["QUIXMDExposureTimeString"], Parse(R"({"analyzer":"keyword"})"));
 
   EXPECT_EQ(GetFileIndexSettings(), Json::Value(Json::objectValue));
-  EXPECT_EQ(GetFileIndexEventHandler(),
-            Parse(R"({"lib_path":"/var/packages/Orvane/target/handler/fileindex_event_handler.so"})"));
+  EXPECT_EQ(
+      GetFileIndexEventHandler(),
+      Parse(R"({"lib_path":"/var/packages/Orvane/target/handler/fileindex_event_handler.so"})"));
   EXPECT_EQ(GetFileIndexID("photo"), "fileindex_photo");
   EXPECT_EQ(GetFileIndexID("My Share"), "fileindex_My Share");
 }
@@ -224,17 +273,35 @@ TEST_F(ElasticControlTest, DocumentCommandsCarryTheExtractedDocument) {
   EXPECT_EQ(sent[5]["data"]["data"]["QUIXMDSearchFileName"], doc["QUIXMDFSName"]);
 }
 
-TEST_F(ElasticControlTest, ExtractionFailureIs914AndSendsNothing) {
-  Engine engine(Sock(), [](const Json::Value& req) {
-    return Hits(Parse(R"([{"QUIXMDPath":"x"}])"));
-  });
-  const std::string missing = volume_.path() + "/photo/gone.txt";
-  const Error e = ErrorOf([&] { IndexUpsert("photo", missing, true); });
-  EXPECT_EQ(e.code, kErrParseFile);
-  EXPECT_EQ(std::string(e.what()), "Orvane error, code=914, reason=[Parse failed, path=" + missing + "]");
-  EXPECT_TRUE(engine.requests().empty());
-  EXPECT_EQ(ErrorOf([&] { IndexAttr("photo", missing); }).code, kErrParseFile);
-  EXPECT_EQ(engine.requests().size(), 1u);  // only the existence query
+TEST_F(ElasticControlTest, ExtractionIsAskedForMetadataOnlyOnUpsertRequest) {
+  Engine engine(Sock(), [](const Json::Value&) { return Hits(Parse(R"([{"QUIXMDPath":"x"}])")); });
+  std::vector<Json::Value> configs;
+  bool fail = false;
+  const ParseFileFn previous =
+      SetParseFile([&](const std::string& path, const Json::Value& config, Json::Value& doc) {
+        configs.push_back(config);
+        if (fail) throw std::runtime_error("not an Error");
+        doc["QUIXMDFSName"] = "n";
+        doc["QUIXMDParent"] = "/p";
+      });
+  IndexUpsert("photo", "/p/n", false);
+  IndexUpsert("photo", "/p/n", true);
+  IndexAttr("photo", "/p/n");
+  fail = true;
+  EXPECT_STREQ(ErrorOf([] { IndexUpsert("photo", "/p/n", true); }).what(),
+               "Orvane error, code=914, reason=[Parse failed, path=/p/n]");
+  SetParseFile(previous);
+
+  EXPECT_THAT(configs,
+              ElementsAre(Parse(R"({"need_meta":false})"), Parse(R"({"need_meta":true})"),
+                          Parse(R"({"need_meta":false})"), Parse(R"({"need_meta":true})")));
+  const std::vector<Json::Value> sent = engine.requests();
+  ASSERT_EQ(sent.size(), 4u);  // the failed upsert sent nothing
+  EXPECT_EQ(sent[0], Parse(R"({"command":"document_upsert_by_id","data":{"id":"fileindex_photo",
+      "doc_id":"/p/n","data":{"QUIXMDFSName":"n","QUIXMDParent":"/p",
+      "QUIXMDSearchFileName":"n","QUIXMDSearchAncestor":"/p"}}})"));
+  EXPECT_EQ(sent[1]["command"], "document_upsert_by_id");
+  EXPECT_EQ(sent[3]["command"], "document_set_by_id");
 }
 
 TEST_F(ElasticControlTest, QueryRepliesWithoutADataArrayAre916) {
@@ -244,8 +311,10 @@ TEST_F(ElasticControlTest, QueryRepliesWithoutADataArrayAre916) {
     log_.Clear();
     const Error e = ErrorOf([] { IsDocumentExists("photo", "/p"); });
     EXPECT_EQ(e.code, kErrNoQueryData);
-    EXPECT_EQ(std::string(e.what()), "Orvane error, code=916, reason=[" + JsonToString(reply) + "]");
-    EXPECT_TRUE(log_.Contains("(IsDocumentExists) Failed [!res.isMember(\"data\") || !res[\"data\"].isArray()]"));
+    EXPECT_EQ(std::string(e.what()),
+              "Orvane error, code=916, reason=[" + JsonToString(reply) + "]");
+    EXPECT_TRUE(log_.Contains(
+        "(IsDocumentExists) Failed [!res.isMember(\"data\") || !res[\"data\"].isArray()]"));
     std::vector<std::string> paths;
     EXPECT_EQ(ErrorOf([&] { IndexGetByPrefixPath("db", "/d", paths); }).code, kErrNoQueryData);
     EXPECT_EQ(ErrorOf([] { IndexRename("photo", "/n", "/o"); }).code, kErrNoQueryData);
@@ -254,7 +323,8 @@ TEST_F(ElasticControlTest, QueryRepliesWithoutADataArrayAre916) {
 
 TEST_F(ElasticControlTest, PrefixListingKeepsEarlierPathsAndSkipsHitsWithoutOne) {
   Engine engine(Sock(), [](const Json::Value&) {
-    return Hits(Parse(R"([{"QUIXMDPath":"/d/1"},{"other":1},{"QUIXMDPath":"/d/2"},{"QUIXMDPath":{}}])"));
+    return Hits(
+        Parse(R"([{"QUIXMDPath":"/d/1"},{"other":1},{"QUIXMDPath":"/d/2"},{"QUIXMDPath":{}}])"));
   });
   std::vector<std::string> paths = {"kept"};
   IndexGetByPrefixPath("fileindex_raw db", "/d", paths);
@@ -330,14 +400,13 @@ TEST_F(ElasticControlTest, RenameRepathsDescendantsInBatchesWithCommitsBetween) 
   const std::vector<Json::Value> sent = engine.requests();
   std::vector<std::string> shape;
   for (const Json::Value& req : sent) {
-    shape.push_back(req.isMember("compound")
-                        ? "compound " + std::to_string(req["compound"].size())
-                        : req["command"].asString());
+    shape.push_back(req.isMember("compound") ? "compound " + std::to_string(req["compound"].size())
+                                             : req["command"].asString());
   }
-  EXPECT_THAT(shape, ElementsAre("document_get_by_query", "document_set_by_id",
-                                 "document_get_by_query", "compound 10000", "commit",
-                                 "document_get_by_query", "compound 10000", "commit",
-                                 "document_get_by_query", "compound 5000"));
+  EXPECT_THAT(shape,
+              ElementsAre("document_get_by_query", "document_set_by_id", "document_get_by_query",
+                          "compound 10000", "commit", "document_get_by_query", "compound 10000",
+                          "commit", "document_get_by_query", "compound 5000"));
   EXPECT_EQ(sent[1], Parse(R"({"command":"document_set_by_id","data":{"id":"fileindex_s",
       "doc_id":"/v/s/a","data":{"QUIXMDPath":"/v/s/bb.Dir","QUIXMDParent":"/v/s",
       "QUIXMDFSName":"bb.Dir","QUIXMDSearchFileName":"bb.Dir","QUIXMDSearchAncestor":"/v/s",
@@ -361,7 +430,8 @@ TEST_F(ElasticControlTest, RenameRepathsDescendantsInBatchesWithCommitsBetween) 
   const Json::Value& fields = sub["data"]["data"];
   ASSERT_EQ(fields.size(), 4u);
   const std::string name = old_path.substr(old_path.rfind('/') + 1);
-  const std::string new_parent = old_path.find("/a/x/") != std::string::npos ? "/v/s/bb.Dir/x" : "/v/s/bb.Dir";
+  const std::string new_parent =
+      old_path.find("/a/x/") != std::string::npos ? "/v/s/bb.Dir/x" : "/v/s/bb.Dir";
   EXPECT_EQ(fields["QUIXMDParent"], new_parent);
   EXPECT_EQ(fields["QUIXMDPath"], new_parent + "/" + name);
   EXPECT_EQ(fields["QUIXMDSearchFileName"], name);
@@ -370,7 +440,8 @@ TEST_F(ElasticControlTest, RenameRepathsDescendantsInBatchesWithCommitsBetween) 
   // Everything below moved, except what the last, uncommitted pass staged.
   EXPECT_EQ(store.commits(), 2);
   int moved = 0;
-  for (const auto& [id, doc] : store.docs()) moved += StringStartWith(doc["QUIXMDPath"].asString(), "/v/s/bb.Dir/");
+  for (const auto& [id, doc] : store.docs())
+    moved += StringStartWith(doc["QUIXMDPath"].asString(), "/v/s/bb.Dir/");
   EXPECT_EQ(moved, 20000);
   EXPECT_EQ(store.docs().at("/v/s/ab")["QUIXMDPath"], "/v/s/ab");
 }
@@ -378,7 +449,8 @@ TEST_F(ElasticControlTest, RenameRepathsDescendantsInBatchesWithCommitsBetween) 
 TEST_F(ElasticControlTest, RenameOfExactlyOneBatchEndsWithAnEmptyPass) {
   DocumentStore store;
   store.Add("/v/s/a", "/v/s", "a");
-  for (int i = 0; i < 10000; ++i) store.Add("/v/s/a/f" + std::to_string(i), "/v/s/a", "f" + std::to_string(i));
+  for (int i = 0; i < 10000; ++i)
+    store.Add("/v/s/a/f" + std::to_string(i), "/v/s/a", "f" + std::to_string(i));
   Engine engine(Sock(), [&](const Json::Value& req) { return store.Answer(req); });
   IndexRename("s", "/v/s/b", "/v/s/a");
   EXPECT_EQ(engine.requests().size(), 6u);  // exists, set, query, compound, commit, empty query
@@ -462,7 +534,8 @@ TEST_F(TermSuggestionDriverTest, RebuildsUnavailableSharesInNameOrderUnderTheirM
     }
     if (req.isMember("compound")) {
       const std::string db = req["compound"][0]["data"]["db_name"].asString();
-      markers_seen.push_back(db + (access(Marker(db.substr(10)).c_str(), F_OK) == 0 ? " marked" : ""));
+      markers_seen.push_back(db +
+                             (access(Marker(db.substr(10)).c_str(), F_OK) == 0 ? " marked" : ""));
     }
     if (req["command"] == "document_get_by_query") {
       const std::string dir = req["data"]["query"]["qsl"]["prefix"]["QUIXMDPath"].asString();
@@ -476,13 +549,14 @@ TEST_F(TermSuggestionDriverTest, RebuildsUnavailableSharesInNameOrderUnderTheirM
 
   std::vector<std::string> shape;
   for (const Json::Value& req : engine.requests()) {
-    shape.push_back(req.isMember("compound") ? "compound" : req["command"].asString() + " " +
-                                                                  req["data"]["id"].asString());
+    shape.push_back(req.isMember("compound")
+                        ? "compound"
+                        : req["command"].asString() + " " + req["data"]["id"].asString());
   }
-  EXPECT_THAT(shape, ElementsAre("list_term_sugg_db ", "document_get_by_query fileindex_a",
-                                 "compound", "commit fileindex_a",
-                                 "document_get_by_query fileindex_c", "compound",
-                                 "commit fileindex_c"));
+  EXPECT_THAT(shape,
+              ElementsAre("list_term_sugg_db ", "document_get_by_query fileindex_a", "compound",
+                          "commit fileindex_a", "document_get_by_query fileindex_c", "compound",
+                          "commit fileindex_c"));
   EXPECT_THAT(markers_seen, ElementsAre("fileindex_a marked", "fileindex_c marked"));
   const Json::Value update = engine.requests()[2]["compound"][0];
   EXPECT_EQ(update["data"]["doc_id_field"], volume_.path() + "/a/doc");
@@ -501,7 +575,8 @@ TEST_F(TermSuggestionDriverTest, NothingUnavailableTouchesNothingAndAFailureLeav
   EXPECT_EQ(access(Marker("a").c_str(), F_OK), -1);
 
   Engine engine(Sock(), [](const Json::Value& req) {
-    if (req["command"] == "list_term_sugg_db") return Hits(Parse(R"({"unavail":["fileindex_a","fileindex_b"]})"));
+    if (req["command"] == "list_term_sugg_db")
+      return Hits(Parse(R"({"unavail":["fileindex_a","fileindex_b"]})"));
     if (req.isMember("compound")) return Fail(42, "broken");
     return Hits(Json::Value(Json::arrayValue));
   });
@@ -512,7 +587,8 @@ TEST_F(TermSuggestionDriverTest, NothingUnavailableTouchesNothingAndAFailureLeav
   // A marker that cannot be written is logged and the rebuild goes on.
   test::TempDir other;
   Engine ok(Sock(), [](const Json::Value& req) {
-    if (req["command"] == "list_term_sugg_db") return Hits(Parse(R"({"unavail":["fileindex_photo"]})"));
+    if (req["command"] == "list_term_sugg_db")
+      return Hits(Parse(R"({"unavail":["fileindex_photo"]})"));
     return Hits(Json::Value(Json::arrayValue));
   });
   dir_.Write("var/packages/Orvane/etc/fileindex.folders", R"([{"path":"/photo","name":"p")"

@@ -2,8 +2,10 @@
 
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include "fileindex/admin_test_env.hpp"
+#include "platform/unicode.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -224,6 +226,45 @@ TEST_F(FolderMgrTest, ListFiltersSortsAndPages) {
   for (size_t i = 0; i < out.size(); ++i) EXPECT_EQ(out[i]->IsDocument(), i >= 3) << i;
   mgr.List(out, total, 0, 10, "Document", "desc", "all", "");  // the key is case-sensitive
   EXPECT_EQ(names().front(), "Émile");
+}
+
+TEST(CaseBlindCompareTest, Utf8TextsOrderWithoutCase) {
+  auto cmp = [](const char* a, const char* b) {
+    return platform::QLIBCUnicodeUTF8StrCaseCmp(a, b);
+  };
+  EXPECT_EQ(cmp("ÉCOLE Ünïcode", "école ünÏcode"), 0);
+  EXPECT_LT(cmp("abc", "ABD"), 0);
+  EXPECT_LT(cmp("ab", "AbC"), 0);  // a prefix first
+  EXPECT_GT(cmp("é", "z"), 0);     // by code point, not by any collation
+  EXPECT_LT(cmp("Ωmega", "ωMEGA2"), 0);
+  // Bytes that begin no valid sequence sort after every character, and never read past the end.
+  EXPECT_GT(cmp("a\xff", "a\xf4\x8f\xbf\xbf"), 0);
+  EXPECT_GT(cmp("\xc3", "z"), 0);
+  EXPECT_GT(cmp("\xe0\x80\xaf", "z"), 0);  // overlong "/"
+  EXPECT_NE(cmp("\xc3", "\xc4"), 0);
+  EXPECT_EQ(cmp(nullptr, ""), 0);
+}
+
+TEST_F(FolderMgrTest, UnprivilegedWriterGetsAnErrorAndTheFileStays) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to run a process as nobody";
+  WriteFolders(Parse("[" + JsonToString(FolderJson("/music", "M", true, true, true, true)) + "]"));
+  const std::string before = test::ReadFile(FoldersPath());
+  ASSERT_EQ(chmod(root_.path().c_str(), 0755), 0);
+  // Saving needs root; a process that cannot become root is refused before writing anything.
+  const int code = test::RunAsUser("nobody", [] {
+    try {
+      FolderMgr mgr;
+      if (mgr.folders().size() != 1) return 1;
+      std::shared_ptr<Folder> diff;
+      mgr.Upsert(diff, std::make_shared<Folder>(FolderJson("/photo", "P", true, true, true, true)));
+      mgr.Save();
+    } catch (const Error& e) {
+      return e.code == kErrCredentials ? 0 : 2;
+    }
+    return 3;
+  });
+  EXPECT_EQ(code, 0);
+  EXPECT_EQ(test::ReadFile(FoldersPath()), before);
 }
 
 }  // namespace

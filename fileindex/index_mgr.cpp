@@ -105,9 +105,12 @@ void FolderUpsert(const Json::Value& folder_list, bool create, bool updater_mode
   StatusMgr::CreateIfMissing();
   for (const std::string& share : shares) NotifySettingChanged(share, true);
   if (updater_mode) return;
+  std::vector<CustomEvent> events;
   for (const auto& diff : diffs) {
-    if (diff) AddCustomEvent(kEventFolderSettings, diff->GetFullPath(), "", diff->GetIndexCfg());
+    if (diff)
+      events.push_back({kEventFolderSettings, diff->GetFullPath(), "", diff->GetIndexCfg()});
   }
+  AddCustomEvents(events);
 }
 
 }  // namespace
@@ -120,11 +123,6 @@ void FolderSet(const Json::Value& folder_list, bool updater_mode) {
   FolderUpsert(folder_list, false, updater_mode);
 }
 
-}  // namespace fileindex
-}  // namespace orvane
-
-namespace orvane {
-namespace fileindex {
 namespace {
 
 void SendWorkerCommand(const std::string& cmd, const std::string& share) {
@@ -316,18 +314,23 @@ void FolderDelete(const Json::Value& path_list) {
   }
   folder_mgr.Save();
   for (const std::string& share : shares) NotifySettingChanged(share, false);
+  std::vector<CustomEvent> events;
   for (const auto& diff : diffs) {
     // What no folder covers any more leaves with its share's index or through the daemon's own
     // handling of the removal; below another folder only the flipped switches need re-reading.
     const std::string full_path = diff->GetFullPath();
     if (SwitchesAnyOn(*diff) && folder_mgr.IsFullPathIndexed(full_path)) {
-      AddCustomEvent(kEventFolderSettings, full_path, "", diff->GetIndexCfg());
+      events.push_back({kEventFolderSettings, full_path, "", diff->GetIndexCfg()});
     }
   }
+  AddCustomEvents(events);
   if (folder_mgr.folders().empty()) SetupRelatedServices(false);
 }
 
 void FolderReindex(const Json::Value& path_list) {
+  // Nothing is saved, but the index rebuild must not interleave with another operation's
+  // changes to the same share.
+  FolderCfgLock lock;
   FolderMgr folder_mgr;
   const std::vector<std::shared_ptr<Folder>> requested = RequestedFolders(folder_mgr, path_list);
   std::map<std::string, std::set<std::string>> asked;
@@ -347,9 +350,11 @@ void FolderReindex(const Json::Value& path_list) {
     StatusMgr().UnsetShareStatus(share, kShareStatusNeedReindex);
     rebuilt.push_back(share);
   }
+  std::vector<CustomEvent> events;
   for (const auto& folder : requested) {
-    AddCustomEvent(kEventReindex, folder->GetFullPath(), "", Json::Value());
+    events.push_back({kEventReindex, folder->GetFullPath(), "", Json::Value()});
   }
+  AddCustomEvents(events);
   for (const std::string& share : rebuilt) SendWorkerCommand("worker_create", share);
 }
 

@@ -164,6 +164,25 @@ TEST_F(ShareOpsTest, ClearPausedAndAutoCleanRemoveOnlyIndexData) {
   EXPECT_EQ(ErrorOf([] { ShareAutoClean("nosuch"); }).code, kErrShareGet);
 }
 
+TEST_F(ShareOpsTest, DaemonOrPlatformFailuresStopBeforeLaterSteps) {
+  test::FakeEnv env;  // the connect attempts sleep on the fake clock
+  indexd_.reset();
+  const Error e = ErrorOf([] { SharePause("photo"); });
+  EXPECT_EQ(e.code, kErrSystem);
+  EXPECT_EQ(e.message.rfind("Orvane error, code=502, reason=[write failed, reason=", 0), 0u)
+      << e.message;
+  EXPECT_EQ(Paused(), (std::vector<bool>{false, false, false}));
+  EXPECT_EQ(Registrations(), (Strings{"music: /music", "photo: /photo/trips /photo/family"}));
+  EXPECT_TRUE(NewEngine().empty());
+
+  // The index locations cannot be composed: nothing is removed.
+  volume_.Write("music/@eaDir/@fileindex/db/seg", "data");
+  ScopedFaults faults;
+  faults.Arm("FILEIDXQueuePathCompose", Fault{-1, ENAMETOOLONG});
+  EXPECT_EQ(ErrorOf([&] { CleanShareIndexData("music", vol_ + "/music"); }).code, kErrSystem);
+  EXPECT_EQ(test::ReadFile(vol_ + "/music/@eaDir/@fileindex/db/seg"), "data");
+}
+
 TEST_F(ShareOpsTest, MigrateFollowsTheShareToItsNewFolder) {
   test::TempDir volume2;
   const std::string old_path = vol_ + "/photo";

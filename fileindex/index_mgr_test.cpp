@@ -128,6 +128,15 @@ TEST_F(IndexMgrTest, RefusedRequestsChangeNothing) {
   EXPECT_EQ(test::ReadFile(Queue("photo")), queue);
 }
 
+TEST_F(IndexMgrTest, FreshSystemAnswersQuestionsWithoutAnyFile) {
+  EXPECT_EQ(FolderSummary(), Parse(R"({"folder_count": 0, "resume_time": -1, "paused": false,
+                                      "shares": []})"));
+  EXPECT_EQ(FolderList(Parse("{}")), Parse(R"({"folders": [], "total": 0})"));
+  EXPECT_EQ(FolderListGroups(), Json::Value(Json::arrayValue));
+  EXPECT_EQ(ErrorOf([] { FolderGetProcessingStatus("/music"); }).code, kErrFolderNotFound);
+  EXPECT_FALSE(IsFileExist(FoldersPath()));
+}
+
 TEST_F(IndexMgrTest, EmptyRequestOnlySwitchesServicesOn) {
   FolderAdd(Json::Value(Json::arrayValue), false);
   EXPECT_EQ(Folders(), Json::Value(Json::arrayValue));

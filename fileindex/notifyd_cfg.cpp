@@ -3,12 +3,17 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <cstring>
+#include <unordered_set>
+#include <utility>
 
 #include "common/error.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
 #include "common/sdk/share.hpp"
+#include "common/util.hpp"
 #include "fileindex/queue_file.hpp"
 #include "fileindex/queue_mgr.hpp"
 #include "fileindex/status_mgr.hpp"
@@ -50,56 +55,144 @@ void DeleteQUIXNotifydCfg(const std::string& share_name) {
       kErrSystem, "MonitorQueue::Delete failed, share=" + share_name);
 }
 
+namespace {
+
+// The lines gathered for one share's queue.
+struct QueueBatch {
+  std::string queue_path;
+  bool can_be_indexed = false;
+  // Paths whose plain re-index is queued (in the queue, its side file or this batch).
+  std::unordered_set<std::string> reindexed;
+  std::string lines;
+};
+
+// Reads the plain re-index paths of one queue file; malformed lines fail as they would for the
+// queue's own questions.
+void CollectReindexes(const std::string& path, std::unordered_set<std::string>& out) {
+  if (!IsFileExist(path)) return;
+  QueueFileReader reader(path);
+  ORVANE_THROW_IF(!reader, kErrSystem,
+                  std::string("Failed to open queue, reason=") + std::strerror(errno));
+  std::string line;
+  while (reader.ReadLine(&line, kMaxEventLineLength)) {
+    if (line.size() > kMaxEventLineLength) {
+      throw Error(kErrMalformedEvent, "Event line too long: " + line.substr(0, 256) + "...");
+    }
+    Event event(line);
+    if (event.event == kEventReindex) out.insert(event.path);
+  }
+}
+
+// Whether `path` or one of its ancestors is in `reindexed`.
+bool HasReindex(const std::unordered_set<std::string>& reindexed, const std::string& path) {
+  if (reindexed.empty()) return false;
+  size_t end = path.size();
+  while (true) {
+    if (reindexed.count(path.substr(0, end)) != 0) return true;
+    if (end == 0) return false;
+    end = path.rfind('/', end - 1);
+    if (end == std::string::npos) return false;
+  }
+}
+
+void LogEventFailure(const Error& e, const std::string& share_name) {
+  const char* func = "AddCustomEvent";
+  if (errno != 0) {
+    Log(LOG_ERR,
+        "%s:%d (%d, %u) (%s) AddCustomEvent failed, code=%d, reason=%s. Set [%s] need reindex "
+        "[err: %m]",
+        SourceName(__FILE__), __LINE__, getpid(), geteuid(), func, e.code, e.what(),
+        share_name.c_str());
+    errno = 0;
+  } else {
+    Log(LOG_ERR,
+        "%s:%d (%d, %u) (%s) AddCustomEvent failed, code=%d, reason=%s. Set [%s] need reindex",
+        SourceName(__FILE__), __LINE__, getpid(), geteuid(), func, e.code, e.what(),
+        share_name.c_str());
+  }
+  // Without a share there is nothing to flag; a flag that cannot be stored must not hide the
+  // error that the caller is owed.
+  if (share_name.empty()) return;
+  try {
+    StatusMgr status;
+    status.SetShareStatus(share_name, kShareStatusNeedReindex);
+  } catch (const Error& flag_error) {
+    Log(LOG_ERR, "%s:%d Cannot flag [%s] for re-index: %s", SourceName(__FILE__), __LINE__,
+        share_name.c_str(), flag_error.what());
+  }
+}
+
+// Appends each share's gathered lines; the first failure is logged, flagged and thrown.
+void FlushBatches(std::vector<std::pair<std::string, QueueBatch>>& batches) {
+  for (auto& entry : batches) {
+    QueueBatch& batch = entry.second;
+    if (batch.lines.empty()) continue;
+    try {
+      // The append takes the queue's lock and makes sure the file it locked is still the live
+      // queue, so a line never lands in a batch that the indexer has already taken.
+      if (!QueueFileAppend(batch.queue_path, batch.lines)) {
+        ThrowError(__FILE__, __LINE__, "AddCustomEvent", "!QueueFileAppend(queue_path, line)",
+                   kErrSystem, "Cannot append to queue: " + batch.queue_path);
+      }
+      batch.lines.clear();
+    } catch (const Error& e) {
+      LogEventFailure(e, entry.first);
+      throw;
+    }
+  }
+}
+
+}  // namespace
+
+void AddCustomEvents(const std::vector<CustomEvent>& events) {
+  // Shares in order of first appearance, each with its gathered lines.
+  std::vector<std::pair<std::string, QueueBatch>> batches;
+  for (const CustomEvent& custom : events) {
+    std::string share_name;
+    try {
+      std::string share_path;
+      GetShareNamePathByFullPath(share_name, share_path, custom.path);
+      auto it = std::find_if(batches.begin(), batches.end(),
+                             [&](const auto& b) { return b.first == share_name; });
+      if (it == batches.end()) {
+        QueueBatch batch;
+        sdk::SDKShare share(share_name);
+        batch.queue_path = share.GetQueuePath();
+        batch.can_be_indexed = share.CanBeIndexed();
+        if (batch.can_be_indexed) {
+          CollectReindexes(batch.queue_path, batch.reindexed);
+          CollectReindexes(batch.queue_path + ".tmp", batch.reindexed);
+        }
+        batches.emplace_back(share_name, std::move(batch));
+        it = batches.end() - 1;
+      }
+      QueueBatch& batch = it->second;
+      // A queued re-index of an ancestor will read everything below it again anyway.
+      if (!batch.can_be_indexed || HasReindex(batch.reindexed, custom.path)) continue;
+
+      Json::Value line(Json::objectValue);
+      line["event"] = custom.event;
+      line["path"] = custom.path;
+      line["path_old"] = custom.path_old;
+      line["data"] = custom.data;
+      batch.lines += JsonToString(line) + "\n";
+      if (static_cast<uint32_t>(custom.event) == kEventReindex) batch.reindexed.insert(custom.path);
+    } catch (const Error& e) {
+      // What was gathered before the failure is still written.
+      try {
+        FlushBatches(batches);
+      } catch (const Error&) {
+      }
+      LogEventFailure(e, share_name);
+      throw;
+    }
+  }
+  FlushBatches(batches);
+}
+
 void AddCustomEvent(int event, const std::string& path, const std::string& path_old,
                     const Json::Value& data) {
-  std::string share_name;
-  try {
-    std::string share_path;
-    GetShareNamePathByFullPath(share_name, share_path, path);
-    sdk::SDKShare share(share_name);
-    const std::string& queue_path = share.GetQueuePath();
-    QueueMgr queue(queue_path);
-    // A queued re-index of an ancestor will read everything below it again anyway.
-    if (!share.CanBeIndexed() || queue.IsFullPathHasReindex(path)) return;
-
-    Json::Value line(Json::objectValue);
-    line["event"] = event;
-    line["path"] = path;
-    line["path_old"] = path_old;
-    line["data"] = data;
-    // The append takes the queue's lock and makes sure the file it locked is still the live
-    // queue, so a line never lands in a batch that the indexer has already taken.
-    if (!QueueFileAppend(queue_path, JsonToString(line) + "\n")) {
-      ThrowError(__FILE__, __LINE__, __func__, "!QueueFileAppend(queue_path, line)", kErrSystem,
-                 "Cannot append to queue: " + queue_path);
-    }
-  } catch (const Error& e) {
-    if (errno != 0) {
-      Log(LOG_ERR,
-          "%s:%d (%d, %u) (%s) AddCustomEvent failed, code=%d, reason=%s. Set [%s] need reindex "
-          "[err: %m]",
-          SourceName(__FILE__), __LINE__, getpid(), geteuid(), __func__, e.code, e.what(),
-          share_name.c_str());
-      errno = 0;
-    } else {
-      Log(LOG_ERR,
-          "%s:%d (%d, %u) (%s) AddCustomEvent failed, code=%d, reason=%s. Set [%s] need reindex",
-          SourceName(__FILE__), __LINE__, getpid(), geteuid(), __func__, e.code, e.what(),
-          share_name.c_str());
-    }
-    // Without a share there is nothing to flag; a flag that cannot be stored must not hide the
-    // error that the caller is owed.
-    if (!share_name.empty()) {
-      try {
-        StatusMgr status;
-        status.SetShareStatus(share_name, kShareStatusNeedReindex);
-      } catch (const Error& flag_error) {
-        Log(LOG_ERR, "%s:%d Cannot flag [%s] for re-index: %s", SourceName(__FILE__), __LINE__,
-            share_name.c_str(), flag_error.what());
-      }
-    }
-    throw;
-  }
+  AddCustomEvents({CustomEvent{event, path, path_old, data}});
 }
 
 namespace {

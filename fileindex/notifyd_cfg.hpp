@@ -8,6 +8,7 @@
 #include <json/json.h>
 
 #include <string>
+#include <vector>
 
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/notify.hpp"
@@ -32,6 +33,19 @@ void DeleteQUIXNotifydCfg(const std::string& share);
 // file and the Error is thrown on.
 void AddCustomEvent(int event, const std::string& path, const std::string& path_old,
                     const Json::Value& data);
+
+// One event for AddCustomEvents.
+struct CustomEvent {
+  int event;
+  std::string path;
+  std::string path_old;
+  Json::Value data;
+};
+// AddCustomEvent for each event in order, with each share's queue read once and each share's
+// lines appended in one locked write: an operation on many folders costs one pass over the
+// queue instead of one per folder. A re-index in the batch makes later events below it
+// redundant too. On the first failure the events gathered before it are still written.
+void AddCustomEvents(const std::vector<CustomEvent>& events);
 
 // The service switch: on, the file-sharing search integration, the content extraction service
 // and the indexing daemon are started; off, the integration is turned off and the indexing

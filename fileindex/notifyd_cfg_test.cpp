@@ -100,6 +100,40 @@ TEST_F(NotifydCfgTest, CustomEventsAreAppendedOrDropped) {
   EXPECT_EQ(StatusMgr().GetShareStatus("photo"), 0);
 }
 
+TEST_F(NotifydCfgTest, BatchesReadEachQueueOnceAndKeepTheRules) {
+  StatusMgr::CreateIfMissing();
+  const std::string trips = vol_ + "/photo/trips";
+  AddCustomEvent(0x10000, trips + "/2024", "", Json::Value());
+  AddCustomEvents({{0x20000, trips + "/2024/a", "", Json::Value(1)},  // below the queued one
+                   {0x10000, trips, "", Json::Value()},
+                   {0x20000, vol_ + "/music/live", "", Json::Value(2)},
+                   {0x20000, trips + "/x", "", Json::Value(3)},  // below the batch's own
+                   {0x10000, vol_ + "/ro/x", "", Json::Value()},
+                   {0x100, vol_ + "/photo/family", vol_ + "/photo/f", Json::Value()}});
+  std::vector<std::string> photo;
+  for (const auto& line : QueueLines("photo")) photo.push_back(JsonToString(line));
+  EXPECT_EQ(photo,
+            (std::vector<std::string>{
+                R"({"data":null,"event":65536,"path":")" + trips + R"(/2024","path_old":""})",
+                R"({"data":null,"event":65536,"path":")" + trips + R"(","path_old":""})",
+                R"({"data":null,"event":256,"path":")" + vol_ +
+                    R"(/photo/family",)"
+                    R"("path_old":")" +
+                    vol_ + R"(/photo/f"})"}));
+  EXPECT_EQ(QueueLines("music").size(), 1u);
+  EXPECT_FALSE(IsFileExist(Queue("ro")));
+
+  // A path in no share ends the batch: what came before it is written, the rest is not.
+  EXPECT_EQ(ErrorOf([&] {
+              AddCustomEvents({{0x20000, vol_ + "/music/a", "", Json::Value()},
+                               {0x20000, scratch_.path(), "", Json::Value()},
+                               {0x20000, vol_ + "/music/b", "", Json::Value()}});
+            }).code,
+            kErrSystem);
+  EXPECT_EQ(QueueLines("music").size(), 2u);
+  EXPECT_EQ(QueueLines("music").back()["path"], vol_ + "/music/a");
+}
+
 TEST_F(NotifydCfgTest, FailedEventFlagsTheShareAndIsThrownOn) {
   StatusMgr::CreateIfMissing();
   // A folder in the queue's place cannot be opened for appending.

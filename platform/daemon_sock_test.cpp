@@ -33,8 +33,10 @@ TEST(DaemonSockTest, FramesTravelBothWaysWithTheirExactBytes) {
   TempDir dir;
   const std::string big(3 << 20, 'x');  // more than a socket buffer: partial sends and reads
   FakeDaemon daemon(dir.Path("d.sock"), [&](int fd, const std::string& request) {
-    if (request == "small") FakeDaemon::WriteFrame(fd, std::string("{\"ok\":1}\0", 9));
-    else FakeDaemon::WriteFrame(fd, request + "!");
+    if (request == "small")
+      FakeDaemon::WriteFrame(fd, std::string("{\"ok\":1}\0", 9));
+    else
+      FakeDaemon::WriteFrame(fd, request + "!");
   });
 
   DomainSockConnection conn(dir.Path("d.sock"));
@@ -112,11 +114,14 @@ TEST(DaemonSockTest, BrokenRepliesFailWithinTheTimeOuts) {
       {"half a length", [](int fd, const std::string&) { FakeDaemon::WriteAll(fd, "\x05\x00"); },
        ECONNRESET},
       {"half a payload then close",
-       [](int fd, const std::string&) { FakeDaemon::WriteAll(fd, Frame("0123456789").substr(0, 8)); },
+       [](int fd, const std::string&) {
+         FakeDaemon::WriteAll(fd, Frame("0123456789").substr(0, 8));
+       },
        ECONNRESET},
       {"announces 4 GiB",
        [&](int fd, const std::string&) {
-         FakeDaemon::WriteAll(fd, std::string(reinterpret_cast<const char*>(&four_gib_minus_one), 4) + "{}");
+         FakeDaemon::WriteAll(
+             fd, std::string(reinterpret_cast<const char*>(&four_gib_minus_one), 4) + "{}");
          FakeDaemon::WaitForPeerClose(fd, 5000);
        },
        EMSGSIZE},
@@ -126,8 +131,8 @@ TEST(DaemonSockTest, BrokenRepliesFailWithinTheTimeOuts) {
          FakeDaemon::WaitForPeerClose(fd, 5000);
        },
        ETIMEDOUT},
-      {"never answers",
-       [](int fd, const std::string&) { FakeDaemon::WaitForPeerClose(fd, 5000); }, ETIMEDOUT},
+      {"never answers", [](int fd, const std::string&) { FakeDaemon::WaitForPeerClose(fd, 5000); },
+       ETIMEDOUT},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);

@@ -134,6 +134,15 @@ TEST_F(DaemonTest, FramesOfEveryShapeGetAReplyOrAClose) {
   EXPECT_EQ(Count("/v/share/"), 120);
 }
 
+TEST_F(DaemonTest, AnswersBusyBeyondTheMemoryLimitAndRecovers) {
+  Launch({"--memory-limit-mb", "1"});
+  Json::Value big = Cmd("index_list", Json::Value());
+  big["padding"] = std::string(400 * 1024, 'x');  // counted four times: over the 1 MiB limit
+  const Json::Value refused = Send(big);
+  EXPECT_EQ(refused["error"]["code"], kCodeOutOfMemory) << JsonToString(refused);
+  EXPECT_EQ(Send(Cmd("index_list", Json::Value()))["success"], true);
+}
+
 TEST_F(DaemonTest, SigtermStopsCleanly) {
   Launch();
   ASSERT_EQ(CreateIndex()["success"], true);

@@ -56,6 +56,9 @@ int64_t OptionalInt(const Json::Value& obj, const char* key, int64_t fallback) {
   return v->asLargestInt();
 }
 
+// How many times its size a request is counted against the memory limit while it runs.
+constexpr int64_t kParsedWeight = 4;
+
 // Deepest page a search may ask for; deeper paging is a sign of a runaway client.
 constexpr int64_t kMaxSearchFrom = 1000000;
 
@@ -267,37 +270,46 @@ void Engine::OpenAll(bool after_crash) {
     for (auto& [id, e] : indexes_) entries.push_back(e);
   }
   for (auto& e : entries) {
-    EntryGuard lock(*e);
-    if (e->state != State::kOpening && e->state != State::kRecovering) continue;
     if (shut_down_) break;
+    std::string path;
+    State waiting;
+    {
+      EntryGuard lock(*e);
+      if (e->state != State::kOpening && e->state != State::kRecovering) continue;
+      path = e->path;
+      waiting = e->state;
+    }
+    // Opening and checking run without the index's lock, so that its requests are answered
+    // 607 or 608 meanwhile instead of waiting.
+    std::shared_ptr<IndexStore> store;
+    std::string failure;
+    bool damaged = false;
     try {
-      if (!IndexStore::ExistsIn(e->path)) {
-        e->state = State::kDamaged;
-        Log(LOG_ERR, "%s:%d index %s has no store in %s; it needs a rebuild",
-            SourceName(__FILE__), __LINE__, e->id.c_str(), e->path.c_str());
-        continue;
-      }
-      e->store = IndexStore::Open(e->path);
-      std::string detail;
-      if (after_crash && !e->store->QuickCheck(&detail)) {
-        SetAside(*e, detail);
-        continue;
-      }
-      e->state = State::kReady;
-    } catch (const StoreError& err) {
-      if (err.IsCorruption()) {
-        SetAside(*e, err.what());
+      if (!IndexStore::ExistsIn(path)) {
+        failure = "no store in " + path;
       } else {
-        e->store.reset();
-        e->state = State::kDamaged;
-        Log(LOG_ERR, "%s:%d index %s cannot be opened: %s", SourceName(__FILE__), __LINE__,
-            e->id.c_str(), err.what());
+        store = IndexStore::Open(path);
+        if (after_crash && !store->QuickCheck(&failure)) damaged = true;
       }
+    } catch (const StoreError& err) {
+      failure = err.what();
+      damaged = err.IsCorruption();
     } catch (const std::exception& err) {
-      e->store.reset();
+      failure = err.what();
+    }
+    EntryGuard lock(*e);
+    // Paused, moved or deleted meanwhile: that request decided the index's state.
+    if (e->removed || e->state != waiting || e->path != path) continue;
+    if (failure.empty()) {
+      e->store = std::move(store);
+      e->state = State::kReady;
+    } else if (damaged) {
+      store.reset();
+      SetAside(*e, failure);
+    } else {
       e->state = State::kDamaged;
-      Log(LOG_ERR, "%s:%d index %s cannot be opened: %s", SourceName(__FILE__), __LINE__,
-          e->id.c_str(), err.what());
+      Log(LOG_ERR, "%s:%d index %s cannot be opened (%s); it needs a rebuild",
+          SourceName(__FILE__), __LINE__, e->id.c_str(), failure.c_str());
     }
   }
   std::lock_guard<std::mutex> lock(opened_mu_);
@@ -389,15 +401,18 @@ void Engine::SaveRegistry() {
 }
 
 int Engine::AdmitFrame(int64_t bytes) {
-  const int64_t in_flight = frame_bytes_.fetch_add(bytes) + bytes;
+  // A request is held as text and as parsed values at once; the values take several times the
+  // text's size.
+  const int64_t weight = bytes * kParsedWeight;
+  const int64_t in_flight = frame_bytes_.fetch_add(weight) + weight;
   if (in_flight + sqlite3_memory_used() > options_.memory_limit_bytes) {
-    frame_bytes_.fetch_sub(bytes);
+    frame_bytes_.fetch_sub(weight);
     return kCodeOutOfMemory;
   }
   return 0;
 }
 
-void Engine::ReleaseFrame(int64_t bytes) { frame_bytes_.fetch_sub(bytes); }
+void Engine::ReleaseFrame(int64_t bytes) { frame_bytes_.fetch_sub(bytes * kParsedWeight); }
 
 Json::Value Engine::Handle(const std::string& payload, const Caller& caller) {
   std::string text = payload;

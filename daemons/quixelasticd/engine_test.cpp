@@ -303,13 +303,13 @@ TEST_F(EngineTest, OnlyPrivilegedCallersChangeIndexes) {
 TEST_F(EngineTest, RefusesWorkBeyondItsLimits) {
   EngineOptions options;
   options.max_write_backlog = 0;
-  options.memory_limit_bytes = 1 << 20;
+  options.memory_limit_bytes = 8 << 20;
   engine_.reset();
   StartEngine(options);
   EXPECT_EQ(CodeOf(IdOnly("commit")), kCodeOverloaded);
   // People's searches are not writes and still pass.
   EXPECT_EQ(CodeOf(Send(Obj(R"({"command":"search","data":{"name":"abc"}})"))), 0);
-  EXPECT_EQ(engine_->AdmitFrame(2 << 20), kCodeOutOfMemory);
+  EXPECT_EQ(engine_->AdmitFrame(3 << 20), kCodeOutOfMemory);
   EXPECT_EQ(engine_->AdmitFrame(1000), 0);
   engine_->ReleaseFrame(1000);
 }

@@ -4,6 +4,7 @@
 // bytes (length prefix included), anything else as the payload of one well-formed frame, with
 // bit 1 choosing the public socket's rights. Every reply must be one frame holding a JSON
 // object with a boolean "success"; anything else aborts.
+#include <ftw.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -25,11 +26,20 @@ using orvane::elasticd::EngineOptions;
 using orvane::elasticd::Server;
 using orvane::elasticd::ServerOptions;
 
+std::string* g_scratch = nullptr;
+
 struct Fixture {
   Fixture() {
     char tmpl[] = "/tmp/quixelasticd-fuzz-XXXXXX";
     if (mkdtemp(tmpl) == nullptr) std::abort();
     dir = tmpl;
+    // The scratch folder goes when the fuzzer exits normally; a crash keeps it for a look.
+    g_scratch = new std::string(dir);
+    std::atexit([] {
+      nftw(g_scratch->c_str(),
+           [](const char* p, const struct stat*, int, struct FTW*) { return remove(p) == 0 ? 0 : 0; },
+           64, FTW_DEPTH | FTW_PHYS);
+    });
     orvane::SetLogSink([](int, const std::string&) {});
     EngineOptions options;
     options.registry_file = dir + "/state/indexes.json";

@@ -19,6 +19,9 @@ void Db::Open(const std::string& file, bool create, bool read_only) {
     throw StoreError(rc, "open " + file + ": " + msg);
   }
   sqlite3_extended_result_codes(db_, 1);
+  // A larger lookaside pool serves the many small allocations of statements and full-text
+  // inserts without going to malloc.
+  sqlite3_db_config(db_, SQLITE_DBCONFIG_LOOKASIDE, nullptr, 512, 1024);
   // Writers of one index are serialised by the daemon; the timeout only covers readers that
   // hold the WAL briefly during a checkpoint.
   sqlite3_busy_timeout(db_, 5000);

@@ -64,6 +64,16 @@ Where WhereOf(const Schema& schema, const DocQuery& q) {
       w.sql = "1";
       break;
     case DocQuery::Kind::kTerm:
+      if (!q.field.empty() && q.field == schema.ancestor_field()) {
+        // The ancestor field stands for the folder and every folder above it: a term matches
+        // documents anywhere below that folder.
+        std::string folder = q.value;
+        while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
+        const std::string under = folder == "/" ? "/" : folder + "/";
+        w.sql = "(ancestor = ? OR (ancestor >= ? AND ancestor < ?))";
+        w.args = {folder, under, *PrefixUpperBound(under)};
+        break;
+      }
       if (id_field) {
         w.sql = "path = ?";
       } else {

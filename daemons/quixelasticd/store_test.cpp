@@ -94,7 +94,7 @@ TEST(PrefixUpperBoundTest, IncrementsTheLastByteThatCan) {
   EXPECT_FALSE(PrefixUpperBound(std::string("\xff\xff", 2)).has_value());
 }
 
-TEST(SuggestionTermsTest, KeepsWordsNotNumbers) {
+TEST(SuggestionTest, OffersWordsNotNumbersOrSingleCharacters) {
   EXPECT_TRUE(IsSuggestible("beach"));
   EXPECT_FALSE(IsSuggestible("2024"));
   EXPECT_FALSE(IsSuggestible("a"));
@@ -151,6 +151,10 @@ TEST_F(StoreTest, PrefixQueriesStopAtTheFolderBoundary) {
   by_parent.field = "QUIXMDParent";
   by_parent.kind = DocQuery::Kind::kTerm;
   EXPECT_THAT(Paths(by_parent), ElementsAre("/v/s/a/x.txt"));
+  // The ancestor field matches a folder and everything below it.
+  DocQuery by_ancestor = by_parent;
+  by_ancestor.field = "QUIXMDSearchAncestor";
+  EXPECT_THAT(Paths(by_ancestor), ElementsAre("/v/s/a/x.txt", "/v/s/a/y/z.txt"));
 
   WriteTxn txn(*store_);
   EXPECT_EQ(store_->DeleteByQuery(Prefix("/v/s/a/")), 2);

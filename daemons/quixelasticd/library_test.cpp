@@ -1,0 +1,181 @@
+// The library's own search-index commands against the real daemon: real files on a configured
+// share, extracted by the library, indexed, re-pathed and deleted through the daemon's socket.
+#include <sys/stat.h>
+
+#include <algorithm>
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "common/error.hpp"
+#include "common/json_util.hpp"
+#include "common/sdk/share.hpp"
+#include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/test_client.hpp"
+#include "fileindex/elastic_control.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace elasticd {
+namespace {
+
+namespace el = ::orvane::fileindex::elastic;
+using ::testing::ElementsAre;
+using ::testing::UnorderedElementsAre;
+
+template <typename Fn>
+int ErrorCodeOf(Fn fn) {
+  try {
+    fn();
+  } catch (const Error& e) {
+    return e.code;
+  }
+  return 0;
+}
+
+class LibraryTest : public ::testing::Test {
+ protected:
+  LibraryTest() : root_(dir_.path()) {
+    share_ = volume_.Path("photo");
+    test::WritePlatformConfig(dir_.path(), R"({"shares": [
+      {"name": "photo", "path": ")" + share_ + R"("},
+      {"name": "pics", "path": ")" + volume_.Path("pics") + R"("}]})");
+  }
+  void SetUp() override {
+    daemon_ = std::make_unique<tc::DaemonProcess>(dir_.path());
+    ASSERT_TRUE(daemon_->WaitReady());
+  }
+  // A real file on the share, indexed with its file-system attributes.
+  std::string AddFile(const std::string& rel) {
+    const std::string path = volume_.Write("photo/" + rel, "content of " + rel);
+    el::IndexUpsert("photo", path, false);
+    return path;
+  }
+  std::string AddDir(const std::string& rel) {
+    const std::string path = share_ + "/" + rel;
+    ::mkdir(path.c_str(), 0755);
+    el::IndexUpsert("photo", path, false);
+    return path;
+  }
+  std::vector<std::string> Below(const std::string& dir, const std::string& db = "fileindex_photo") {
+    std::vector<std::string> paths;
+    el::IndexGetByPrefixPath(db, dir, paths);
+    std::sort(paths.begin(), paths.end());
+    return paths;
+  }
+
+  test::TempDir dir_;
+  test::TempDir volume_;
+  test::ScopedRoot root_;
+  test::LogCapture log_;
+  std::string share_;
+  std::unique_ptr<tc::DaemonProcess> daemon_;
+};
+
+TEST_F(LibraryTest, DocumentCommandsFollowTheFiles) {
+  el::ShareIndexCreate("photo");
+  el::ShareIndexCreate("photo");  // sent again on every folder change: the index stays
+  const std::string dir = AddDir("trip");
+  const std::string a = AddFile("trip/a.jpg");
+  const std::string b = AddFile("trip/day2/b.jpg");
+  AddFile("trip2/c.jpg");
+  EXPECT_TRUE(el::IsDocumentExists("photo", a));
+  EXPECT_FALSE(el::IsDocumentExists("photo", share_ + "/nothing"));
+  el::IndexAttr("photo", a);
+  EXPECT_EQ(ErrorCodeOf([&] { el::IndexAttr("photo", share_ + "/never.jpg"); }), kErrNoDocument);
+
+  // /trip/ does not reach /trip2.
+  EXPECT_THAT(Below(dir), ElementsAre(a, b));
+
+  el::IndexRename("photo", share_ + "/holiday", dir);
+  EXPECT_THAT(Below(share_ + "/holiday"),
+              ElementsAre(share_ + "/holiday/a.jpg", share_ + "/holiday/day2/b.jpg"));
+  EXPECT_TRUE(Below(dir).empty());
+  EXPECT_TRUE(el::IsDocumentExists("photo", share_ + "/holiday"));
+  EXPECT_FALSE(el::IsDocumentExists("photo", dir));
+
+  el::IndexDelDir("photo", share_ + "/holiday");
+  EXPECT_TRUE(Below(share_ + "/holiday").empty());
+  EXPECT_TRUE(el::IsDocumentExists("photo", share_ + "/holiday"));  // the folder's own stays
+  el::IndexDel("photo", share_ + "/holiday");
+  EXPECT_FALSE(el::IsDocumentExists("photo", share_ + "/holiday"));
+  el::IndexCommit("photo");
+  EXPECT_THAT(Below(share_), ElementsAre(share_ + "/trip2/c.jpg"));
+
+  // What people find: the library's documents carry what search and suggest need.
+  Json::Value search;
+  search["command"] = "search";
+  search["data"]["name"] = "c.j";
+  search["data"]["folder"] = share_;
+  const Json::Value found = tc::Request(daemon_->socket(), search);
+  ASSERT_EQ(found["data"]["total"], 1) << JsonToString(found);
+  EXPECT_EQ(found["data"]["hits"][0]["path"], share_ + "/trip2/c.jpg");
+}
+
+TEST_F(LibraryTest, RenameOfMoreDocumentsThanOnePass) {
+  el::ShareIndexCreate("photo");
+  const std::string dir = AddDir("many");
+  // Upserts in compound batches, as a bulk loader would; the library's rename then needs two
+  // query passes of 10000 with a commit between them.
+  Json::Value batch;
+  batch["compound"] = Json::Value(Json::arrayValue);
+  for (int i = 0; i < 10003; ++i) {
+    const std::string sub = dir + "/s" + std::to_string(i % 7);
+    const std::string name = "f" + std::to_string(i) + ".txt";
+    Json::Value doc;
+    doc["QUIXMDPath"] = sub + "/" + name;
+    doc["QUIXMDFSName"] = name;
+    doc["QUIXMDParent"] = sub;
+    doc["QUIXMDSearchFileName"] = name;
+    doc["QUIXMDSearchAncestor"] = sub;
+    Json::Value req;
+    req["command"] = "document_upsert_by_id";
+    req["data"]["id"] = "fileindex_photo";
+    req["data"]["doc_id"] = doc["QUIXMDPath"];
+    req["data"]["data"] = doc;
+    batch["compound"].append(req);
+  }
+  ASSERT_EQ(tc::Request(daemon_->socket(), batch)["has_fail"], false);
+  el::IndexRename("photo", share_ + "/moved", dir);
+  std::vector<std::string> moved;
+  el::IndexGetByPrefixPath("fileindex_photo", share_ + "/moved", moved);
+  EXPECT_EQ(moved.size(), 1000u);  // one page of the daemon's default size
+  EXPECT_TRUE(Below(dir).empty());
+  EXPECT_TRUE(el::IsDocumentExists("photo", share_ + "/moved/s3/f10.txt"));
+}
+
+TEST_F(LibraryTest, IndexLifecycleAndSuggestions) {
+  el::ShareIndexCreate("photo");
+  const std::string a = AddFile("sunset beach.jpg");
+  el::ShareIndexPause("photo");
+  EXPECT_EQ(ErrorCodeOf([&] { AddFile("b.jpg"); }), kCodeIndexPaused);
+  el::ShareIndexResume("photo");
+  AddFile("b.jpg");
+
+  // Share renamed: the index is re-keyed and moved with its documents.
+  const std::string new_db = sdk::SDKShare("pics").GetDBPath();
+  el::ShareIndexRename("photo", "pics", new_db);
+  EXPECT_TRUE(el::IsDocumentExists("pics", a));
+  EXPECT_EQ(ErrorCodeOf([&] { el::IsDocumentExists("photo", a); }), kCodeIndexNotFound);
+  el::ShareIndexMigrate("pics", volume_.Path("elsewhere/db"));
+  EXPECT_TRUE(el::IsDocumentExists("pics", a));
+
+  std::vector<std::string> unavailable;
+  el::ListUnAvailTermSuggDB(unavailable);
+  EXPECT_TRUE(unavailable.empty());
+  el::UpdateTermSuggestion("fileindex_pics", {a});
+  el::IndexCommit("pics");
+  Json::Value suggest;
+  suggest["command"] = "suggest";
+  suggest["data"]["prefix"] = "suns";
+  EXPECT_EQ(JsonToString(tc::Request(daemon_->socket(), suggest)["data"]["suggestions"]),
+            "[\"sunset\"]");
+
+  el::ShareIndexDelete("pics");
+  el::ShareIndexDelete("pics");
+  EXPECT_EQ(ErrorCodeOf([&] { el::IsDocumentExists("pics", a); }), kCodeIndexNotFound);
+}
+
+}  // namespace
+}  // namespace elasticd
+}  // namespace orvane

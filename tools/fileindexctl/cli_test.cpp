@@ -1,0 +1,200 @@
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "common/json_util.hpp"
+#include "common/root.hpp"
+#include "test/fake_daemon.hpp"
+#include "test/test_util.hpp"
+#include "tools/fileindexctl/cli.hpp"
+
+namespace orvane {
+namespace ctl {
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::StartsWith;
+
+struct Result {
+  int status;
+  std::string out;
+  std::string err;
+};
+
+// Runs the real program with ORVANE_ROOT set, collecting both streams.
+Result RunCtl(const std::string& root, std::vector<std::string> args) {
+  test::TempDir io;
+  const std::string out_path = io.Path("out");
+  const std::string err_path = io.Path("err");
+  const pid_t pid = fork();
+  if (pid == 0) {
+    setenv("ORVANE_ROOT", root.c_str(), 1);
+    dup2(open(out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
+    dup2(open(err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
+    std::vector<char*> argv = {const_cast<char*>("fileindexctl")};
+    for (std::string& a : args) argv.push_back(a.data());
+    argv.push_back(nullptr);
+    execv(FILEINDEXCTL_BIN, argv.data());
+    _exit(127);
+  }
+  int status = 0;
+  waitpid(pid, &status, 0);
+  return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, test::ReadFile(out_path),
+          test::ReadFile(err_path)};
+}
+
+class CtlTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_EQ(mkdir(dir_.Path("vol").c_str(), 0755), 0);
+    ASSERT_EQ(mkdir(docs_.c_str(), 0755), 0);
+    ASSERT_EQ(mkdir((docs_ + "/reports").c_str(), 0755), 0);
+    test::WritePlatformConfig(dir_.path(), R"({"shares": [{"name": "docs", "path": ")" + docs_ +
+                                               R"("}], "admin_group": "root"})");
+    MakeParentDirs(dir_.Path("var/run/x"));
+  }
+  Result Run(std::vector<std::string> args) { return RunCtl(dir_.path(), std::move(args)); }
+
+  test::TempDir dir_;
+  std::string docs_ = dir_.Path("vol/docs");
+};
+
+TEST_F(CtlTest, HelpAndCommandLineMistakes) {
+  Result r = Run({"--help"});
+  EXPECT_EQ(r.status, 0);
+  EXPECT_THAT(r.out, HasSubstr("folder add"));
+  EXPECT_THAT(r.out, HasSubstr("status"));
+  EXPECT_EQ(Run({}).status, 2);
+  r = Run({"folder", "--help"});
+  EXPECT_EQ(r.status, 0);
+  EXPECT_THAT(r.out, HasSubstr("folder reindex"));
+  EXPECT_THAT(r.out, ::testing::Not(HasSubstr("share rename")));
+  r = Run({"search", "--help"});
+  EXPECT_EQ(r.status, 0);
+  EXPECT_THAT(r.out, StartsWith("usage: fileindexctl search [KEYWORDS...]"));
+
+  r = Run({"frobnicate"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_THAT(r.err, HasSubstr("unknown command \"frobnicate\""));
+  r = Run({"folder", "get"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_THAT(r.err, StartsWith("fileindexctl: missing PATH\nusage: fileindexctl folder get"));
+  r = Run({"folder", "list", "--colour", "red"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_THAT(r.err, HasSubstr("unknown option --colour"));
+  r = Run({"folder", "add", "/docs/reports", "--audio", "maybe"});
+  EXPECT_EQ(r.status, 2);
+  EXPECT_THAT(r.err, HasSubstr("--audio takes on or off"));
+}
+
+// The administration road end to end through the program, with stand-ins for the two daemons
+// that answer every command with success.
+TEST_F(CtlTest, FolderLifecycleWithHumanAndJsonOutput) {
+  const std::string ok = R"({"success":true,"data":{}})";
+  test::FakeDaemon engine(dir_.Path("var/run/quixelasticd.sock"), test::FakeDaemon::Replies({ok}));
+  test::FakeDaemon indexer(dir_.Path("var/run/fileindexd.sock"), test::FakeDaemon::Replies({ok}));
+
+  // A folder named by its place on disk is stored by its share path.
+  Result r = Run({"folder", "add", docs_ + "/reports", "--name", "Reports", "--photo", "on"});
+  ASSERT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("added 1 folder(s)"));
+
+  r = Run({"folder", "list"});
+  ASSERT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("/docs/reports"));
+  EXPECT_THAT(r.out, HasSubstr("document,photo"));
+  EXPECT_THAT(r.out, HasSubstr("1 of 1 folder(s)"));
+
+  r = Run({"--json", "folder", "list"});
+  JsonValue listed;
+  ASSERT_TRUE(listed.fromString(r.out)) << r.out;
+  EXPECT_EQ(listed["total"].asUInt(), 1u);
+  EXPECT_EQ(listed["folders"][0]["name"], "Reports");
+
+  ASSERT_EQ(Run({"folder", "set", "/docs/reports", "--document", "off"}).status, 0);
+  r = Run({"--json", "folder", "get", "/docs/reports"});
+  JsonValue got;
+  ASSERT_TRUE(got.fromString(r.out)) << r.out;
+  EXPECT_FALSE(got["document"].asBool());
+  EXPECT_TRUE(got["photo"].asBool());
+
+  ASSERT_EQ(Run({"folder", "delete", "/docs/reports"}).status, 0);
+  r = Run({"folder", "get", "/docs/reports"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_THAT(r.err, StartsWith("fileindexctl: the folder is not indexed (error 902)"));
+  EXPECT_THAT(r.err, HasSubstr("\"fileindexctl folder list\" shows indexed folders"));
+  EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1);
+
+  r = Run({"folder", "add", "/nosuchshare/x"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_THAT(r.err, StartsWith("fileindexctl: "));
+}
+
+TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
+  const std::string reply =
+      R"({"success":true,"data":{"total":1,"total_exact":true,"hits":[{"path":")" + docs_ +
+      R"(/reports/q3.pdf","name":"q3.pdf","ext":"pdf","size":1536,"mtime":1700000000,)"
+      R"("is_dir":false,"snippet":"the <b>revenue</b> grew","score":1.5}]}})";
+  test::FakeDaemon engine(dir_.Path("var/run/quixelasticd.search.sock"),
+                          test::FakeDaemon::Replies({reply}));
+  Result r = Run({"search", "revenue", "growth", "--name", "q3", "--ext", "PDF,docx", "--min-size",
+                  "1k", "--folder", "/docs/reports", "--sort", "size", "--desc"});
+  ASSERT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("q3.pdf"));
+  EXPECT_THAT(r.out, HasSubstr("1.5 KiB"));
+  EXPECT_THAT(r.out, HasSubstr("the *revenue* grew"));
+  EXPECT_THAT(r.out, HasSubstr("showing 1-1 of 1 file(s)"));
+  const Json::Value req = engine.json_requests().at(0);
+  EXPECT_EQ(req["command"], "search");
+  const Json::Value& data = req["data"];
+  EXPECT_EQ(data["keyword"], "revenue growth");
+  EXPECT_EQ(data["name"], "q3");
+  EXPECT_EQ(JsonToString(data["ext"]), R"(["pdf","docx"])");
+  EXPECT_EQ(data["size_range"]["gte"].asUInt64(), 1024u);
+  EXPECT_EQ(data["folder"], docs_ + "/reports");  // the share path, searched on disk
+  EXPECT_EQ(data["sort"], "size");
+  EXPECT_EQ(data["order"], "desc");
+
+  EXPECT_EQ(Run({"search"}).status, 2);
+  // No engine at all: one clear line.
+  test::TempDir empty;
+  r = RunCtl(empty.path(), {"search", "x"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_THAT(r.err, StartsWith("fileindexctl: the search engine cannot be reached (error 913)"));
+}
+
+TEST_F(CtlTest, StatusWithNothingRunning) {
+  Result r = Run({"status"});
+  ASSERT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("quixelasticd"));
+  EXPECT_THAT(r.out, HasSubstr("stopped"));
+  EXPECT_THAT(r.out, HasSubstr("no indexed folders"));
+  r = Run({"status", "--wait", "--timeout", "5"});
+  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("indexing is idle"));
+}
+
+TEST(CliTest, ValuesPeopleType) {
+  EXPECT_EQ(ParseSize("10k"), 10240u);
+  EXPECT_EQ(ParseSize("2M"), 2u << 20);
+  EXPECT_THROW(ParseSize("lots"), UsageError);
+  EXPECT_EQ(ParseTime("1700000000"), 1700000000);
+  EXPECT_GT(ParseTime("2024-05-06"), 1700000000);
+  EXPECT_THROW(ParseTime("yesterday"), UsageError);
+  EXPECT_EQ(HumanSize(912), "912 B");
+  EXPECT_EQ(HumanSize(1536), "1.5 KiB");
+  EXPECT_EQ(ReasonOf("Orvane error, code=902, reason=[/docs/x]"), "/docs/x");
+  EXPECT_EQ(ReasonOf("Orvane error, code=902"), "Orvane error, code=902");
+  Args args({"a", "--size", "3", "--desc", "--name=x", "--", "--literal"}, {"desc"});
+  EXPECT_EQ(args.positional(), (std::vector<std::string>{"a", "--literal"}));
+  EXPECT_EQ(args.GetInt("size", 0), 3);
+  EXPECT_EQ(args.Get("name"), "x");
+  EXPECT_TRUE(args.Has("desc"));
+}
+
+}  // namespace
+}  // namespace ctl
+}  // namespace orvane

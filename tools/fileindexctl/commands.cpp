@@ -1,0 +1,751 @@
+#include "tools/fileindexctl/commands.hpp"
+
+#include <pwd.h>
+#include <signal.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <cstring>
+#include <fstream>
+
+#include "common/env.hpp"
+#include "common/error.hpp"
+#include "common/json_util.hpp"
+#include "common/root.hpp"
+#include "common/util.hpp"
+#include "fileindex/index_mgr.hpp"
+#include "fileindex/notifyd_cfg.hpp"
+#include "fileindex/status_mgr.hpp"
+#include "fileindex/util.hpp"
+#include "platform/daemon_sock.hpp"
+
+namespace orvane {
+namespace ctl {
+
+void Output::Emit(const Json::Value& value, const std::function<void(std::ostream&)>& human) {
+  if (json_) {
+    Json::StreamWriterBuilder builder;
+    builder["emitUTF8"] = true;
+    builder["indentation"] = "  ";
+    out_ << Json::writeString(builder, value) << '\n';
+  } else {
+    human(out_);
+  }
+}
+
+void Output::Done(const std::string& message) {
+  Json::Value ok(Json::objectValue);
+  ok["success"] = true;
+  Emit(ok, [&message](std::ostream& out) { out << message << '\n'; });
+}
+
+namespace {
+
+using namespace orvane::fileindex;  // NOLINT: the operations read best unqualified here
+
+const char kEngineSearchSocket[] = "/var/run/quixelasticd.search.sock";
+const char kEngineSocket[] = "/var/run/quixelasticd.sock";
+const char kIndexerSocket[] = "/var/run/fileindexd.sock";
+
+// A folder named on the command line: a share path ("/music/rock") as the configuration keeps
+// it, or a folder on disk inside a share, turned into its share path.
+std::string SharePathOf(const std::string& arg) {
+  if (!arg.empty() && arg[0] == '/' && IsDirExist(arg, true)) {
+    try {
+      std::string share_name;
+      std::string share_path;
+      GetShareNamePathByFullPath(share_name, share_path, RealPath(arg));
+      return "/" + share_name + RealPath(arg).substr(share_path.size());
+    } catch (const Error&) {
+      // Not inside a share on this disk: it may still be a share path.
+    }
+  }
+  return arg;
+}
+
+Json::Value SharePaths(const Args& args, const std::string& what) {
+  Json::Value paths(Json::arrayValue);
+  args.At(0, what);
+  for (const std::string& p : args.positional()) paths.append(SharePathOf(p));
+  return paths;
+}
+
+std::string CurrentUserName() {
+  struct passwd* pw = getpwuid(geteuid());
+  return pw != nullptr ? pw->pw_name : std::to_string(geteuid());
+}
+
+std::string Kinds(const Json::Value& folder) {
+  std::string kinds;
+  for (const char* kind : {"document", "audio", "video", "photo"}) {
+    if (folder[kind].asBool()) kinds += std::string(kinds.empty() ? "" : ",") + kind;
+  }
+  return kinds.empty() ? "names only" : kinds;
+}
+
+std::string StatusText(const Json::Value& folder) {
+  const Json::Value& status = folder["additional"]["status"];
+  if (!status.isObject()) return "";
+  std::string text = status["text"].asString();
+  if (status.isMember("desc")) text += " (" + status["desc"].asString() + ")";
+  return text;
+}
+
+void ApplyFolderOptions(const Args& args, Json::Value& folder) {
+  if (args.Has("name")) folder["name"] = args.Get("name");
+  for (const char* kind : {"document", "audio", "video", "photo"}) {
+    folder[kind] = args.GetSwitch(kind, folder[kind].asBool());
+  }
+  if (args.Has("group")) folder["group"] = args.Get("group");
+  if (args.Has("owner")) folder["owner"] = args.Get("owner");
+}
+
+// One request and one reply over a daemon's socket; false with the reason when the daemon
+// cannot be reached or answers garbage.
+bool Exchange(const std::string& socket, const std::string& payload, Json::Value& reply,
+              std::string& error) {
+  quixdaemon::DomainSockConnection conn(socket);
+  conn.SetTimeouts(30000, 30000);
+  std::string text;
+  if (!conn.Connect(2000) || !conn.Send(payload) || !conn.Recv(text)) {
+    error = socket + ": " + std::strerror(errno);
+    return false;
+  }
+  JsonValue parsed;
+  if (!parsed.fromString(text) || !parsed.isObject()) {
+    error = socket + ": the reply is not a JSON object";
+    return false;
+  }
+  reply = parsed;
+  return true;
+}
+
+// A people's command to the search engine, on its public socket when there is one.
+Json::Value AskEngine(const std::string& command, const Json::Value& data) {
+  Json::Value req(Json::objectValue);
+  req["command"] = command;
+  req["data"] = data;
+  std::string socket = RootedPath(kEngineSearchSocket);
+  if (access(socket.c_str(), F_OK) != 0) socket = RootedPath(kEngineSocket);
+  Json::Value reply;
+  std::string error;
+  if (!Exchange(socket, JsonToString(req), reply, error)) throw Error(kErrElastic, error);
+  if (!reply["success"].isBool() || !reply["success"].asBool()) {
+    const Json::Value& err = reply["error"];
+    throw Error(kErrElastic, err.isObject() ? err["msg"].asString() + " (engine code " +
+                                                  std::to_string(err["code"].asInt()) + ")"
+                                            : JsonToString(reply));
+  }
+  return reply["data"];
+}
+
+// ---- folders
+
+void FolderAddCmd(const Args& args, Output& out) {
+  if (args.Has("name") && args.positional().size() > 1) {
+    throw UsageError("--name names one folder: give a single PATH with it");
+  }
+  Json::Value list(Json::arrayValue);
+  for (const Json::Value& path : SharePaths(args, "PATH")) {
+    Json::Value folder(Json::objectValue);
+    folder["path"] = path;
+    folder["name"] = Basename(path.asString());
+    folder["document"] = true;
+    folder["audio"] = folder["video"] = folder["photo"] = false;
+    folder["owner"] = CurrentUserName();
+    folder["privileged"] = geteuid() == 0;
+    ApplyFolderOptions(args, folder);
+    list.append(folder);
+  }
+  FolderAdd(list, false);
+  out.Done("added " + std::to_string(list.size()) + " folder(s); indexing starts at once");
+}
+
+void FolderSetCmd(const Args& args, Output& out) {
+  const std::string path = SharePathOf(args.At(0, "PATH"));
+  Json::Value folder = FolderGet(path, Json::Value(Json::arrayValue));
+  ApplyFolderOptions(args, folder);
+  Json::Value list(Json::arrayValue);
+  list.append(folder);
+  FolderSet(list, false);
+  out.Done("updated " + path);
+}
+
+void FolderDeleteCmd(const Args& args, Output& out) {
+  const Json::Value paths = SharePaths(args, "PATH");
+  FolderDelete(paths);
+  out.Done("removed " + std::to_string(paths.size()) + " folder(s) from the index");
+}
+
+void FolderReindexCmd(const Args& args, Output& out) {
+  const Json::Value paths = SharePaths(args, "PATH");
+  FolderReindex(paths);
+  out.Done("queued " + std::to_string(paths.size()) + " folder(s) for re-indexing");
+}
+
+void FolderListCmd(const Args& args, Output& out) {
+  Json::Value req(Json::objectValue);
+  if (args.Has("keyword")) req["keyword"] = args.Get("keyword");
+  if (args.Has("group")) req["group"] = args.Get("group");
+  if (args.Has("sort")) req["sort_by"] = args.Get("sort");
+  req["sort_direction"] = args.Has("desc") ? "desc" : "asc";
+  if (args.Has("offset")) req["offset"] = static_cast<Json::UInt>(args.GetInt("offset", 0));
+  if (args.Has("limit")) req["limit"] = static_cast<Json::UInt>(args.GetInt("limit", 0));
+  req["additional"].append("status");
+  const Json::Value res = FolderList(req);
+  out.Emit(res, [&res](std::ostream& os) {
+    Table table({"PATH", "NAME", "CONTENT", "GROUP", "STATUS"});
+    for (const Json::Value& f : res["folders"]) {
+      table.Add({f["path"].asString(), f["name"].asString(), Kinds(f), f["group"].asString(),
+                 StatusText(f)});
+    }
+    if (table.empty()) {
+      os << "no indexed folders (add one with \"fileindexctl folder add PATH\")\n";
+      return;
+    }
+    table.Print(os);
+    os << res["folders"].size() << " of " << res["total"].asUInt() << " folder(s)\n";
+  });
+}
+
+void FolderGetCmd(const Args& args, Output& out) {
+  Json::Value additional(Json::arrayValue);
+  additional.append("status");
+  const Json::Value f = FolderGet(SharePathOf(args.At(0, "PATH")), additional);
+  out.Emit(f, [&f](std::ostream& os) {
+    Table table({"FIELD", "VALUE"});
+    table.Add({"path", f["path"].asString()});
+    table.Add({"name", f["name"].asString()});
+    table.Add({"content", Kinds(f)});
+    table.Add({"owner", f["owner"].asString()});
+    table.Add({"group", f["group"].asString()});
+    table.Add({"paused", YesNo(f["paused"].asBool())});
+    table.Add({"status", StatusText(f)});
+    table.Print(os);
+  });
+}
+
+void FolderGroupsCmd(const Args&, Output& out) {
+  const Json::Value groups = FolderListGroups();
+  out.Emit(groups, [&groups](std::ostream& os) {
+    for (const Json::Value& g : groups) os << g.asString() << '\n';
+  });
+}
+
+// ---- shares, volumes, users, homes
+
+std::function<void(const Args&, Output&)> OneArg(void (*op)(const std::string&),
+                                                 const std::string& what, const std::string& done) {
+  return [op, what, done](const Args& args, Output& out) {
+    const std::string value = args.At(0, what);
+    op(value);
+    out.Done(done + " " + value);
+  };
+}
+
+std::function<void(const Args&, Output&)> TwoArgs(
+    void (*op)(const std::string&, const std::string&), const std::string& first,
+    const std::string& second, const std::string& done) {
+  return [=](const Args& args, Output& out) {
+    const std::string a = args.At(0, first);
+    const std::string b = args.At(1, second);
+    op(a, b);
+    out.Done(done + " " + a + " -> " + b);
+  };
+}
+
+unsigned int Uid(const Args& args) {
+  const std::string text = args.At(0, "UID or user name");
+  if (struct passwd* pw = getpwnam(text.c_str())) return pw->pw_uid;
+  char* end = nullptr;
+  const unsigned long uid = std::strtoul(text.c_str(), &end, 10);
+  if (text.empty() || *end != '\0' || uid > UINT_MAX) {
+    throw UsageError("\"" + text + "\" is neither a user name nor a user id");
+  }
+  return static_cast<unsigned int>(uid);
+}
+
+platform::AUTH_TYPE Auth(const Args& args) {
+  const std::string auth = args.Get("auth", "all");
+  if (auth == "local") return platform::AUTH_LOCAL;
+  if (auth == "domain") return platform::AUTH_DOMAIN;
+  if (auth == "ldap") return platform::AUTH_LDAP;
+  if (auth == "all") return platform::AUTH_ALL;
+  throw UsageError("--auth takes local, domain, ldap or all");
+}
+
+// ---- search
+
+Json::Value SearchRequest(const Args& args) {
+  Json::Value data(Json::objectValue);
+  std::string keywords;
+  for (const std::string& word : args.positional())
+    keywords += (keywords.empty() ? "" : " ") + word;
+  if (!keywords.empty()) data["keyword"] = keywords;
+  if (args.Has("name")) data["name"] = args.Get("name");
+  if (args.Has("folder")) {
+    std::string folder = args.Get("folder");
+    // A share path is searched as the folder it names on disk.
+    if (!IsDirExist(folder, true)) {
+      try {
+        folder = GetFullPath(folder);
+      } catch (const Error&) {
+      }
+    }
+    data["folder"] = folder;
+  }
+  if (args.Has("ext")) {
+    std::string list = args.Get("ext");
+    for (size_t pos = 0; pos <= list.size();) {
+      const size_t comma = std::min(list.find(',', pos), list.size());
+      if (comma > pos) data["ext"].append(ToLower(list.substr(pos, comma - pos)));
+      pos = comma + 1;
+    }
+  }
+  if (args.Has("type")) data["file_type"] = args.Get("type");
+  if (args.Has("min-size"))
+    data["size_range"]["gte"] = Json::UInt64(ParseSize(args.Get("min-size")));
+  if (args.Has("max-size"))
+    data["size_range"]["lte"] = Json::UInt64(ParseSize(args.Get("max-size")));
+  if (args.Has("after")) data["mtime_range"]["gte"] = Json::Int64(ParseTime(args.Get("after")));
+  if (args.Has("before")) data["mtime_range"]["lte"] = Json::Int64(ParseTime(args.Get("before")));
+  if (args.Has("sort")) data["sort"] = args.Get("sort");
+  if (args.Has("desc")) data["order"] = "desc";
+  data["from"] = static_cast<Json::Int64>(args.GetInt("from", 0));
+  data["size"] = static_cast<Json::Int64>(args.GetInt("size", 20));
+  if (args.Has("share")) data["id"] = "fileindex_" + args.Get("share");
+  if (data.size() == 2 + (args.Has("share") ? 1 : 0)) {
+    throw UsageError("give keywords, --name or a filter to search for");
+  }
+  return data;
+}
+
+// Engine snippets mark matches with <b></b>; a terminal shows them between asterisks.
+std::string PlainSnippet(std::string text) {
+  for (const char* tag : {"<b>", "</b>"}) {
+    for (size_t pos; (pos = text.find(tag)) != std::string::npos;)
+      text.replace(pos, strlen(tag), "*");
+  }
+  return text;
+}
+
+void SearchCmd(const Args& args, Output& out) {
+  const Json::Value req = SearchRequest(args);
+  const Json::Value res = AskEngine("search", req);
+  out.Emit(res, [&res, &req](std::ostream& os) {
+    const Json::Value& hits = res["hits"];
+    if (hits.empty()) {
+      os << "no files found\n";
+      return;
+    }
+    Table table({"NAME", "SIZE", "MODIFIED", "FOLDER"});
+    for (const Json::Value& hit : hits) {
+      const std::string path = hit["path"].asString();
+      table.Add({hit["name"].asString() + (hit["is_dir"].asBool() ? "/" : ""),
+                 hit["is_dir"].asBool() ? "-" : HumanSize(hit["size"].asUInt64()),
+                 HumanTime(hit["mtime"].asInt64()), Dirname(path)});
+    }
+    table.Print(os);
+    bool snippets = false;
+    for (const Json::Value& hit : hits) {
+      if (!hit["snippet"].isString() || hit["snippet"].asString().empty()) continue;
+      if (!snippets) os << '\n';
+      snippets = true;
+      os << hit["path"].asString() << "\n    " << PlainSnippet(hit["snippet"].asString()) << '\n';
+    }
+    const Json::Int64 from = req["from"].asInt64();
+    os << "showing " << from + 1 << "-" << from + static_cast<Json::Int64>(hits.size()) << " of "
+       << res["total"].asInt64() << (res["total_exact"].asBool() ? "" : "+") << " file(s)\n";
+  });
+}
+
+void SuggestCmd(const Args& args, Output& out) {
+  Json::Value data(Json::objectValue);
+  data["prefix"] = args.At(0, "PREFIX");
+  data["size"] = static_cast<Json::Int64>(args.GetInt("size", 10));
+  const Json::Value res = AskEngine("suggest", data);
+  out.Emit(res, [&res](std::ostream& os) {
+    for (const Json::Value& s : res["suggestions"]) os << s.asString() << '\n';
+  });
+}
+
+// ---- pause and services
+
+void PauseCmd(const Args& args, Output& out) {
+  const long long hours = args.GetInt("hours", 0);
+  if (hours < 0 || hours > 24 * 365) throw UsageError("--hours takes 0 to 8760");
+  StatusMgr().Pause(static_cast<int>(hours));
+  out.Done(hours == 0 ? "indexing paused until \"fileindexctl resume\""
+                      : "indexing paused for " + std::to_string(hours) + " hour(s)");
+}
+
+void ResumeCmd(const Args&, Output& out) {
+  StatusMgr().Resume();
+  out.Done("indexing resumed");
+}
+
+void ServicesPrepareCmd(const Args&, Output& out) {
+  PrepareServices();
+  out.Done("services switched to match the indexed folders");
+}
+
+// ---- status
+
+// A daemon is running when its pid file names a live process.
+Json::Value DaemonState(const std::string& name) {
+  Json::Value state(Json::objectValue);
+  state["name"] = name;
+  state["running"] = false;
+  std::ifstream in(RootedPath("/var/run/" + name + ".pid"));
+  long pid = 0;
+  if (in >> pid && pid > 0 && (kill(static_cast<pid_t>(pid), 0) == 0 || errno == EPERM)) {
+    state["running"] = true;
+    state["pid"] = static_cast<Json::Int64>(pid);
+  }
+  return state;
+}
+
+Json::Value CollectStatus() {
+  Json::Value status(Json::objectValue);
+  for (const char* daemon : {"quixelasticd", "fileindexd", "quixnotifyd"}) {
+    status["daemons"].append(DaemonState(daemon));
+  }
+  status["summary"] = FolderSummary();
+  Json::Value req(Json::objectValue);
+  req["additional"].append("status");
+  status["folders"] = FolderList(req)["folders"];
+  // The indexing daemon's own counters, when it is up.
+  Json::Value reply;
+  std::string error;
+  Json::Value cmd(Json::objectValue);
+  cmd["type"] = "status";
+  cmd["data"] = Json::Value();
+  if (Exchange(RootedPath(kIndexerSocket), JsonToString(cmd) + std::string(1, '\0'), reply,
+               error)) {
+    status["indexer"] = reply;
+  }
+  return status;
+}
+
+uint64_t QueuedEvents(const Json::Value& status) {
+  uint64_t queued = 0;
+  for (const Json::Value& share : status["summary"]["shares"]) {
+    queued += share["queue_length"].asUInt64();
+  }
+  return queued;
+}
+
+void PrintStatus(const Json::Value& status, std::ostream& os) {
+  Table daemons({"DAEMON", "STATE", "PID"});
+  for (const Json::Value& d : status["daemons"]) {
+    daemons.Add({d["name"].asString(), d["running"].asBool() ? "running" : "stopped",
+                 d.isMember("pid") ? std::to_string(d["pid"].asInt64()) : "-"});
+  }
+  daemons.Print(os);
+  const Json::Value& summary = status["summary"];
+  os << '\n';
+  if (summary["paused"].asBool()) {
+    const long long until = summary["resume_time"].asInt64();
+    os << "indexing is paused" << (until > 0 ? " until " + HumanTime(until) : "") << "\n\n";
+  }
+  Table shares({"SHARE", "FOLDERS", "QUEUED", "NEEDS REINDEX", "VOLUME PAUSED"});
+  for (const Json::Value& s : summary["shares"]) {
+    shares.Add({s["share"].asString(), std::to_string(s["folder_count"].asUInt()),
+                std::to_string(s["queue_length"].asUInt64()), YesNo(s["need_reindex"].asBool()),
+                YesNo(s["volume_paused"].asBool())});
+  }
+  if (!shares.empty()) {
+    shares.Print(os);
+    os << '\n';
+  }
+  Table folders({"FOLDER", "STATUS"});
+  for (const Json::Value& f : status["folders"]) {
+    folders.Add({f["path"].asString(), StatusText(f)});
+  }
+  if (folders.empty()) {
+    os << "no indexed folders\n";
+  } else {
+    folders.Print(os);
+  }
+  if (status.isMember("indexer")) {
+    os << "\nindexer: " << JsonToString(status["indexer"]) << '\n';
+  }
+}
+
+void StatusCmd(const Args& args, Output& out) {
+  if (!args.Has("wait")) {
+    const Json::Value status = CollectStatus();
+    out.Emit(status, [&status](std::ostream& os) { PrintStatus(status, os); });
+    return;
+  }
+  // Waits for the queues to drain, drawing a bar against the largest backlog seen.
+  const long long timeout = args.GetInt("timeout", 0);
+  const int64_t start = Env::Current()->NowMicros();
+  uint64_t most = 0;
+  for (;;) {
+    const Json::Value status = CollectStatus();
+    const uint64_t queued = QueuedEvents(status);
+    most = std::max(most, queued);
+    if (!out.json()) {
+      const int width = 40;
+      const int filled = most == 0 ? width : static_cast<int>(width * (most - queued) / most);
+      out.stream() << "\r[" << std::string(filled, '#') << std::string(width - filled, ' ') << "] "
+                   << queued << " change(s) queued   " << std::flush;
+    }
+    if (queued == 0) {
+      if (!out.json()) out.stream() << "\nindexing is idle\n";
+      out.Emit(status, [](std::ostream&) {});
+      return;
+    }
+    if (timeout > 0 && Env::Current()->NowMicros() - start > timeout * 1000000) {
+      if (!out.json()) out.stream() << '\n';
+      throw Error(kErrSystem, "still " + std::to_string(queued) + " change(s) queued after " +
+                                  std::to_string(timeout) + " s");
+    }
+    Env::Current()->SleepMicros(500000);
+  }
+}
+
+}  // namespace
+
+const std::vector<Command>& Commands() {
+  static const std::vector<Command> commands = {
+      {"folder",
+       "add",
+       "PATH... [--name NAME] [--document on|off] [--audio on|off] "
+       "[--video on|off] [--photo on|off] [--group GROUP] [--owner USER]",
+       "index folders (documents by default; names and attributes always)",
+       {"name", "document", "audio", "video", "photo", "group", "owner"},
+       {},
+       1000,
+       FolderAddCmd},
+      {"folder",
+       "set",
+       "PATH [--name NAME] [--document on|off] [--audio on|off] "
+       "[--video on|off] [--photo on|off] [--group GROUP]",
+       "change an indexed folder's settings",
+       {"name", "document", "audio", "video", "photo", "group", "owner"},
+       {},
+       1,
+       FolderSetCmd},
+      {"folder",
+       "delete",
+       "PATH...",
+       "stop indexing folders and drop their documents",
+       {},
+       {},
+       1000,
+       FolderDeleteCmd},
+      {"folder",
+       "list",
+       "[--keyword TEXT] [--group GROUP] [--sort name|path] [--desc] "
+       "[--offset N] [--limit N]",
+       "list indexed folders with their status",
+       {"keyword", "group", "sort", "offset", "limit"},
+       {"desc"},
+       0,
+       FolderListCmd},
+      {"folder", "get", "PATH", "show one indexed folder", {}, {}, 1, FolderGetCmd},
+      {"folder",
+       "reindex",
+       "PATH...",
+       "index folders again from scratch",
+       {},
+       {},
+       1000,
+       FolderReindexCmd},
+      {"folder", "groups", "", "list the groups folders are shown to", {}, {}, 0, FolderGroupsCmd},
+      {"share",
+       "rename",
+       "FROM TO",
+       "follow a share's new name",
+       {},
+       {},
+       2,
+       TwoArgs(ShareRename, "FROM", "TO", "renamed share")},
+      {"share",
+       "pause",
+       "SHARE",
+       "stop indexing a share",
+       {},
+       {},
+       1,
+       OneArg(SharePause, "SHARE", "paused share")},
+      {"share",
+       "resume",
+       "SHARE",
+       "index a paused share again",
+       {},
+       {},
+       1,
+       OneArg(ShareResume, "SHARE", "resumed share")},
+      {"share",
+       "rebuild",
+       "SHARE",
+       "rebuild a share's index from scratch",
+       {},
+       {},
+       1,
+       OneArg(ShareRebuild, "SHARE", "rebuilding share")},
+      {"share",
+       "clear-paused",
+       "SHARE SHARE_PATH",
+       "drop a paused share's index data",
+       {},
+       {},
+       2,
+       TwoArgs(ShareClearPaused, "SHARE", "SHARE_PATH", "cleared")},
+      {"share",
+       "auto-clean",
+       "SHARE",
+       "drop the folders of a share that is gone",
+       {},
+       {},
+       1,
+       OneArg(ShareAutoClean, "SHARE", "cleaned share")},
+      {"share",
+       "check-recycle",
+       "SHARE",
+       "apply the recycle-bin rules to a share again",
+       {},
+       {},
+       1,
+       OneArg(ShareCheckRecycle, "SHARE", "re-checking recycle bin of")},
+      {"share",
+       "migrate",
+       "SHARE FROM_PATH",
+       "follow a share moved to another volume",
+       {},
+       {},
+       2,
+       TwoArgs(ShareMigrate, "SHARE", "FROM_PATH", "migrated")},
+      {"volume",
+       "pause",
+       "VOLUME",
+       "stop indexing every share on a volume",
+       {},
+       {},
+       1,
+       OneArg(VolumePause, "VOLUME", "paused volume")},
+      {"volume",
+       "resume",
+       "VOLUME",
+       "index a volume's shares again",
+       {},
+       {},
+       1,
+       OneArg(VolumeResume, "VOLUME", "resumed volume")},
+      {"volume",
+       "clear-paused",
+       "VOLUME",
+       "drop the index data of a paused volume",
+       {},
+       {},
+       1,
+       OneArg(VolumeClearPaused, "VOLUME", "cleared volume")},
+      {"user",
+       "rename",
+       "FROM TO",
+       "follow a user's new name",
+       {},
+       {},
+       2,
+       TwoArgs(UserRename, "FROM", "TO", "renamed user")},
+      {"user",
+       "delete",
+       "USER",
+       "drop the indexed folders of a deleted user's home",
+       {},
+       {},
+       1,
+       [](const Args& args, Output& out) {
+         UserDelete(Uid(args));
+         out.Done("removed the home folders of user " + args.At(0, "USER"));
+       }},
+      {"user",
+       "remember",
+       "USER",
+       "record a user's home for a later delete",
+       {},
+       {},
+       1,
+       [](const Args& args, Output& out) {
+         UserRemember(Uid(args));
+         out.Done("remembered the home of user " + args.At(0, "USER"));
+       }},
+      {"home",
+       "enable",
+       "[--auth local|domain|ldap|all]",
+       "the home service was switched on",
+       {"auth"},
+       {},
+       0,
+       [](const Args& args, Output& out) {
+         HomeEnable(Auth(args));
+         out.Done("home recycle bins queued for re-indexing");
+       }},
+      {"home",
+       "disable",
+       "[--auth local|domain|ldap|all]",
+       "the home service was switched off",
+       {"auth"},
+       {},
+       0,
+       [](const Args& args, Output& out) {
+         HomeDisable(Auth(args));
+         out.Done("home recycle bins queued for re-indexing");
+       }},
+      {"services",
+       "prepare",
+       "",
+       "start or stop the services indexing depends on",
+       {},
+       {},
+       0,
+       ServicesPrepareCmd},
+      {"",
+       "pause",
+       "[--hours N]",
+       "pause all indexing (0 hours: until resumed)",
+       {"hours"},
+       {},
+       0,
+       PauseCmd},
+      {"", "resume", "", "resume all indexing", {}, {}, 0, ResumeCmd},
+      {"",
+       "search",
+       "[KEYWORDS...] [--name TEXT] [--folder PATH] [--ext EXT,...] "
+       "[--type document|audio|video|photo|folder] [--min-size SIZE] "
+       "[--max-size SIZE] [--after DATE] [--before DATE] "
+       "[--sort relevance|name|size|mtime] [--desc] [--from N] [--size N] "
+       "[--share SHARE]",
+       "search file names, contents and metadata",
+       {"name", "folder", "ext", "type", "min-size", "max-size", "after", "before", "sort", "from",
+        "size", "share"},
+       {"desc"},
+       1000,
+       SearchCmd},
+      {"",
+       "suggest",
+       "PREFIX [--size N]",
+       "complete a word being typed",
+       {"size"},
+       {},
+       1,
+       SuggestCmd},
+      {"",
+       "status",
+       "[--wait [--timeout SECONDS]]",
+       "daemons, queues and folder status; --wait shows progress until indexing is idle",
+       {"timeout"},
+       {"wait"},
+       0,
+       StatusCmd},
+  };
+  return commands;
+}
+
+}  // namespace ctl
+}  // namespace orvane
