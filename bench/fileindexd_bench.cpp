@@ -2,7 +2,9 @@
 //   1. first indexing of a 100,000-file tree by name and attributes (files per second);
 //   2. delay from a file's close-write to its appearance in a search (median, 95th percentile);
 //   3. a burst of 100,000 changes (ten writes to each of 10,000 files), coalesced and applied;
-//   4. peak memory (VmHWM) of each daemon.
+//   4. first indexing with contents of a mixed text corpus (UTF-8 and Latin-1 text, CSV, HTML,
+//      Markdown; MB and files per second);
+//   5. peak memory (VmHWM) of each daemon.
 // Built with the benchmarks, run by hand (a non-sanitized release build gives the real figures):
 //   fileindexd_bench [files]
 #include <signal.h>
@@ -14,6 +16,8 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
+#include <iterator>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -53,6 +57,22 @@ long PeakKb(pid_t pid) {
   return -1;
 }
 
+// User plus system CPU seconds the process has used so far.
+double CpuSeconds(pid_t pid) {
+  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
+  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  const size_t close = text.rfind(')');
+  if (close == std::string::npos) return -1;
+  std::istringstream rest(text.substr(close + 2));
+  std::string field;
+  unsigned long long utime = 0, stime = 0;
+  for (int i = 3; i <= 15 && rest >> field; ++i) {
+    if (i == 14) utime = std::stoull(field);
+    if (i == 15) stime = std::stoull(field);
+  }
+  return double(utime + stime) / sysconf(_SC_CLK_TCK);
+}
+
 bool Searchable(const std::string& name) {
   Json::Value q(Json::objectValue);
   q["name"] = name;
@@ -70,7 +90,7 @@ int main(int argc, char** argv) {
   const int files = argc > 1 ? std::atoi(argv[1]) : 100000;
   constexpr int kPerDir = 1000;
   setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BIN, 1);
-  System sys({"bench"});
+  System sys({"bench", "content"});
   sys.WriteFolders(Json::Value(Json::arrayValue));
   const std::string tree = sys.Vol("bench/tree");
   for (int i = 0; i < files; ++i) {
@@ -79,6 +99,41 @@ int main(int argc, char** argv) {
     std::ofstream(dir + "/f" + std::to_string(i) + ".txt") << i;
   }
   const int dirs = (files + kPerDir - 1) / kPerDir;
+  // The content corpus: 2,000 files of 2 to 64 KiB of words in five formats.
+  constexpr int kContentFiles = 2000;
+  const char* const kExts[] = {".txt", ".csv", ".html", ".md", ".log"};
+  const char* const kWords[] = {"invoice", "quarterly", "revenue", "holiday", "garden",
+                                "report",  "meeting",   "budget",  "caf\xe9", "na\xefve"};
+  uint64_t content_bytes = 0;
+  unsigned seed = 7;
+  for (int i = 0; i < kContentFiles; ++i) {
+    const std::string path = sys.Vol("content/c" + std::to_string(i % 20) + "/doc" +
+                                     std::to_string(i) + kExts[i % 5]);
+    orvane::MakeParentDirs(path);
+    const size_t size = 2048 + (seed = seed * 1103515245u + 12345u) % (62 * 1024);
+    std::string text;
+    if (i % 5 == 2) text = "<html><body><p>";
+    while (text.size() < size) {
+      // Every third file is Latin-1: its accented words are single bytes.
+      std::string word = kWords[(seed = seed * 1103515245u + 12345u) % 10];
+      if (i % 3 != 0) {
+        std::string utf8;
+        for (unsigned char c : word) {
+          if (c < 0x80) {
+            utf8 += char(c);
+          } else {
+            utf8 += char(0xC0 | (c >> 6));
+            utf8 += char(0x80 | (c & 0x3F));
+          }
+        }
+        word = utf8;
+      }
+      text += word + (i % 5 == 1 ? "," : " ");
+      if (text.size() % 80 < 8) text += "\n";
+    }
+    std::ofstream(path) << text;
+    content_bytes += text.size();
+  }
   auto engine = sys.StartEngine();
   auto notifyd = sys.StartNotifyd();
   auto indexd = sys.StartIndexd();
@@ -93,6 +148,8 @@ int main(int argc, char** argv) {
   const double first = Seconds(t0, Clock::now());
   std::printf("first indexing: %d files (+%d folders) in %.2f s = %.0f files/s\n", files, dirs,
               first, files / first);
+  std::printf("  CPU seconds so far: quixelasticd %.2f, quixnotifyd %.2f, fileindexd %.2f\n",
+              CpuSeconds(engine->pid()), CpuSeconds(notifyd->pid()), CpuSeconds(indexd->pid()));
 
   // 2. Close-write to searchable.
   std::vector<double> delays;
@@ -133,6 +190,17 @@ int main(int argc, char** argv) {
   std::printf("burst: %d changes written in %.2f s, applied %.2f s after the last write"
               " (%.2f s in all)\n",
               burst_files * 10, Seconds(b0, b1), Seconds(b1, b2) - 0.3, Seconds(b0, b2) - 0.3);
+
+  // 4. Contents.
+  Json::Value content(Json::arrayValue);
+  content.append(System::Folder("/content", true));
+  const auto c0 = Clock::now();
+  orvane::fileindex::FolderAdd(content, false);
+  WaitFor([&] { return Documents("fileindex_content") >= kContentFiles + 21; }, 3600 * 1000);
+  const double with_content = Seconds(c0, Clock::now());
+  std::printf("first indexing with contents: %d files, %.1f MB in %.2f s = %.2f MB/s, %.0f files/s\n",
+              kContentFiles, content_bytes / 1e6, with_content,
+              content_bytes / 1e6 / with_content, kContentFiles / with_content);
 
   std::printf("peak memory (VmHWM): quixelasticd %ld KiB, quixnotifyd %ld KiB, fileindexd %ld KiB\n",
               PeakKb(engine->pid()), PeakKb(notifyd->pid()), PeakKb(indexd->pid()));

@@ -78,7 +78,13 @@ void IndexDaemon::Reload() {
   }
   for (const auto& share : to_stop) StopWorker(share);
   for (const auto& share : indexed) {
-    if (paused.count(share) == 0) StartWorker(share);
+    if (paused.count(share) != 0) continue;
+    // One share the platform no longer knows must not keep the others from starting.
+    try {
+      StartWorker(share);
+    } catch (const Error& e) {
+      Log(LOG_ERR, "fileindexd: no worker for share %s: %s", share.c_str(), e.what());
+    }
   }
 }
 

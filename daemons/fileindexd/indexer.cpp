@@ -60,6 +60,8 @@ class Indexer::Batch {
       Log(LOG_WARNING, "fileindexd: %s not indexed: %s", path.c_str(), e.what());
       return;
     }
+    // Name-only documents are small; with contents the file's size bounds the extracted text.
+    bytes_ += need_meta ? 512 + doc[QUIX::CONTENT_EXTRACT::QUIXMDFSSize].asUInt64() : 512;
     doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchFileName] = doc[QUIX::CONTENT_EXTRACT::QUIXMDFSName];
     doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchAncestor] = doc[QUIX::CONTENT_EXTRACT::QUIXMDParent];
     Json::Value data(Json::objectValue);
@@ -81,18 +83,20 @@ class Indexer::Batch {
     Json::Value req(Json::objectValue);
     req["compound"] = std::move(reqs_);
     reqs_ = Json::Value(Json::arrayValue);
+    bytes_ = 0;
     el::SendRequest(req);
   }
 
  private:
   void Add(Json::Value req) {
     reqs_.append(std::move(req));
-    if (reqs_.size() >= kCrawlBatchSize) Flush();
+    if (reqs_.size() >= kCrawlBatchSize || bytes_ >= kCrawlBatchBytes) Flush();
   }
 
   Indexer* owner_;
   std::string id_;
   Json::Value reqs_;
+  uint64_t bytes_ = 0;
 };
 
 Indexer::Indexer(const std::string& share, const std::atomic<bool>* stop)

@@ -22,6 +22,9 @@ namespace fileindexd {
 
 // Upserts and deletes a crawl sends per compound request.
 constexpr size_t kCrawlBatchSize = 512;
+// ... or fewer, once the contents extracted for a batch reach about this many bytes, so that a
+// crawl of large text files does not hold hundreds of them in memory at once.
+constexpr uint64_t kCrawlBatchBytes = 8 << 20;
 // Documents asked for per page when listing what the index holds below a directory.
 constexpr unsigned int kListPageSize = 10000;
 
