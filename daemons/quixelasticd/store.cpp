@@ -13,6 +13,7 @@
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/json_writer.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -362,10 +363,10 @@ void IndexStore::Upsert(const std::string& doc_id, Json::Value doc) {
     const int64_t rowid = find.Int(0);
     const DerivedDoc old = schema_.Derive(ParseBody(find.Text(1)));
     find.Reset();
-    WriteRow(rowid, d, JsonToString(doc), false, &old);
+    WriteRow(rowid, d, CompactJson(doc), false, &old);
   } else {
     find.Reset();
-    WriteRow(0, d, JsonToString(doc), true, nullptr);
+    WriteRow(0, d, CompactJson(doc), true, nullptr);
   }
 }
 
@@ -403,7 +404,7 @@ void IndexStore::SetFields(const std::string& doc_id, const Json::Value& fields)
       other.Reset();
     }
   }
-  WriteRow(rowid, d, JsonToString(doc), false, &old);
+  WriteRow(rowid, d, CompactJson(doc), false, &old);
 }
 
 bool IndexStore::Delete(const std::string& doc_id) {
