@@ -9,6 +9,7 @@
 #include <ctime>
 #include <fstream>
 #include <functional>
+#include <optional>
 
 #include "common/env.hpp"
 #include "common/json_util.hpp"
@@ -64,6 +65,38 @@ constexpr int64_t kMaxSearchFrom = 1000000;
 
 bool IsPublicCommand(const std::string& command) {
   return command == "search" || command == "suggest";
+}
+
+// The index a document command of a batch writes to, or empty for any other command.
+std::string DocumentIndexOf(const Json::Value& sub) {
+  if (!sub.isObject() || sub.isMember("compound")) return std::string();
+  const Json::Value& command = sub["command"];
+  const Json::Value& data = sub["data"];
+  if (!command.isString() || !data.isObject()) return std::string();
+  const std::string name = command.asString();
+  const char* key = nullptr;
+  if (name == "update_term_suggestion") {
+    key = "db_name";
+  } else if (name == "document_upsert_by_id" || name == "document_set_by_id" ||
+             name == "document_del_by_id" || name == "document_del_by_query" ||
+             name == "document_get_by_query") {
+    key = "id";
+  } else {
+    return std::string();
+  }
+  const Json::Value& id = data[key];
+  return id.isString() ? id.asString() : std::string();
+}
+
+// Whether every request of a batch is a document command on one and the same index.
+bool IsOneIndexBatch(const Json::Value& list) {
+  std::string first;
+  for (const Json::Value& sub : list) {
+    const std::string id = DocumentIndexOf(sub);
+    if (id.empty() || (!first.empty() && id != first)) return false;
+    first = id;
+  }
+  return !first.empty();
 }
 
 const char* StateText(int code) {
@@ -128,6 +161,12 @@ class Engine::Session {
   Session& operator=(const Session&) = delete;
 
   void SetLostHandler(LostFn fn) { lost_ = std::move(fn); }
+
+  // Whether each command runs inside its own savepoint, so that a failed one is undone alone.
+  // Without them a failed command leaves its partial writes in the transaction, which the
+  // caller must then roll back as a whole.
+  void SetSavepoints(bool on) { savepoints_ = on; }
+  bool savepoints() const { return savepoints_; }
 
   IndexStore& Acquire(const std::string& id) {
     if (entry_ && entry_->id == id && txn_) return *entry_->store;
@@ -217,6 +256,7 @@ class Engine::Session {
   std::unique_ptr<WriteTxn> txn_;
   std::vector<size_t> pending_;
   LostFn lost_;
+  bool savepoints_ = true;
 };
 
 Engine::Engine(EngineOptions options) : options_(std::move(options)) {
@@ -460,6 +500,8 @@ Json::Value Engine::HandleValue(const Json::Value& request, const Caller& caller
 
   if (compound) return RunCompound(request["compound"], caller);
   Session session(*this);
+  // A failed request is rolled back whole when the session ends unfinished.
+  session.SetSavepoints(false);
   Json::Value reply = RunSingle(request, caller, session);
   if (reply["success"].asBool()) {
     try {
@@ -504,11 +546,25 @@ Json::Value Engine::RunSingle(const Json::Value& request, const Caller& caller,
 }
 
 Json::Value Engine::RunCompound(const Json::Value& list, const Caller& caller) {
+  // A savepoint makes the full-text tables write their pending terms out as a segment of their
+  // own, which for small documents costs more than the documents themselves. A batch on one
+  // index therefore first runs as a single transaction without them; only when one of its
+  // commands fails is all of it rolled back and run again with a savepoint per command.
+  if (IsOneIndexBatch(list)) {
+    Json::Value reply = RunCompoundPass(list, caller, false);
+    if (!reply.isNull()) return reply;
+  }
+  return RunCompoundPass(list, caller, true);
+}
+
+Json::Value Engine::RunCompoundPass(const Json::Value& list, const Caller& caller,
+                                    bool savepoints) {
   Json::Value reply;
   reply["success"] = true;
   reply["data"] = Json::Value(Json::arrayValue);
   Json::Value& results = reply["data"];
   Session session(*this);
+  session.SetSavepoints(savepoints);
   session.SetLostHandler([&](const std::vector<size_t>& which, int code, const std::string& msg) {
     for (size_t i : which) results[static_cast<Json::ArrayIndex>(i)] = ErrorReply(code, msg);
   });
@@ -520,8 +576,11 @@ Json::Value Engine::RunCompound(const Json::Value& list, const Caller& caller) {
     } else {
       result = RunSingle(sub, caller, session);
     }
-    results.append(result);
-    if (result["success"].asBool()) session.NoteWrite(i);
+    // The session's destructor rolls back whatever this pass wrote.
+    if (!savepoints && !result["success"].asBool()) return Json::Value();
+    const bool ok = result["success"].asBool();
+    results.append(std::move(result));
+    if (ok) session.NoteWrite(i);
   }
   session.FinishQuietly();
   bool has_fail = false;
@@ -554,18 +613,20 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
     const std::string db = RequireString(data, "db_name");
     const std::string doc_id = RequireString(data, "doc_id_field");
     IndexStore& store = session.Acquire(db);
-    Savepoint sp(store.writer());
+    std::optional<Savepoint> sp;
+    if (session.savepoints()) sp.emplace(store.writer());
     if (!store.UpdateTermSuggestion(doc_id)) {
       throw EngineError(kCodeDocNotFound, "no document " + doc_id);
     }
     if (store.Meta("term_sugg") == "unavail") store.SetMeta("term_sugg", "rebuilding");
-    sp.Release();
+    if (sp) sp->Release();
     return result;
   }
   if (!batched) throw EngineError(kCodeUnknownCommand, "unknown command: " + command);
   const std::string id = RequireString(data, "id");
   IndexStore& store = session.Acquire(id);
-  Savepoint sp(store.writer());
+  std::optional<Savepoint> sp;
+  if (session.savepoints()) sp.emplace(store.writer());
   if (command == "document_upsert_by_id") {
     const Json::Value& doc = data["data"];
     if (!doc.isObject()) throw EngineError(kCodeInvalidParam, "\"data\" must be an object");
@@ -603,7 +664,7 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
                                   options_.max_page_size);
     result = store.GetByQuery(q, load, from, size);
   }
-  sp.Release();
+  if (sp) sp->Release();
   return result;
 }
 

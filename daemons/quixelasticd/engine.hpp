@@ -111,6 +111,8 @@ class Engine {
                        Session& session);
   Json::Value RunSingle(const Json::Value& request, const Caller& caller, Session& session);
   Json::Value RunCompound(const Json::Value& list, const Caller& caller);
+  // One run of a batch; without savepoints it gives up (null) at the first failed command.
+  Json::Value RunCompoundPass(const Json::Value& list, const Caller& caller, bool savepoints);
 
   Json::Value IndexCreate(const Json::Value& data);
   Json::Value IndexDelete(const Json::Value& data);

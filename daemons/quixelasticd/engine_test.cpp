@@ -194,6 +194,44 @@ TEST_F(EngineTest, CompoundAnswersEachInOrderAndSeesItsOwnWrites) {
   EXPECT_EQ(m["data"][4]["data"]["total"], 1);
 }
 
+// A batch on one index runs first without a savepoint per command; a failure anywhere in it
+// must undo that run completely before the commands run again one by one.
+TEST_F(EngineTest, FailedCommandInAOneIndexBatchLeavesTheOthersDoneOnce) {
+  ASSERT_EQ(CodeOf(Create()), 0);
+  ASSERT_EQ(Send(Upsert("/v/share/e"))["success"], true);
+  Json::Value bad_doc = Upsert("/v/share/bad");
+  bad_doc["data"]["data"]["QUIXMDFSSize"] = "not a number";
+  Json::Value rekey = Cmd("document_set_by_id", Json::Value(Json::objectValue));
+  rekey["data"]["id"] = "fileindex_share";
+  rekey["data"]["doc_id"] = "/v/share/a";
+  rekey["data"]["data"]["QUIXMDPath"] = "/v/share/a2";
+  Json::Value missing = rekey;
+  missing["data"]["doc_id"] = "/v/share/none";
+  Json::Value del = Cmd("document_del_by_id", Json::Value(Json::objectValue));
+  del["data"]["id"] = "fileindex_share";
+  del["data"]["doc_id"] = "/v/share/e";
+
+  Json::Value req;
+  req["compound"].append(Upsert("/v/share/a"));
+  req["compound"].append(rekey);
+  req["compound"].append(del);
+  req["compound"].append(bad_doc);
+  req["compound"].append(missing);
+  req["compound"].append(Query("prefix", "/v/share/"));
+  req["compound"].append(Upsert("/v/share/b"));
+  const Json::Value r = Send(req);
+  ASSERT_EQ(r["data"].size(), 7u) << JsonToString(r);
+  EXPECT_EQ(r["has_fail"], true);
+  EXPECT_EQ(r["data"][1]["success"], true);
+  // Had the first run's delete stood, the second would have found nothing to delete.
+  EXPECT_EQ(r["data"][2]["data"]["deleted"], 1);
+  EXPECT_EQ(CodeOf(r["data"][3]), kCodeDocInvalid);
+  EXPECT_EQ(CodeOf(r["data"][4]), kCodeDocNotFound);
+  EXPECT_THAT(HitPaths(r["data"][5]), ::testing::ElementsAre("/v/share/a2"));
+  EXPECT_THAT(HitPaths(Send(Query("prefix", "/v/share/"))),
+              ::testing::ElementsAre("/v/share/a2", "/v/share/b"));
+}
+
 // The library's directory rename: one query per pass, then a batch of set_by_id requests that
 // still carry the query's members and a load_field list that grows on every pass.
 TEST_F(EngineTest, RenameLoopRequestsWithLeftoverMembersWork) {

@@ -13,6 +13,7 @@
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/json_writer.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -349,10 +350,17 @@ void IndexStore::DeleteRow(int64_t rowid, const DerivedDoc& old) {
   Cached("DELETE FROM docs WHERE rowid = ?").Bind(1, rowid).Run();
 }
 
-void IndexStore::Upsert(const std::string& doc_id, Json::Value doc) {
-  if (!doc.isObject()) throw EngineError(kCodeDocInvalid, "document is not an object");
+void IndexStore::Upsert(const std::string& doc_id, const Json::Value& given) {
+  if (!given.isObject()) throw EngineError(kCodeDocInvalid, "document is not an object");
   const std::string& pid = schema_.property_id();
-  if (!doc.isMember(pid) && !doc_id.empty()) doc[pid] = doc_id;
+  // Only a document that lacks its identifying field is copied, to fill it in.
+  Json::Value filled;
+  const bool fill = !given.isMember(pid) && !doc_id.empty();
+  if (fill) {
+    filled = given;
+    filled[pid] = doc_id;
+  }
+  const Json::Value& doc = fill ? filled : given;
   schema_.Validate(doc);
   const DerivedDoc d = schema_.Derive(doc);
   if (!doc_id.empty() && doc_id != d.path) Delete(doc_id);
@@ -362,10 +370,10 @@ void IndexStore::Upsert(const std::string& doc_id, Json::Value doc) {
     const int64_t rowid = find.Int(0);
     const DerivedDoc old = schema_.Derive(ParseBody(find.Text(1)));
     find.Reset();
-    WriteRow(rowid, d, JsonToString(doc), false, &old);
+    WriteRow(rowid, d, CompactJson(doc), false, &old);
   } else {
     find.Reset();
-    WriteRow(0, d, JsonToString(doc), true, nullptr);
+    WriteRow(0, d, CompactJson(doc), true, nullptr);
   }
 }
 
@@ -403,7 +411,7 @@ void IndexStore::SetFields(const std::string& doc_id, const Json::Value& fields)
       other.Reset();
     }
   }
-  WriteRow(rowid, d, JsonToString(doc), false, &old);
+  WriteRow(rowid, d, CompactJson(doc), false, &old);
 }
 
 bool IndexStore::Delete(const std::string& doc_id) {

@@ -91,7 +91,7 @@ class IndexStore {
   Db& writer() { return writer_; }
   // Adds or replaces a whole document. `doc_id` names the document it replaces; the document's
   // identity is its property_id field (filled from `doc_id` when absent).
-  void Upsert(const std::string& doc_id, Json::Value doc);
+  void Upsert(const std::string& doc_id, const Json::Value& doc);
   // Merges `fields` into the existing document `doc_id`; throws EngineError(kCodeDocNotFound).
   // Changing the identifying field re-keys it, replacing any document already under the new key.
   void SetFields(const std::string& doc_id, const Json::Value& fields);
