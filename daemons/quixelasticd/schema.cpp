@@ -23,17 +23,17 @@ namespace {
   throw EngineError(kCodeInvalidParam, "mappings: " + what);
 }
 
-void ReadSpec(FieldSpec& spec, const std::string& name, const Json::Value& attrs) {
+void ReadSpec(FieldSpec& field, const std::string& name, const Json::Value& attrs) {
   if (!attrs.isObject()) Invalid("attributes of " + name + " are not an object");
   for (const std::string& key : attrs.getMemberNames()) {
     const Json::Value& v = attrs[key];
     if (key == "type") {
       const std::string t = v.isString() ? v.asString() : "";
-      if (t == "string") spec.type = FieldType::kString;
-      else if (t == "text") spec.type = FieldType::kText;
-      else if (t == "int") spec.type = FieldType::kInt;
-      else if (t == "double") spec.type = FieldType::kDouble;
-      else if (t == "bool") spec.type = FieldType::kBool;
+      if (t == "string") field.type = FieldType::kString;
+      else if (t == "text") field.type = FieldType::kText;
+      else if (t == "int") field.type = FieldType::kInt;
+      else if (t == "double") field.type = FieldType::kDouble;
+      else if (t == "bool") field.type = FieldType::kBool;
       else Invalid("unknown type of " + name + ": " + JsonToString(v));
     } else if (key == "analyzer") {
       const std::string a = v.isString() ? v.asString() : "";
@@ -41,17 +41,17 @@ void ReadSpec(FieldSpec& spec, const std::string& name, const Json::Value& attrs
           a != "white space escaped") {
         Invalid("unknown analyzer of " + name + ": " + JsonToString(v));
       }
-      spec.analyzer = a;
+      field.analyzer = a;
     } else if (key == "required" || key == "stored" || key == "_all") {
       if (!v.isBool()) Invalid(key + " of " + name + " is not a bool");
-      (key == "required" ? spec.required : key == "stored" ? spec.stored : spec.all) = v.asBool();
+      (key == "required" ? field.required : key == "stored" ? field.stored : field.all) = v.asBool();
     } else if (key == "preprocess") {
       if (!v.isArray()) Invalid("preprocess of " + name + " is not an array");
       for (const Json::Value& p : v) {
         const std::string step = p.isString() ? p.asString() : "";
-        if (step == "tolower") spec.tolower = true;
-        else if (step == "ngram") spec.ngram = true;
-        else if (step == "list_ancestor") spec.list_ancestor = true;
+        if (step == "tolower") field.tolower = true;
+        else if (step == "ngram") field.ngram = true;
+        else if (step == "list_ancestor") field.list_ancestor = true;
         else Invalid("unknown preprocess of " + name + ": " + JsonToString(p));
       }
     }
@@ -59,14 +59,14 @@ void ReadSpec(FieldSpec& spec, const std::string& name, const Json::Value& attrs
   }
 }
 
-bool IsTextual(const FieldSpec& spec) {
-  return spec.type == FieldType::kString || spec.type == FieldType::kText;
+bool IsTextual(const FieldSpec& field) {
+  return field.type == FieldType::kString || field.type == FieldType::kText;
 }
 
 bool ScalarOk(const Json::Value& v) { return v.isString() || v.isNumeric() || v.isBool(); }
 
-bool ValueMatches(const FieldSpec& spec, const Json::Value& v) {
-  switch (spec.type) {
+bool ValueMatches(const FieldSpec& field, const Json::Value& v) {
+  switch (field.type) {
     case FieldType::kInt:
       return v.isIntegral() || (v.isDouble() && std::isfinite(v.asDouble()) &&
                                 std::floor(v.asDouble()) == v.asDouble() &&
@@ -140,11 +140,11 @@ Schema Schema::Parse(const Json::Value& mappings) {
     // Member order of the text is lost by the JSON reader; the catch-all text only needs a
     // stable order, which the sorted names give.
     for (const std::string& name : props.getMemberNames()) {
-      FieldSpec spec = s.default_;
-      ReadSpec(spec, name, props[name]);
-      s.fields_[name] = spec;
-      if (spec.ngram) s.ngram_fields_.push_back(name);
-      if (spec.list_ancestor && s.ancestor_field_.empty()) s.ancestor_field_ = name;
+      FieldSpec field = s.default_;
+      ReadSpec(field, name, props[name]);
+      s.fields_[name] = field;
+      if (field.ngram) s.ngram_fields_.push_back(name);
+      if (field.list_ancestor && s.ancestor_field_.empty()) s.ancestor_field_ = name;
     }
   }
   return s;
@@ -157,8 +157,8 @@ const FieldSpec& Schema::Field(const std::string& field) const {
 
 void Schema::Validate(const Json::Value& doc) const {
   if (!doc.isObject()) throw EngineError(kCodeDocInvalid, "document is not an object");
-  for (const auto& [name, spec] : fields_) {
-    if (!spec.required) continue;
+  for (const auto& [name, field] : fields_) {
+    if (!field.required) continue;
     const Json::Value* v = doc.find(name.data(), name.data() + name.size());
     if (v == nullptr || v->isNull() || (v->isString() && v->asString().empty())) {
       throw EngineError(kCodeDocInvalid, "required field missing: " + name);
@@ -206,10 +206,10 @@ DerivedDoc Schema::Derive(const Json::Value& doc) const {
   std::vector<std::string> parts;
   std::vector<std::string> folded;
   for (auto it = doc.begin(); it != doc.end(); ++it) {
-    const FieldSpec& spec = Field(it.name());
-    if (!spec.all || !IsTextual(spec)) continue;
+    const FieldSpec& field = Field(it.name());
+    if (!field.all || !IsTextual(field)) continue;
     std::string t = ValueText(*it);
-    if (spec.tolower) t = AsciiLower(t);
+    if (field.tolower) t = AsciiLower(t);
     std::string low = AsciiLower(t);
     if (t.empty() || std::find(folded.begin(), folded.end(), low) != folded.end()) continue;
     parts.push_back(std::move(t));

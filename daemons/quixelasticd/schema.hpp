@@ -58,7 +58,7 @@ class Schema {
   const std::string& property_id() const { return property_id_; }
   // The field whose value is expanded into its ancestors ("" when none).
   const std::string& ancestor_field() const { return ancestor_field_; }
-  // The spec of `field`: its own, or the default for fields the mappings do not list.
+  // The attributes of `field`: its own, or the default for fields the mappings do not list.
   const FieldSpec& Field(const std::string& field) const;
   bool IsListed(const std::string& field) const { return fields_.count(field) != 0; }
 
