@@ -2,10 +2,14 @@
 #ifndef ORVANE_PLATFORM_INTERNAL_HPP_
 #define ORVANE_PLATFORM_INTERNAL_HPP_
 
+#include <pwd.h>
+#include <sys/types.h>
+
 #include <cerrno>
 #include <cstddef>
 #include <cstdint>
 #include <string>
+#include <vector>
 
 #include "platform/fault.hpp"
 #include "platform/platform_error.hpp"
@@ -23,6 +27,9 @@ inline int FailWith(int result, int err, uint32_t code, const char* file, int li
 // Copies `text` with its NUL into buf; false (nothing copied beyond an empty string) when it
 // does not fit.
 bool CopyOut(const std::string& text, char* buf, size_t size);
+
+// The user's groups, primary group included.
+std::vector<gid_t> GroupList(const struct passwd& pw);
 
 // Whether `path` is `dir` itself or lies below it, comparing whole components.
 bool PathIsAtOrBelow(const std::string& path, const std::string& dir);

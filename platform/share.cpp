@@ -50,18 +50,6 @@ int FlagGet(const char* call, const QUIXSHARE* share, int* flag, int QUIXSHARE::
   return 0;
 }
 
-// The user's groups, primary group included.
-std::vector<gid_t> GroupsOf(const struct passwd& pw) {
-  int count = 32;
-  std::vector<gid_t> groups(count);
-  while (getgrouplist(pw.pw_name, pw.pw_gid, groups.data(), &count) < 0) {
-    groups.resize(static_cast<size_t>(count) + 32);
-    count = static_cast<int>(groups.size());
-  }
-  groups.resize(count);
-  return groups;
-}
-
 std::string GroupName(gid_t gid) {
   struct group gr;
   struct group* result = nullptr;
@@ -222,7 +210,7 @@ int QUIXShareUserPrivCalc(const char* user, const QUIXSHARE* share) {
     return PLATFORM_FAIL(-1, ENOENT, kQErrNoSuchUser);
   }
   if (pw.pw_uid == 0) return SHARE_READWRITE;
-  const std::vector<gid_t> groups = GroupsOf(pw);
+  const std::vector<gid_t> groups = GroupList(pw);
 
   // Entries naming the user or one of the user's groups: a denial anywhere wins, otherwise the
   // widest grant counts.

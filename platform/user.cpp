@@ -53,6 +53,8 @@ int FillUser(const struct passwd& pw, PQUIXUSER* user) {
   return 0;
 }
 
+}  // namespace
+
 std::vector<gid_t> GroupList(const struct passwd& pw) {
   int count = 32;
   std::vector<gid_t> groups(count);
@@ -63,8 +65,6 @@ std::vector<gid_t> GroupList(const struct passwd& pw) {
   groups.resize(count);
   return groups;
 }
-
-}  // namespace
 
 int QUIXUserGet(const char* name, PQUIXUSER* user) {
   PLATFORM_FAULT_POINT("QUIXUserGet", nullptr);
