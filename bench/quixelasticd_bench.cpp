@@ -225,7 +225,7 @@ int main(int argc, char** argv) {
   std::printf("SQLite %s; WAL, synchronous=NORMAL (commit syncs the log), cache_size=32 MiB,"
               " temp_store=MEMORY, page size 4096; FTS5 unicode61 (catch-all) and trigram"
               " (names)\n", sqlite3_libversion());
-  const uint64_t batch = 1000;
+  const uint64_t batch = argc > 2 ? std::strtoull(argv[2], nullptr, 10) : 1000;
   const uint64_t bulk = total - 125000;
   auto start = Clock::now();
   double cpu = CpuSeconds();

@@ -13,8 +13,11 @@
 
 namespace orvane {
 
-// The compact one-line text of a value (on the wire and in failure texts). UTF-8 passes as is.
+// The compact one-line text of a value (on the wire, in stored documents and in failure texts),
+// byte for byte what the library's compact writer produces. UTF-8 passes as is.
 std::string JsonToString(const Json::Value& value);
+// The same text, appended to `*out`.
+void AppendJson(const Json::Value& value, std::string* out);
 
 // A Json::Value with the three conveniences. It adds no data, so it converts both ways freely.
 class JsonValue : public Json::Value {
@@ -29,6 +32,7 @@ class JsonValue : public Json::Value {
 
   // Parses one JSON text (the whole text; trailing garbage fails). False and null on failure.
   bool fromString(const std::string& text);
+  bool fromString(const char* begin, const char* end);
   // Parses a whole file. False on a missing, unreadable or malformed file.
   bool fromFile(const std::string& path);
   // Writes the value, indented, to `path`: a temporary file beside it is written, synced and

@@ -455,10 +455,12 @@ int Engine::AdmitFrame(int64_t bytes) {
 void Engine::ReleaseFrame(int64_t bytes) { frame_bytes_.fetch_sub(bytes * kParsedWeight); }
 
 Json::Value Engine::Handle(const std::string& payload, const Caller& caller) {
-  std::string text = payload;
-  while (!text.empty() && text.back() == '\0') text.pop_back();
+  size_t len = payload.size();
+  while (len > 0 && payload[len - 1] == '\0') --len;
   JsonValue request;
-  if (!request.fromString(text)) return ErrorReply(kCodeMalformed, "request is not valid JSON");
+  if (!request.fromString(payload.data(), payload.data() + len)) {
+    return ErrorReply(kCodeMalformed, "request is not valid JSON");
+  }
   return HandleValue(request, caller);
 }
 

@@ -17,7 +17,6 @@
 #include "common/root.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
 #include "daemons/quixelasticd/frame.hpp"
-#include "daemons/quixelasticd/json_writer.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -106,7 +105,7 @@ void Server::AcceptLoop() {
 void Server::Serve(int fd, bool public_socket) {
   const int64_t deadline = Env::Current()->NowMicros() + options_.io_timeout_micros;
   auto reply = [&](const Json::Value& r) {
-    WriteFrame(fd, CompactJson(r), Env::Current()->NowMicros() + options_.io_timeout_micros);
+    WriteFrame(fd, JsonToString(r), Env::Current()->NowMicros() + options_.io_timeout_micros);
   };
   uint32_t length = 0;
   if (ReadFrameLength(fd, &length, deadline) != IoStatus::kOk) return;

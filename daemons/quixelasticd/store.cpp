@@ -13,7 +13,6 @@
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
-#include "daemons/quixelasticd/json_writer.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -370,10 +369,10 @@ void IndexStore::Upsert(const std::string& doc_id, const Json::Value& given) {
     const int64_t rowid = find.Int(0);
     const DerivedDoc old = schema_.Derive(ParseBody(find.Text(1)));
     find.Reset();
-    WriteRow(rowid, d, CompactJson(doc), false, &old);
+    WriteRow(rowid, d, JsonToString(doc), false, &old);
   } else {
     find.Reset();
-    WriteRow(0, d, CompactJson(doc), true, nullptr);
+    WriteRow(0, d, JsonToString(doc), true, nullptr);
   }
 }
 
@@ -411,7 +410,7 @@ void IndexStore::SetFields(const std::string& doc_id, const Json::Value& fields)
       other.Reset();
     }
   }
-  WriteRow(rowid, d, CompactJson(doc), false, &old);
+  WriteRow(rowid, d, JsonToString(doc), false, &old);
 }
 
 bool IndexStore::Delete(const std::string& doc_id) {
