@@ -48,9 +48,9 @@ std::string DescribeStatus(int status) {
 class Helper {
  public:
   enum class Outcome {
-    kFields,      // the reply held the fields
-    kFailed,      // the file failed: the helper replied an error, or crashed, hung or misbehaved
-    kWentStale,   // a helper that served before was gone or out of step before the request
+    kFields,     // the reply held the fields
+    kFailed,     // the file failed: the helper replied an error, or crashed, hung or misbehaved
+    kWentStale,  // a helper that served before was gone or out of step before the request
   };
 
   static std::unique_ptr<Helper> Start(const std::string& program, std::string* error);
@@ -68,7 +68,9 @@ class Helper {
 
  private:
   Helper(std::string program, pid_t pid, UniqueFd channel, UniqueFd errors)
-      : program_(std::move(program)), pid_(pid), channel_(std::move(channel)),
+      : program_(std::move(program)),
+        pid_(pid),
+        channel_(std::move(channel)),
         errors_(std::move(errors)) {}
 
   // Kills the process (a no-op on one that already died) and reaps it; its wait status. The
@@ -133,8 +135,7 @@ std::unique_ptr<Helper> Helper::Start(const std::string& program, std::string* e
     *error = "cannot start " + program + ": " + std::strerror(rc);
     return nullptr;
   }
-  return std::unique_ptr<Helper>(
-      new Helper(program, pid, std::move(channel), std::move(err_read)));
+  return std::unique_ptr<Helper>(new Helper(program, pid, std::move(channel), std::move(err_read)));
 }
 
 int Helper::KillAndReap() {

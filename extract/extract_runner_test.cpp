@@ -86,17 +86,17 @@ class ExtractRunnerTest : public ::testing::Test {
     return path;
   }
   // A script that stands in for a helper keeping to the protocol: it answers each request with
-  // its pid, and hangs or crashes on the files named for that.
+  // its pid, and hangs, crashes or answers twice on the files named for that.
   std::string ServingScript() {
-    return Script("serving",
-                  "while IFS= read -r -d '' path; do\n"
-                  "  case \"$path\" in\n"
-                  "    *hang*) exec sleep 30 ;;\n"
-                  "    *crash*) kill -SEGV $$ ;;\n"
-                  "    *twice*) printf '{\"fields\":{}}\\n{\"fields\":{}}\\n'; touch \"$path\" ;;\n"
-                  "    *) printf '{\"fields\":{\"pid\":%d}}\\n' $$ ;;\n"
-                  "  esac\n"
-                  "done");
+    return Script("serving", R"(
+while IFS= read -r -d '' path; do
+  case "$path" in
+    *hang*) exec sleep 30 ;;
+    *crash*) kill -SEGV $$ ;;
+    *twice*) printf '{"fields":{}}\n{"fields":{}}\n'; touch "$path" ;;
+    *) printf '{"fields":{"pid":%d}}\n' $$ ;;
+  esac
+done)");
   }
   test::TempDir dir_;
 };
@@ -185,7 +185,9 @@ TEST_F(ExtractRunnerTest, RealHelperStartsCleanUnderItsLimits) {
   EXPECT_EQ(SoftLimit(pid, "Max file size"), "0");
   EXPECT_EQ(SoftLimit(pid, "Max core file size"), "0");
   EXPECT_EQ(SoftLimit(pid, "Max open files"), "64");
-  if (!TEST_ASAN) EXPECT_EQ(SoftLimit(pid, "Max address space"), "1073741824");
+  if (!TEST_ASAN) {
+    EXPECT_EQ(SoftLimit(pid, "Max address space"), "1073741824");
+  }
 }
 
 // A hostile file is a helper that hangs, floods, crashes or talks nonsense: the indexer gets a
@@ -288,15 +290,16 @@ TEST_F(ExtractRunnerTest, ConcurrentCallersEachGetAHelper) {
   constexpr int kCallers = 4;
   const std::string helper =
       Script("barrier",
-             "while IFS= read -r -d '' path; do\n"
-             "  touch \"" + dir_.Path("arrived.") + "$$\"\n"
-             "  for i in $(seq 200); do\n"
-             "    arrived=(\"" + dir_.Path("arrived.") + "\"*)\n"
-             "    [ ${#arrived[@]} -ge " + std::to_string(kCallers) + " ] && break\n"
-             "    sleep 0.05\n"
-             "  done\n"
-             "  printf '{\"fields\":{\"pid\":%d,\"seen\":%d}}\\n' $$ ${#arrived[@]}\n"
-             "done");
+             "marks=" + dir_.Path("arrived") + "\ncallers=" + std::to_string(kCallers) + "\n" + R"(
+while IFS= read -r -d '' path; do
+  touch "$marks.$$"
+  for i in $(seq 200); do
+    arrived=("$marks".*)
+    [ ${#arrived[@]} -ge $callers ] && break
+    sleep 0.05
+  done
+  printf '{"fields":{"pid":%d,"seen":%d}}\n' $$ ${#arrived[@]}
+done)");
   setenv("FILEINDEX_EXTRACT_HELPER", helper.c_str(), 1);
   std::vector<Json::Value> results(kCallers);
   std::vector<std::thread> threads;
@@ -320,7 +323,9 @@ TEST_F(ExtractRunnerTest, ConcurrentCallersEachGetAHelper) {
   const std::vector<pid_t> idle = IdleExtractHelpers();
   EXPECT_LE(idle.size(), std::max(1u, std::thread::hardware_concurrency()));
   for (pid_t pid : pids) {
-    if (std::find(idle.begin(), idle.end(), pid) == idle.end()) EXPECT_TRUE(Reaped(pid)) << pid;
+    if (std::find(idle.begin(), idle.end(), pid) == idle.end()) {
+      EXPECT_TRUE(Reaped(pid)) << pid;
+    }
   }
   CloseIdleExtractHelpers();
   for (pid_t pid : idle) EXPECT_TRUE(Reaped(pid)) << pid;
