@@ -7,7 +7,8 @@
 // error).
 //
 // Runs under its own limits (memory, no file writes, few descriptors, no core dump, and CPU time
-// for each file), so a hostile file costs at most this one process.
+// for each file), so a hostile file costs at most this one process. The limit on file writes
+// covers its output too: read it through a pipe or a socket, never redirect it to a file.
 #include <fcntl.h>
 #include <sys/resource.h>
 #include <unistd.h>

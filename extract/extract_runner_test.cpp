@@ -11,6 +11,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <chrono>
+#include <cstdio>
 #include <cstring>
 #include <fstream>
 #include <memory>
@@ -130,6 +131,34 @@ TEST_F(ExtractRunnerTest, RealHelperServesFileAfterFileAndIsRetiredAfterAFailure
   const pid_t last = IdleExtractHelpers()[0];
   CloseIdleExtractHelpers();
   EXPECT_TRUE(Reaped(last));
+}
+
+// The protocol seen from outside: a name may hold a newline, a reply never does, and the end
+// of the requests ends the helper.
+TEST_F(ExtractRunnerTest, RealHelperAnswersEachRequestOnOneLine) {
+  const std::string odd = dir_.Write("two\nlines.txt", "odd name");
+  dir_.Write("requests", dir_.Write("a.txt", "first\nsecond") + '\0' + dir_.Path("missing") + '\0' +
+                             odd + '\0');
+  // Read through a pipe: the helper may not write files, its replies included.
+  FILE* helper =
+      popen((std::string(EXTRACT_HELPER_BINARY) + " < " + dir_.Path("requests")).c_str(), "r");
+  ASSERT_NE(helper, nullptr);
+  std::vector<std::string> lines;
+  std::string line;
+  for (int c; (c = std::fgetc(helper)) != EOF;) {
+    if (c != '\n') {
+      line += static_cast<char>(c);
+    } else {
+      lines.push_back(line);
+      line.clear();
+    }
+  }
+  EXPECT_EQ(pclose(helper), 0);
+  EXPECT_EQ(line, "");
+  ASSERT_EQ(lines.size(), 3u);
+  EXPECT_EQ(lines[0], R"({"fields":{"QUIXMDTextContent":"first\nsecond"}})");
+  EXPECT_EQ(lines[1], R"({"error":"cannot open: No such file or directory"})");
+  EXPECT_EQ(lines[2], R"({"fields":{"QUIXMDTextContent":"odd name"}})");
 }
 
 // The caller's thread blocks signals, its process ignores SIGPIPE and holds a descriptor open
