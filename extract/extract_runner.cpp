@@ -176,10 +176,10 @@ std::string Helper::Ended(std::string errors) {
 
 Helper::Outcome Helper::Extract(const std::string& path, const ExtractLimits& limits,
                                 Json::Value* fields, std::string* error) {
-  // What it wrote on standard error since its last reply belongs to no file.
-  ReadErrors(nullptr);
   std::string errors;
   if (served_ > 0) {
+    // What it wrote on standard error since its last reply belongs to no file.
+    ReadErrors(nullptr);
     // A reply nobody asked for, or a closed socket, means this helper is out of step or gone;
     // that is no fault of this file.
     char probe;
