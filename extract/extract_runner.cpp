@@ -125,7 +125,11 @@ std::unique_ptr<Helper> Helper::Start(const std::string& program, std::string* e
   sigfillset(&all);
   posix_spawnattr_setsigmask(&attr, &none);
   posix_spawnattr_setsigdefault(&attr, &all);
-  posix_spawnattr_setflags(&attr, POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF);
+  // A group of its own: a Ctrl-C meant for a daemon in the foreground is not a reason to fail
+  // the file in hand; helpers end when they are told to, or when their input ends.
+  posix_spawnattr_setpgroup(&attr, 0);
+  posix_spawnattr_setflags(&attr,
+                           POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETPGROUP);
   char* argv[] = {const_cast<char*>("fileindex-extract"), nullptr};
   pid_t pid = -1;
   const int rc = posix_spawn(&pid, program.c_str(), &actions, &attr, argv, environ);

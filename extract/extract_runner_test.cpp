@@ -162,7 +162,8 @@ TEST_F(ExtractRunnerTest, RealHelperAnswersEachRequestOnOneLine) {
 }
 
 // The caller's thread blocks signals, its process ignores SIGPIPE and holds a descriptor open
-// across exec: none of that reaches the helper, which runs under its limits.
+// across exec: none of that reaches the helper, which runs in a process group of its own under
+// its limits.
 TEST_F(ExtractRunnerTest, RealHelperStartsCleanUnderItsLimits) {
   const std::string leak_path = dir_.Write("leak", "");
   UniqueFd leak(open(leak_path.c_str(), O_RDONLY));  // no O_CLOEXEC, on purpose
@@ -186,6 +187,7 @@ TEST_F(ExtractRunnerTest, RealHelperStartsCleanUnderItsLimits) {
   ASSERT_EQ(IdleExtractHelpers().size(), 1u);
   const pid_t pid = IdleExtractHelpers()[0];
 
+  EXPECT_EQ(getpgid(pid), pid);
   const unsigned long long blocked = std::stoull(Status(pid, "SigBlk"), nullptr, 16);
   const unsigned long long ignored = std::stoull(Status(pid, "SigIgn"), nullptr, 16);
   for (int sig : {SIGPIPE, SIGXCPU, SIGXFSZ, SIGTERM}) {
