@@ -235,15 +235,13 @@ Helper::Outcome Helper::Extract(const std::string& path, const ExtractLimits& li
       return Outcome::kFailed;
     }
     reply.append(buf, static_cast<size_t>(n));
-    const size_t end = reply.find('\n');
-    if (end == std::string::npos) {
-      if (reply.size() > limits.max_output) {
-        KillAndReap();
-        *error = "printed more than " + std::to_string(limits.max_output) + " bytes";
-        return Outcome::kFailed;
-      }
-      continue;
+    const size_t end = reply.find('\n', reply.size() - static_cast<size_t>(n));
+    if ((end == std::string::npos ? reply.size() : end + 1) > limits.max_output) {
+      KillAndReap();
+      *error = "printed more than " + std::to_string(limits.max_output) + " bytes";
+      return Outcome::kFailed;
     }
+    if (end == std::string::npos) continue;
     if (end + 1 != reply.size()) {
       KillAndReap();
       *error = "printed more than one reply";

@@ -237,6 +237,9 @@ TEST_F(ExtractRunnerTest, MisbehavingHelpersAreContained) {
   small.max_output = 4096;
   EXPECT_FALSE(RunWith(Script("flood", "exec cat /dev/zero"), "/x", &fields, &error, small));
   EXPECT_EQ(error, "printed more than 4096 bytes");
+  EXPECT_FALSE(RunWith(Script("long", "printf '%*s\\n' 5000 ''; exec sleep 5"), "/x", &fields,
+                       &error, small));
+  EXPECT_EQ(error, "printed more than 4096 bytes");
 
   EXPECT_FALSE(RunWith(Script("crash", "kill -SEGV $$"), "/x", &fields, &error));
   EXPECT_EQ(error, "killed by Segmentation fault");
