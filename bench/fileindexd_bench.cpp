@@ -161,8 +161,8 @@ int main(int argc, char** argv) {
   uint64_t content_bytes = 0;
   unsigned seed = 7;
   for (int i = 0; i < kContentFiles; ++i) {
-    const std::string path =
-        sys.Vol("content/c" + std::to_string(i % 20) + "/doc" + std::to_string(i) + kExts[i % 5]);
+    const std::string path = sys.Vol("content/c" + std::to_string(i % 20) + "/doc" +
+                                     std::to_string(i) + kExts[i % 5]);
     orvane::MakeParentDirs(path);
     const size_t size = 2048 + (seed = seed * 1103515245u + 12345u) % (62 * 1024);
     std::string text;
@@ -255,17 +255,17 @@ int main(int argc, char** argv) {
     usleep(20000);
   }
   std::sort(delays.begin(), delays.end());
-  std::printf(
-      "close-write to searchable: median %.0f ms, p95 %.0f ms (100 files, polled every"
-      " 20 ms)\n",
-      delays[delays.size() / 2] * 1000, delays[delays.size() * 95 / 100] * 1000);
+  std::printf("close-write to searchable: median %.0f ms, p95 %.0f ms (100 files, polled every"
+              " 20 ms)\n",
+              delays[delays.size() / 2] * 1000, delays[delays.size() * 95 / 100] * 1000);
 
   // 3. A burst of changes: ten writes to each of 10,000 files.
   const int burst_files = std::min(files, 10000);
   const auto b0 = Clock::now();
   for (int round = 0; round < 10; ++round) {
     for (int i = 0; i < burst_files; ++i) {
-      std::ofstream(tree + "/d" + std::to_string(i / kPerDir) + "/f" + std::to_string(i) + ".txt")
+      std::ofstream(tree + "/d" + std::to_string(i / kPerDir) + "/f" + std::to_string(i) +
+                    ".txt")
           << round << "-" << i;
     }
   }
@@ -280,10 +280,9 @@ int main(int argc, char** argv) {
       },
       3600 * 1000);
   const auto b2 = Clock::now();
-  std::printf(
-      "burst: %d changes written in %.2f s, applied %.2f s after the last write"
-      " (%.2f s in all)\n",
-      burst_files * 10, Seconds(b0, b1), Seconds(b1, b2) - 0.3, Seconds(b0, b2) - 0.3);
+  std::printf("burst: %d changes written in %.2f s, applied %.2f s after the last write"
+              " (%.2f s in all)\n",
+              burst_files * 10, Seconds(b0, b1), Seconds(b1, b2) - 0.3, Seconds(b0, b2) - 0.3);
 
   // 4. Contents.
   double cpu[3] = {CpuSeconds(engine->pid()), CpuSeconds(indexd->pid()),
@@ -294,10 +293,9 @@ int main(int argc, char** argv) {
   orvane::fileindex::FolderAdd(content, false);
   WaitFor([&] { return Documents("fileindex_content") >= kContentFiles + 21; }, 3600 * 1000);
   const double with_content = Seconds(c0, Clock::now());
-  std::printf(
-      "first indexing with contents: %d files, %.1f MB in %.2f s = %.2f MB/s, %.0f files/s\n",
-      kContentFiles, content_bytes / 1e6, with_content, content_bytes / 1e6 / with_content,
-      kContentFiles / with_content);
+  std::printf("first indexing with contents: %d files, %.1f MB in %.2f s = %.2f MB/s, %.0f files/s\n",
+              kContentFiles, content_bytes / 1e6, with_content,
+              content_bytes / 1e6 / with_content, kContentFiles / with_content);
   PrintCpu(engine->pid(), indexd->pid(), cpu);
   Json::Value media(Json::arrayValue);
   media.append(System::Folder("/media", true));
@@ -316,9 +314,8 @@ int main(int argc, char** argv) {
       KeywordHits("fileindex_media", "quarterly"), quarterly);
   PrintCpu(engine->pid(), indexd->pid(), cpu);
 
-  std::printf(
-      "peak memory (VmHWM): quixelasticd %ld KiB, quixnotifyd %ld KiB, fileindexd %ld KiB\n",
-      PeakKb(engine->pid()), PeakKb(notifyd->pid()), PeakKb(indexd->pid()));
+  std::printf("peak memory (VmHWM): quixelasticd %ld KiB, quixnotifyd %ld KiB, fileindexd %ld KiB\n",
+              PeakKb(engine->pid()), PeakKb(notifyd->pid()), PeakKb(indexd->pid()));
   indexd->Signal(SIGTERM);
   notifyd->Signal(SIGTERM);
   engine->Signal(SIGTERM);
