@@ -3,10 +3,13 @@
 //   2. delay from a file's close-write to its appearance in a search (median, 95th percentile);
 //   3. a burst of 100,000 changes (ten writes to each of 10,000 files), coalesced and applied;
 //   4. first indexing with contents of a mixed text corpus (UTF-8 and Latin-1 text, CSV, HTML,
-//      Markdown; MB and files per second);
+//      Markdown; MB and files per second), then of small PDF, office (OOXML, OpenDocument), WAV
+//      and PNG files (files per second), with the CPU time of the engine, the indexer and its
+//      extraction helpers;
 //   5. peak memory (VmHWM) of each daemon.
 // Built with the benchmarks, run by hand (a non-sanitized release build gives the real figures):
 //   fileindexd_bench [files]
+#include <dirent.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -17,6 +20,7 @@
 #include <cstdlib>
 #include <fstream>
 #include <iterator>
+#include <memory>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -25,6 +29,7 @@
 #include "common/util.hpp"
 #include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/index_mgr.hpp"
+#include "test/sample_files.hpp"
 
 namespace {
 
@@ -73,6 +78,55 @@ double CpuSeconds(pid_t pid) {
   return double(utime + stime) / sysconf(_SC_CLK_TCK);
 }
 
+// CPU seconds of the children of `pid` (its extraction helpers), the running and the reaped.
+double ChildrenCpuSeconds(pid_t pid) {
+  const std::string proc = "/proc/" + std::to_string(pid);
+  double total = 0;
+  std::ifstream stat(proc + "/stat");
+  std::string text((std::istreambuf_iterator<char>(stat)), std::istreambuf_iterator<char>());
+  const size_t close = text.rfind(')');
+  if (close != std::string::npos) {
+    std::istringstream rest(text.substr(close + 2));
+    std::string field;
+    unsigned long long reaped = 0;
+    for (int i = 3; i <= 17 && rest >> field; ++i) {
+      if (i == 16 || i == 17) reaped += std::stoull(field);
+    }
+    total += double(reaped) / sysconf(_SC_CLK_TCK);
+  }
+  std::unique_ptr<DIR, int (*)(DIR*)> tasks(opendir((proc + "/task").c_str()), closedir);
+  while (tasks != nullptr) {
+    const struct dirent* task = readdir(tasks.get());
+    if (task == nullptr) break;
+    if (task->d_name[0] == '.') continue;
+    std::ifstream children(proc + "/task/" + task->d_name + "/children");
+    pid_t child;
+    while (children >> child) total += CpuSeconds(child);
+  }
+  return total;
+}
+
+// Prints the CPU seconds the engine, the indexer and its helpers used since `before`, which it
+// then updates.
+void PrintCpu(pid_t engine, pid_t indexd, double before[3]) {
+  const double now[3] = {CpuSeconds(engine), CpuSeconds(indexd), ChildrenCpuSeconds(indexd)};
+  std::printf("  CPU seconds: quixelasticd %.2f, fileindexd %.2f, extraction helpers %.2f\n",
+              now[0] - before[0], now[1] - before[1], now[2] - before[2]);
+  for (int i = 0; i < 3; ++i) before[i] = now[i];
+}
+
+// Documents of index `id` whose extracted words hold `keyword`.
+int KeywordHits(const std::string& id, const std::string& keyword) {
+  Json::Value q(Json::objectValue);
+  q["keyword"] = keyword;
+  q["id"] = id;
+  try {
+    return System::Engine("search", q)["data"]["total"].asInt();
+  } catch (const std::exception&) {
+    return -1;
+  }
+}
+
 bool Searchable(const std::string& name) {
   Json::Value q(Json::objectValue);
   q["name"] = name;
@@ -90,7 +144,7 @@ int main(int argc, char** argv) {
   const int files = argc > 1 ? std::atoi(argv[1]) : 100000;
   constexpr int kPerDir = 1000;
   setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BIN, 1);
-  System sys({"bench", "content"});
+  System sys({"bench", "content", "media"});
   sys.WriteFolders(Json::Value(Json::arrayValue));
   const std::string tree = sys.Vol("bench/tree");
   for (int i = 0; i < files; ++i) {
@@ -133,6 +187,45 @@ int main(int argc, char** argv) {
     }
     std::ofstream(path) << text;
     content_bytes += text.size();
+  }
+  // The other kinds: small real files, a hundred of each.
+  constexpr int kMediaFiles = 500;
+  for (int i = 0; i < kMediaFiles; ++i) {
+    const std::string stem =
+        sys.Vol("media/m" + std::to_string(i % 10) + "/file" + std::to_string(i));
+    orvane::MakeParentDirs(stem);
+    const std::string words =
+        std::string(kWords[i % 8]) + " " + kWords[(i + 3) % 8] + " " + std::to_string(i);
+    switch (i % 5) {
+      case 0:
+        std::ofstream(stem + ".pdf")
+            << orvane::test::SamplePdf("Report " + std::to_string(i), words);
+        break;
+      case 1:
+        orvane::test::WriteSampleZip(
+            stem + ".docx",
+            {{"[Content_Types].xml", "<Types/>"},
+             {"word/document.xml", "<w:document xmlns:w=\"w\"><w:body><w:p><w:r><w:t>" + words +
+                                       "</w:t></w:r></w:p></w:body></w:document>"},
+             {"docProps/core.xml",
+              "<cp:coreProperties xmlns:cp=\"c\" xmlns:dc=\"d\">"
+              "<dc:title>Plan</dc:title></cp:coreProperties>"}});
+        break;
+      case 2:
+        orvane::test::WriteSampleZip(
+            stem + ".odt", {{"mimetype", "application/vnd.oasis.opendocument.text"},
+                            {"content.xml",
+                             "<office:document-content xmlns:text=\"t\" xmlns:office=\"o\">"
+                             "<office:body><text:p>" +
+                                 words + "</text:p></office:body></office:document-content>"}});
+        break;
+      case 3:
+        std::ofstream(stem + ".wav") << orvane::test::SampleWav(1, 8000, 1);
+        break;
+      case 4:
+        std::ofstream(stem + ".png") << orvane::test::SamplePng(64, 64);
+        break;
+    }
   }
   auto engine = sys.StartEngine();
   auto notifyd = sys.StartNotifyd();
@@ -192,6 +285,8 @@ int main(int argc, char** argv) {
               burst_files * 10, Seconds(b0, b1), Seconds(b1, b2) - 0.3, Seconds(b0, b2) - 0.3);
 
   // 4. Contents.
+  double cpu[3] = {CpuSeconds(engine->pid()), CpuSeconds(indexd->pid()),
+                   ChildrenCpuSeconds(indexd->pid())};
   Json::Value content(Json::arrayValue);
   content.append(System::Folder("/content", true));
   const auto c0 = Clock::now();
@@ -201,6 +296,23 @@ int main(int argc, char** argv) {
   std::printf("first indexing with contents: %d files, %.1f MB in %.2f s = %.2f MB/s, %.0f files/s\n",
               kContentFiles, content_bytes / 1e6, with_content,
               content_bytes / 1e6 / with_content, kContentFiles / with_content);
+  PrintCpu(engine->pid(), indexd->pid(), cpu);
+  Json::Value media(Json::arrayValue);
+  media.append(System::Folder("/media", true));
+  const auto m0 = Clock::now();
+  orvane::fileindex::FolderAdd(media, false);
+  WaitFor([&] { return Documents("fileindex_media") >= kMediaFiles + 11; }, 3600 * 1000);
+  const double with_media = Seconds(m0, Clock::now());
+  // The PDF and office files whose words hold "quarterly" show that their contents, not just
+  // their names, were indexed.
+  int quarterly = 0;
+  for (int i = 0; i < kMediaFiles; ++i) quarterly += i % 5 < 3 && (i % 8 == 1 || i % 8 == 6);
+  std::printf(
+      "first indexing with contents: %d PDF, office, WAV and PNG files in %.2f s = %.0f"
+      " files/s (%d of %d documents found by a word of their contents)\n",
+      kMediaFiles, with_media, kMediaFiles / with_media,
+      KeywordHits("fileindex_media", "quarterly"), quarterly);
+  PrintCpu(engine->pid(), indexd->pid(), cpu);
 
   std::printf("peak memory (VmHWM): quixelasticd %ld KiB, quixnotifyd %ld KiB, fileindexd %ld KiB\n",
               PeakKb(engine->pid()), PeakKb(notifyd->pid()), PeakKb(indexd->pid()));

@@ -503,9 +503,14 @@ Kind KindOf(const std::string& path, const std::string& mime) {
 }  // namespace
 
 std::string MimeType(const std::string& path) {
-  std::unique_ptr<struct magic_set, void (*)(magic_t)> cookie(
-      magic_open(MAGIC_MIME_TYPE | MAGIC_NO_CHECK_COMPRESS | MAGIC_ERROR), magic_close);
-  if (!cookie || magic_load(cookie.get(), nullptr) != 0) return "";
+  // Loading the magic database costs more than looking most files up, and a long-lived helper
+  // looks up many: each thread keeps the cookie it loaded (a cookie is not thread-safe).
+  thread_local std::unique_ptr<struct magic_set, void (*)(magic_t)> cookie(nullptr, magic_close);
+  if (!cookie) {
+    cookie.reset(magic_open(MAGIC_MIME_TYPE | MAGIC_NO_CHECK_COMPRESS | MAGIC_ERROR));
+    if (cookie && magic_load(cookie.get(), nullptr) != 0) cookie.reset();
+    if (!cookie) return "";
+  }
   const char* type = magic_file(cookie.get(), path.c_str());
   return type == nullptr ? "" : type;
 }

@@ -2,7 +2,8 @@
 // properties, office documents (OOXML and OpenDocument), audio tags and properties, photo EXIF
 // data and video technical data, as document fields named like the index schema ("QUIXMD...").
 // Runs the format libraries in-process, so callers that must survive hostile files run it in
-// the helper process (extract_helper). Stateless; safe from any thread.
+// the helper process (fileindex-extract). Keeps nothing between files but each thread's loaded
+// file-type database; safe from any thread.
 #ifndef ORVANE_EXTRACT_CONTENT_HPP_
 #define ORVANE_EXTRACT_CONTENT_HPP_
 

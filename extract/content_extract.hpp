@@ -1,7 +1,7 @@
 // The content-extraction interface: the metadata vocabulary of index documents and ParseFile,
-// which turns one file or directory into the fields of its document. This first version fills
-// the file-system fields from statx(2); content and media fields come later. Stateless; safe from
-// any thread.
+// which turns one file or directory into the fields of its document: the file-system fields from
+// statx(2), the content and media fields from an extraction helper process (extract_runner).
+// Keeps no state of its own; safe from any thread.
 #ifndef ORVANE_EXTRACT_CONTENT_EXTRACT_HPP_
 #define ORVANE_EXTRACT_CONTENT_EXTRACT_HPP_
 

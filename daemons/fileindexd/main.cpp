@@ -22,6 +22,7 @@
 #include "common/root.hpp"
 #include "daemons/fileindexd/index_daemon.hpp"
 #include "daemons/fileindexd/server.hpp"
+#include "extract/extract_runner.hpp"
 
 int main(int argc, char** argv) {
   std::string pid_file = orvane::fileindexd::kFileIndexdPidPath;
@@ -86,6 +87,7 @@ int main(int argc, char** argv) {
     orvane::Log(LOG_INFO, "fileindexd: stopping");
     server.Stop();
     daemon.StopAll();
+    orvane::extract::CloseIdleExtractHelpers();
   } catch (const orvane::Error& e) {
     orvane::Log(LOG_ERR, "fileindexd: %s", e.what());
     rc = 1;
