@@ -11,8 +11,8 @@
 
 #include <chrono>
 #include <cstdlib>
-#include <functional>
 #include <fstream>
+#include <functional>
 #include <map>
 
 #include "common/json_util.hpp"
@@ -259,9 +259,7 @@ TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
 
   // The worker deleted while it crawls a folder just added.
   fileindex::FolderAdd(Folder("/docs/big", false), false);
-  stop_mid_crawl([&] {
-    EXPECT_TRUE(test::Command("worker_delete", docs)["success"].asBool());
-  });
+  stop_mid_crawl([&] { EXPECT_TRUE(test::Command("worker_delete", docs)["success"].asBool()); });
   EXPECT_EQ(0u, test::Command("status", Json::Value())["data"]["shares"].size());
   // The disk changes while no worker runs; created again, the worker settles both.
   ASSERT_EQ(0, Shell("rm -rf " + D("big/d3")));
