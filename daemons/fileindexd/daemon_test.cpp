@@ -1,5 +1,6 @@
 // The daemon binary on its real socket: its commands, who may send them, following a queue
-// without being told, the pause, a batch left behind by a killed daemon, and a clean stop.
+// without being told, the pause, re-reading the folder file on SIGHUP, a batch left behind by a
+// killed daemon, and a clean stop.
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
@@ -13,6 +14,9 @@
 #include "common/util.hpp"
 #include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/elastic_control.hpp"
+#include "fileindex/folder_mgr.hpp"
+#include "fileindex/notifyd_cfg.hpp"
+#include "fileindex/optree.hpp"
 #include "fileindex/queue_file.hpp"
 #include "test/test_util.hpp"
 
@@ -138,6 +142,48 @@ TEST_F(DaemonTest, OnlyRootAndItsOwnUserControlIt) {
   });
   EXPECT_EQ(103, refused);
   EXPECT_EQ(std::set<std::string>{"docs"}, Running());
+}
+
+TEST_F(DaemonTest, SighupReReadsTheFolderConfiguration) {
+  auto indexd = sys_.StartIndexd();
+  ASSERT_EQ(std::set<std::string>{"docs"}, Running());
+  const std::string music = sys_.Vol("music");
+  MakeParentDirs(music + "/album/x");
+  std::ofstream(music + "/album/song.txt") << "la";
+
+  // The folder file changed behind the daemon's back (/music resumed, /docs/a gone) with the
+  // re-index adding a folder queues; only the signal tells the daemon.
+  Json::Value folders(Json::arrayValue);
+  folders.append(System::Folder("/music", false));
+  sys_.WriteFolders(folders);
+  fileindex::elastic::ShareIndexCreate("music");
+  fileindex::AddCustomEvent(fileindex::kEventReindex, music, "", Json::Value());
+  ASSERT_EQ(0, kill(indexd->pid(), SIGHUP));
+  EXPECT_TRUE(WaitFor([] { return Running() == std::set<std::string>{"music"}; }, 5000));
+  const std::set<std::string> want = {music, music + "/album", music + "/album/song.txt"};
+  EXPECT_TRUE(WaitFor([&] { return sys_.Documents("music") == want; }, 5000));
+
+  // The share no longer indexed has no worker; its queue keeps what arrives meanwhile.
+  std::ofstream(V("a/late.txt")) << "l";
+  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), CreateLine(V("a/late.txt"))));
+  EXPECT_FALSE(WaitFor([&] { return Indexed("a/late.txt"); }, 1000));
+
+  // A folder file broken by hand is reported and changes nothing: the daemon lives on with the
+  // workers it had.
+  std::ofstream(RootedPath(fileindex::kFileIndexFoldersCfgPath)) << R"([{"path": "/docs/a")";
+  EXPECT_EQ(kErrLoadConfig,
+            Command("notify_setting_changed", Share("docs"))["error"]["code"].asInt());
+  ASSERT_EQ(0, kill(indexd->pid(), SIGHUP));
+  EXPECT_FALSE(indexd->Exited(500));
+  EXPECT_EQ(std::set<std::string>{"music"}, Running());
+
+  // Indexed again: the worker comes back and drains what its queue kept.
+  folders.append(System::Folder("/docs/a", false));
+  sys_.WriteFolders(folders);
+  ASSERT_EQ(0, kill(indexd->pid(), SIGHUP));
+  EXPECT_TRUE(WaitFor([] { return Running() == std::set<std::string>{"docs", "music"}; }, 5000));
+  EXPECT_TRUE(WaitFor([&] { return Indexed("a/late.txt"); }, 5000));
+  EXPECT_EQ(want, sys_.Documents("music"));
 }
 
 TEST_F(DaemonTest, ABatchLeftByAKilledDaemonIsFinishedFirst) {

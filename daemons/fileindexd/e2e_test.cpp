@@ -1,20 +1,24 @@
 // The whole system in a scratch root: the search engine, the file-change daemon and the
 // indexing daemon as real processes, folders added through the administration operations, and
-// real work on disk. After each round the index must hold exactly what a walk of the disk says
-// is indexable, with the right names, parents and sizes.
+// real work on disk, daemons killed or stopped half-way. After each round the index must hold
+// exactly what a walk of the disk says is indexable, with the right names, parents and sizes.
 #include <dirent.h>
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <cstdlib>
 #include <fstream>
+#include <functional>
 #include <map>
 
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
+#include "daemons/fileindexd/indexer.hpp"
 #include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/index_mgr.hpp"
 #include "fileindex/util.hpp"
@@ -222,6 +226,57 @@ TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
   Write(D("proj/after/restart.txt"), "after");
   ASSERT_EQ(0, Shell("rm -rf " + D("proj/big/d7")));
   ExpectSettled("docs", {D("proj")});
+}
+
+TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
+  // Most files in one directory, so that a stop must land inside it, and a few below.
+  constexpr int kFlat = 2500;
+  for (int i = 0; i < kFlat + 500; ++i) {
+    const std::string dir = i < kFlat ? "big" : "big/d" + std::to_string(i % 5);
+    Write(D(dir + "/f" + std::to_string(i) + ".txt"), "x");
+  }
+  const std::string side_file = sys_.Queue("docs") + ".tmp";
+  const auto read_side_file = [&] {
+    std::ifstream in(side_file);
+    return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+  };
+  // Stops the crawl with `stop` once its first documents are in, and checks that it ends
+  // promptly, within a request or two of being asked (the one on its way, and one more should
+  // this process be slow to ask), and leaves its batch queued as it was.
+  const auto stop_mid_crawl = [&](const std::function<void()>& stop) {
+    ASSERT_TRUE(WaitFor([] { return EngineCount("docs") >= int64_t(kCrawlBatchSize); }, 20000));
+    const std::string batch = read_side_file();
+    const int64_t asked_at = EngineCount("docs");
+    const auto start = std::chrono::steady_clock::now();
+    stop();
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
+    EXPECT_LE(EngineCount("docs"), asked_at + 2 * int64_t(kCrawlBatchSize));
+    EXPECT_FALSE(batch.empty());
+    EXPECT_EQ(batch, read_side_file());
+  };
+  Json::Value docs(Json::objectValue);
+  docs["share_name"] = "docs";
+
+  // The worker deleted while it crawls a folder just added.
+  fileindex::FolderAdd(Folder("/docs/big", false), false);
+  stop_mid_crawl([&] { EXPECT_TRUE(test::Command("worker_delete", docs)["success"].asBool()); });
+  EXPECT_EQ(0u, test::Command("status", Json::Value())["data"]["shares"].size());
+  // The disk changes while no worker runs; created again, the worker settles both.
+  ASSERT_EQ(0, Shell("rm -rf " + D("big/d3")));
+  Write(D("big/late.txt"), "late");
+  EXPECT_TRUE(test::Command("worker_create", docs)["success"].asBool());
+  ExpectSettled("docs", {D("big")});
+
+  // The daemon stopped with SIGTERM while it re-indexes.
+  Json::Value reindex(Json::arrayValue);
+  reindex.append("/docs/big");
+  fileindex::FolderReindex(reindex);
+  int status = -1;
+  stop_mid_crawl([&] { status = indexd_->Signal(SIGTERM); });
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+  Write(D("big/d1/later.txt"), "later");
+  indexd_ = sys_.StartIndexd();
+  ExpectSettled("docs", {D("big")});
 }
 
 }  // namespace

@@ -129,7 +129,7 @@ void IndexDaemon::StopAll() {
     workers.swap(workers_);
   }
   // Ask all first, so their operations end together rather than one after another.
-  for (auto& [share, worker] : workers) worker->Wake();
+  for (auto& [share, worker] : workers) worker->RequestStop();
   workers.clear();
 }
 

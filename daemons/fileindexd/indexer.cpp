@@ -253,8 +253,10 @@ void Indexer::Crawl(const std::string& root, const CrawlMode& mode, bool reconci
       }
     }
   }
-  // A stopped crawl saw only part of the tree: what it did not reach is not stale.
-  if (reconcile && !Stopping()) {
+  // A stopped crawl saw only part of the tree: what it did not reach is not stale. What it
+  // gathered but did not send yet is dropped too: its operation stays queued and crawls again.
+  if (Stopping()) return;
+  if (reconcile) {
     for (const auto& path : stale) batch.Delete(path);
   }
   batch.Flush();
@@ -287,6 +289,8 @@ void Indexer::CrawlDir(const std::string& dir, dev_t dev, const CrawlMode& mode,
   }
   std::vector<std::string> subdirs;
   while (struct dirent* entry = readdir(raw)) {
+    // Per entry rather than per directory: one flat directory may hold most of a share.
+    if (Stopping()) return;
     const std::string name = entry->d_name;
     if (name == "." || name == "..") continue;
     const std::string path = dir + "/" + name;

@@ -75,10 +75,11 @@ int main(int argc, char** argv) {
       int sig = 0;
       if (sigwait(&signals, &sig) != 0) continue;
       if (sig == SIGHUP) {
+        // A folder file broken by hand must not stop the daemon: the workers it has go on.
         try {
           daemon.Reload();
-        } catch (const orvane::Error& e) {
-          orvane::Log(LOG_ERR, "fileindexd: reload failed: %s", e.what());
+        } catch (const std::exception& e) {
+          orvane::Log(LOG_ERR, "fileindexd: reload failed, workers unchanged: %s", e.what());
         }
         continue;
       }

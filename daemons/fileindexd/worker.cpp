@@ -74,9 +74,13 @@ void Worker::Start() {
 }
 
 void Worker::Stop() {
+  RequestStop();
+  if (thread_.joinable()) thread_.join();
+}
+
+void Worker::RequestStop() {
   stop_.store(true);
   Wake();
-  if (thread_.joinable()) thread_.join();
 }
 
 void Worker::Wake() {

@@ -49,6 +49,8 @@ class Worker {
   void Start();
   // Ends the current operation early and joins the thread; a batch not finished stays queued.
   void Stop();
+  // Stop without the join, so that several workers can be told at once and joined after.
+  void RequestStop();
   // Makes the worker look at its queue (and the pause) now.
   void Wake();
   // {"share", "queue_length", "ops_pending", "ops_done", "documents_written",
