@@ -345,6 +345,8 @@ ours_run() {
   local reaped
   reaped=$(time_figures "$ORVANE_ROOT/fileindexd.time" 2>/dev/null || echo 0)
   [ "$reaped" -gt "${hwm[fileindexd]}" ] && [ "$reaped" -gt "$helper_hwm" ] && helper_hwm=$reaped
+  # While running the store has its write-ahead log beside it; a clean stop folds it in.
+  size+=" running, $(du -sk "$tree/@eaDir/@fileindex" | awk '{ printf "%.2f", $1 / 1024 }') stopped"
   rm -rf "$tree/@eaDir/@fileindex"
 
   local mem="" cpu="" all=0 hz
