@@ -365,7 +365,7 @@ ours_run() {
   cpu="$(awk -v t="$all" -v hz="$hz" 'BEGIN { printf "%.1f", t / hz }'): $cpu"
   # Files of none of the four kinds keep their contents and metadata whatever the switches say,
   # so the helper runs for those in the names run too.
-  local what="names and attributes (contents of files of no listed kind)"
+  local what="names and attributes; contents only of files of none of the four kinds"
   [ "$mode" = contents ] && what="names, attributes and contents (documents, audio, video, photos)"
   add_row "**this system** (\`folder add\` to idle)" "$what" "$docs" \
     "$(awk -v us=$((t1 - t0)) 'BEGIN { printf "%.2f", us / 1e6 }')" \
