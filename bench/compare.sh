@@ -27,7 +27,7 @@ unset LOCATE_PATH RECOLL_CONFDIR RECOLL_CONFTOP RECOLL_CONFMID
 
 fi_require_root compare "sudo bash bench/compare.sh"
 
-base=${COMPARE_DIR:-/tmp/fileindex-compare}
+base=$(realpath -m "${COMPARE_DIR:-/tmp/fileindex-compare}")
 read -r -a queries <<<"${COMPARE_QUERIES:-readme changelog copyright html lib example py}"
 runs=${COMPARE_RUNS:-3}
 with_contents=${COMPARE_CONTENTS:-1}
@@ -47,9 +47,25 @@ install_tools() {
   apt-get install -y -q "${need[@]}" >/dev/null ||
     { apt-get update -q >/dev/null && apt-get install -y -q "${need[@]}" >/dev/null; }
 }
-install_tools
-fi_build
 
+# The arguments and the scratch folder are checked before anything is installed or removed.
+if [ $# -ge 1 ]; then
+  tree=$(realpath -e "$1" 2>/dev/null) && [ -d "$tree" ] ||
+    { echo "compare: $1 is not a folder" >&2; exit 1; }
+  case "$tree/" in "$base"/*)
+    echo "compare: the tree must lie outside $base, which is emptied at each run" >&2; exit 1 ;;
+  esac
+  case "$base/" in "$tree"/*)
+    echo "compare: $base, where the indexes go, must lie outside the tree; set COMPARE_DIR" >&2
+    exit 1 ;;
+  esac
+  if [ -e "$tree/@eaDir/@fileindex" ]; then
+    # A store found there would be adopted with its documents, and the timing would mean nothing.
+    echo "compare: $tree/@eaDir/@fileindex holds an index already; remove it first" >&2
+    exit 1
+  fi
+  tree_desc="$tree"
+fi
 # Our scratch folder is emptied only when it is ours (it carries the marker) or does not exist.
 if [ -e "$base" ] && [ ! -e "$base/$marker" ]; then
   echo "compare: $base exists and was not made by this script; set COMPARE_DIR" >&2
@@ -58,23 +74,14 @@ fi
 for m in names contents; do
   ORVANE_ROOT=$base/root-$m fi_refuse_running compare
 done
+
+install_tools
+fi_build
+
 rm -rf "$base"
 mkdir -p "$base"/{results,logs,plocate,recoll/home,recoll/tmp}
 touch "$base/$marker"
-
-if [ $# -ge 1 ]; then
-  tree=$(realpath "$1")
-  [ -d "$tree" ] || { echo "compare: $1 is not a folder" >&2; exit 1; }
-  case "$tree/" in "$base"/*)
-    echo "compare: the tree must lie outside $base, which is emptied at each run" >&2; exit 1 ;;
-  esac
-  if [ -e "$tree/@eaDir/@fileindex" ]; then
-    # A store found there would be adopted with its documents, and the timing would mean nothing.
-    echo "compare: $tree/@eaDir/@fileindex holds an index already; remove it first" >&2
-    exit 1
-  fi
-  tree_desc="$tree"
-else
+if [ $# -eq 0 ]; then
   tree=$base/volume1/doc
   mkdir -p "$base/volume1"
   echo "== copying /usr/share/doc"
