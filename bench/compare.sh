@@ -13,7 +13,8 @@
 #
 # Environment:
 #   COMPARE_DIR       scratch folder (default /tmp/fileindex-compare), emptied at the start
-#   COMPARE_QUERIES   file-name substrings (default "readme changelog copyright html lib example py")
+#   COMPARE_QUERIES   file-name substrings, plain words (default "readme changelog copyright html
+#                     lib example py"); wildcards and quotes mean something else to each tool
 #   COMPARE_RUNS      runs of each query; the median is shown (default 3)
 #   COMPARE_CONTENTS  0 skips the runs that index contents, the slow ones (default 1)
 #   COMPARE_KEEP      1 keeps the indexes and the tree copy for a look afterwards (default 0)
