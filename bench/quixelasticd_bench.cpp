@@ -22,6 +22,8 @@
 #include <cstring>
 #include <random>
 #include <string>
+#include <thread>
+#include <atomic>
 #include <vector>
 
 #include "common/fd.hpp"
@@ -157,28 +159,40 @@ double Seconds(Clock::time_point since) {
   return std::chrono::duration<double>(Clock::now() - since).count();
 }
 
-// Upserts `count` documents under `parent` in compound batches of `batch`.
+// Upserts `count` documents under `parent` in compound batches of `batch`, from `g_senders`
+// connections at once: each builds its next batch while the daemon writes another's.
+unsigned g_senders = 2;
+
 void Load(const std::string& parent, uint64_t first, uint64_t count, uint64_t batch) {
-  for (uint64_t done = 0; done < count;) {
-    Json::Value req;
-    req["compound"] = Json::Value(Json::arrayValue);
-    const uint64_t n = std::min(batch, count - done);
-    for (uint64_t k = 0; k < n; ++k) {
-      const uint64_t i = first + done + k;
-      const std::string dir = parent + "/d" + std::to_string(i / 1000);
-      const std::string name = NameOf(i);
-      Json::Value data;
-      data["id"] = kId;
-      data["doc_id"] = dir + "/" + name;
-      data["data"] = FileDoc(dir, name, i);
-      req["compound"].append(Cmd("document_upsert_by_id", data));
+  std::atomic<uint64_t> next{0};
+  auto send = [&] {
+    for (;;) {
+      const uint64_t done = next.fetch_add(batch);
+      if (done >= count) return;
+      Json::Value req;
+      req["compound"] = Json::Value(Json::arrayValue);
+      const uint64_t n = std::min(batch, count - done);
+      for (uint64_t k = 0; k < n; ++k) {
+        const uint64_t i = first + done + k;
+        const std::string dir = parent + "/d" + std::to_string(i / 1000);
+        const std::string name = NameOf(i);
+        Json::Value& sub = req["compound"].append(Json::Value(Json::objectValue));
+        sub["command"] = "document_upsert_by_id";
+        Json::Value& data = sub["data"];
+        data["id"] = kId;
+        data["doc_id"] = dir + "/" + name;
+        data["data"] = FileDoc(dir, name, i);
+      }
+      if (Request(req)["has_fail"].asBool()) {
+        std::fprintf(stderr, "a batch had failures\n");
+        std::exit(1);
+      }
     }
-    if (Request(req)["has_fail"].asBool()) {
-      std::fprintf(stderr, "a batch had failures\n");
-      std::exit(1);
-    }
-    done += n;
-  }
+  };
+  std::vector<std::thread> senders;
+  for (unsigned t = 1; t < g_senders; ++t) senders.emplace_back(send);
+  send();
+  for (std::thread& t : senders) t.join();
 }
 
 void Commit() {
@@ -226,6 +240,7 @@ int main(int argc, char** argv) {
               " temp_store=MEMORY, page size 4096; FTS5 unicode61 (catch-all) and trigram"
               " (names)\n", sqlite3_libversion());
   const uint64_t batch = argc > 2 ? std::strtoull(argv[2], nullptr, 10) : 1000;
+  if (argc > 3) g_senders = static_cast<unsigned>(std::strtoul(argv[3], nullptr, 10));
   const uint64_t bulk = total - 125000;
   auto start = Clock::now();
   double cpu = CpuSeconds();
