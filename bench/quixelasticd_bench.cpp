@@ -3,7 +3,7 @@
 // folder of 100,000 documents, re-pathing a folder with 25,000 descendants the way the library
 // does it, and the store size per name-only document.
 //
-//   quixelasticd_bench [documents=1000000]
+//   quixelasticd_bench [documents=1000000 [batch=1000 [connections=2]]]
 //
 // The engine and server run in this process on the daemon's socket path below a scratch
 // ORVANE_ROOT; the bulk load and the searches are framed requests on that socket, the delete
@@ -236,9 +236,9 @@ int main(int argc, char** argv) {
   create["mappings"] = Mappings();
   Request(Cmd("index_create", create));
 
-  std::printf("SQLite %s; WAL, synchronous=NORMAL (commit syncs the log), cache_size=32 MiB,"
-              " temp_store=MEMORY, page size 4096; FTS5 unicode61 (catch-all) and trigram"
-              " (names)\n", sqlite3_libversion());
+  std::printf("SQLite %s; WAL, synchronous=NORMAL (commit syncs the log), cache_size=64 MiB,"
+              " temp_store=MEMORY, mmap_size=2 GiB, page size 4096; FTS5 unicode61 (catch-all)"
+              " and trigram (names)\n", sqlite3_libversion());
   const uint64_t batch = argc > 2 ? std::strtoull(argv[2], nullptr, 10) : 1000;
   if (argc > 3) g_senders = static_cast<unsigned>(std::strtoul(argv[3], nullptr, 10));
   const uint64_t bulk = total - 125000;

@@ -32,14 +32,19 @@ const char kSchemaSql[] =
 
 constexpr int kFormat = 1;
 
+// SQLite's default compile-time ceiling for a map (SQLITE_MAX_MMAP_SIZE).
+const char kMmapPragma[] = "PRAGMA mmap_size=2147418112";
+
 // WAL with synchronous=NORMAL: a finished request survives the daemon being killed; "commit"
-// syncs the log so that it also survives a power loss.
+// syncs the log so that it also survives a power loss. The map covers the store up to SQLite's
+// own ceiling: once a store outgrew a smaller map, every page beyond it went through read calls
+// and bulk loads of a million documents slowed by a quarter.
 void ConfigureWriter(Db& db) {
   db.Exec("PRAGMA journal_mode=WAL");
   db.Exec("PRAGMA synchronous=NORMAL");
-  db.Exec("PRAGMA cache_size=-32768");
+  db.Exec("PRAGMA cache_size=-65536");
   db.Exec("PRAGMA temp_store=MEMORY");
-  db.Exec("PRAGMA mmap_size=268435456");
+  db.Exec(kMmapPragma);
   db.Exec("PRAGMA wal_autocheckpoint=4096");
 }
 
@@ -516,7 +521,7 @@ std::unique_ptr<Db> IndexStore::TakeReader() {
   db->Open(file_, false, false);
   db->Exec("PRAGMA query_only=1");
   db->Exec("PRAGMA cache_size=-16384");
-  db->Exec("PRAGMA mmap_size=268435456");
+  db->Exec(kMmapPragma);
   return db;
 }
 
