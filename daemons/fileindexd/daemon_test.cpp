@@ -192,6 +192,12 @@ TEST_F(DaemonTest, SighupReReadsTheFolderConfiguration) {
   EXPECT_TRUE(WaitFor([] { return Running() == std::set<std::string>{"docs", "music"}; }, 5000));
   EXPECT_TRUE(WaitFor([&] { return Indexed("a/late.txt"); }, 5000));
   EXPECT_EQ(want, sys_.Documents("music"));
+
+  // All of a share's folders paused: its worker stops, as it would not have started.
+  folders[0]["paused"] = true;
+  sys_.WriteFolders(folders);
+  ASSERT_EQ(0, kill(indexd->pid(), SIGHUP));
+  EXPECT_TRUE(WaitFor([] { return Running() == std::set<std::string>{"docs"}; }, 5000));
 }
 
 TEST_F(DaemonTest, ABatchLeftByAKilledDaemonIsFinishedFirst) {

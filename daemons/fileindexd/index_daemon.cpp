@@ -72,8 +72,9 @@ void IndexDaemon::Reload() {
   std::vector<std::string> to_stop;
   {
     std::lock_guard<std::mutex> lock(mu_);
+    // A share whose folders are now all paused stops as it would not have started.
     for (const auto& [share, worker] : workers_) {
-      if (indexed.count(share) == 0) to_stop.push_back(share);
+      if (indexed.count(share) == 0 || paused.count(share) != 0) to_stop.push_back(share);
     }
   }
   for (const auto& share : to_stop) StopWorker(share);
