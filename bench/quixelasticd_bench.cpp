@@ -122,30 +122,6 @@ Json::Value FileDoc(const std::string& parent, const std::string& name, uint64_t
   return d;
 }
 
-Json::Value Mappings() {
-  orvane::JsonValue m;
-  m.fromString(R"({"property_id": "QUIXMDPath",
-    "default": {"type": "string", "analyzer": "quixstandard", "required": false,
-                "stored": true, "_all": true},
-    "properties": {
-      "QUIXMDPath": {"analyzer": "keyword", "required": true, "_all": false},
-      "QUIXMDFSName": {"analyzer": "keyword", "_all": false},
-      "QUIXMDIsDir": {"type": "bool", "_all": false},
-      "QUIXMDOwnerUserID": {"analyzer": "keyword", "_all": false},
-      "QUIXMDOwnerGroupID": {"analyzer": "keyword", "_all": false},
-      "QUIXMDFSSize": {"type": "int"},
-      "QUIXMDFSContentChangeDate": {"type": "int"},
-      "QUIXMDAttributeChangeDate": {"type": "int"},
-      "QUIXMDFSCreationDate": {"type": "int"},
-      "QUIXMDParent": {"analyzer": "keyword", "_all": false},
-      "QUIXMDExtension": {"analyzer": "keyword", "_all": false},
-      "QUIXMDSearchFileName": {"type": "text", "analyzer": "white space",
-                               "preprocess": ["tolower", "ngram"]},
-      "QUIXMDSearchAncestor": {"type": "text", "analyzer": "white space escaped",
-                               "_all": false, "preprocess": ["list_ancestor"]}}})");
-  return m;
-}
-
 // CPU seconds this process has used (client and daemon threads together): a figure that other
 // load on the machine does not distort the way wall time is.
 double CpuSeconds() {
@@ -232,8 +208,9 @@ int main(int argc, char** argv) {
   Json::Value create;
   create["id"] = kId;
   create["path"] = dir + "/db";
-  create["settings"] = Json::Value(Json::objectValue);
-  create["mappings"] = Mappings();
+  // The library's own schema and settings, as ShareIndexCreate sends them.
+  create["settings"] = orvane::fileindex::elastic::GetFileIndexSettings();
+  create["mappings"] = orvane::fileindex::elastic::GetFileIndexMappings();
   Request(Cmd("index_create", create));
 
   std::printf("SQLite %s; WAL, synchronous=NORMAL (commit syncs the log), cache_size=64 MiB,"
