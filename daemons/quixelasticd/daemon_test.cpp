@@ -37,7 +37,9 @@ class DaemonTest : public ::testing::Test {
     // until then they answer 607 or 608, which the library waits out the same way.
     for (int i = 0; i < 400; ++i) {
       bool settled = true;
-      for (const Json::Value& index : Send(Cmd("index_list", Json::Value()))["data"]) {
+      // The reply is kept in a local: a range over a member of a temporary would dangle.
+      const Json::Value list = Send(Cmd("index_list", Json::Value()));
+      for (const Json::Value& index : list["data"]) {
         const std::string state = index["state"].asString();
         settled = settled && state != "opening" && state != "recovering";
       }
