@@ -4,6 +4,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <map>
 #include <set>
 #include <sstream>
@@ -302,6 +303,11 @@ TEST_F(IndexMgrTest, ConcurrentAdministratorsLoseNothing) {
           MakeParentDirs(vol_ + "/music/p" + std::to_string(p) + "/f" + std::to_string(i) + "/x"));
     }
   }
+  // Every child is forked before any of them starts: once one talks to the fixture's daemon
+  // threads, a fork could copy a lock one of those threads holds (the allocator's) into the next
+  // child, which would then wait on it forever.
+  int start[2];
+  ASSERT_EQ(pipe(start), 0);
   std::vector<pid_t> children;
   std::vector<std::string> results;
   for (int p = 0; p < kProcs; ++p) {
@@ -310,6 +316,10 @@ TEST_F(IndexMgrTest, ConcurrentAdministratorsLoseNothing) {
     const pid_t pid = fork();
     ASSERT_GE(pid, 0);
     if (pid == 0) {
+      close(start[1]);
+      char c;
+      while (read(start[0], &c, 1) < 0 && errno == EINTR) {
+      }
       std::string done;
       for (int i = 0; i < kFolders; ++i) {
         const std::string path = "/music/p" + std::to_string(p) + "/f" + std::to_string(i);
@@ -337,6 +347,8 @@ TEST_F(IndexMgrTest, ConcurrentAdministratorsLoseNothing) {
     }
     children.push_back(pid);
   }
+  close(start[0]);
+  close(start[1]);  // the children read end-of-file and start together
   for (pid_t pid : children) {
     int status = 0;
     ASSERT_EQ(waitpid(pid, &status, 0), pid);

@@ -5,6 +5,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstring>
+
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "test/fake_daemon.hpp"
@@ -24,20 +26,28 @@ struct Result {
   std::string err;
 };
 
-// Runs the real program with ORVANE_ROOT set, collecting both streams.
+// Runs the real program with ORVANE_ROOT set, collecting both streams. Everything is prepared
+// before the fork: the child of a process with running daemon threads may only make calls that
+// take no lock (open, dup2, exec) until it execs.
 Result RunCtl(const std::string& root, std::vector<std::string> args) {
   test::TempDir io;
   const std::string out_path = io.Path("out");
   const std::string err_path = io.Path("err");
+  std::vector<char*> argv = {const_cast<char*>("fileindexctl")};
+  for (std::string& a : args) argv.push_back(a.data());
+  argv.push_back(nullptr);
+  std::vector<std::string> env_text = {"ORVANE_ROOT=" + root};
+  for (char** e = environ; *e != nullptr; ++e) {
+    if (std::strncmp(*e, "ORVANE_ROOT=", 12) != 0) env_text.emplace_back(*e);
+  }
+  std::vector<char*> envp;
+  for (std::string& e : env_text) envp.push_back(e.data());
+  envp.push_back(nullptr);
   const pid_t pid = fork();
   if (pid == 0) {
-    setenv("ORVANE_ROOT", root.c_str(), 1);
     dup2(open(out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
     dup2(open(err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
-    std::vector<char*> argv = {const_cast<char*>("fileindexctl")};
-    for (std::string& a : args) argv.push_back(a.data());
-    argv.push_back(nullptr);
-    execv(FILEINDEXCTL_BIN, argv.data());
+    execve(FILEINDEXCTL_BIN, argv.data(), envp.data());
     _exit(127);
   }
   int status = 0;
