@@ -9,12 +9,14 @@
 #include <climits>
 #include <cstring>
 #include <fstream>
+#include <iostream>
 
 #include "common/env.hpp"
 #include "common/error.hpp"
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
+#include "fileindex/elastic_control.hpp"
 #include "fileindex/index_mgr.hpp"
 #include "fileindex/notifyd_cfg.hpp"
 #include "fileindex/status_mgr.hpp"
@@ -408,6 +410,21 @@ Json::Value DaemonState(const std::string& name) {
   return state;
 }
 
+// What the search engine says of each index (id, state, documents); empty when it cannot be
+// asked: not running, or the caller is neither root nor the service account.
+Json::Value EngineIndexes() {
+  Json::Value req(Json::objectValue);
+  req["command"] = "index_list";
+  req["data"] = Json::Value(Json::objectValue);
+  Json::Value reply;
+  std::string error;
+  if (!Exchange(RootedPath(kEngineSocket), JsonToString(req), reply, error) ||
+      !reply["success"].asBool() || !reply["data"].isArray()) {
+    return Json::Value(Json::arrayValue);
+  }
+  return reply["data"];
+}
+
 Json::Value CollectStatus() {
   Json::Value status(Json::objectValue);
   for (const char* daemon : {"quixelasticd", "fileindexd", "quixnotifyd"}) {
@@ -427,6 +444,7 @@ Json::Value CollectStatus() {
                error)) {
     status["indexer"] = reply;
   }
+  status["indexes"] = EngineIndexes();
   return status;
 }
 
@@ -436,6 +454,37 @@ uint64_t QueuedEvents(const Json::Value& status) {
     queued += share["queue_length"].asUInt64();
   }
   return queued;
+}
+
+uint64_t DocumentsWritten(const Json::Value& status) {
+  uint64_t written = 0;
+  for (const Json::Value& share : status["indexer"]["data"]["shares"]) {
+    written += share["documents_written"].asUInt64();
+  }
+  return written;
+}
+
+// The entry of `list` whose `key` is `value`; null when there is none.
+const Json::Value& EntryWith(const Json::Value& list, const char* key, const std::string& value) {
+  static const Json::Value kNone;
+  for (const Json::Value& entry : list) {
+    if (entry[key].asString() == value) return entry;
+  }
+  return kNone;
+}
+
+// What needs an administrator's eye about a share, or "ok".
+std::string ShareState(const Json::Value& summary, const Json::Value& worker,
+                       const Json::Value& index) {
+  std::vector<std::string> notes;
+  if (worker["paused"].asBool() || summary["volume_paused"].asBool()) notes.push_back("paused");
+  if (summary["need_reindex"].asBool()) notes.push_back("needs re-index");
+  if (worker["out_of_space"].asBool()) notes.push_back("out of space");
+  const std::string engine = index["state"].asString();
+  if (!engine.empty() && engine != "ready") notes.push_back("index " + engine);
+  std::string text;
+  for (const std::string& note : notes) text += (text.empty() ? "" : ", ") + note;
+  return text.empty() ? "ok" : text;
 }
 
 void PrintStatus(const Json::Value& status, std::ostream& os) {
@@ -451,11 +500,30 @@ void PrintStatus(const Json::Value& status, std::ostream& os) {
     const long long until = summary["resume_time"].asInt64();
     os << "indexing is paused" << (until > 0 ? " until " + HumanTime(until) : "") << "\n\n";
   }
-  Table shares({"SHARE", "FOLDERS", "QUEUED", "NEEDS REINDEX", "VOLUME PAUSED"});
+  // The indexing daemon's and the engine's columns read "-" while they cannot be asked.
+  const bool indexer_up = status.isMember("indexer");
+  const bool engine_up = !status["indexes"].empty();
+  auto count = [](bool known, const Json::Value& v) {
+    return known ? std::to_string(v.asUInt64()) : std::string("-");
+  };
+  Table shares({"SHARE", "FOLDERS", "QUEUED", "PENDING", "DONE", "DOCUMENTS", "ERRORS", "LAST PASS",
+                "STATE"});
+  std::vector<std::string> errors;
   for (const Json::Value& s : summary["shares"]) {
-    shares.Add({s["share"].asString(), std::to_string(s["folder_count"].asUInt()),
-                std::to_string(s["queue_length"].asUInt64()), YesNo(s["need_reindex"].asBool()),
-                YesNo(s["volume_paused"].asBool())});
+    const std::string name = s["share"].asString();
+    const Json::Value& worker = EntryWith(status["indexer"]["data"]["shares"], "share", name);
+    const Json::Value& index = EntryWith(status["indexes"], "id", elastic::GetFileIndexID(name));
+    const bool has_worker = indexer_up && worker.isObject();
+    shares.Add({name, std::to_string(s["folder_count"].asUInt()),
+                std::to_string(s["queue_length"].asUInt64()),
+                count(has_worker, worker["ops_pending"]), count(has_worker, worker["ops_done"]),
+                count(engine_up && index.isObject(), index["documents"]),
+                count(has_worker, worker["errors"]),
+                has_worker ? HumanTime(worker["last_pass"].asInt64()) : "-",
+                ShareState(s, worker, index)});
+    if (worker["errors"].asUInt64() > 0 && !worker["last_error"].asString().empty()) {
+      errors.push_back(name + ": " + worker["last_error"].asString());
+    }
   }
   if (!shares.empty()) {
     shares.Print(os);
@@ -470,8 +538,9 @@ void PrintStatus(const Json::Value& status, std::ostream& os) {
   } else {
     folders.Print(os);
   }
-  if (status.isMember("indexer")) {
-    os << "\nindexer: " << JsonToString(status["indexer"]) << '\n';
+  if (!errors.empty()) {
+    os << "\nlast errors:\n";
+    for (const std::string& line : errors) os << "  " << line << '\n';
   }
 }
 
@@ -481,27 +550,42 @@ void StatusCmd(const Args& args, Output& out) {
     out.Emit(status, [&status](std::ostream& os) { PrintStatus(status, os); });
     return;
   }
-  // Waits for the queues to drain, drawing a bar against the largest backlog seen.
+  // Waits for the queues to drain. On a terminal a bar is drawn against the largest backlog
+  // seen; into a file or a pipe a line is written when the figures change, at most every 5 s.
+  const bool terminal = &out.stream() == &std::cout && isatty(STDOUT_FILENO) == 1;
   const long long timeout = args.GetInt("timeout", 0);
   const int64_t start = Env::Current()->NowMicros();
+  int64_t last_line = 0;
+  std::string last_text;
   uint64_t most = 0;
   for (;;) {
     const Json::Value status = CollectStatus();
     const uint64_t queued = QueuedEvents(status);
+    const int64_t now = Env::Current()->NowMicros();
     most = std::max(most, queued);
     if (!out.json()) {
-      const int width = 40;
-      const int filled = most == 0 ? width : static_cast<int>(width * (most - queued) / most);
-      out.stream() << "\r[" << std::string(filled, '#') << std::string(width - filled, ' ') << "] "
-                   << queued << " change(s) queued   " << std::flush;
+      std::string text = std::to_string(queued) + " change(s) queued";
+      if (status.isMember("indexer")) {
+        text += ", " + std::to_string(DocumentsWritten(status)) + " document(s) written";
+      }
+      if (terminal) {
+        const int width = 40;
+        const int filled = most == 0 ? width : static_cast<int>(width * (most - queued) / most);
+        out.stream() << "\r[" << std::string(filled, '#') << std::string(width - filled, ' ')
+                     << "] " << text << "   " << std::flush;
+      } else if (text != last_text && (queued == 0 || now - last_line >= 5000000)) {
+        out.stream() << text << '\n' << std::flush;
+        last_text = text;
+        last_line = now;
+      }
     }
     if (queued == 0) {
-      if (!out.json()) out.stream() << "\nindexing is idle\n";
+      if (!out.json()) out.stream() << (terminal ? "\n" : "") << "indexing is idle\n";
       out.Emit(status, [](std::ostream&) {});
       return;
     }
-    if (timeout > 0 && Env::Current()->NowMicros() - start > timeout * 1000000) {
-      if (!out.json()) out.stream() << '\n';
+    if (timeout > 0 && now - start > timeout * 1000000) {
+      if (terminal) out.stream() << '\n';
       throw Error(kErrSystem, "still " + std::to_string(queued) + " change(s) queued after " +
                                   std::to_string(timeout) + " s");
     }
