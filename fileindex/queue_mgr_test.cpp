@@ -1,8 +1,6 @@
 #include "fileindex/queue_mgr.hpp"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sys/file.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -11,8 +9,8 @@
 
 #include "common/error.hpp"
 #include "common/lock_file.hpp"
-#include "common/root.hpp"
 #include "common/util.hpp"
+#include "fileindex/queue_file.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -31,6 +29,17 @@ std::vector<std::string> Paths(QueueMgr& mgr, bool tmp, size_t* count = nullptr)
   return out;
 }
 
+// The Error that `fn` throws; code 0 when it throws none.
+template <typename Fn>
+Error ErrorOf(Fn fn) {
+  try {
+    fn();
+  } catch (const Error& e) {
+    return e;
+  }
+  return Error(static_cast<ErrorCode>(0), "no error");
+}
+
 class QueueMgrTest : public ::testing::Test {
  protected:
   test::TempDir dir_;
@@ -38,18 +47,13 @@ class QueueMgrTest : public ::testing::Test {
   std::string queue_ = dir_.Path("share/@eaDir/@fileindex/queue");
 };
 
-TEST_F(QueueMgrTest, NoFilesMeansNothingToDo) {
-  QueueMgr mgr(queue_);
-  size_t count = 7;
-  EXPECT_TRUE(Paths(mgr, true, &count).empty());
-  EXPECT_EQ(count, 0u);
-  EXPECT_TRUE(Paths(mgr, false, &count).empty());
-  EXPECT_EQ(count, 0u);
-  EXPECT_FALSE(mgr.IsFullPathProcessing("/v/s"));
-  EXPECT_FALSE(mgr.IsFullPathHasReindex("/v/s"));
-}
-
 TEST_F(QueueMgrTest, PassTakesTheLiveQueueAndNewEventsStartAFreshFile) {
+  QueueMgr idle(queue_);
+  size_t count = 7;
+  EXPECT_TRUE(Paths(idle, true, &count).empty());
+  EXPECT_EQ(count, 0u);
+  EXPECT_FALSE(idle.IsFullPathProcessing("/v/s"));
+
   dir_.Write("share/@eaDir/@fileindex/queue", Line(2, "/v/s/a"));
   QueueMgr mgr(queue_);
   EXPECT_EQ(Paths(mgr, true), std::vector<std::string>{"/v/s/a"});
@@ -58,7 +62,6 @@ TEST_F(QueueMgrTest, PassTakesTheLiveQueueAndNewEventsStartAFreshFile) {
   dir_.Write("share/@eaDir/@fileindex/queue", Line(2, "/v/s/b"));
   mgr.DeleteTmp();
   EXPECT_FALSE(IsFileExist(queue_ + ".tmp"));
-
   QueueMgr next(queue_);
   EXPECT_EQ(Paths(next, true), std::vector<std::string>{"/v/s/b"});
 }
@@ -74,26 +77,32 @@ TEST_F(QueueMgrTest, LeftoverSideFileGoesFirstAndLiveQueueWaits) {
   EXPECT_TRUE(IsFileExist(queue_));
 }
 
-// An unprivileged daemon meeting a folder it may read but not change.
-TEST_F(QueueMgrTest, RenameFailureIs502AndLeavesTheQueue) {
+// An unprivileged daemon meeting a queue folder it may read but not change, and a side file it
+// may not read.
+TEST_F(QueueMgrTest, RenameAndOpenFailuresAre502AndLeaveTheFiles) {
   const std::string folder = dir_.Path("share/@eaDir/@fileindex");
   dir_.Write("share/@eaDir/@fileindex/queue", Line(2, "/v/s/a"));
+  const std::string unreadable = dir_.Write("other.tmp", Line(2, "/v/s/a"));
   ASSERT_EQ(chmod(dir_.path().c_str(), 0755), 0);
   ASSERT_EQ(chmod(folder.c_str(), 0555), 0);
+  ASSERT_EQ(chmod(unreadable.c_str(), 0), 0);
   const int result = test::RunAsUser("nobody", [this] {
     test::LogCapture log;
+    const std::string open_failed =
+        "Orvane error, code=502, reason=[Failed to open queue, reason=Permission denied]";
     QueueMgr mgr(queue_);
-    try {
-      mgr.PrepareTmpQueue();
+    QueueMgr other(dir_.Path("other"));
+    if (ErrorOf([&] { mgr.PrepareTmpQueue(); }).what() !=
+        std::string("Orvane error, code=502, reason=[rename failed, reason=Permission denied]")) {
       return 1;
-    } catch (const Error& e) {
-      if (std::string(e.what()) !=
-          "Orvane error, code=502, reason=[rename failed, reason=Permission denied]") {
-        return 2;
-      }
     }
-    return log.Contains("Failed [0 > rename(queue_path_.c_str(), queue_path_tmp_.c_str())]") ? 0
-                                                                                             : 3;
+    if (ErrorOf([&] { other.ProcessOP([](std::shared_ptr<OP>) {}, true); }).what() != open_failed)
+      return 2;
+    if (ErrorOf([&] { other.IsFullPathProcessing("/v/s/a"); }).what() != open_failed) return 3;
+    return log.Contains("Failed [0 > rename(queue_path_.c_str(), queue_path_tmp_.c_str())]") &&
+                   log.Count("Failed [!input_stream]") == 2
+               ? 0
+               : 4;
   });
   chmod(folder.c_str(), 0755);
   EXPECT_EQ(result, 0);
@@ -112,100 +121,39 @@ TEST_F(QueueMgrTest, RenameWaitsForTheWritersLock) {
   EXPECT_FALSE(IsFileExist(queue_ + ".tmp"));
 }
 
-TEST_F(QueueMgrTest, UnreadableQueueIs502) {
-  dir_.Write("share/@eaDir/@fileindex/queue.tmp", Line(2, "/v/s/a"));
-  ASSERT_EQ(chmod(dir_.path().c_str(), 0755), 0);
-  ASSERT_EQ(chmod((queue_ + ".tmp").c_str(), 0), 0);
-  const int result = test::RunAsUser("nobody", [this] {
-    test::LogCapture log;
-    const std::string expected =
-        "Orvane error, code=502, reason=[Failed to open queue, reason=Permission denied]";
-    QueueMgr mgr(queue_);
-    try {
-      mgr.ProcessOP([](std::shared_ptr<OP>) {}, true);
-      return 1;
-    } catch (const Error& e) {
-      if (e.what() != expected) return 2;
-    }
-    try {
-      mgr.IsFullPathProcessing("/v/s/a");
-      return 3;
-    } catch (const Error& e) {
-      if (e.what() != expected) return 4;
-    }
-    return log.Count("Failed [!input_stream]") == 2 ? 0 : 5;
-  });
-  EXPECT_EQ(result, 0);
-}
-
 TEST_F(QueueMgrTest, PendingPathQuestions) {
   dir_.Write("share/@eaDir/@fileindex/queue",
              Line(2, "/v/s/a/x") + Line(0x100, "/v/s/new", ",\"path_old\":\"/v/s/old\"") +
                  Line(0x10000 | 0x2, "/v/s/both"));
   dir_.Write("share/@eaDir/@fileindex/queue.tmp", Line(0x10000, "/v/s/r"));
   QueueMgr mgr(queue_);
-  EXPECT_TRUE(mgr.IsFullPathProcessing("/v/s/a"));
-  EXPECT_TRUE(mgr.IsFullPathProcessing("/v/s/a/x"));
-  EXPECT_TRUE(mgr.IsFullPathProcessing("/v/s/old"));
-  EXPECT_TRUE(mgr.IsFullPathProcessing("/v/s/r"));  // found in the side file
-  EXPECT_TRUE(mgr.IsFullPathProcessing("/v/s"));
-  EXPECT_FALSE(mgr.IsFullPathProcessing("/v/s/r/deep"));
-  EXPECT_FALSE(mgr.IsFullPathProcessing("/v/s/a/x/y"));
-  EXPECT_FALSE(mgr.IsFullPathProcessing("/v/s/ab"));
-
+  // The side file counts too; a path matches itself and its ancestors, by whole components.
+  for (const char* path : {"/v/s/a", "/v/s/a/x", "/v/s/old", "/v/s/r", "/v/s"})
+    EXPECT_TRUE(mgr.IsFullPathProcessing(path)) << path;
+  for (const char* path : {"/v/s/r/deep", "/v/s/a/x/y", "/v/s/ab"})
+    EXPECT_FALSE(mgr.IsFullPathProcessing(path)) << path;
   EXPECT_TRUE(mgr.IsFullPathHasReindex("/v/s/r"));
   EXPECT_TRUE(mgr.IsFullPathHasReindex("/v/s/r/a/b"));
-  EXPECT_FALSE(mgr.IsFullPathHasReindex("/v/s/rx"));
-  EXPECT_FALSE(mgr.IsFullPathHasReindex("/v/s"));
-  EXPECT_FALSE(mgr.IsFullPathHasReindex("/v/s/both"));  // other bits besides re-index
+  // Not a sibling sharing letters, an ancestor, or a line with other bits besides re-index.
+  for (const char* path : {"/v/s/rx", "/v/s", "/v/s/both"})
+    EXPECT_FALSE(mgr.IsFullPathHasReindex(path)) << path;
 
   // A malformed line is not skipped here: the question cannot be answered.
   dir_.Write("share/@eaDir/@fileindex/queue", "garbage\n");
-  try {
-    mgr.IsFullPathHasReindex("/v/s/zzz");
-    FAIL();
-  } catch (const Error& e) {
-    EXPECT_EQ(e.code, kErrMalformedEvent);
-  }
-}
-
-TEST_F(QueueMgrTest, BrokenFolderConfigurationFailsTheProcessingQuestion) {
+  EXPECT_EQ(ErrorOf([&] { mgr.IsFullPathHasReindex("/v/s/zzz"); }).code, kErrMalformedEvent);
+  // Nor can it with a broken folder configuration.
   dir_.Write("var/packages/Orvane/etc/fileindex.folders", "[{");
-  QueueMgr mgr(queue_);
-  try {
-    mgr.IsFullPathProcessing("/v/s");
-    FAIL();
-  } catch (const Error& e) {
-    EXPECT_EQ(e.code, kErrLoadConfig);
-  }
-  dir_.Write("var/packages/Orvane/etc/fileindex.folders", "[]");
-  EXPECT_FALSE(mgr.IsFullPathProcessing("/v/s"));
+  EXPECT_EQ(ErrorOf([&] { mgr.IsFullPathProcessing("/v/s"); }).code, kErrLoadConfig);
 }
 
 // The indexing daemon's whole pass, with a writer appending from another process meanwhile:
 // every line ends up in exactly one batch.
 TEST_F(QueueMgrTest, ConcurrentWriterLosesNothing) {
   const int kLines = 2000;
-  ASSERT_TRUE(MakeParentDirs(queue_));
   pid_t pid = fork();
   if (pid == 0) {
     for (int i = 0; i < kLines; ++i) {
-      for (;;) {
-        // The descriptor locked must still be the live queue: it may just have become the
-        // side file, in which case the line would land in a batch already read.
-        int fd = open(queue_.c_str(), O_WRONLY | O_APPEND | O_CREAT, 0644);
-        if (fd < 0 || flock(fd, LOCK_EX) != 0) _exit(2);
-        struct stat locked, current;
-        if (fstat(fd, &locked) != 0 || stat(queue_.c_str(), &current) != 0 ||
-            locked.st_ino != current.st_ino) {
-          close(fd);
-          continue;
-        }
-        const std::string line = Line(2, "/v/s/f" + std::to_string(i));
-        if (write(fd, line.data(), line.size()) != static_cast<ssize_t>(line.size())) _exit(3);
-        close(fd);
-        break;
-      }
+      if (!QueueFileAppend(queue_, Line(2, "/v/s/f" + std::to_string(i)))) _exit(2);
     }
     _exit(0);
   }
