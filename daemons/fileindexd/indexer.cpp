@@ -15,7 +15,6 @@
 #include "common/util.hpp"
 #include "extract/content_extract.hpp"
 #include "fileindex/elastic_control.hpp"
-#include "fileindex/folder.hpp"
 #include "fileindex/util.hpp"
 
 namespace orvane {
@@ -150,14 +149,13 @@ void Indexer::Apply(const OP& op) {
 void Indexer::Upsert(const std::string& path) {
   struct stat st;
   if (lstat(path.c_str(), &st) != 0) return;  // gone again; its delete is queued
-  const auto cfg = folders_->GetMostSuitableCfg(path);
-  if (!cfg || !fileindex::CanFullPathBeIndexed(path)) return;
+  if (!folders_->GetMostSuitableCfg(path) || !fileindex::CanFullPathBeIndexed(path)) return;
   if (S_ISDIR(st.st_mode)) {
     Crawl(path, CrawlMode(), false);
     return;
   }
   if (!S_ISREG(st.st_mode)) return;
-  el::IndexUpsert(share_, path, NeedMeta(*cfg, path));
+  el::IndexUpsert(share_, path, folders_->IsFullPathNeedMeta(path));
   ++documents_written_;
 }
 
@@ -246,10 +244,9 @@ void Indexer::Crawl(const std::string& root, const CrawlMode& mode, bool reconci
     if (S_ISDIR(st.st_mode)) {
       CrawlDir(root, st.st_dev, mode, batch, reconcile ? &stale : nullptr);
     } else if (S_ISREG(st.st_mode)) {
-      const auto cfg = folders_->GetMostSuitableCfg(root);
-      if (cfg && fileindex::CanFullPathBeIndexed(root)) {
+      if (folders_->GetMostSuitableCfg(root) && fileindex::CanFullPathBeIndexed(root)) {
         stale.erase(root);
-        batch.Upsert(root, NeedMeta(*cfg, root));
+        batch.Upsert(root, folders_->IsFullPathNeedMeta(root));
       }
     }
   }
@@ -266,8 +263,7 @@ void Indexer::CrawlDir(const std::string& dir, dev_t dev, const CrawlMode& mode,
                        std::unordered_set<std::string>* stale) {
   if (Stopping()) return;
   // The rules are judged once here for every entry of the directory.
-  const auto cfg = folders_->GetMostSuitableCfg(dir);
-  const bool indexable = cfg && fileindex::CanFullPathBeIndexed(dir);
+  const bool indexable = folders_->GetMostSuitableCfg(dir) && fileindex::CanFullPathBeIndexed(dir);
   if (!indexable && !HasFolderBelow(dir)) return;
 
   DIR* raw = opendir(dir.c_str());
@@ -305,7 +301,9 @@ void Indexer::CrawlDir(const std::string& dir, dev_t dev, const CrawlMode& mode,
     if (fileindex::IsSystemPreservedFileName(name)) continue;
     bool missing = false;
     if (stale != nullptr) missing = stale->erase(path) == 0;
-    if (mode.all || missing || KindSwitched(mode, path)) batch.Upsert(path, NeedMeta(*cfg, path));
+    if (mode.all || missing || KindSwitched(mode, path)) {
+      batch.Upsert(path, folders_->IsFullPathNeedMeta(path));
+    }
   }
   closer.reset();
   for (const auto& sub : subdirs) CrawlDir(sub, dev, mode, batch, stale);
@@ -317,21 +315,6 @@ bool Indexer::HasFolderBelow(const std::string& dir) const {
     if (full != dir && IsSubPath(full, dir)) return true;
   }
   return false;
-}
-
-bool Indexer::NeedMeta(const fileindex::Folder& cfg, const std::string& path) const {
-  switch (fileindex::GetFileTypeByFullPath(path)) {
-    case fileindex::kDocument:
-      return cfg.IsDocument();
-    case fileindex::kAudio:
-      return cfg.IsAudio();
-    case fileindex::kVideo:
-      return cfg.IsVideo();
-    case fileindex::kPhoto:
-      return cfg.IsPhoto();
-    default:
-      return true;
-  }
 }
 
 bool Indexer::KindSwitched(const CrawlMode& mode, const std::string& path) const {

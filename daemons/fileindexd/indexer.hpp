@@ -66,7 +66,6 @@ class Indexer {
                 std::unordered_set<std::string>* stale);
   // Whether some configured folder lies strictly below `dir`.
   bool HasFolderBelow(const std::string& dir) const;
-  bool NeedMeta(const fileindex::Folder& cfg, const std::string& path) const;
   bool KindSwitched(const CrawlMode& mode, const std::string& path) const;
   bool Stopping() const { return stop_ != nullptr && stop_->load(); }
 
