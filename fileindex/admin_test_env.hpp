@@ -9,6 +9,7 @@
 #include <json/json.h>
 
 #include <algorithm>
+#include <cstdio>
 #include <memory>
 #include <string>
 #include <vector>
@@ -25,6 +26,8 @@
 namespace orvane {
 namespace fileindex {
 namespace testenv {
+
+using Strings = std::vector<std::string>;
 
 class AdminTestEnv : public ::testing::Test {
  protected:
@@ -70,6 +73,18 @@ class AdminTestEnv : public ::testing::Test {
   }
 
   std::string Rooted(const std::string& fixed) const { return root_.path() + fixed; }
+  std::string FoldersPath() const { return Rooted(kFileIndexFoldersCfgPath); }
+  void WriteFolders(const std::vector<Json::Value>& folders) {
+    Json::Value list(Json::arrayValue);
+    for (const auto& f : folders) list.append(f);
+    ASSERT_TRUE(JsonValue(list).toFile(FoldersPath()));
+  }
+  // Puts `text` in place of the file at `path` whole, the way an editor saves it.
+  void ReplaceFile(const std::string& path, const std::string& text) {
+    ASSERT_TRUE(MakeParentDirs(path));
+    volume_.Write("replacement", text);
+    ASSERT_EQ(rename(volume_.Path("replacement").c_str(), path.c_str()), 0);
+  }
   std::string Queue(const std::string& share) const {
     return vol_ + "/" + share + "/@eaDir/@fileindex/queue";
   }
@@ -95,6 +110,20 @@ class AdminTestEnv : public ::testing::Test {
     return lines;
   }
 
+  // The queue lines of a share as "<event> <path below the volume> <data>".
+  Strings Events(const std::string& share) const {
+    Strings out;
+    for (const Json::Value& e : QueueLines(share)) {
+      std::string line =
+          std::to_string(e["event"].asUInt()) + " " + e["path"].asString().substr(vol_.size());
+      if (!e["path_old"].asString().empty()) {
+        line += " <- " + e["path_old"].asString().substr(vol_.size());
+      }
+      if (!e["data"].isNull()) line += " " + JsonToString(e["data"]);
+      out.push_back(line);
+    }
+    return out;
+  }
   // A folder record as a request or the folder file holds it.
   static Json::Value FolderJson(const std::string& path, const std::string& name, bool document,
                                 bool audio, bool video, bool photo) {
@@ -154,8 +183,6 @@ class AdminTestEnv : public ::testing::Test {
   std::string vol_;
 };
 
-using Strings = std::vector<std::string>;
-
 // The same with the fake daemons running and views of what the operations left behind.
 class AdminOpsTest : public AdminTestEnv {
  protected:
@@ -163,7 +190,6 @@ class AdminOpsTest : public AdminTestEnv {
     AdminTestEnv::SetUp();
     StartDaemons();
   }
-  std::string FoldersPath() const { return Rooted(kFileIndexFoldersCfgPath); }
   Json::Value Folders() const { return ReadJson(FoldersPath()); }
   // The paths of the folder file, in order.
   Strings FolderPaths() const {
@@ -189,20 +215,6 @@ class AdminOpsTest : public AdminTestEnv {
   }
   static std::string Worker(const std::string& type, const std::string& share) {
     return R"({"data":{"share_name":")" + share + R"("},"type":")" + type + R"("})";
-  }
-  // The queue lines of a share as "<event> <path below the volume> <data>".
-  Strings Events(const std::string& share) const {
-    Strings out;
-    for (const Json::Value& e : QueueLines(share)) {
-      std::string line =
-          std::to_string(e["event"].asUInt()) + " " + e["path"].asString().substr(vol_.size());
-      if (!e["path_old"].asString().empty()) {
-        line += " <- " + e["path_old"].asString().substr(vol_.size());
-      }
-      if (!e["data"].isNull()) line += " " + JsonToString(e["data"]);
-      out.push_back(line);
-    }
-    return out;
   }
   static Json::Value List(std::vector<Json::Value> folders) {
     Json::Value list(Json::arrayValue);

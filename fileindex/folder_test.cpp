@@ -13,149 +13,94 @@ using testenv::ErrorOf;
 
 class FolderTest : public testenv::AdminTestEnv {};
 
-TEST_F(FolderTest, RecordFromJsonWithDefaultsAndRefusals) {
+TEST_F(FolderTest, RecordsFromJsonAndTheirPaths) {
   Folder minimal(FolderJson("/photo/trips", "Trips", true, false, true, false));
   EXPECT_EQ(minimal.GetData(), Parse(R"({"path": "/photo/trips", "name": "Trips",
       "document": true, "audio": false, "video": true, "photo": false, "paused": false,
       "owner": "", "group": "", "privileged": false, "volume_to_be_clean": ""})"));
-  EXPECT_EQ(minimal.GetIndexCfg(),
-            Parse(R"({"document": true, "audio": false, "video": true, "photo": false})"));
-
   Json::Value full = FolderJson("/photo", "P", false, true, false, true);
   full["owner"] = "bob";
   full["group"] = "All";  // only the exact "all" is reserved
-  full["privileged"] = 1;
-  full["paused"] = true;
+  full["privileged"] = true;
+  full["paused"] = "yes";  // optional members of the wrong type keep their defaults
   full["volume_to_be_clean"] = "/volume2";
-  Folder stored(full);
-  EXPECT_EQ(stored.GetData(), [&] {
-    Json::Value expected = full;
-    expected["privileged"] = true;
-    return expected;
-  }());
+  Json::Value expected = full;
+  expected["paused"] = false;
+  EXPECT_EQ(Folder(full).GetData(), expected);
 
-  // Optional members of the wrong type keep their defaults.
-  Json::Value odd = FolderJson("/photo", "P", true, true, true, true);
-  odd["paused"] = "yes";
-  odd["owner"] = Json::Value(Json::arrayValue);
-  Folder lenient(odd);
-  EXPECT_FALSE(lenient.IsPaused());
-  EXPECT_EQ(lenient.GetOwner(), "");
-
-  Json::Value bad_switch = FolderJson("/photo", "P", true, true, true, true);
+  Json::Value bad_switch = full;
   bad_switch["document"] = "yes";
-  Error e = ErrorOf([&] { Folder f(bad_switch); });
-  EXPECT_EQ(e.code, kErrInvalidParam);
-  EXPECT_EQ(e.message,
-            "Orvane error, code=120, reason=[Not a string, data=" + JsonToString(bad_switch) + "]");
-  Json::Value no_name = FolderJson("/photo", "P", true, true, true, true);
+  Json::Value no_name = full;
   no_name.removeMember("name");
-  e = ErrorOf([&] { Folder f(no_name); });
-  EXPECT_EQ(e.message, "Orvane error, code=120, reason=[Missing property: name, data=" +
-                           JsonToString(no_name) + "]");
-  EXPECT_EQ(ErrorOf([] { Folder f(Json::Value("x")); }).message,
-            "Orvane error, code=120, reason=[Not an object, data=\"x\"]");
-
+  EXPECT_EQ(ErrorOf([&] { Folder f(bad_switch); }).code, kErrInvalidParam);
+  EXPECT_EQ(ErrorOf([&] { Folder f(no_name); }).code, kErrInvalidParam);
   test::LogCapture log;
-  Json::Value all = FolderJson("/photo", "P", true, true, true, true);
-  all["group"] = "all";
-  e = ErrorOf([&] { Folder f(all); });
-  EXPECT_EQ(e.message, "Orvane error, code=120, reason=[\"all\" is reserved group name]");
+  full["group"] = "all";
+  EXPECT_EQ(ErrorOf([&] { Folder f(full); }).message,
+            "Orvane error, code=120, reason=[\"all\" is reserved group name]");
   EXPECT_TRUE(log.Contains("Failed [kAll == group_]"));
 
-  // The positional constructor drops the group.
-  Folder positional("/music", "M", "alice", "staff", true, false, false, false, true, true);
-  EXPECT_EQ(positional.GetGroup(), "");
-  EXPECT_EQ(positional.GetOwner(), "alice");
-  EXPECT_TRUE(positional.IsPrivileged());
-  EXPECT_TRUE(positional.IsPaused());
-}
-
-TEST_F(FolderTest, ShareAndFullPathFollowRenames) {
-  Folder root(FolderJson("/photo", "P", true, true, true, true));
-  EXPECT_EQ(root.GetShare(), "photo");
-  EXPECT_EQ(root.GetFullPath(), vol_ + "/photo");
-  root.SetShare("pics");
-  EXPECT_EQ(root.GetPath(), "/pics");
-  EXPECT_EQ(root.GetShare(), "pics");
-
+  // Only the leading share component is renamed, and a new path forgets the cached share.
   Folder deep(FolderJson("/photo/trips/photo", "P", true, true, true, true));
-  deep.SetShare("Photos");  // only the leading share component changes
+  EXPECT_EQ(deep.GetFullPath(), vol_ + "/photo/trips/photo");
+  deep.SetShare("Photos");
   EXPECT_EQ(deep.GetPath(), "/Photos/trips/photo");
-
+  EXPECT_EQ(deep.GetShare(), "Photos");
   deep.SetPath("/music/live");
   EXPECT_EQ(deep.GetShare(), "music");
   EXPECT_EQ(deep.GetFullPath(), vol_ + "/music/live");
-
   Folder unknown(FolderJson("/nosuch/x", "N", true, true, true, true));
   EXPECT_EQ(ErrorOf([&] { unknown.GetFullPath(); }).code, kErrShareGet);
 }
 
-TEST_F(FolderTest, StatusRulesInOrder) {
+TEST_F(FolderTest, StatusRulesInOrderAndAsAdditionalMember) {
   test::FakeEnv env;
   const long long now = env.Now();
   StatusMgr::CreateIfMissing();
   Folder trips(FolderJson("/photo/trips", "Trips", true, true, true, true));
-  Folder bin(FolderJson("/photo/#recycle", "Bin", true, true, true, true));
-
   auto status_of = [](const Folder& f) {
     Json::Value out(Json::objectValue);
-    out["keep"] = 1;
     f.GetStatus(out);
-    EXPECT_EQ(out["keep"], 1);  // other members are left alone
-    out.removeMember("keep");
-    return out;
+    return JsonToString(out);
   };
-  EXPECT_EQ(status_of(trips), Parse(R"({"text": "finished"})"));
+  EXPECT_EQ(status_of(trips), R"({"text":"finished"})");
 
   // Work queued below the folder: running unless paused.
   ASSERT_TRUE(MakeParentDirs(Queue("photo")));
   volume_.Write("photo/@eaDir/@fileindex/queue",
                 R"({"event": 8, "path": ")" + vol_ + "/photo/trips/2024/a.jpg\"}\n");
   EXPECT_TRUE(trips.IsIndexing());
-  EXPECT_EQ(status_of(trips), Parse(R"({"text": "processing"})"));
-
-  auto write_pause = [&](long long resume_time) {
+  EXPECT_EQ(status_of(trips), R"({"text":"processing"})");
+  for (const long long resume_time : {0LL, now + 1, now}) {
     Json::Value data = Parse(R"({"share": {}})");
     data["resume_time"] = Json::Int64(resume_time);
     ASSERT_TRUE(JsonValue(data).toFile(Rooted(kFileIndexStatusCfgPath)));
-  };
-  write_pause(0);
-  EXPECT_EQ(status_of(trips), Parse(R"({"text": "paused"})"));
-  write_pause(now + 1);
-  EXPECT_EQ(status_of(trips), Parse(R"({"text": "paused"})"));
-  write_pause(now);
-  EXPECT_EQ(status_of(trips), Parse(R"({"text": "processing"})"));
+    EXPECT_EQ(status_of(trips), resume_time == now ? R"({"text":"processing"})"
+                                                   : R"({"text":"paused"})")
+        << resume_time;
+  }
 
   // The share's re-index flag beats the pause; an invalid path beats both.
   StatusMgr().SetShareStatus("photo", 3);
-  EXPECT_EQ(status_of(trips), Parse(R"({"text": "need_reindex"})"));
-  EXPECT_EQ(status_of(bin), Parse(R"({"text": "error", "desc": "invalid_path"})"));
-
-  // Another folder of the share without queued work is finished.
+  EXPECT_EQ(status_of(trips), R"({"text":"need_reindex"})");
+  Folder bin(FolderJson("/photo/#recycle", "Bin", true, true, true, true));
+  EXPECT_EQ(status_of(bin), R"({"desc":"invalid_path","text":"error"})");
   StatusMgr().UnsetShareStatus("photo", 1);
   Folder family(FolderJson("/photo/family", "Family", true, true, true, true));
-  EXPECT_EQ(status_of(family), Parse(R"({"text": "finished"})"));
-}
+  EXPECT_EQ(status_of(family), R"({"text":"finished"})");
 
-TEST_F(FolderTest, AdditionalMembers) {
-  StatusMgr::CreateIfMissing();
-  Folder trips(FolderJson("/photo/trips", "Trips", true, true, true, true));
-  EXPECT_EQ(trips.GetDataWithAdditional(Json::Value(Json::arrayValue)), trips.GetData());
-  Json::Value with_status = trips.GetDataWithAdditional(Parse(R"(["status", "status"])"));
-  EXPECT_EQ(with_status["additional"], Parse(R"({"status": {"text": "finished"}})"));
+  Json::Value with_status = family.GetDataWithAdditional(Parse(R"(["status", "status"])"));
+  EXPECT_EQ(JsonToString(with_status["additional"]), R"({"status":{"text":"finished"}})");
   with_status.removeMember("additional");
-  EXPECT_EQ(with_status, trips.GetData());
-
+  EXPECT_EQ(with_status, family.GetData());
   test::LogCapture log;
-  Error e = ErrorOf([&] { trips.GetDataWithAdditional(Parse(R"({"a": 1})")); });
-  EXPECT_EQ(e.message, "Orvane error, code=120, reason=[{\"a\":1}]");
+  EXPECT_EQ(ErrorOf([&] { family.GetDataWithAdditional(Parse(R"({"a": 1})")); }).message,
+            "Orvane error, code=120, reason=[{\"a\":1}]");
   EXPECT_TRUE(log.Contains("Failed [!addiitionals.isArray()]"));
-  e = ErrorOf([&] { trips.GetDataWithAdditional(Parse(R"(["status", 7])")); });
-  EXPECT_EQ(e.message, "Orvane error, code=120, reason=[7]");
-  EXPECT_TRUE(log.Contains("Failed [!it.isString()]"));
-  e = ErrorOf([&] { trips.GetDataWithAdditional(Parse(R"(["size"])")); });
-  EXPECT_EQ(e.message, "Orvane error, code=120, reason=[Unknown additioal: size]");
+  EXPECT_EQ(ErrorOf([&] { family.GetDataWithAdditional(Parse(R"(["status", 7])")); }).message,
+            "Orvane error, code=120, reason=[7]");
+  EXPECT_EQ(ErrorOf([&] { family.GetDataWithAdditional(Parse(R"(["size"])")); }).message,
+            "Orvane error, code=120, reason=[Unknown additioal: size]");
 }
 
 }  // namespace

@@ -18,12 +18,7 @@ using testenv::ErrorOf;
 class StatusMgrTest : public testenv::AdminTestEnv {
  protected:
   std::string StatusPath() const { return Rooted(kFileIndexStatusCfgPath); }
-  // Puts `text` in place of the status file the way an editor would, whole.
-  void ReplaceStatus(const std::string& text) {
-    ASSERT_TRUE(MakeParentDirs(StatusPath()));
-    volume_.Write("status", text);
-    ASSERT_EQ(rename(volume_.Path("status").c_str(), StatusPath().c_str()), 0);
-  }
+  void ReplaceStatus(const std::string& text) { ReplaceFile(StatusPath(), text); }
 };
 
 TEST_F(StatusMgrTest, MissingDamagedOrMisshapenFilesAreRefusedAndLeftAlone) {
