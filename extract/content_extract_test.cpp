@@ -11,7 +11,7 @@ namespace QUIX {
 namespace CONTENT_EXTRACT {
 namespace {
 
-TEST(ParseFileTest, FillsTheFileSystemFieldsOfFilesDirectoriesAndLinks) {
+TEST(ParseFileTest, FillsTheFileSystemFieldsOfFilesDirectoriesAndLinksOrThrows) {
   orvane::test::TempDir dir;
   const std::string file = dir.Write("docs/Report.Final.PDF", "12345");
   ASSERT_EQ(chown(file.c_str(), 1234, 567), 0);
@@ -47,20 +47,17 @@ TEST(ParseFileTest, FillsTheFileSystemFieldsOfFilesDirectoriesAndLinks) {
   ParseFile(dir.Path("link.mp3"), config, doc);
   EXPECT_FALSE(doc[QUIXMDIsDir].asBool());
   EXPECT_EQ(doc[QUIXMDExtension].asString(), "mp3");
-}
 
-TEST(ParseFileTest, ThrowsForWhatCannotBeStated) {
-  orvane::test::TempDir dir;
   orvane::test::LogCapture log;
-  Json::Value doc;
+  Json::Value untouched;
   try {
-    ParseFile(dir.Path("missing"), Json::Value(), doc);
+    ParseFile(dir.Path("missing"), Json::Value(), untouched);
     FAIL() << "no Error";
   } catch (const orvane::Error& e) {
     EXPECT_EQ(e.code, orvane::kErrSystem);
     EXPECT_NE(std::string(e.what()).find("No such file or directory"), std::string::npos);
   }
-  EXPECT_TRUE(doc.isNull());
+  EXPECT_TRUE(untouched.isNull());
 }
 
 }  // namespace

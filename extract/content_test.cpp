@@ -7,6 +7,7 @@
 #include <exiv2/exiv2.hpp>
 #include <fstream>
 
+#include "common/json_util.hpp"
 #include "test/sample_files.hpp"
 #include "test/test_util.hpp"
 
@@ -20,8 +21,6 @@ class ContentTest : public ::testing::Test {
 };
 
 TEST_F(ContentTest, TextInAnyCommonEncodingBecomesUtf8) {
-  EXPECT_EQ(ExtractContent(dir_.Write("a.txt", "caf\xc3\xa9 cr\xc3\xa8me"))["QUIXMDTextContent"],
-            "caf\xc3\xa9 cr\xc3\xa8me");
   // Latin-1 bytes are recognised and converted.
   const std::string latin1 =
       "Le caf\xe9 est tr\xe8s bon et la cr\xe8me br\xfbl\xe9"
@@ -111,16 +110,13 @@ TEST_F(ContentTest, AudioTagsAndProperties) {
     file.ID3v2Tag()->setTrack(7);
     ASSERT_TRUE(file.save());
   }
-  const Json::Value f = ExtractContent(path);
-  EXPECT_EQ(f["QUIXMDMediaTypes"], "Sound");
-  EXPECT_EQ(f["QUIXMDTitle"], "Song");
-  EXPECT_EQ(f["QUIXMDAuthors"], "Band");
-  EXPECT_EQ(f["QUIXMDAlbum"], "Album");
-  EXPECT_EQ(f["QUIXMDRecordingYear"], 1999);
-  EXPECT_EQ(f["QUIXMDAudioTrackNumber"], 7);
+  Json::Value f = ExtractContent(path);
   EXPECT_DOUBLE_EQ(f["QUIXMDDurationSecond"].asDouble(), 2.0);
-  EXPECT_EQ(f["QUIXMDAudioSampleRate"], 8000);
-  EXPECT_EQ(f["QUIXMDAudioChannelCount"], 2);
+  f.removeMember("QUIXMDDurationSecond");
+  EXPECT_EQ(JsonToString(f),
+            R"({"QUIXMDAlbum":"Album","QUIXMDAudioBitRate":256,"QUIXMDAudioChannelCount":2,)"
+            R"("QUIXMDAudioSampleRate":8000,"QUIXMDAudioTrackNumber":7,"QUIXMDAuthors":"Band",)"
+            R"("QUIXMDMediaTypes":"Sound","QUIXMDRecordingYear":1999,"QUIXMDTitle":"Song"})");
 }
 
 TEST_F(ContentTest, PhotoExif) {
@@ -138,14 +134,10 @@ TEST_F(ContentTest, PhotoExif) {
     image->setExifData(exif);
     image->writeMetadata();
   }
-  const Json::Value f = ExtractContent(path);
-  EXPECT_EQ(f["QUIXMDMediaTypes"], "Image");
-  EXPECT_EQ(f["QUIXMDAcquisitionMake"], "Maker");
-  EXPECT_EQ(f["QUIXMDAcquisitionModel"], "Model 5");
-  EXPECT_EQ(f["QUIXMDAperture"], "f/2.8");
-  EXPECT_EQ(f["QUIXMDExposureTimeString"], "1/60");
-  EXPECT_EQ(f["QUIXMDISOSpeed"], 200);
-  EXPECT_EQ(f["QUIXMDContentCreationDate"].asInt64(), 1714979289);
+  EXPECT_EQ(JsonToString(ExtractContent(path)),
+            R"({"QUIXMDAcquisitionMake":"Maker","QUIXMDAcquisitionModel":"Model 5",)"
+            R"("QUIXMDAperture":"f/2.8","QUIXMDContentCreationDate":1714979289,)"
+            R"("QUIXMDExposureTimeString":"1/60","QUIXMDISOSpeed":200,"QUIXMDMediaTypes":"Image"})");
 }
 
 TEST_F(ContentTest, KindsWithNothingToExtract) {
