@@ -99,6 +99,14 @@ bool IsOneIndexBatch(const Json::Value& list) {
   return !first.empty();
 }
 
+// Root sees every hit; anyone else only the files they could open. The checker lives as long
+// as the request's function, so its folder answers are shared by every hit of the request.
+VisibleFn VisibleTo(const Caller& caller) {
+  if (caller.uid == 0) return VisibleFn();
+  auto checker = std::make_shared<AccessChecker>(caller.uid, caller.gid);
+  return [checker](const std::string& path) { return checker->CanOpen(path); };
+}
+
 const char* StateText(int code) {
   switch (code) {
     case kCodeIndexOpening: return "is opening";
@@ -1057,12 +1065,7 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller) {
   }
 
   std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
-  std::unique_ptr<AccessChecker> checker;
-  VisibleFn visible;
-  if (caller.uid != 0) {
-    checker = std::make_unique<AccessChecker>(caller.uid, caller.gid);
-    visible = [&checker](const std::string& path) { return checker->CanOpen(path); };
-  }
+  const VisibleFn visible = VisibleTo(caller);
   // Each index gives its best from + size hits; the merge keeps the global order.
   SearchParams each = p;
   each.from = 0;
@@ -1112,12 +1115,7 @@ Json::Value Engine::Suggest(const Json::Value& data, const Caller& caller) {
   const std::string prefix = RequireString(d, "prefix");
   const int64_t size = std::min<int64_t>(OptionalInt(d, "size", 10), 100);
   std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
-  std::unique_ptr<AccessChecker> checker;
-  VisibleFn visible;
-  if (caller.uid != 0) {
-    checker = std::make_unique<AccessChecker>(caller.uid, caller.gid);
-    visible = [&checker](const std::string& path) { return checker->CanOpen(path); };
-  }
+  const VisibleFn visible = VisibleTo(caller);
   std::vector<std::string> terms;
   for (auto& store : stores) {
     for (const std::string& t : store->Suggest(prefix, static_cast<size_t>(size), visible)) {
