@@ -368,30 +368,21 @@ void IndexStore::Upsert(const std::string& doc_id, const Json::Value& given) {
   schema_.Validate(doc);
   const DerivedDoc d = schema_.Derive(doc);
   if (!doc_id.empty() && doc_id != d.path) Delete(doc_id);
-  Stmt& find = Cached("SELECT rowid, body FROM docs WHERE path = ?");
-  find.Bind(1, d.path);
-  if (find.Step()) {
-    const int64_t rowid = find.Int(0);
-    const DerivedDoc old = schema_.Derive(ParseBody(find.Text(1)));
-    find.Reset();
+  int64_t rowid = 0;
+  Json::Value stored;
+  if (FindRow(d.path, &rowid, &stored)) {
+    const DerivedDoc old = schema_.Derive(stored);
     WriteRow(rowid, d, JsonToString(doc), false, &old);
   } else {
-    find.Reset();
     WriteRow(0, d, JsonToString(doc), true, nullptr);
   }
 }
 
 void IndexStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
   if (!fields.isObject()) throw EngineError(kCodeDocInvalid, "fields are not an object");
-  Stmt& find = Cached("SELECT rowid, body FROM docs WHERE path = ?");
-  find.Bind(1, doc_id);
-  if (!find.Step()) {
-    find.Reset();
-    throw EngineError(kCodeDocNotFound, "no document " + doc_id);
-  }
-  const int64_t rowid = find.Int(0);
-  Json::Value doc = ParseBody(find.Text(1));
-  find.Reset();
+  int64_t rowid = 0;
+  Json::Value doc;
+  if (!FindRow(doc_id, &rowid, &doc)) throw EngineError(kCodeDocNotFound, "no document " + doc_id);
   const DerivedDoc old = schema_.Derive(doc);
   for (const std::string& k : fields.getMemberNames()) {
     if (fields[k].isNull()) {
@@ -404,32 +395,31 @@ void IndexStore::SetFields(const std::string& doc_id, const Json::Value& fields)
   const DerivedDoc d = schema_.Derive(doc);
   if (d.path != old.path) {
     // The file now lives where another document was: that file has been replaced.
-    Stmt& other = Cached("SELECT rowid, body FROM docs WHERE path = ?");
-    other.Bind(1, d.path);
-    if (other.Step()) {
-      const int64_t other_row = other.Int(0);
-      const DerivedDoc other_old = schema_.Derive(ParseBody(other.Text(1)));
-      other.Reset();
-      DeleteRow(other_row, other_old);
-    } else {
-      other.Reset();
-    }
+    int64_t other_row = 0;
+    Json::Value other;
+    if (FindRow(d.path, &other_row, &other)) DeleteRow(other_row, schema_.Derive(other));
   }
   WriteRow(rowid, d, JsonToString(doc), false, &old);
 }
 
 bool IndexStore::Delete(const std::string& doc_id) {
-  Stmt& find = Cached("SELECT rowid, body FROM docs WHERE path = ?");
-  find.Bind(1, doc_id);
-  if (!find.Step()) {
-    find.Reset();
-    return false;
-  }
-  const int64_t rowid = find.Int(0);
-  const DerivedDoc old = schema_.Derive(ParseBody(find.Text(1)));
-  find.Reset();
-  DeleteRow(rowid, old);
+  int64_t rowid = 0;
+  Json::Value stored;
+  if (!FindRow(doc_id, &rowid, &stored)) return false;
+  DeleteRow(rowid, schema_.Derive(stored));
   return true;
+}
+
+bool IndexStore::FindRow(const std::string& path, int64_t* rowid, Json::Value* stored) {
+  Stmt& find = Cached("SELECT rowid, body FROM docs WHERE path = ?");
+  find.Bind(1, path);
+  const bool found = find.Step();
+  if (found) {
+    *rowid = find.Int(0);
+    *stored = ParseBody(find.Text(1));
+  }
+  find.Reset();
+  return found;
 }
 
 int64_t IndexStore::DeleteByQuery(const DocQuery& q) {

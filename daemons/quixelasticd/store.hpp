@@ -124,6 +124,8 @@ class IndexStore {
   void WriteRow(int64_t rowid, const DerivedDoc& d, const std::string& body, bool insert,
                 const DerivedDoc* old);
   void DeleteRow(int64_t rowid, const DerivedDoc& old);
+  // The row and stored document under `path`; false when there is none.
+  bool FindRow(const std::string& path, int64_t* rowid, Json::Value* stored);
   // A prepared writer statement, reset and ready for binding.
   Stmt& Cached(const char* sql);
 
