@@ -1,9 +1,10 @@
 #include "common/lock_file.hpp"
 
 #include <gtest/gtest.h>
-#include <sys/file.h>
 #include <sys/wait.h>
 #include <unistd.h>
+
+#include <memory>
 
 #include "common/error.hpp"
 #include "test/test_util.hpp"
@@ -11,21 +12,32 @@
 namespace orvane {
 namespace {
 
-TEST(LockFileTest, MissingFolderFailsAtOnceWithoutRetry) {
+TEST(LockFileTest, ExcludesWithinOneProcessAndFailsAtOnceOnAMissingFolder) {
   test::FakeEnv env;
   test::LogCapture log;
   test::TempDir dir;
-  const std::string path = dir.Path("no/such/lock");
+  const std::string missing = dir.Path("no/such/lock");
   try {
-    LockFile lock(path, true);
+    LockFile lock(missing, true);
     FAIL();
   } catch (const Error& e) {
     EXPECT_EQ(e.code, kErrLockFile);
-    EXPECT_EQ(std::string(e.what()), "Orvane error, code=506, reason=[open failed, path=" + path +
-                                         ", reason=No such file or directory]");
+    EXPECT_EQ(std::string(e.what()), "Orvane error, code=506, reason=[open failed, path=" +
+                                         missing + ", reason=No such file or directory]");
   }
   EXPECT_TRUE(env.sleeps().empty());
   EXPECT_TRUE(log.Contains("Failed [0 > (fd_ = open(path_.c_str(), O_RDONLY | O_CREAT, 0644))]"));
+
+  const std::string path = dir.Path("lock");
+  auto first = std::make_unique<LockFile>(path, true);
+  EXPECT_THROW(LockFile(path, true), Error);
+  first.reset();
+  {
+    LockFile s1(path, false);
+    LockFile s2(path, false);  // shared locks coexist
+    EXPECT_THROW(LockFile(path, true), Error);
+  }
+  LockFile again(path, true);
 }
 
 TEST(LockFileTest, BusyLockHeldByAnotherProcessGivesUpAfter64Attempts) {
@@ -63,24 +75,10 @@ TEST(LockFileTest, BusyLockHeldByAnotherProcessGivesUpAfter64Attempts) {
   ASSERT_EQ(write(release[1], "x", 1), 1);
   int status;
   waitpid(pid, &status, 0);
-  // Released: the next attempt succeeds at once.
+  // Released with its holder: the next attempt succeeds at once.
   test::FakeEnv env;
   LockFile lock(path, true);
   EXPECT_TRUE(env.sleeps().empty());
-}
-
-TEST(LockFileTest, ExcludesWithinOneProcessAndReleasesOnDestruction) {
-  test::TempDir dir;
-  const std::string path = dir.Path("lock");
-  test::FakeEnv env;
-  auto first = std::make_unique<LockFile>(path, true);
-  EXPECT_THROW(LockFile(path, true), Error);
-  first.reset();
-  LockFile second(path, true);
-  // Shared locks coexist.
-  test::TempDir dir2;
-  LockFile s1(dir2.Path("l"), false);
-  LockFile s2(dir2.Path("l"), false);
 }
 
 }  // namespace

