@@ -22,9 +22,26 @@ namespace elasticd {
 namespace {
 
 using tc::Cmd;
+using tc::OnIndex;
 using tc::Request;
 
-const char kId[] = "fileindex_share";
+// Polls `pred` every 25 ms for up to ten seconds.
+bool Eventually(const std::function<bool()>& pred) {
+  for (int i = 0; i < 400; ++i) {
+    if (pred()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(25));
+  }
+  return pred();
+}
+
+// Upserts of <dir>/file<first>.txt and on, in one compound request.
+Json::Value Batch(const std::string& dir, int first, int count) {
+  std::vector<Json::Value> upserts;
+  for (int i = first; i < first + count; ++i) {
+    upserts.push_back(tc::Upsert(dir + "/file" + std::to_string(i) + ".txt"));
+  }
+  return tc::Compound(upserts);
+}
 
 class DaemonTest : public ::testing::Test {
  protected:
@@ -35,61 +52,28 @@ class DaemonTest : public ::testing::Test {
     ASSERT_TRUE(daemon_->WaitReady());
     // After a restart the indexes open (and, after a crash, are checked) in the background;
     // until then they answer 607 or 608, which the library waits out the same way.
-    for (int i = 0; i < 400; ++i) {
-      bool settled = true;
+    ASSERT_TRUE(Eventually([&] {
       // The reply is kept in a local: a range over a member of a temporary would dangle.
       const Json::Value list = Send(Cmd("index_list", Json::Value()));
       for (const Json::Value& index : list["data"]) {
         const std::string state = index["state"].asString();
-        settled = settled && state != "opening" && state != "recovering";
+        if (state == "opening" || state == "recovering") return false;
       }
-      if (settled) return;
-      std::this_thread::sleep_for(std::chrono::milliseconds(25));
-    }
-    FAIL() << "indexes did not open";
+      return true;
+    })) << "indexes did not open";
   }
   Json::Value Send(const Json::Value& req) { return Request(daemon_->socket(), req); }
   Json::Value CreateIndex() {
-    Json::Value data;
-    data["id"] = kId;
-    data["path"] = dir_.Path("db");
-    data["mappings"] = tc::FileMappings();
-    return Send(Cmd("index_create", data));
-  }
-  static Json::Value FileDoc(const std::string& path) {
-    const size_t slash = path.find_last_of('/');
-    Json::Value d;
-    d["QUIXMDPath"] = path;
-    d["QUIXMDFSName"] = path.substr(slash + 1);
-    d["QUIXMDParent"] = path.substr(0, slash);
-    d["QUIXMDSearchFileName"] = path.substr(slash + 1);
-    d["QUIXMDSearchAncestor"] = path.substr(0, slash);
-    return d;
-  }
-  static Json::Value Batch(const std::string& dir, int first, int count) {
-    Json::Value req;
-    req["compound"] = Json::Value(Json::arrayValue);
-    for (int i = first; i < first + count; ++i) {
-      const std::string path = dir + "/file" + std::to_string(i) + ".txt";
-      Json::Value data;
-      data["id"] = kId;
-      data["doc_id"] = path;
-      data["data"] = FileDoc(path);
-      req["compound"].append(Cmd("document_upsert_by_id", data));
-    }
-    return req;
+    Json::Value r = OnIndex("index_create");
+    r["data"]["path"] = dir_.Path("db");
+    r["data"]["mappings"] = tc::FileMappings();
+    return Send(r);
   }
   int64_t Count(const std::string& prefix) {
-    Json::Value data;
-    data["id"] = kId;
-    data["query"]["qsl"]["prefix"]["QUIXMDPath"] = prefix;
-    data["query"]["size"] = 10000;
-    return static_cast<int64_t>(Send(Cmd("document_get_by_query", data))["data"].size());
-  }
-  Json::Value IdOnly(const std::string& command) {
-    Json::Value data;
-    data["id"] = kId;
-    return Send(Cmd(command, data));
+    Json::Value r = OnIndex("document_get_by_query");
+    r["data"]["query"]["qsl"]["prefix"]["QUIXMDPath"] = prefix;
+    r["data"]["query"]["size"] = 10000;
+    return static_cast<int64_t>(Send(r)["data"].size());
   }
 
   orvane::test::TempDir dir_;
@@ -106,15 +90,13 @@ TEST_F(DaemonTest, FramesOfEveryShapeGetAReplyOrAClose) {
   // No trailing NUL is fine too.
   EXPECT_EQ(Request(daemon_->socket(), Cmd("index_list", Json::Value()))["success"], true);
 
-  auto code_of = [](const std::string& payload) {
-    JsonValue v;
-    std::string text = payload;
+  auto code_of = [&](const std::string& bytes) {
+    std::string text = tc::RawExchange(daemon_->socket(), bytes);
     while (!text.empty() && text.back() == '\0') text.pop_back();
-    return v.fromString(text) ? v["error"]["code"].asInt() : -1;
+    return tc::Parse(text)["error"]["code"].asInt();
   };
-  EXPECT_EQ(code_of(tc::RawExchange(daemon_->socket(), tc::Frame(""))), kCodeMalformed);
-  EXPECT_EQ(code_of(tc::RawExchange(daemon_->socket(), tc::Frame(std::string(5000, ' ')))),
-            kCodeTooLarge);
+  EXPECT_EQ(code_of(tc::Frame("")), kCodeMalformed);
+  EXPECT_EQ(code_of(tc::Frame(std::string(5000, ' '))), kCodeTooLarge);
   // A frame cut short, or only part of a length: the connection is closed without a reply.
   EXPECT_EQ(tc::RawExchange(daemon_->socket(), tc::Frame("{\"command\"").substr(0, 9)), "");
   EXPECT_EQ(tc::RawExchange(daemon_->socket(), std::string("\x10\x00", 2)), "");
@@ -173,34 +155,26 @@ TEST_F(DaemonTest, RunsAsAServiceWithAPidFile) {
   ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);  // the parent returns at once
   const std::string pid_file = dir_.Path("var/run/quixelasticd.pid");
   pid_t pid = 0;
-  for (int i = 0; i < 400 && pid == 0; ++i) {
-    pid = static_cast<pid_t>(std::atoi(orvane::test::ReadFile(pid_file).c_str()));
-    if (pid == 0) std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  ASSERT_GT(pid, 0);
+  ASSERT_TRUE(Eventually([&] {
+    return (pid = static_cast<pid_t>(std::atoi(orvane::test::ReadFile(pid_file).c_str()))) > 0;
+  }));
   EXPECT_NE(pid, launcher);
-  bool answered = false;
-  for (int i = 0; i < 400 && !answered; ++i) {
-    answered = Request(dir_.Path("var/run/quixelasticd.sock"),
-                       Cmd("index_list", Json::Value()))["success"].asBool();
-    if (!answered) std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  EXPECT_TRUE(answered);
+  EXPECT_TRUE(Eventually([&] {
+    return Request(dir_.Path("var/run/quixelasticd.sock"),
+                   Cmd("index_list", Json::Value()))["success"].asBool();
+  }));
   // A second daemon on the same root refuses to start while the first holds the pid file.
   tc::DaemonProcess second(dir_.path());
   EXPECT_EQ(second.Signal(0), 1 << 8);
   ::kill(pid, SIGTERM);
-  for (int i = 0; i < 400 && IsFileExist(pid_file); ++i) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  EXPECT_FALSE(IsFileExist(pid_file));
+  EXPECT_TRUE(Eventually([&] { return !IsFileExist(pid_file); }));
 }
 
 TEST_F(DaemonTest, KillNineLosesNothingCommittedAndNoBatchHalfWay) {
   Launch();
   ASSERT_EQ(CreateIndex()["success"], true);
   ASSERT_EQ(Send(Batch("/v/share/kept", 0, 500))["has_fail"], false);
-  ASSERT_EQ(IdOnly("commit")["success"], true);
+  ASSERT_EQ(Send(OnIndex("commit"))["success"], true);
   daemon_->Signal(SIGKILL);
   Launch();
   EXPECT_EQ(Count("/v/share/kept/"), 500);
@@ -227,26 +201,20 @@ TEST_F(DaemonTest, OrdinaryUsersOnlySearchAndOnlySeeWhatTheyCanOpen) {
   const uid_t uid = nobody->pw_uid;
   const gid_t gid = nobody->pw_gid;
   // Real files: one readable, one unreadable, one in a folder nobody cannot enter.
-  const std::string open_file = dir_.Write("share/pub/report open.txt", "x");
-  const std::string closed_file = dir_.Write("share/pub/report closed.txt", "x");
-  const std::string hidden_file = dir_.Write("share/priv/report hidden.txt", "x");
-  ::chmod(dir_.Path("share").c_str(), 0755);
-  ::chmod(dir_.Path("share/pub").c_str(), 0755);
-  ::chmod(open_file.c_str(), 0644);
-  ::chmod(closed_file.c_str(), 0600);
-  ::chmod(dir_.Path("share/priv").c_str(), 0700);
-  ::chmod(hidden_file.c_str(), 0644);
-
+  const std::vector<std::pair<std::string, mode_t>> modes = {
+      {"share/pub/report open.txt", 0644}, {"share/pub/report closed.txt", 0600},
+      {"share/priv/report hidden.txt", 0644}, {"share", 0755}, {"share/pub", 0755},
+      {"share/priv", 0700}};
+  std::vector<Json::Value> upserts;
+  for (const auto& [rel, mode] : modes) {
+    if (rel.find(".txt") != std::string::npos) {
+      upserts.push_back(tc::Upsert(dir_.Write(rel, "x")));
+    }
+    ::chmod(dir_.Path(rel).c_str(), mode);
+  }
   Launch();
   ASSERT_EQ(CreateIndex()["success"], true);
-  Json::Value batch;
-  for (const std::string& p : {open_file, closed_file, hidden_file}) {
-    Json::Value data;
-    data["id"] = kId;
-    data["doc_id"] = p;
-    data["data"] = FileDoc(p);
-    batch["compound"].append(Cmd("document_upsert_by_id", data));
-  }
+  const Json::Value batch = tc::Compound(upserts);
   ASSERT_EQ(Send(batch)["has_fail"], false);
 
   // The main socket is closed to ordinary users; the public one takes searches only.
@@ -256,18 +224,14 @@ TEST_F(DaemonTest, OrdinaryUsersOnlySearchAndOnlySeeWhatTheyCanOpen) {
   const Json::Value upsert = tc::RequestAs(daemon_->public_socket(), batch, uid, gid);
   EXPECT_EQ(upsert["data"][0]["error"]["code"], kCodePermissionDenied) << JsonToString(upsert);
 
-  Json::Value search;
-  search["command"] = "search";
-  search["data"]["name"] = "report";
+  const Json::Value search = tc::Parse(R"({"command": "search", "data": {"name": "report"}})");
   const Json::Value mine = tc::RequestAs(daemon_->public_socket(), search, uid, gid);
   ASSERT_EQ(mine["success"], true) << JsonToString(mine);
   EXPECT_EQ(mine["data"]["total"], 1);
-  EXPECT_EQ(mine["data"]["hits"][0]["path"], open_file);
+  EXPECT_EQ(mine["data"]["hits"][0]["path"], dir_.Path("share/pub/report open.txt"));
   EXPECT_EQ(Send(search)["data"]["total"], 3);  // root sees everything
 
-  Json::Value suggest;
-  suggest["command"] = "suggest";
-  suggest["data"]["prefix"] = "o";
+  Json::Value suggest = tc::Parse(R"({"command": "suggest", "data": {"prefix": "o"}})");
   EXPECT_EQ(JsonToString(tc::RequestAs(daemon_->public_socket(), suggest, uid, gid)["data"]),
             "{\"suggestions\":[\"open\"]}");
   suggest["data"]["prefix"] = "hid";

@@ -12,6 +12,8 @@
 #include <cstring>
 #include <thread>
 
+#include <gtest/gtest.h>
+
 #include "common/fd.hpp"
 #include "common/json_util.hpp"
 
@@ -138,6 +140,49 @@ Json::Value Cmd(const std::string& command, const Json::Value& data) {
   r["command"] = command;
   r["data"] = data;
   return r;
+}
+
+Json::Value OnIndex(const std::string& command, const std::string& id) {
+  Json::Value data;
+  data["id"] = id;
+  return Cmd(command, data);
+}
+
+Json::Value Parse(const std::string& text) {
+  JsonValue v;
+  EXPECT_TRUE(v.fromString(text)) << text;
+  return v;
+}
+
+Json::Value Compound(const std::vector<Json::Value>& requests) {
+  Json::Value c;
+  c["compound"] = Json::Value(Json::arrayValue);
+  for (const Json::Value& r : requests) c["compound"].append(r);
+  return c;
+}
+
+Json::Value FileDoc(const std::string& path, int64_t size, int64_t mtime) {
+  const size_t slash = path.find_last_of('/');
+  const std::string name = path.substr(slash + 1);
+  const size_t dot = name.find_last_of('.');
+  Json::Value d;
+  d["QUIXMDPath"] = path;
+  d["QUIXMDFSName"] = name;
+  d["QUIXMDParent"] = path.substr(0, slash);
+  d["QUIXMDSearchFileName"] = name;
+  d["QUIXMDSearchAncestor"] = path.substr(0, slash);
+  d["QUIXMDExtension"] = dot == std::string::npos ? "" : name.substr(dot + 1);
+  d["QUIXMDFSSize"] = static_cast<Json::Int64>(size);
+  d["QUIXMDFSContentChangeDate"] = static_cast<Json::Int64>(mtime);
+  return d;
+}
+
+Json::Value Upsert(const std::string& path, const std::string& id) {
+  Json::Value data;
+  data["id"] = id;
+  data["doc_id"] = path;
+  data["data"] = FileDoc(path);
+  return Cmd("document_upsert_by_id", data);
 }
 
 Json::Value FileMappings() {

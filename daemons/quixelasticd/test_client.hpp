@@ -7,6 +7,7 @@
 
 #include <json/json.h>
 
+#include <cstdint>
 #include <string>
 #include <vector>
 
@@ -47,6 +48,16 @@ class DaemonProcess {
 
 // A request {"command": command, "data": data}.
 Json::Value Cmd(const std::string& command, const Json::Value& data);
+// A request {"command": command, "data": {"id": id}}.
+Json::Value OnIndex(const std::string& command, const std::string& id = "fileindex_share");
+// JSON text parsed; null (and a test failure) when it does not parse.
+Json::Value Parse(const std::string& text);
+// {"compound": requests}.
+Json::Value Compound(const std::vector<Json::Value>& requests);
+// A file's document as the library writes it, its names and parents taken from the path.
+Json::Value FileDoc(const std::string& path, int64_t size = 1, int64_t mtime = 0);
+// document_upsert_by_id of FileDoc(path) into index `id`.
+Json::Value Upsert(const std::string& path, const std::string& id = "fileindex_share");
 // The schema the library sends at index creation, reduced to the fields the tests use.
 Json::Value FileMappings();
 
