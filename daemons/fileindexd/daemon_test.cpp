@@ -32,6 +32,26 @@ std::string CreateLine(const std::string& path) {
   return R"({"event": 64, "is_dir": false, "path": ")" + path + "\"}\n";
 }
 
+Json::Value Share(const std::string& name) {
+  Json::Value d(Json::objectValue);
+  d["share_name"] = name;
+  return d;
+}
+
+Json::Value Status() { return Command("status", Json::Value())["data"]; }
+
+std::set<std::string> Running() {
+  std::set<std::string> shares;
+  const Json::Value status = Status();  // a range over a temporary's member would dangle
+  for (const auto& s : status["shares"]) shares.insert(s["share"].asString());
+  return shares;
+}
+
+// The reply to a frame of `payload` behind a length of `length`.
+std::string RawFrame(uint32_t length, const std::string& payload) {
+  return test::RawCommand(std::string(reinterpret_cast<const char*>(&length), 4) + payload);
+}
+
 class DaemonTest : public ::testing::Test {
  protected:
   DaemonTest() : sys_({"docs", "music"}) {}
@@ -40,9 +60,8 @@ class DaemonTest : public ::testing::Test {
     setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BIN, 1);
     Json::Value folders(Json::arrayValue);
     folders.append(System::Folder("/docs/a", false));
-    Json::Value paused = System::Folder("/music", false);
-    paused["paused"] = true;
-    folders.append(paused);
+    folders.append(System::Folder("/music", false));
+    folders[1]["paused"] = true;
     sys_.WriteFolders(folders);
     MakeParentDirs(V("a/x"));
     engine_ = sys_.StartEngine();
@@ -50,18 +69,10 @@ class DaemonTest : public ::testing::Test {
   }
   std::string V(const std::string& rel) const { return sys_.Vol("docs/" + rel); }
   bool Indexed(const std::string& rel) const { return sys_.Documents("docs").count(V(rel)) > 0; }
-  static Json::Value Share(const std::string& name) {
-    Json::Value d(Json::objectValue);
-    d["share_name"] = name;
-    return d;
-  }
-  static std::set<std::string> Running() {
-    std::set<std::string> shares;
-    const Json::Value status = Command("status", Json::Value());
-    for (const auto& s : status["data"]["shares"]) {
-      shares.insert(s["share"].asString());
-    }
-    return shares;
+  // Writes a file of the share and queues its creation.
+  void Create(const std::string& rel) {
+    std::ofstream(V(rel)) << rel;
+    ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), CreateLine(V(rel))));
   }
 
   System sys_;
@@ -72,9 +83,7 @@ TEST_F(DaemonTest, FollowsTheQueueAndAnswersItsCommands) {
   auto indexd = sys_.StartIndexd();
   // Only the share whose folders are not all paused has a worker.
   EXPECT_EQ(std::set<std::string>{"docs"}, Running());
-
-  std::ofstream(V("a/one.txt")) << "1";
-  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), CreateLine(V("a/one.txt"))));
+  Create("a/one.txt");
   EXPECT_TRUE(WaitFor([&] { return Indexed("a/one.txt"); }, 5000));
 
   EXPECT_TRUE(Command("worker_create", Share("music"))["success"].asBool());
@@ -86,44 +95,32 @@ TEST_F(DaemonTest, FollowsTheQueueAndAnswersItsCommands) {
   Json::Value pause(Json::objectValue);
   pause["resume_time"] = 0;
   EXPECT_TRUE(Command("pause", pause)["success"].asBool());
-  Json::Value status = Command("status", Json::Value())["data"];
-  EXPECT_TRUE(status["paused"].asBool());
-  std::ofstream(V("a/two.txt")) << "2";
-  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), CreateLine(V("a/two.txt"))));
+  EXPECT_TRUE(Status()["paused"].asBool());
+  Create("a/two.txt");
   EXPECT_FALSE(WaitFor([&] { return Indexed("a/two.txt"); }, 1500));
-  EXPECT_EQ(1u, Command("status", Json::Value())["data"]["shares"][0]["queue_length"].asUInt());
+  EXPECT_EQ(1u, Status()["shares"][0]["queue_length"].asUInt());
   EXPECT_TRUE(Command("resume", Json::Value())["success"].asBool());
   EXPECT_TRUE(WaitFor([&] { return Indexed("a/two.txt"); }, 5000));
 
   // The pass counts its operations once it has finished, which is after the commit that made
   // the document visible.
   Json::Value report;
-  EXPECT_TRUE(WaitFor(
-      [&] {
-        report = Command("status", Json::Value())["data"]["shares"][0];
-        return report["ops_done"].asUInt() == 2;
-      },
-      5000))
+  EXPECT_TRUE(
+      WaitFor([&] { return (report = Status()["shares"][0])["ops_done"].asUInt() == 2; }, 5000))
       << report;
   EXPECT_EQ("docs", report["share"].asString());
-  for (const char* key : {"queue_length", "ops_pending", "documents_written", "last_pass",
-                          "errors", "paused"}) {
+  for (const char* key :
+       {"queue_length", "ops_pending", "documents_written", "last_pass", "errors", "paused"}) {
     EXPECT_TRUE(report.isMember(key)) << key;
   }
 
-  // Bad input gets an error reply, never a crash.
+  // Bad input gets an error reply, never a crash; a frame cut short is closed without one.
   EXPECT_EQ(101, Command("reboot", Json::Value())["error"]["code"].asInt());
   EXPECT_EQ(120, Command("worker_create", Json::Value())["error"]["code"].asInt());
   EXPECT_EQ(120, Command("pause", Json::Value(Json::objectValue))["error"]["code"].asInt());
-  const std::string junk = "not json";
-  const uint32_t junk_len = junk.size();
-  EXPECT_NE(std::string::npos,
-            test::RawCommand(std::string(reinterpret_cast<const char*>(&junk_len), 4) + junk)
-                .find("\"code\":100"));
-  const uint32_t huge = 1u << 30;
-  EXPECT_NE(std::string::npos,
-            test::RawCommand(std::string(reinterpret_cast<const char*>(&huge), 4)).find("104"));
-  EXPECT_EQ("", test::RawCommand("ab"));  // cut short: closed without a reply
+  EXPECT_NE(std::string::npos, RawFrame(8, "not json").find("\"code\":100"));
+  EXPECT_NE(std::string::npos, RawFrame(1u << 30, "").find("104"));
+  EXPECT_EQ("", test::RawCommand("ab"));
   EXPECT_TRUE(Command("status", Json::Value())["success"].asBool());
 
   // A clean stop removes the socket and the pid file.
@@ -141,14 +138,12 @@ TEST_F(DaemonTest, OnlyRootAndItsOwnUserControlIt) {
   }
   auto indexd = sys_.StartIndexd();
   if (geteuid() != 0) GTEST_SKIP() << "needs root to act as another user";
-  const int status_ok = orvane::test::RunAsUser("nobody", [] {
-    return Command("status", Json::Value())["success"].asBool() ? 1 : 0;
-  });
-  EXPECT_EQ(1, status_ok);
-  const int refused = orvane::test::RunAsUser("nobody", [] {
-    return Command("worker_delete", Share("docs"))["error"]["code"].asInt();
-  });
-  EXPECT_EQ(103, refused);
+  EXPECT_EQ(1, orvane::test::RunAsUser("nobody", [] {
+              return Command("status", Json::Value())["success"].asBool() ? 1 : 0;
+            }));
+  EXPECT_EQ(103, orvane::test::RunAsUser("nobody", [] {
+              return Command("worker_delete", Share("docs"))["error"]["code"].asInt();
+            }));
   EXPECT_EQ(std::set<std::string>{"docs"}, Running());
 }
 
@@ -172,8 +167,7 @@ TEST_F(DaemonTest, SighupReReadsTheFolderConfiguration) {
   EXPECT_TRUE(WaitFor([&] { return sys_.Documents("music") == want; }, 5000));
 
   // The share no longer indexed has no worker; its queue keeps what arrives meanwhile.
-  std::ofstream(V("a/late.txt")) << "l";
-  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), CreateLine(V("a/late.txt"))));
+  Create("a/late.txt");
   EXPECT_FALSE(WaitFor([&] { return Indexed("a/late.txt"); }, 1000));
 
   // A folder file broken by hand is reported and changes nothing: the daemon lives on with the
@@ -201,12 +195,11 @@ TEST_F(DaemonTest, SighupReReadsTheFolderConfiguration) {
 }
 
 TEST_F(DaemonTest, ABatchLeftByAKilledDaemonIsFinishedFirst) {
-  std::ofstream(V("a/left.txt")) << "l";
-  std::ofstream(V("a/new.txt")) << "n";
   // The side file a killed pass leaves, and new lines queued after it.
+  std::ofstream(V("a/left.txt")) << "l";
   MakeParentDirs(sys_.Queue("docs"));
   std::ofstream(sys_.Queue("docs") + ".tmp") << CreateLine(V("a/left.txt"));
-  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), CreateLine(V("a/new.txt"))));
+  Create("a/new.txt");
   auto indexd = sys_.StartIndexd();
   EXPECT_TRUE(WaitFor([&] { return Indexed("a/left.txt") && Indexed("a/new.txt"); }, 5000));
   EXPECT_TRUE(WaitFor([&] { return !IsFileExist(sys_.Queue("docs") + ".tmp"); }, 5000));

@@ -26,118 +26,105 @@ namespace {
 
 using test::System;
 
-std::string Line(unsigned mask, const std::string& path, bool is_dir = false,
-                 const std::string& old_path = "", const Json::Value& data = Json::Value()) {
-  Json::Value e(Json::objectValue);
-  e["event"] = mask;
-  e["is_dir"] = is_dir;
-  e["path"] = path;
-  if (!old_path.empty()) e["path_old"] = old_path;
-  if (!data.isNull()) e["data"] = data;
-  return JsonToString(e) + "\n";
-}
-
-Json::Value Kinds(bool on) {
+// A folder-settings change that switched every kind of metadata on.
+Json::Value AllKinds() {
   Json::Value k(Json::objectValue);
-  for (const char* kind : {"document", "audio", "video", "photo"}) k[kind] = on;
+  for (const char* kind : {"document", "audio", "video", "photo"}) k[kind] = true;
   return k;
 }
 
-void Write(const std::string& path, const std::string& text) {
-  MakeParentDirs(path);
-  std::ofstream(path) << text;
+Json::Value Folders(const std::vector<Json::Value>& list) {
+  Json::Value folders(Json::arrayValue);
+  for (const Json::Value& f : list) folders.append(f);
+  return folders;
 }
 
-class WorkerTest : public ::testing::Test {
+// A scratch system with the share "docs" and its worker.
+class ShareTest : public ::testing::Test {
  protected:
-  WorkerTest() : sys_({"docs"}), worker_("docs", sys_.Queue("docs"), Worker::PauseGate()) {}
+  ShareTest() : sys_({"docs"}), worker_("docs", sys_.Queue("docs"), Worker::PauseGate()) {}
 
+  std::string V(const std::string& rel) const { return sys_.Vol("docs/" + rel); }
+  void Write(const std::string& rel, const std::string& text = "x") {
+    MakeParentDirs(V(rel));
+    std::ofstream(V(rel)) << text;
+  }
+  // One queue line, its paths relative to the share.
+  std::string Line(unsigned mask, const std::string& rel, bool is_dir = false,
+                   const std::string& old_rel = "", const Json::Value& data = Json::Value()) {
+    Json::Value e(Json::objectValue);
+    e["event"] = mask;
+    e["is_dir"] = is_dir;
+    e["path"] = V(rel);
+    if (!old_rel.empty()) e["path_old"] = V(old_rel);
+    if (!data.isNull()) e["data"] = data;
+    return JsonToString(e) + "\n";
+  }
+
+  System sys_;
+  Worker worker_;
+};
+
+class WorkerTest : public ShareTest {
+ protected:
   void SetUp() override {
     setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BIN, 1);
-    Json::Value folders(Json::arrayValue);
-    folders.append(System::Folder("/docs/a", false));
-    folders.append(System::Folder("/docs/b", false));
-    sys_.WriteFolders(folders);
+    SetFolders({System::Folder("/docs/a", false), System::Folder("/docs/b", false)});
     engine_ = sys_.StartEngine();
     fileindex::elastic::ShareIndexCreate("docs");
   }
 
-  std::string V(const std::string& rel) const { return sys_.Vol("docs/" + rel); }
-  void Queue(const std::string& lines) {
-    ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), lines));
+  void SetFolders(const std::vector<Json::Value>& list) { sys_.WriteFolders(Folders(list)); }
+  void Move(const std::string& from, const std::string& to) {
+    ASSERT_EQ(0, rename(V(from).c_str(), V(to).c_str())) << from;
   }
-  void Pass() {
-    ASSERT_TRUE(worker_.RunPass());
+  // Queues `lines`, runs one pass and returns the documents it leaves.
+  std::set<std::string> Pass(const std::string& lines) {
+    EXPECT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), lines));
+    EXPECT_TRUE(worker_.RunPass());
     EXPECT_FALSE(IsFileExist(sys_.Queue("docs") + ".tmp"));
+    return sys_.Documents("docs");
   }
-  std::set<std::string> Docs() const { return sys_.Documents("docs"); }
   std::set<std::string> Expect(std::initializer_list<const char*> rels) const {
     std::set<std::string> out;
     for (const char* rel : rels) out.insert(V(rel));
     return out;
   }
 
-  System sys_;
   std::unique_ptr<test::ChildProcess> engine_;
-  Worker worker_;
 };
 
-TEST_F(WorkerTest, CreatedFilesAndDirectoriesAreIndexedWithinTheRules) {
-  Write(V("a/x.txt"), "x");
-  Write(V("a/sub/y.txt"), "y");
-  Write(V("a/sub/deeper/z.txt"), "z");
-  Write(V("a/sub/@eaDir/thumb.txt"), "t");
-  Write(V("a/sub/.DS_Store"), "t");
-  Write(V("c/out.txt"), "not under an indexed folder");
+TEST_F(WorkerTest, EventsFollowTheDiskWithinTheRules) {
+  for (const char* rel :
+       {"a/x.txt", "a/sub/y.txt", "a/sub/deeper/z.txt", "a/sub/@eaDir/thumb.txt", "a/sub/.DS_Store",
+        "a/d/f1.txt", "a/dx.txt", "a/out.txt", "c/not-under-a-folder.txt", "c/m/inner.txt"}) {
+    Write(rel, rel);
+  }
   ASSERT_EQ(0, symlink(V("a/x.txt").c_str(), V("a/sub/link.txt").c_str()));
-  Queue(Line(0x40, V("a/x.txt")) + Line(0x8, V("a/x.txt")) + Line(0x40, V("a/sub"), true) +
-        Line(0x40, V("c/out.txt")) + Line(0x40, V("a/gone.txt")));
-  Pass();
-  EXPECT_EQ(Expect({"a/x.txt", "a/sub", "a/sub/y.txt", "a/sub/deeper", "a/sub/deeper/z.txt"}),
-            Docs());
+  EXPECT_EQ(Expect({"a/x.txt", "a/sub", "a/sub/y.txt", "a/sub/deeper", "a/sub/deeper/z.txt", "a/d",
+                    "a/d/f1.txt", "a/dx.txt", "a/out.txt"}),
+            Pass(Line(0x40, "a/x.txt") + Line(0x8, "a/x.txt") + Line(0x40, "a/sub", true) +
+                 Line(0x40, "c/not-under-a-folder.txt") + Line(0x40, "a/gone.txt") +
+                 Line(0x40, "a/d", true) + Line(0x40, "a/dx.txt") + Line(0x40, "a/out.txt")));
   const Json::Value report = worker_.Report();
-  EXPECT_EQ(0u, report["errors"].asUInt());
-  EXPECT_EQ(0u, report["queue_length"].asUInt());
+  EXPECT_EQ(0u, report["errors"].asUInt() + report["queue_length"].asUInt()) << report;
   EXPECT_GT(report["last_pass"].asInt64(), 0);
-}
 
-TEST_F(WorkerTest, RenamesDeletesAndAttributeChangesFollowTheDisk) {
-  Write(V("a/d/f1.txt"), "1");
-  Write(V("a/d/f2.txt"), "2");
-  Write(V("a/dx.txt"), "x");
-  Write(V("a/ex.txt"), "x");
-  Queue(Line(0x10000, V("a")));
-  Pass();
-  EXPECT_EQ(Expect({"a", "a/d", "a/d/f1.txt", "a/d/f2.txt", "a/dx.txt", "a/ex.txt"}), Docs());
-
-  // A directory renamed, then deleted: the sibling whose name only begins the same stays.
-  ASSERT_EQ(0, rename(V("a/d").c_str(), V("a/e").c_str()));
-  Queue(Line(0x100, V("a/e"), true, V("a/d")));
-  Pass();
-  EXPECT_EQ(Expect({"a", "a/e", "a/e/f1.txt", "a/e/f2.txt", "a/dx.txt", "a/ex.txt"}), Docs());
-  ASSERT_EQ(0, unlink(V("a/e/f1.txt").c_str()));
-  ASSERT_EQ(0, unlink(V("a/e/f2.txt").c_str()));
-  ASSERT_EQ(0, rmdir(V("a/e").c_str()));
-  Queue(Line(0x80, V("a/e"), true));
-  Pass();
-  EXPECT_EQ(Expect({"a", "a/dx.txt", "a/ex.txt"}), Docs());
-
-  // An attribute change of a file never indexed indexes it; a move in from an unindexed place
-  // (no old document) crawls the new name; a move out deletes the old one.
-  Write(V("a/new.txt"), "n");
-  Write(V("c/m/inner.txt"), "i");
-  ASSERT_EQ(0, rename(V("c/m").c_str(), V("a/m").c_str()));
-  ASSERT_EQ(0, rename(V("a/dx.txt").c_str(), V("c/dx.txt").c_str()));
-  Queue(Line(0x4, V("a/new.txt")) + Line(0x100, V("a/m"), true, V("c/m")) +
-        Line(0x100, V("c/dx.txt"), false, V("a/dx.txt")));
-  Pass();
-  EXPECT_EQ(Expect({"a", "a/ex.txt", "a/new.txt", "a/m", "a/m/inner.txt"}), Docs());
-
-  // A file renamed in its folder keeps its document under the new name, with the new name.
-  ASSERT_EQ(0, rename(V("a/ex.txt").c_str(), V("a/why.txt").c_str()));
-  Queue(Line(0x100, V("a/why.txt"), false, V("a/ex.txt")));
-  Pass();
-  EXPECT_EQ(Expect({"a", "a/why.txt", "a/new.txt", "a/m", "a/m/inner.txt"}), Docs());
+  // A directory renamed (its sibling whose name only begins the same stays) and one deleted; a
+  // file renamed in its folder; an attribute change of a file never indexed indexes it; a move
+  // in from an unindexed place (no old document) crawls the new name; a move out deletes.
+  Move("a/d", "a/e");
+  Move("a/x.txt", "a/why.txt");
+  Write("a/new.txt", "n");
+  Move("c/m", "a/m");
+  Move("a/out.txt", "c/out.txt");
+  ASSERT_EQ(0, system(("rm -r " + V("a/sub")).c_str()));
+  EXPECT_EQ(
+      Expect({"a/e", "a/e/f1.txt", "a/dx.txt", "a/why.txt", "a/new.txt", "a/m", "a/m/inner.txt"}),
+      Pass(Line(0x100, "a/e", true, "a/d") + Line(0x100, "a/why.txt", false, "a/x.txt") +
+           Line(0x4, "a/new.txt") + Line(0x100, "a/m", true, "c/m") +
+           Line(0x100, "c/out.txt", false, "a/out.txt") + Line(0x80, "a/sub", true)));
+  // The renamed file's document carries its new name.
   Json::Value q(Json::objectValue);
   q["id"] = "fileindex_docs";
   q["query"]["qsl"]["term"]["QUIXMDPath"] = V("a/why.txt");
@@ -147,35 +134,28 @@ TEST_F(WorkerTest, RenamesDeletesAndAttributeChangesFollowTheDisk) {
 }
 
 TEST_F(WorkerTest, ReindexAndCrashSettleTheIndexWithTheDisk) {
-  Write(V("a/keep.txt"), "k");
-  Write(V("a/old.txt"), "o");
-  Write(V("b/other.txt"), "b");
-  Queue(Line(0x10000, V("a")));
-  Pass();
-  EXPECT_EQ(Expect({"a", "a/keep.txt", "a/old.txt"}), Docs());
+  Write("a/keep.txt", "k");
+  Write("a/old.txt", "o");
+  Write("b/other.txt", "b");
+  EXPECT_EQ(Expect({"a", "a/keep.txt", "a/old.txt"}), Pass(Line(0x10000, "a")));
 
   // Changes nobody reported: a re-index finds them, only below its own path.
   ASSERT_EQ(0, unlink(V("a/old.txt").c_str()));
-  Write(V("a/sub/new.txt"), "n");
-  Queue(Line(0x10000, V("a/sub")));
-  Pass();
-  EXPECT_EQ(Expect({"a", "a/keep.txt", "a/old.txt", "a/sub", "a/sub/new.txt"}), Docs());
-  Queue(Line(0x10000, V("a")));
-  Pass();
-  EXPECT_EQ(Expect({"a", "a/keep.txt", "a/sub", "a/sub/new.txt"}), Docs());
+  Write("a/sub/new.txt", "n");
+  EXPECT_EQ(Expect({"a", "a/keep.txt", "a/old.txt", "a/sub", "a/sub/new.txt"}),
+            Pass(Line(0x10000, "a/sub")));
+  EXPECT_EQ(Expect({"a", "a/keep.txt", "a/sub", "a/sub/new.txt"}), Pass(Line(0x10000, "a")));
 
   // A crashed queue: the events after the crash mark are not read; every folder is crawled.
   ASSERT_EQ(0, unlink(V("a/keep.txt").c_str()));
-  Queue(Line(0x40, V("a/ignored.txt")) + Line(0x200, V("a")) + Line(0x80, V("a/sub"), true));
-  Pass();
-  EXPECT_EQ(Expect({"a", "a/sub", "a/sub/new.txt", "b", "b/other.txt"}), Docs());
+  EXPECT_EQ(Expect({"a", "a/sub", "a/sub/new.txt", "b", "b/other.txt"}),
+            Pass(Line(0x40, "a/ignored.txt") + Line(0x200, "a") + Line(0x80, "a/sub", true)));
 }
 
 TEST_F(WorkerTest, FolderSettingChangesAddStripAndRemove) {
-  Write(V("a/notes.txt"), "zebra crossing");
-  Write(V("a/sub/more.txt"), "more");
-  Queue(Line(0x10000, V("a")));
-  Pass();
+  Write("a/notes.txt", "zebra crossing");
+  Write("a/sub/more.txt", "more");
+  Pass(Line(0x10000, "a"));
   auto search = [](const std::string& word) {
     Json::Value q(Json::objectValue);
     q["keyword"] = word;
@@ -185,41 +165,27 @@ TEST_F(WorkerTest, FolderSettingChangesAddStripAndRemove) {
   EXPECT_EQ(0, search("zebra"));  // names and attributes only
 
   // Documents switched on for the folder: its text files are extracted again.
-  Json::Value folders(Json::arrayValue);
-  folders.append(System::Folder("/docs/a", true));
-  folders.append(System::Folder("/docs/b", false));
-  sys_.WriteFolders(folders);
+  SetFolders({System::Folder("/docs/a", true), System::Folder("/docs/b", false)});
   Json::Value switched(Json::objectValue);
   switched["document"] = true;
-  Queue(Line(0x20000, V("a"), true, "", switched));
-  Pass();
+  Pass(Line(0x20000, "a", true, "", switched));
   EXPECT_EQ(1, search("zebra"));
 
   // The folder removed: no folder covers its documents any more.
-  folders = Json::Value(Json::arrayValue);
-  folders.append(System::Folder("/docs/b", false));
-  sys_.WriteFolders(folders);
-  Queue(Line(0x20000, V("a"), true, "", Kinds(true)));
-  Pass();
-  EXPECT_TRUE(Docs().empty());
+  SetFolders({System::Folder("/docs/b", false)});
+  EXPECT_TRUE(Pass(Line(0x20000, "a", true, "", AllKinds())).empty());
 
   // A sub-folder of an unindexed folder added on its own: only it is indexed.
-  folders.append(System::Folder("/docs/a/sub", false));
-  sys_.WriteFolders(folders);
-  Queue(Line(0x20000, V("a/sub"), true, "", Kinds(true)));
-  Pass();
-  EXPECT_EQ(Expect({"a/sub", "a/sub/more.txt"}), Docs());
+  SetFolders({System::Folder("/docs/b", false), System::Folder("/docs/a/sub", false)});
+  EXPECT_EQ(Expect({"a/sub", "a/sub/more.txt"}),
+            Pass(Line(0x20000, "a/sub", true, "", AllKinds())));
 }
 
 // The engine replaced by a scripted one: every write succeeds except those `fail` picks, which
 // are answered with `code`; queries find nothing.
-class ScriptedEngineTest : public ::testing::Test {
+class ScriptedEngineTest : public ShareTest {
  protected:
-  ScriptedEngineTest() : sys_({"docs"}), worker_("docs", sys_.Queue("docs"), Worker::PauseGate()) {
-    Json::Value folders(Json::arrayValue);
-    folders.append(System::Folder("/docs/a", false));
-    sys_.WriteFolders(folders);
-  }
+  ScriptedEngineTest() { sys_.WriteFolders(Folders({System::Folder("/docs/a", false)})); }
 
   void StartEngine(std::function<int(const Json::Value&)> fail, bool hang_up = false) {
     engine_.reset();  // it removes the socket file when it goes
@@ -236,23 +202,25 @@ class ScriptedEngineTest : public ::testing::Test {
           orvane::test::FakeDaemon::WriteFrame(fd, JsonToString(reply));
         });
   }
-  std::string V(const std::string& rel) const { return sys_.Vol("docs/" + rel); }
   std::string Tmp() const { return sys_.Queue("docs") + ".tmp"; }
+  // Writes the files and queues their creation.
+  void Create(std::initializer_list<const char*> rels) {
+    std::string lines;
+    for (const char* rel : rels) {
+      Write(rel, rel);
+      lines += Line(0x40, rel);
+    }
+    ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), lines));
+  }
 
-  System sys_;
-  Worker worker_;
   std::unique_ptr<orvane::test::FakeDaemon> engine_;
   orvane::test::FakeEnv env_;
 };
 
 TEST_F(ScriptedEngineTest, AFailingOperationIsRetriedWithBackoffThenSkipped) {
-  StartEngine([this](const Json::Value& req) {
-    return req["data"]["doc_id"] == V("a/bad.txt") ? 604 : 0;
-  });
-  Write(V("a/bad.txt"), "b");
-  Write(V("a/good.txt"), "g");
-  ASSERT_TRUE(fileindex::QueueFileAppend(
-      sys_.Queue("docs"), Line(0x40, V("a/bad.txt")) + Line(0x40, V("a/good.txt"))));
+  StartEngine(
+      [this](const Json::Value& req) { return req["data"]["doc_id"] == V("a/bad.txt") ? 604 : 0; });
+  Create({"a/bad.txt", "a/good.txt"});
   ASSERT_TRUE(worker_.RunPass());
   EXPECT_FALSE(IsFileExist(Tmp()));
   // Four attempts with one, two and four seconds between them, on the fake clock.
@@ -272,13 +240,12 @@ TEST_F(ScriptedEngineTest, AFailingOperationIsRetriedWithBackoffThenSkipped) {
 
 TEST_F(ScriptedEngineTest, AnEngineThatDropsTheConnectionKeepsTheBatch) {
   StartEngine([](const Json::Value&) { return 0; }, /*hang_up=*/true);
-  Write(V("a/x.txt"), "x");
-  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), Line(0x40, V("a/x.txt"))));
+  Create({"a/x.txt"});
   EXPECT_FALSE(worker_.RunPass());
   EXPECT_TRUE(IsFileExist(Tmp()));
   // Nothing was skipped: the next pass (engine back) does the same batch.
   StartEngine([](const Json::Value&) { return 0; });
-  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), Line(0x40, V("a/later.txt"))));
+  Create({"a/later.txt"});
   EXPECT_TRUE(worker_.RunPass());
   EXPECT_FALSE(IsFileExist(Tmp()));
   EXPECT_TRUE(IsFileExist(sys_.Queue("docs")));  // the later line waits for its own pass
@@ -288,13 +255,9 @@ TEST_F(ScriptedEngineTest, AnEngineThatDropsTheConnectionKeepsTheBatch) {
 TEST_F(ScriptedEngineTest, AFullVolumeFlagsTheShareAndNotifiesOnce) {
   StartEngine([](const Json::Value& req) { return req["command"] == "commit" ? 605 : 0; });
   platform::ScopedFaults faults;
-  platform::Fault full;
-  full.result = 0;
-  full.platform_err = platform::kQErrVolumeFull;
-  faults.Arm("QUIXQuotaIsEnough", full, 0, -1);
+  faults.Arm("QUIXQuotaIsEnough", platform::Fault{0, 0, platform::kQErrVolumeFull}, 0, -1);
   fileindex::StatusMgr::CreateIfMissing();  // as the daemon does at its start
-  Write(V("a/x.txt"), "x");
-  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), Line(0x40, V("a/x.txt"))));
+  Create({"a/x.txt"});
   EXPECT_FALSE(worker_.RunPass());
   EXPECT_FALSE(worker_.RunPass());
   EXPECT_TRUE(IsFileExist(Tmp()));
