@@ -145,14 +145,17 @@ class AdminTestEnv : public ::testing::Test {
     engine_.reset();
     indexd_ = std::make_unique<test::FakeDaemon>(Rooted("/var/run/fileindexd.sock"),
                                                  test::FakeDaemon::Replies({"{}"}));
+    indexd_seen_ = 0;
     engine_ = std::make_unique<test::FakeDaemon>(
         Rooted("/var/run/quixelasticd.sock"), test::FakeDaemon::Replies({R"({"success":true})"}));
+    engine_seen_ = 0;
   }
   // Replaces the engine with one that gives `replies` in turn (the last one repeated).
   void StartEngine(std::vector<std::string> replies) {
     engine_.reset();
     engine_ = std::make_unique<test::FakeDaemon>(Rooted("/var/run/quixelasticd.sock"),
                                                  test::FakeDaemon::Replies(std::move(replies)));
+    engine_seen_ = 0;
   }
   // The indexing daemon's commands as compact {"type", "data"} texts, in order.
   std::vector<std::string> IndexdCommands() const {
@@ -169,6 +172,14 @@ class AdminTestEnv : public ::testing::Test {
     return out;
   }
   std::vector<Json::Value> EngineRequests() const { return engine_->json_requests(); }
+  // What reached each daemon since the last look.
+  Strings NewEngine() { return Since(EngineCommands(), engine_seen_); }
+  Strings NewIndexd() { return Since(IndexdCommands(), indexd_seen_); }
+  static Strings Since(const Strings& all, size_t& seen) {
+    Strings out(all.begin() + seen, all.end());
+    seen = all.size();
+    return out;
+  }
 
   // The services started, stopped and restarted, one per line.
   std::string Actions() const { return test::ReadFile(actions_); }
@@ -179,6 +190,8 @@ class AdminTestEnv : public ::testing::Test {
   std::string actions_;
   std::unique_ptr<test::FakeDaemon> indexd_;
   std::unique_ptr<test::FakeDaemon> engine_;
+  size_t indexd_seen_ = 0;
+  size_t engine_seen_ = 0;
   test::ScopedRoot scoped_{root_.path()};
   std::string vol_;
 };
@@ -191,6 +204,12 @@ class AdminOpsTest : public AdminTestEnv {
     StartDaemons();
   }
   Json::Value Folders() const { return ReadJson(FoldersPath()); }
+  // The folder file's "paused" members, in order.
+  std::vector<bool> Paused() const {
+    std::vector<bool> paused;
+    for (const auto& f : Folders()) paused.push_back(f["paused"].asBool());
+    return paused;
+  }
   // The paths of the folder file, in order.
   Strings FolderPaths() const {
     Strings paths;

@@ -30,22 +30,6 @@ class ShareOpsTest : public testenv::AdminOpsTest {
     NewEngine();
     NewIndexd();
   }
-  // What reached each daemon since the last look.
-  Strings NewEngine() { return Since(EngineCommands(), engine_seen_); }
-  Strings NewIndexd() { return Since(IndexdCommands(), indexd_seen_); }
-  static Strings Since(const Strings& all, size_t& seen) {
-    Strings out(all.begin() + seen, all.end());
-    seen = all.size();
-    return out;
-  }
-  std::vector<bool> Paused() const {
-    std::vector<bool> paused;
-    for (const auto& f : Folders()) paused.push_back(f["paused"].asBool());
-    return paused;
-  }
-
-  size_t engine_seen_ = 0;
-  size_t indexd_seen_ = 0;
 };
 
 TEST_F(ShareOpsTest, PauseAndResumeSharesAndVolumes) {
