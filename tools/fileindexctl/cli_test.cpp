@@ -17,6 +17,7 @@ namespace orvane {
 namespace ctl {
 namespace {
 
+using ::testing::AllOf;
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
 
@@ -72,32 +73,31 @@ class CtlTest : public ::testing::Test {
   std::string docs_ = dir_.Path("vol/docs");
 };
 
-TEST_F(CtlTest, HelpAndCommandLineMistakes) {
-  Result r = Run({"--help"});
-  EXPECT_EQ(r.status, 0);
-  EXPECT_THAT(r.out, HasSubstr("folder add"));
-  EXPECT_THAT(r.out, HasSubstr("status"));
-  EXPECT_EQ(Run({}).status, 2);
-  r = Run({"folder", "--help"});
-  EXPECT_EQ(r.status, 0);
-  EXPECT_THAT(r.out, HasSubstr("folder reindex"));
-  EXPECT_THAT(r.out, ::testing::Not(HasSubstr("share rename")));
-  r = Run({"search", "--help"});
-  EXPECT_EQ(r.status, 0);
-  EXPECT_THAT(r.out, StartsWith("usage: fileindexctl search [KEYWORDS...]"));
+using Case = std::pair<std::vector<std::string>, std::string>;
 
-  r = Run({"frobnicate"});
-  EXPECT_EQ(r.status, 2);
-  EXPECT_THAT(r.err, HasSubstr("unknown command \"frobnicate\""));
-  r = Run({"folder", "get"});
-  EXPECT_EQ(r.status, 2);
-  EXPECT_THAT(r.err, StartsWith("fileindexctl: missing PATH\nusage: fileindexctl folder get"));
-  r = Run({"folder", "list", "--colour", "red"});
-  EXPECT_EQ(r.status, 2);
-  EXPECT_THAT(r.err, HasSubstr("unknown option --colour"));
-  r = Run({"folder", "add", "/docs/reports", "--audio", "maybe"});
-  EXPECT_EQ(r.status, 2);
-  EXPECT_THAT(r.err, HasSubstr("--audio takes on or off"));
+TEST_F(CtlTest, HelpAndCommandLineMistakes) {
+  for (const auto& [args, text] : std::vector<Case>{
+           {{"--help"}, "\n  folder add "},
+           {{"folder", "--help"}, "\n  folder reindex "},
+           {{"search", "--help"}, "usage: fileindexctl search [KEYWORDS...]"}}) {
+    const Result r = Run(args);
+    EXPECT_EQ(r.status, 0) << text;
+    EXPECT_THAT(r.out, HasSubstr(text));
+  }
+  EXPECT_THAT(Run({"folder", "--help"}).out, ::testing::Not(HasSubstr("share rename")));
+  // A mistake is one line on the error stream, then the usage.
+  for (const auto& [args, text] : std::vector<Case>{
+           {{}, ""},
+           {{"frobnicate"}, "fileindexctl: unknown command \"frobnicate\""},
+           {{"folder", "get"}, "fileindexctl: missing PATH\nusage: fileindexctl folder get"},
+           {{"folder", "list", "--colour", "red"}, "fileindexctl: unknown option --colour\n"},
+           {{"folder", "add", "/docs/reports", "--audio", "maybe"},
+            "fileindexctl: --audio takes on or off\n"},
+           {{"search"}, "fileindexctl: give keywords"}}) {
+    const Result r = Run(args);
+    EXPECT_EQ(r.status, 2) << text;
+    EXPECT_THAT(r.err, StartsWith(text));
+  }
 }
 
 // The administration road end to end through the program, with stand-ins for the two daemons
@@ -114,9 +114,8 @@ TEST_F(CtlTest, FolderLifecycleWithHumanAndJsonOutput) {
 
   r = Run({"folder", "list"});
   ASSERT_EQ(r.status, 0) << r.err;
-  EXPECT_THAT(r.out, HasSubstr("/docs/reports"));
-  EXPECT_THAT(r.out, HasSubstr("document,photo"));
-  EXPECT_THAT(r.out, HasSubstr("1 of 1 folder(s)"));
+  EXPECT_THAT(r.out, AllOf(HasSubstr("/docs/reports"), HasSubstr("document,photo"),
+                           HasSubstr("1 of 1 folder(s)")));
 
   r = Run({"--json", "folder", "list"});
   JsonValue listed;
@@ -153,10 +152,8 @@ TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
   Result r = Run({"search", "revenue", "growth", "--name", "q3", "--ext", "PDF,docx", "--min-size",
                   "1k", "--folder", "/docs/reports", "--sort", "size", "--desc"});
   ASSERT_EQ(r.status, 0) << r.err;
-  EXPECT_THAT(r.out, HasSubstr("q3.pdf"));
-  EXPECT_THAT(r.out, HasSubstr("1.5 KiB"));
-  EXPECT_THAT(r.out, HasSubstr("the *revenue* grew"));
-  EXPECT_THAT(r.out, HasSubstr("showing 1-1 of 1 file(s)"));
+  EXPECT_THAT(r.out, AllOf(HasSubstr("q3.pdf"), HasSubstr("1.5 KiB"), HasSubstr("the *revenue* grew"),
+                           HasSubstr("showing 1-1 of 1 file(s)")));
   const Json::Value req = engine.json_requests().at(0);
   EXPECT_EQ(req["command"], "search");
   const Json::Value& data = req["data"];
@@ -168,7 +165,6 @@ TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
   EXPECT_EQ(data["sort"], "size");
   EXPECT_EQ(data["order"], "desc");
 
-  EXPECT_EQ(Run({"search"}).status, 2);
   // No engine at all: one clear line.
   test::TempDir empty;
   r = RunCtl(empty.path(), {"search", "x"});
@@ -179,9 +175,8 @@ TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
 TEST_F(CtlTest, StatusWithNothingRunning) {
   Result r = Run({"status"});
   ASSERT_EQ(r.status, 0) << r.err;
-  EXPECT_THAT(r.out, HasSubstr("quixelasticd"));
-  EXPECT_THAT(r.out, HasSubstr("stopped"));
-  EXPECT_THAT(r.out, HasSubstr("no indexed folders"));
+  EXPECT_THAT(r.out,
+              AllOf(HasSubstr("quixelasticd"), HasSubstr("stopped"), HasSubstr("no indexed folders")));
   r = Run({"status", "--wait", "--timeout", "5"});
   EXPECT_EQ(r.status, 0) << r.err;
   EXPECT_THAT(r.out, HasSubstr("indexing is idle"));
@@ -195,7 +190,6 @@ TEST(CliTest, ValuesPeopleType) {
   EXPECT_GT(ParseTime("2024-05-06"), 1700000000);
   EXPECT_THROW(ParseTime("yesterday"), UsageError);
   EXPECT_EQ(HumanSize(912), "912 B");
-  EXPECT_EQ(HumanSize(1536), "1.5 KiB");
   EXPECT_EQ(ReasonOf("Orvane error, code=902, reason=[/docs/x]"), "/docs/x");
   EXPECT_EQ(ReasonOf("Orvane error, code=902"), "Orvane error, code=902");
   Args args({"a", "--size", "3", "--desc", "--name=x", "--", "--literal"}, {"desc"});
