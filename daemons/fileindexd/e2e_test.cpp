@@ -2,7 +2,6 @@
 // indexing daemon as real processes, folders added through the administration operations, and
 // real work on disk, daemons killed or stopped half-way. After each round the index must hold
 // exactly what a walk of the disk says is indexable, with the right names, parents and sizes.
-#include <dirent.h>
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/stat.h>
@@ -11,9 +10,11 @@
 
 #include <chrono>
 #include <cstdlib>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
+#include <tuple>
 
 #include "common/json_util.hpp"
 #include "common/root.hpp"
@@ -30,19 +31,13 @@ namespace {
 using test::System;
 using test::WaitFor;
 
-// What a document must say about its file.
-struct Entry {
-  std::string name;
-  std::string parent;
-  int64_t size;
-  bool operator==(const Entry& o) const {
-    return name == o.name && parent == o.parent && size == o.size;
-  }
-};
+// What a document must say about its file: name, parent and size (-1 for a directory).
+using Entry = std::tuple<std::string, std::string, int64_t>;
 using Listing = std::map<std::string, Entry>;
 
-std::ostream& operator<<(std::ostream& out, const Listing& l) {
-  for (const auto& [path, e] : l) out << "\n  " << path << " (" << e.size << ")";
+std::string Show(const Listing& l) {
+  std::string out;
+  for (const auto& [path, e] : l) out += "\n  " + path + " (" + std::to_string(std::get<2>(e)) + ")";
   return out;
 }
 
@@ -52,6 +47,73 @@ void Write(const std::string& path, const std::string& text) {
 }
 
 int Shell(const std::string& cmd) { return std::system(cmd.c_str()); }
+
+// What the disk says an index must hold below the folder `root`.
+Listing Walk(const std::string& root) {
+  Listing out;
+  auto add = [&out](const std::string& path) {
+    struct stat st;
+    if (lstat(path.c_str(), &st) != 0 || !(S_ISDIR(st.st_mode) || S_ISREG(st.st_mode))) {
+      return false;
+    }
+    out[path] = Entry{Basename(path), Dirname(path), S_ISDIR(st.st_mode) ? -1 : st.st_size};
+    return true;
+  };
+  add(root);
+  namespace fs = std::filesystem;
+  std::error_code ec;
+  for (fs::recursive_directory_iterator it(root, ec), end; !ec && it != end; it.increment(ec)) {
+    const std::string name = it->path().filename();
+    if (fileindex::IsSystemPreservedFileName(name) || name == "#recycle" || !add(it->path())) {
+      it.disable_recursion_pending();
+    }
+  }
+  return out;
+}
+
+// What the index of `share` holds.
+Listing Index(const std::string& share) {
+  Listing out;
+  Json::Value q(Json::objectValue);
+  q["id"] = "fileindex_" + share;
+  q["query"]["qsl"]["match_all"] = Json::Value(Json::objectValue);
+  for (const char* f : {"QUIXMDPath", "QUIXMDFSName", "QUIXMDParent", "QUIXMDFSSize", "QUIXMDIsDir"}) {
+    q["query"]["load_field"].append(f);
+  }
+  q["size"] = 10000;  // the most one page holds, more than any of these tests makes
+  Json::Value res;
+  try {
+    res = System::Engine("document_get_by_query", q);
+  } catch (const std::exception&) {
+    return out;
+  }
+  for (const auto& hit : res["data"]) {
+    out[hit["QUIXMDPath"].asString()] =
+        Entry{hit["QUIXMDFSName"].asString(), hit["QUIXMDParent"].asString(),
+              hit["QUIXMDIsDir"].asBool() ? -1 : hit["QUIXMDFSSize"].asInt64()};
+  }
+  return out;
+}
+
+int64_t EngineCount(const std::string& share) {
+  const Json::Value list = System::Engine("index_list", Json::Value());
+  for (const auto& index : list["data"]) {
+    if (index["id"] == "fileindex_" + share) return index["documents"].asInt64();
+  }
+  return -1;
+}
+
+Json::Value Folder(const std::string& path, bool meta) {
+  Json::Value list(Json::arrayValue);
+  list.append(System::Folder(path, meta));
+  return list;
+}
+
+int Search(const std::string& word) {
+  Json::Value q(Json::objectValue);
+  q["keyword"] = word;
+  return System::Engine("search", q)["data"]["total"].asInt();
+}
 
 class EndToEndTest : public ::testing::Test {
  protected:
@@ -68,82 +130,13 @@ class EndToEndTest : public ::testing::Test {
   std::string D(const std::string& rel) const { return sys_.Vol("docs/" + rel); }
   std::string M(const std::string& rel) const { return sys_.Vol("media/" + rel); }
 
-  // What the disk says the index of `share` must hold below the folders `roots`.
-  Listing Walk(const std::vector<std::string>& roots) const {
-    Listing out;
-    for (const auto& root : roots) WalkInto(root, &out);
-    return out;
-  }
-  void WalkInto(const std::string& path, Listing* out) const {
-    struct stat st;
-    if (lstat(path.c_str(), &st) != 0) return;
-    const std::string name = Basename(path);
-    if (fileindex::IsSystemPreservedFileName(name) || name == "#recycle") return;
-    if (!S_ISDIR(st.st_mode) && !S_ISREG(st.st_mode)) return;
-    (*out)[path] = Entry{name, Dirname(path), S_ISDIR(st.st_mode) ? -1 : int64_t(st.st_size)};
-    if (!S_ISDIR(st.st_mode)) return;
-    DIR* dir = opendir(path.c_str());
-    if (dir == nullptr) return;
-    while (struct dirent* e = readdir(dir)) {
-      const std::string child = e->d_name;
-      if (child != "." && child != "..") WalkInto(path + "/" + child, out);
-    }
-    closedir(dir);
-  }
-  // What the index of `share` holds.
-  static Listing Index(const std::string& share) {
-    Listing out;
-    Json::Value q(Json::objectValue);
-    q["id"] = "fileindex_" + share;
-    q["query"]["qsl"]["match_all"] = Json::Value(Json::objectValue);
-    for (const char* f : {"QUIXMDPath", "QUIXMDFSName", "QUIXMDParent", "QUIXMDFSSize",
-                          "QUIXMDIsDir"}) {
-      q["query"]["load_field"].append(f);
-    }
-    q["size"] = 10000;
-    for (int from = 0;; from += 10000) {
-      q["from"] = from;
-      Json::Value res;
-      try {
-        res = System::Engine("document_get_by_query", q);
-      } catch (const std::exception&) {
-        return out;
-      }
-      for (const auto& hit : res["data"]) {
-        const bool dir = hit["QUIXMDIsDir"].asBool();
-        out[hit["QUIXMDPath"].asString()] =
-            Entry{hit["QUIXMDFSName"].asString(), hit["QUIXMDParent"].asString(),
-                  dir ? -1 : hit["QUIXMDFSSize"].asInt64()};
-      }
-      if (res["data"].size() < 10000) break;
-    }
-    return out;
-  }
-  static int64_t EngineCount(const std::string& share) {
-    const Json::Value list = System::Engine("index_list", Json::Value());
-    for (const auto& index : list["data"]) {
-      if (index["id"] == "fileindex_" + share) return index["documents"].asInt64();
-    }
-    return -1;
-  }
-  // Waits until the index of `share` matches the walk of `roots`, then checks it.
-  void ExpectSettled(const std::string& share, const std::vector<std::string>& roots,
-                     int timeout_ms = 30000) {
-    WaitFor([&] { return Index(share) == Walk(roots); }, timeout_ms);
-    const Listing want = Walk(roots);
+  // Waits until the index of `share` matches the walk of `root`, then checks it.
+  void ExpectSettled(const std::string& share, const std::string& root, int timeout_ms = 30000) {
+    WaitFor([&] { return Index(share) == Walk(root); }, timeout_ms);
+    const Listing want = Walk(root);
     const Listing got = Index(share);
-    EXPECT_TRUE(want == got) << "disk:" << want << "\nindex:" << got;
+    EXPECT_TRUE(want == got) << "disk:" << Show(want) << "\nindex:" << Show(got);
     EXPECT_EQ(int64_t(got.size()), EngineCount(share)) << "a document is doubled";
-  }
-  static Json::Value Folder(const std::string& path, bool meta) {
-    Json::Value list(Json::arrayValue);
-    list.append(System::Folder(path, meta));
-    return list;
-  }
-  static int Search(const std::string& word) {
-    Json::Value q(Json::objectValue);
-    q["keyword"] = word;
-    return System::Engine("search", q)["data"]["total"].asInt();
   }
 
   System sys_;
@@ -162,8 +155,8 @@ TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
   Write(M("#recycle/deleted.txt"), "in the recycle bin");
   fileindex::FolderAdd(Folder("/docs/proj", false), false);
   fileindex::FolderAdd(Folder("/media", false), false);
-  ExpectSettled("docs", {D("proj")});
-  ExpectSettled("media", {sys_.Vol("media")});
+  ExpectSettled("docs", D("proj"));
+  ExpectSettled("media", sys_.Vol("media"));
 
   // Creates, writes, renames of files and directories, deletes, moves in and out.
   Write(D("proj/new.txt"), "new");
@@ -176,7 +169,7 @@ TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
   ASSERT_EQ(0, rename(D("outside/incoming").c_str(), D("proj/incoming").c_str()));
   ASSERT_EQ(0, rename(D("proj/renamed.txt").c_str(), D("outside/left.txt").c_str()));
   ASSERT_EQ(0, chmod(D("proj/readme.txt").c_str(), 0600));
-  ExpectSettled("docs", {D("proj")});
+  ExpectSettled("docs", D("proj"));
 
   // A tar archive extracted into the folder, then a tree removed with rm -rf.
   const std::string src = sys_.root() + "/tarsrc";
@@ -186,26 +179,26 @@ TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
   }
   ASSERT_EQ(0, Shell("tar -C " + src + " -cf " + sys_.root() + "/pkg.tar pkg"));
   ASSERT_EQ(0, Shell("tar -C " + D("proj") + " -xf " + sys_.root() + "/pkg.tar"));
-  ExpectSettled("docs", {D("proj")});
+  ExpectSettled("docs", D("proj"));
   ASSERT_EQ(0, Shell("rm -rf " + D("proj/pkg")));
-  ExpectSettled("docs", {D("proj")});
+  ExpectSettled("docs", D("proj"));
 
   // A re-index, and a setting change that switches document contents on.
   Json::Value reindex(Json::arrayValue);
   reindex.append("/docs/proj");
   fileindex::FolderReindex(reindex);
-  ExpectSettled("docs", {D("proj")});
+  ExpectSettled("docs", D("proj"));
   EXPECT_EQ(0, Search("hello"));
   fileindex::FolderSet(Folder("/docs/proj", true), false);
   EXPECT_TRUE(WaitFor([] { return Search("hello") == 1; }, 20000));
-  ExpectSettled("docs", {D("proj")});
-  ExpectSettled("media", {sys_.Vol("media")});
+  ExpectSettled("docs", D("proj"));
+  ExpectSettled("media", sys_.Vol("media"));
 }
 
 TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
   Write(D("proj/seed.txt"), "s");
   fileindex::FolderAdd(Folder("/docs/proj", false), false);
-  ExpectSettled("docs", {D("proj")});
+  ExpectSettled("docs", D("proj"));
 
   // A large batch; the indexing daemon is killed while it works on it.
   for (int i = 0; i < 3000; ++i) {
@@ -214,7 +207,7 @@ TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
   WaitFor([&] { return IsFileExist(sys_.Queue("docs") + ".tmp"); }, 10000);
   indexd_->Signal(SIGKILL);
   indexd_ = sys_.StartIndexd();
-  ExpectSettled("docs", {D("proj")}, 60000);
+  ExpectSettled("docs", D("proj"), 60000);
 
   // The file-change daemon killed and started again goes on watching.
   notifyd_->Signal(SIGKILL);
@@ -225,7 +218,7 @@ TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
   }, 20000);
   Write(D("proj/after/restart.txt"), "after");
   ASSERT_EQ(0, Shell("rm -rf " + D("proj/big/d7")));
-  ExpectSettled("docs", {D("proj")});
+  ExpectSettled("docs", D("proj"));
 }
 
 TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
@@ -236,23 +229,19 @@ TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
     Write(D(dir + "/f" + std::to_string(i) + ".txt"), "x");
   }
   const std::string side_file = sys_.Queue("docs") + ".tmp";
-  const auto read_side_file = [&] {
-    std::ifstream in(side_file);
-    return std::string(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
-  };
   // Stops the crawl with `stop` once its first documents are in, and checks that it ends
   // promptly, within a request or two of being asked (the one on its way, and one more should
   // this process be slow to ask), and leaves its batch queued as it was.
   const auto stop_mid_crawl = [&](const std::function<void()>& stop) {
     ASSERT_TRUE(WaitFor([] { return EngineCount("docs") >= int64_t(kCrawlBatchSize); }, 20000));
-    const std::string batch = read_side_file();
+    const std::string batch = orvane::test::ReadFile(side_file);
     const int64_t asked_at = EngineCount("docs");
     const auto start = std::chrono::steady_clock::now();
     stop();
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
     EXPECT_LE(EngineCount("docs"), asked_at + 2 * int64_t(kCrawlBatchSize));
     EXPECT_FALSE(batch.empty());
-    EXPECT_EQ(batch, read_side_file());
+    EXPECT_EQ(batch, orvane::test::ReadFile(side_file));
   };
   Json::Value docs(Json::objectValue);
   docs["share_name"] = "docs";
@@ -265,7 +254,7 @@ TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
   ASSERT_EQ(0, Shell("rm -rf " + D("big/d3")));
   Write(D("big/late.txt"), "late");
   EXPECT_TRUE(test::Command("worker_create", docs)["success"].asBool());
-  ExpectSettled("docs", {D("big")});
+  ExpectSettled("docs", D("big"));
 
   // The daemon stopped with SIGTERM while it re-indexes.
   Json::Value reindex(Json::arrayValue);
@@ -276,7 +265,7 @@ TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
   Write(D("big/d1/later.txt"), "later");
   indexd_ = sys_.StartIndexd();
-  ExpectSettled("docs", {D("big")});
+  ExpectSettled("docs", D("big"));
 }
 
 }  // namespace
