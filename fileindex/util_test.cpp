@@ -34,62 +34,42 @@ Error ErrorOf(Fn fn) {
   return Error(kErrInvalidParam);
 }
 
-TEST(PathPiecesTest, ShareNamesAndShareRenames) {
+TEST(PathPiecesTest, ShareNamesShareRenamesAndPreservedNames) {
   EXPECT_EQ(GetShareNameByPath("/music"), "music");
-  EXPECT_EQ(GetShareNameByPath("/music/a"), "music");
-  EXPECT_EQ(GetShareNameByPath("/"), "");
-  EXPECT_EQ(GetShareNameByPath("//x"), "");
   EXPECT_EQ(GetShareNameByPath("/my music é/x"), "my music é");
+  EXPECT_EQ(GetShareNameByPath("//x"), "");
   test::LogCapture log;
-  for (const std::string bad : {"music/a", ""}) {
-    const Error e = ErrorOf([&] { GetShareNameByPath(bad); });
-    EXPECT_EQ(e.code, kErrInvalidParam);
-    EXPECT_EQ(e.message, bad.empty() ? "Orvane error, code=120"
-                                     : "Orvane error, code=120, reason=[" + bad + "]");
-  }
+  EXPECT_EQ(ErrorOf([] { GetShareNameByPath(""); }).message, "Orvane error, code=120");
+  EXPECT_EQ(ErrorOf([] { GetShareNameByPath("music/a"); }).message,
+            "Orvane error, code=120, reason=[music/a]");
   EXPECT_TRUE(log.Contains("Failed [1 > share_path.size() || '/' != share_path.at(0)]"));
 
-  EXPECT_EQ(ReplacePathShare("/a/b", "x", "a"), "/x/b");
   EXPECT_EQ(ReplacePathShare("/old", "new", "old"), "/new");
   EXPECT_EQ(ReplacePathShare("/old/x", "new", "old"), "/new/x");
   EXPECT_EQ(ReplacePathShare("/s/old/x", "new", "old"), "/s/new/x");  // first match anywhere
-  const Error e = ErrorOf([] { ReplacePathShare("/ab/c", "x", "a"); });
-  EXPECT_EQ(e.code, kErrInvalidParam);
-  EXPECT_EQ(e.message, "Orvane error, code=120, reason=[Cannot find share: a]");
-  EXPECT_TRUE(log.Contains("Failed [string::npos == pos]"));
+  EXPECT_EQ(ErrorOf([] { ReplacePathShare("/ab/c", "x", "a"); }).message,
+            "Orvane error, code=120, reason=[Cannot find share: a]");
 
-  EXPECT_TRUE(IsSystemPreservedFileName("@eaDir"));
-  EXPECT_TRUE(IsSystemPreservedFileName(".DS_Store"));
-  EXPECT_TRUE(IsSystemPreservedFileName(".HFS+ Private Directory Data"));
-  EXPECT_FALSE(IsSystemPreservedFileName("thumbs.db"));  // case matters
-  EXPECT_FALSE(IsSystemPreservedFileName(".git2"));
-  EXPECT_FALSE(IsSystemPreservedFileName(""));
+  for (const char* name : {"@eaDir", ".DS_Store", ".HFS+ Private Directory Data"})
+    EXPECT_TRUE(IsSystemPreservedFileName(name)) << name;
+  for (const char* name : {"thumbs.db", ".git2", ""})  // case matters, whole names only
+    EXPECT_FALSE(IsSystemPreservedFileName(name)) << name;
 }
 
-TEST(FileTypeTest, TableAndLookups) {
-  const auto& table = FileTypeTable();
-  EXPECT_EQ(table.size(), 738u);
-  int counts[5] = {};
-  for (const auto& entry : table) {
-    ++counts[entry.second];
+TEST(FileTypeTest, LookupsByLowerCasedExtension) {
+  // An upper-case key could never be found.
+  for (const auto& entry : FileTypeTable()) {
     for (char c : entry.first) EXPECT_FALSE(c >= 'A' && c <= 'Z') << entry.first;
   }
-  EXPECT_EQ(counts[kDocument], 649);
-  EXPECT_EQ(counts[kAudio], 25);
-  EXPECT_EQ(counts[kVideo], 31);
-  EXPECT_EQ(counts[kPhoto], 33);
-  EXPECT_EQ(counts[kOther], 0);
-
   const struct {
     const char* path;
     FileType type;
   } cases[] = {
-      {"/v/s/Report.PDF", kDocument}, {"/v/s/report.pdf", kDocument}, {"/v/s/a.MP3", kAudio},
-      {"/v/s/README", kDocument},     {"/v/s/archive.", kDocument},   {"/v/s.d/file", kDocument},
-      {"/v/s/x.tar.gz", kDocument},   {"/v/s/x.heic", kOther},        {"/v/s/photo.jpe", kPhoto},
-      {"/v/s/movie.dvr-ms", kVideo},  {"/v/s/a.q&a", kDocument},      {"/v/s/a.TX?", kDocument},
-      {"/v/s/a.prc", kDocument},      {"/v/s/.bashrc", kOther},       {"/v/s/a.Ä", kOther},
-      {"/v/s/clip.M2TS", kVideo},     {"/v/s/raw.X3F", kPhoto},       {"/v/s/", kDocument},
+      {"/v/s/Report.PDF", kDocument}, {"/v/s/a.MP3", kAudio},         {"/v/s/README", kDocument},
+      {"/v/s/archive.", kDocument},   {"/v/s.d/file", kDocument},     {"/v/s/x.tar.gz", kDocument},
+      {"/v/s/x.heic", kOther},        {"/v/s/movie.dvr-ms", kVideo},  {"/v/s/a.q&a", kDocument},
+      {"/v/s/a.TX?", kDocument},      {"/v/s/.bashrc", kOther},       {"/v/s/a.Ä", kOther},
+      {"/v/s/raw.X3F", kPhoto},       {"/v/s/", kDocument},
   };
   for (const auto& c : cases) EXPECT_EQ(GetFileTypeByFullPath(c.path), c.type) << c.path;
 }
@@ -101,22 +81,21 @@ class IndexRulesTest : public ::testing::Test {
     vol_ = volume_.path();
     for (const char* dir : {"music/live", "music/#recycle/old", "music/.git/objects",
                             "music/@eaDir/x", "music/#snapshot/daily", "homes/nobody/#recycle/f",
-                            "homes/nobody/docs", "ro", "vault/inner", "open/sub", "mnt"}) {
+                            "homes/nobody/docs", "ro", "vault/inner", "open/sub"}) {
       ASSERT_TRUE(MakeParentDirs(vol_ + "/" + dir + "/x"));
     }
     volume_.Write("music/a.flac", "x");
     volume_.Write("music/live/Thumbs.db", "x");
-    WriteConfig("");
+    WriteConfig();
   }
 
-  void WriteConfig(const std::string& extra_share) {
+  void WriteConfig() {
     test::WritePlatformConfig(root_.path(), R"({"shares": [
       {"name": "music", "path": ")" + vol_ + R"(/music", "recycle_bin": true},
       {"name": "homes", "path": ")" + vol_ + R"(/homes", "recycle_bin": true},
       {"name": "ro", "path": ")" + vol_ + R"(/ro", "readonly": true},
       {"name": "vault", "path": ")" + vol_ + R"(/vault", "encrypted": true, "encryption": true},
-      {"name": "open", "path": ")" + vol_ + R"(/open", "encryption": true})" + extra_share + R"(
-    ]})");
+      {"name": "open", "path": ")" + vol_ + R"(/open", "encryption": true}]})");
   }
 
   // Mounts a small tmpfs on `dir` (read-only when asked); false with a printed reason when the
@@ -150,13 +129,11 @@ TEST_F(IndexRulesTest, FullAndSharePaths) {
   std::string name;
   std::string path;
   GetShareNamePathByFullPath(name, path, vol_ + "/music/live/x");
-  EXPECT_EQ(name, "music");
-  EXPECT_EQ(path, vol_ + "/music");
+  EXPECT_EQ(name + " " + path, "music " + vol_ + "/music");
   test::LogCapture log;
-  const Error e = ErrorOf([&] { GetShareNamePathByFullPath(name, path, vol_ + "/elsewhere"); });
-  EXPECT_EQ(e.code, kErrSystem);
-  EXPECT_EQ(e.message, "Orvane error, code=502, reason=[QUIXShareNamePathGet failed, full_path=" +
-                           vol_ + "/elsewhere]");
+  EXPECT_EQ(ErrorOf([&] { GetShareNamePathByFullPath(name, path, vol_ + "/elsewhere"); }).message,
+            "Orvane error, code=502, reason=[QUIXShareNamePathGet failed, full_path=" + vol_ +
+                "/elsewhere]");
   EXPECT_TRUE(log.Contains(
       "Failed [0 > QUIXShareNamePathGet(full_path.c_str(), szShareName, sizeof(szShareName), "
       "szSharePath, sizeof(szSharePath))]"));
@@ -164,9 +141,8 @@ TEST_F(IndexRulesTest, FullAndSharePaths) {
 
 TEST_F(IndexRulesTest, RecycleBins) {
   EXPECT_TRUE(IsFullPathInRecycleBin(vol_ + "/music/#recycle"));
-  EXPECT_TRUE(IsFullPathInRecycleBin(vol_ + "/music/#recycle/old"));
-  EXPECT_FALSE(IsFullPathInRecycleBin(vol_ + "/music/live"));
   EXPECT_TRUE(IsFullPathInRecycleBin(vol_ + "/homes/nobody/#recycle/f"));
+  EXPECT_FALSE(IsFullPathInRecycleBin(vol_ + "/music/live"));
   EXPECT_FALSE(IsFullPathInRecycleBin(vol_ + "/homes/nobody/docs"));
   EXPECT_EQ(ErrorOf([&] { IsFullPathInRecycleBin(vol_ + "/none"); }).code, kErrSystem);
   // With the recycle bin switched off, "#recycle" is an ordinary folder.
@@ -177,35 +153,25 @@ TEST_F(IndexRulesTest, RecycleBins) {
 }
 
 TEST_F(IndexRulesTest, EachRuleRefusesItsPaths) {
-  EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/music"));
-  EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/music/a.flac"));
-  EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/music/live"));
-  EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/homes/nobody/docs"));
-  EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/open/sub"));
+  for (const char* rel : {"music", "music/a.flac", "music/live", "homes/nobody/docs", "open/sub"})
+    EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/" + rel)) << rel;
   EXPECT_TRUE(CanPathBeIndexed("/music/live"));
-
-  // Share flags, recycle bins, preserved names.
-  EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/ro"));
-  EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/vault/inner"));
-  EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/#recycle/old"));
-  EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/homes/nobody/#recycle/f"));
-  EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/.git/objects"));
-  EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/@eaDir/x"));
-  EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/live/Thumbs.db"));
   EXPECT_FALSE(CanPathBeIndexed("/music/.git"));
 
-  // Canonical form: every spelling but the one realpath prints, and vanished paths.
+  // Share flags, recycle bins, preserved names; then every spelling but the one realpath
+  // prints, and vanished paths.
   ASSERT_EQ(symlink((vol_ + "/music/live").c_str(), (vol_ + "/music/link").c_str()), 0);
   ASSERT_EQ(symlink((vol_ + "/music/loop2").c_str(), (vol_ + "/music/loop1").c_str()), 0);
   ASSERT_EQ(symlink((vol_ + "/music/loop1").c_str(), (vol_ + "/music/loop2").c_str()), 0);
-  for (const std::string& p : {vol_ + "/music/", vol_ + "/music//live", vol_ + "/music/./live",
-                               vol_ + "/music/live/../live", vol_ + "/music/link",
-                               vol_ + "/music/loop1", vol_ + "/music/gone.mp3"}) {
-    EXPECT_FALSE(CanFullPathBeIndexed(p)) << p;
-  }
-  std::string long_path = vol_ + "/music";
+  std::string long_path = "music";
   while (long_path.size() <= PATH_MAX) long_path += "/abcdefghijklmnopqrstuvwxyz";
-  EXPECT_FALSE(CanFullPathBeIndexed(long_path));
+  const std::string refused[] = {
+      "ro", "vault/inner", "music/#recycle/old", "homes/nobody/#recycle/f", "music/.git/objects",
+      "music/@eaDir/x", "music/live/Thumbs.db", "music/", "music//live", "music/./live",
+      "music/live/../live", "music/link", "music/loop1", "music/gone.mp3", long_path};
+  for (const std::string& rel : refused) {
+    EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/" + rel)) << rel;
+  }
 
   // A path in no share, or in a share that vanished from the configuration, is an error.
   EXPECT_EQ(ErrorOf([&] { CanFullPathBeIndexed(vol_); }).code, kErrSystem);
@@ -213,32 +179,36 @@ TEST_F(IndexRulesTest, EachRuleRefusesItsPaths) {
 }
 
 TEST_F(IndexRulesTest, PlatformAnswersDecideSnapshotsAndFileSystems) {
+  // The real answers first: kernel-made and missing paths.
+  EXPECT_EQ(platform::QUIXGetFSType("/proc/self", 0), platform::FS_TYPE_PSEUDO);
+  EXPECT_EQ(platform::QUIXGetFSType("/no/such/path", 0), -1);
+  EXPECT_EQ(errno, ENOENT);
   ScopedFaults faults;
   const std::string daily = vol_ + "/music/#snapshot/daily";
+  const std::string live = vol_ + "/music/live";
   // A writable folder named "#snapshot" is no snapshot: the other rules judge it.
   EXPECT_TRUE(CanFullPathBeIndexed(daily));
   faults.Arm("QLIBFhsPathInSnapshot", Fault{0, 0, 0, 1, true});
   EXPECT_FALSE(CanFullPathBeIndexed(daily));
   faults.Arm("QLIBFhsPathInSnapshot", Fault{-1, EIO, 0, 1, true});  // a failing call does not refuse
   EXPECT_TRUE(CanFullPathBeIndexed(daily));
-  EXPECT_EQ(platform::CallCount("QLIBFhsPathInSnapshot"), 3);
-  EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/music/live"));
+  EXPECT_TRUE(CanFullPathBeIndexed(live));
   EXPECT_EQ(platform::CallCount("QLIBFhsPathInSnapshot"), 3);  // only asked for "#snapshot" paths
 
   faults.Arm("QUIXGetFSType", Fault{-1, EIO});
-  EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/live"));
+  EXPECT_FALSE(CanFullPathBeIndexed(live));
   for (int type : {platform::FS_TYPE_NFS, platform::FS_TYPE_CIFS, platform::FS_TYPE_FUSE_REMOTE,
                    platform::FS_TYPE_ISO9660, platform::FS_TYPE_SQUASHFS, platform::FS_TYPE_PSEUDO}) {
     faults.Arm("QUIXGetFSType", Fault{type, 0});
-    EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/live")) << type;
+    EXPECT_FALSE(CanFullPathBeIndexed(live)) << type;
   }
   faults.Arm("QUIXGetFSType", Fault{platform::FS_TYPE_BTRFS, 0});
-  EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/music/live"));
+  EXPECT_TRUE(CanFullPathBeIndexed(live));
 
   faults.Arm("QLIBShareIsReadOnlyGet", Fault{-1, EIO});
-  EXPECT_EQ(ErrorOf([&] { CanFullPathBeIndexed(vol_ + "/music/live"); }).code, kErrSystem);
+  EXPECT_EQ(ErrorOf([&] { CanFullPathBeIndexed(live); }).code, kErrSystem);
   faults.Arm("QUIXFSDirIsMntPoint", Fault{1, 0});
-  EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/live"));
+  EXPECT_FALSE(CanFullPathBeIndexed(live));
   faults.Arm("QUIXFSDirIsMntPoint", Fault{1, 0});
   EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/open/sub"));  // an encryption share's mounts are its own
 }
@@ -246,21 +216,12 @@ TEST_F(IndexRulesTest, PlatformAnswersDecideSnapshotsAndFileSystems) {
 TEST_F(IndexRulesTest, RealMountPointsAndSnapshots) {
   if (geteuid() != 0) GTEST_SKIP() << "mounting needs root; running as " << geteuid();
   if (!MountTmpfs(vol_ + "/music/live", false)) GTEST_SKIP() << "this machine refuses a tmpfs mount";
-  EXPECT_TRUE(IsMountPoint(vol_ + "/music/live"));
-  EXPECT_FALSE(IsMountPoint(vol_ + "/music"));
   EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/live"));
+  EXPECT_EQ(platform::QUIXGetFSType((vol_ + "/music/live").c_str(), 0), platform::FS_TYPE_TMPFS);
   ASSERT_TRUE(MountTmpfs(vol_ + "/open", false));
   ASSERT_EQ(mkdir((vol_ + "/open/sub").c_str(), 0755), 0);
   EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/open"));  // the unlocked encryption share's root
   EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/open/sub"));
-
-  // A bind mount stays on the same device and is still a mount point.
-  if (mount((vol_ + "/homes").c_str(), (vol_ + "/mnt").c_str(), nullptr, MS_BIND, nullptr) == 0) {
-    mounts_.push_back(vol_ + "/mnt");
-    EXPECT_TRUE(IsMountPoint(vol_ + "/mnt"));
-  } else {
-    perror("bind mount");
-  }
 
   // A read-only view below "#snapshot" is a snapshot.
   ASSERT_TRUE(MountTmpfs(vol_ + "/music/#snapshot/daily", true));
@@ -268,12 +229,10 @@ TEST_F(IndexRulesTest, RealMountPointsAndSnapshots) {
   EXPECT_EQ(platform::QLIBFhsPathInSnapshot((vol_ + "/music/#snapshot/daily").c_str(), &in_snapshot), 0);
   EXPECT_EQ(in_snapshot, 1);
   EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/#snapshot/daily"));
-  EXPECT_EQ(platform::QUIXGetFSType((vol_ + "/music/live").c_str(), 0), platform::FS_TYPE_TMPFS);
 }
 
 TEST_F(IndexRulesTest, ConcurrentJudgementsWhileTheConfigurationIsRewritten) {
   std::atomic<int> refused{0};
-  std::atomic<bool> done{false};
   std::vector<std::thread> readers;
   for (int t = 0; t < 3; ++t) {
     readers.emplace_back([&] {
@@ -283,28 +242,9 @@ TEST_F(IndexRulesTest, ConcurrentJudgementsWhileTheConfigurationIsRewritten) {
       }
     });
   }
-  std::thread writer([&] {
-    for (int i = 0; i < 40 && !done; ++i) WriteConfig("");  // same shares, a new file each time
-  });
+  for (int i = 0; i < 40; ++i) WriteConfig();  // same shares, a new file each time
   for (std::thread& reader : readers) reader.join();
-  done = true;
-  writer.join();
   EXPECT_EQ(refused, 0);
-}
-
-TEST(PlatformFsTest, FileSystemKinds) {
-  EXPECT_EQ(platform::QUIXGetFSType("/proc/self", 0), platform::FS_TYPE_PSEUDO);
-  EXPECT_EQ(platform::QUIXGetFSType("/sys", 0), platform::FS_TYPE_PSEUDO);
-  EXPECT_EQ(platform::QUIXGetFSType("/no/such/path", 0), -1);
-  EXPECT_EQ(errno, ENOENT);
-  EXPECT_GE(platform::QUIXGetFSType("/", 0), 0);
-  EXPECT_TRUE(platform::QUIXFSIsRemoteFS(platform::FS_TYPE_9P));
-  EXPECT_FALSE(platform::QUIXFSIsRemoteFS(platform::FS_TYPE_FUSE));
-  EXPECT_TRUE(platform::QUIXFSIsImageFS(platform::FS_TYPE_UDF));
-  EXPECT_FALSE(platform::QUIXFSIsImageFS(platform::FS_TYPE_EXT4));
-  EXPECT_TRUE(IsMountPoint("/"));
-  EXPECT_TRUE(IsMountPoint("/proc"));
-  EXPECT_FALSE(IsMountPoint("/no/such/path"));
 }
 
 }  // namespace
