@@ -22,17 +22,9 @@ namespace elasticd {
 namespace {
 
 using tc::Cmd;
+using tc::Eventually;
 using tc::OnIndex;
 using tc::Request;
-
-// Polls `pred` every 25 ms for up to ten seconds.
-bool Eventually(const std::function<bool()>& pred) {
-  for (int i = 0; i < 400; ++i) {
-    if (pred()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  return pred();
-}
 
 // Upserts of <dir>/file<first>.txt and on, in one compound request.
 Json::Value Batch(const std::string& dir, int first, int count) {
@@ -196,10 +188,11 @@ TEST_F(DaemonTest, KillNineLosesNothingCommittedAndNoBatchHalfWay) {
 }
 
 TEST_F(DaemonTest, OrdinaryUsersOnlySearchAndOnlySeeWhatTheyCanOpen) {
-  struct passwd* nobody = ::getpwnam("nobody");
+  const struct passwd* nobody = ::getpwnam("nobody");
   ASSERT_NE(nobody, nullptr);
-  const uid_t uid = nobody->pw_uid;
-  const gid_t gid = nobody->pw_gid;
+  auto as_nobody = [&](const std::string& socket, const Json::Value& request) {
+    return tc::RequestAs(socket, request, nobody->pw_uid, nobody->pw_gid);
+  };
   // Real files: one readable, one unreadable, one in a folder nobody cannot enter.
   const std::vector<std::pair<std::string, mode_t>> modes = {
       {"share/pub/report open.txt", 0644}, {"share/pub/report closed.txt", 0600},
@@ -218,25 +211,23 @@ TEST_F(DaemonTest, OrdinaryUsersOnlySearchAndOnlySeeWhatTheyCanOpen) {
   ASSERT_EQ(Send(batch)["has_fail"], false);
 
   // The main socket is closed to ordinary users; the public one takes searches only.
-  const Json::Value denied = tc::RequestAs(daemon_->socket(), Cmd("index_list", Json::Value()),
-                                           uid, gid);
+  const Json::Value denied = as_nobody(daemon_->socket(), Cmd("index_list", Json::Value()));
   EXPECT_TRUE(denied.isNull()) << JsonToString(denied);
-  const Json::Value upsert = tc::RequestAs(daemon_->public_socket(), batch, uid, gid);
+  const Json::Value upsert = as_nobody(daemon_->public_socket(), batch);
   EXPECT_EQ(upsert["data"][0]["error"]["code"], kCodePermissionDenied) << JsonToString(upsert);
 
   const Json::Value search = tc::Parse(R"({"command": "search", "data": {"name": "report"}})");
-  const Json::Value mine = tc::RequestAs(daemon_->public_socket(), search, uid, gid);
+  const Json::Value mine = as_nobody(daemon_->public_socket(), search);
   ASSERT_EQ(mine["success"], true) << JsonToString(mine);
   EXPECT_EQ(mine["data"]["total"], 1);
   EXPECT_EQ(mine["data"]["hits"][0]["path"], dir_.Path("share/pub/report open.txt"));
   EXPECT_EQ(Send(search)["data"]["total"], 3);  // root sees everything
 
   Json::Value suggest = tc::Parse(R"({"command": "suggest", "data": {"prefix": "o"}})");
-  EXPECT_EQ(JsonToString(tc::RequestAs(daemon_->public_socket(), suggest, uid, gid)["data"]),
+  EXPECT_EQ(JsonToString(as_nobody(daemon_->public_socket(), suggest)["data"]),
             "{\"suggestions\":[\"open\"]}");
   suggest["data"]["prefix"] = "hid";
-  EXPECT_EQ(tc::RequestAs(daemon_->public_socket(), suggest, uid, gid)["data"]["suggestions"].size(),
-            0u);
+  EXPECT_EQ(as_nobody(daemon_->public_socket(), suggest)["data"]["suggestions"].size(), 0u);
   EXPECT_EQ(Send(suggest)["data"]["suggestions"].size(), 1u);
 }
 

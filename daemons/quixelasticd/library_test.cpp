@@ -1,5 +1,6 @@
 // The library's own search-index commands against the real daemon: real files on a configured
 // share, extracted by the library, indexed, re-pathed and deleted through the daemon's socket.
+#include <sqlite3.h>
 #include <sys/stat.h>
 
 #include <algorithm>
@@ -21,7 +22,6 @@ namespace {
 
 namespace el = ::orvane::fileindex::elastic;
 using ::testing::ElementsAre;
-using ::testing::UnorderedElementsAre;
 
 template <typename Fn>
 int ErrorCodeOf(Fn fn) {
@@ -143,11 +143,24 @@ TEST_F(LibraryTest, IndexLifecycleAndSuggestions) {
   el::ShareIndexMigrate("pics", volume_.Path("elsewhere/db"));
   EXPECT_TRUE(el::IsDocumentExists("pics", a));
 
-  std::vector<std::string> unavailable;
-  el::ListUnAvailTermSuggDB(unavailable);
-  EXPECT_TRUE(unavailable.empty());
+  auto unavailable = [] {
+    std::vector<std::string> dbs;
+    el::ListUnAvailTermSuggDB(dbs);
+    return dbs;
+  };
+  EXPECT_TRUE(unavailable().empty());
+  // The suggestions marked unavailable behind the daemon's back, as a lost table would be; the
+  // library's rebuild makes them available again.
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open(volume_.Path("elsewhere/db/index.db").c_str(), &db), SQLITE_OK);
+  EXPECT_EQ(sqlite3_exec(db, "UPDATE meta SET value='unavail' WHERE key='term_sugg'", nullptr,
+                         nullptr, nullptr),
+            SQLITE_OK);
+  sqlite3_close(db);
+  EXPECT_THAT(unavailable(), ElementsAre("fileindex_pics"));
   el::UpdateTermSuggestion("fileindex_pics", {a});
   el::IndexCommit("pics");
+  EXPECT_TRUE(unavailable().empty());
   const Json::Value suggest = tc::Parse(R"({"command": "suggest", "data": {"prefix": "suns"}})");
   EXPECT_EQ(JsonToString(tc::Request(daemon_->socket(), suggest)["data"]["suggestions"]),
             "[\"sunset\"]");

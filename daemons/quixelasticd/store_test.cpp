@@ -59,17 +59,6 @@ TEST(SchemaTest, RefusesUnknownMappingsAndValidatesDocuments) {
   }
 }
 
-TEST(StoreHelpersTest, PrefixBoundsAndSuggestibleWords) {
-  EXPECT_EQ(*PrefixUpperBound("/v/s/"), "/v/s0");
-  EXPECT_EQ(*PrefixUpperBound(std::string("a\xff", 2)), "b");
-  EXPECT_FALSE(PrefixUpperBound("").has_value());
-  EXPECT_FALSE(PrefixUpperBound(std::string("\xff\xff", 2)).has_value());
-  EXPECT_TRUE(IsSuggestible("beach"));
-  EXPECT_TRUE(IsSuggestible("a4"));
-  EXPECT_FALSE(IsSuggestible("2024"));
-  EXPECT_FALSE(IsSuggestible("a"));
-}
-
 class StoreTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -150,64 +139,14 @@ TEST_F(StoreTest, SetFieldsRekeysAndReplacesTheDocumentAtTheNewPath) {
   EXPECT_THAT(Names(p), ElementsAre("new.txt"));
 }
 
-TEST_F(StoreTest, SearchesNamesWordsFoldersAndRanges) {
-  Json::Value report = FileDoc("/v/s/docs/Annual_Report.PDF", 5000, 200);
-  report["QUIXMDExtension"] = "pdf";
-  report["QUIXMDTextContent"] = "the quarterly revenue grew strongly in the north";
-  Put(report);
-  Put(FileDoc("/v/s/docs/report draft.txt", 100, 100));
-  Put(FileDoc("/v/s/music/100%_hits.mp3", 9000, 300));
-  Put(FileDoc("/v/s/music/sub/a_b.mp3", 50, 50));
-  Put(FileDoc("/v/s/musical.txt", 1, 1));
-
-  SearchParams p;
-  p.name = "REPORT";  // the name index is case-insensitive
-  EXPECT_THAT(Names(p), ElementsAre("Annual_Report.PDF", "report draft.txt"));
-  p.name = "t d";  // substrings span word boundaries
-  EXPECT_THAT(Names(p), ElementsAre("report draft.txt"));
-  p.name = "0%";  // short substrings scan, and LIKE wildcards are literal
-  EXPECT_THAT(Names(p), ElementsAre("100%_hits.mp3"));
-  p.name = "_b";
-  EXPECT_THAT(Names(p), ElementsAre("a_b.mp3"));
-
-  p = SearchParams();
-  p.keywords = "revenue north";
-  const SearchPage page = store_->Search(p, nullptr);
-  ASSERT_EQ(page.hits.size(), 1u);
-  EXPECT_THAT(page.hits[0]["snippet"].asString(), ::testing::HasSubstr("<b>revenue</b>"));
-
-  p = SearchParams();
-  p.folder = "/v/s/music/";
-  p.sort = SearchParams::Sort::kSize;
-  p.desc = true;
-  EXPECT_THAT(Names(p), ElementsAre("100%_hits.mp3", "a_b.mp3"));  // not /v/s/musical.txt
-
-  p = SearchParams();
-  p.exts = {"pdf", "mp3"};
-  p.size_min = 100;
-  p.mtime_max = 250;
-  EXPECT_THAT(Names(p), ElementsAre("Annual_Report.PDF"));
-
-  p = SearchParams();
-  p.folder = "/v/s";
-  p.sort = SearchParams::Sort::kMtime;
-  p.from = 1;
-  p.size = 2;
-  EXPECT_EQ(store_->Search(p, nullptr).total, 5);
-  EXPECT_THAT(Names(p), ElementsAre("a_b.mp3", "report draft.txt"));
-
-  // A filtered search counts and pages only what the user may see.
-  p.from = 0;
-  auto no_music = [](const std::string& path) { return path.find("/music/") == std::string::npos; };
-  const SearchPage filtered = store_->Search(p, no_music);
-  EXPECT_EQ(filtered.total, 3);
-  EXPECT_EQ(filtered.hits[0]["name"], "musical.txt");
-}
-
 TEST_F(StoreTest, SuggestsTermsOfVisibleFilesMostUsedFirst) {
   Put(FileDoc("/v/s/beach one.jpg"));
   Put(FileDoc("/v/s/beach two.jpg"));
   Put(FileDoc("/v/s/private/bear.jpg"));
+  Put(FileDoc("/v/s/2024 a a4.jpg"));
+  // Numbers and single characters are not offered.
+  EXPECT_THAT(store_->Suggest("a", 10, nullptr), ElementsAre("a4"));
+  EXPECT_TRUE(store_->Suggest("2", 10, nullptr).empty());
   EXPECT_THAT(store_->Suggest("Be", 10, nullptr), ElementsAre("beach", "bear"));
   auto public_only = [](const std::string& p) { return p.find("private") == std::string::npos; };
   EXPECT_THAT(store_->Suggest("be", 10, public_only), ElementsAre("beach"));
@@ -242,17 +181,6 @@ TEST_F(StoreTest, AFullDiskFailsTheWriteAndKeepsWhatWasThere) {
   EXPECT_EQ(store_->DocCount(), 2);
   std::string detail;
   EXPECT_TRUE(store_->QuickCheck(&detail)) << detail;
-}
-
-TEST_F(StoreTest, ReopensWithItsSchemaAndDocuments) {
-  Put(FileDoc("/v/s/a.txt"));
-  store_->Sync();
-  store_.reset();
-  store_ = IndexStore::Open(dir_.Path("db"));
-  EXPECT_EQ(store_->DocCount(), 1);
-  EXPECT_EQ(store_->Meta("id"), "fileindex_s");
-  EXPECT_EQ(CodeOf([&] { IndexStore::Create(dir_.Path("db"), "x", tc::FileMappings(), {}, {}); }),
-            kCodeIndexExists);
 }
 
 }  // namespace

@@ -118,12 +118,10 @@ DaemonProcess::~DaemonProcess() {
 }
 
 bool DaemonProcess::WaitReady() {
-  for (int i = 0; i < 400; ++i) {
-    Json::Value r = Request(socket(), Cmd("index_list", Json::Value(Json::objectValue)));
-    if (r.isObject() && r["success"].asBool()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  return false;
+  return Eventually([this] {
+    const Json::Value r = Request(socket(), Cmd("index_list", Json::Value(Json::objectValue)));
+    return r.isObject() && r["success"].asBool();
+  });
 }
 
 int DaemonProcess::Signal(int sig) {
@@ -133,6 +131,14 @@ int DaemonProcess::Signal(int sig) {
   ::waitpid(pid_, &status, 0);
   pid_ = -1;
   return status;
+}
+
+bool Eventually(const std::function<bool()>& pred) {
+  for (int i = 0; i < 400; ++i) {
+    if (pred()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(25));
+  }
+  return pred();
 }
 
 Json::Value Cmd(const std::string& command, const Json::Value& data) {
@@ -177,11 +183,11 @@ Json::Value FileDoc(const std::string& path, int64_t size, int64_t mtime) {
   return d;
 }
 
-Json::Value Upsert(const std::string& path, const std::string& id) {
+Json::Value Upsert(const std::string& path, const std::string& id, int64_t size, int64_t mtime) {
   Json::Value data;
   data["id"] = id;
   data["doc_id"] = path;
-  data["data"] = FileDoc(path);
+  data["data"] = FileDoc(path, size, mtime);
   return Cmd("document_upsert_by_id", data);
 }
 

@@ -8,6 +8,7 @@
 #include <json/json.h>
 
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -46,6 +47,9 @@ class DaemonProcess {
   pid_t pid_ = -1;
 };
 
+// Polls `pred` every 25 ms for up to ten seconds; its last answer.
+bool Eventually(const std::function<bool()>& pred);
+
 // A request {"command": command, "data": data}.
 Json::Value Cmd(const std::string& command, const Json::Value& data);
 // A request {"command": command, "data": {"id": id}}.
@@ -56,8 +60,9 @@ Json::Value Parse(const std::string& text);
 Json::Value Compound(const std::vector<Json::Value>& requests);
 // A file's document as the library writes it, its names and parents taken from the path.
 Json::Value FileDoc(const std::string& path, int64_t size = 1, int64_t mtime = 0);
-// document_upsert_by_id of FileDoc(path) into index `id`.
-Json::Value Upsert(const std::string& path, const std::string& id = "fileindex_share");
+// document_upsert_by_id of FileDoc(path, size, mtime) into index `id`.
+Json::Value Upsert(const std::string& path, const std::string& id = "fileindex_share",
+                   int64_t size = 1, int64_t mtime = 0);
 // The schema the library sends at index creation, reduced to the fields the tests use.
 Json::Value FileMappings();
 
