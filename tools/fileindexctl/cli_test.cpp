@@ -117,18 +117,15 @@ TEST_F(CtlTest, FolderLifecycleWithHumanAndJsonOutput) {
   EXPECT_THAT(r.out, AllOf(HasSubstr("/docs/reports"), HasSubstr("document,photo"),
                            HasSubstr("1 of 1 folder(s)")));
 
-  r = Run({"--json", "folder", "list"});
-  JsonValue listed;
-  ASSERT_TRUE(listed.fromString(r.out)) << r.out;
-  EXPECT_EQ(listed["total"].asUInt(), 1u);
-  EXPECT_EQ(listed["folders"][0]["name"], "Reports");
+  JsonValue json;
+  ASSERT_TRUE(json.fromString(Run({"--json", "folder", "list"}).out));
+  EXPECT_EQ(json["total"].asUInt(), 1u);
+  EXPECT_EQ(json["folders"][0]["name"], "Reports");
 
   ASSERT_EQ(Run({"folder", "set", "/docs/reports", "--document", "off"}).status, 0);
-  r = Run({"--json", "folder", "get", "/docs/reports"});
-  JsonValue got;
-  ASSERT_TRUE(got.fromString(r.out)) << r.out;
-  EXPECT_FALSE(got["document"].asBool());
-  EXPECT_TRUE(got["photo"].asBool());
+  ASSERT_TRUE(json.fromString(Run({"--json", "folder", "get", "/docs/reports"}).out));
+  EXPECT_FALSE(json["document"].asBool());
+  EXPECT_TRUE(json["photo"].asBool());
 
   ASSERT_EQ(Run({"folder", "delete", "/docs/reports"}).status, 0);
   r = Run({"folder", "get", "/docs/reports"});
@@ -152,18 +149,17 @@ TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
   Result r = Run({"search", "revenue", "growth", "--name", "q3", "--ext", "PDF,docx", "--min-size",
                   "1k", "--folder", "/docs/reports", "--sort", "size", "--desc"});
   ASSERT_EQ(r.status, 0) << r.err;
-  EXPECT_THAT(r.out, AllOf(HasSubstr("q3.pdf"), HasSubstr("1.5 KiB"), HasSubstr("the *revenue* grew"),
-                           HasSubstr("showing 1-1 of 1 file(s)")));
+  EXPECT_THAT(r.out, AllOf(HasSubstr("q3.pdf"), HasSubstr("1.5 KiB"),
+                           HasSubstr("the *revenue* grew"), HasSubstr("showing 1-1 of 1 file(s)")));
   const Json::Value req = engine.json_requests().at(0);
   EXPECT_EQ(req["command"], "search");
-  const Json::Value& data = req["data"];
-  EXPECT_EQ(data["keyword"], "revenue growth");
-  EXPECT_EQ(data["name"], "q3");
-  EXPECT_EQ(JsonToString(data["ext"]), R"(["pdf","docx"])");
-  EXPECT_EQ(data["size_range"]["gte"].asUInt64(), 1024u);
-  EXPECT_EQ(data["folder"], docs_ + "/reports");  // the share path, searched on disk
-  EXPECT_EQ(data["sort"], "size");
-  EXPECT_EQ(data["order"], "desc");
+  JsonValue want;
+  ASSERT_TRUE(want.fromString(R"({"keyword": "revenue growth", "name": "q3", "ext": ["pdf", "docx"],
+      "size_range": {"gte": 1024}, "sort": "size", "order": "desc"})"));
+  want["folder"] = docs_ + "/reports";  // the share path, searched on disk
+  for (const std::string& key : want.getMemberNames()) {
+    EXPECT_EQ(req["data"][key], want[key]) << key;
+  }
 
   // No engine at all: one clear line.
   test::TempDir empty;
@@ -175,15 +171,14 @@ TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
 TEST_F(CtlTest, StatusWithNothingRunning) {
   Result r = Run({"status"});
   ASSERT_EQ(r.status, 0) << r.err;
-  EXPECT_THAT(r.out,
-              AllOf(HasSubstr("quixelasticd"), HasSubstr("stopped"), HasSubstr("no indexed folders")));
+  EXPECT_THAT(r.out, AllOf(HasSubstr("quixelasticd"), HasSubstr("stopped"),
+                           HasSubstr("no indexed folders")));
   r = Run({"status", "--wait", "--timeout", "5"});
   EXPECT_EQ(r.status, 0) << r.err;
   EXPECT_THAT(r.out, HasSubstr("indexing is idle"));
 }
 
 TEST(CliTest, ValuesPeopleType) {
-  EXPECT_EQ(ParseSize("10k"), 10240u);
   EXPECT_EQ(ParseSize("2M"), 2u << 20);
   EXPECT_THROW(ParseSize("lots"), UsageError);
   EXPECT_EQ(ParseTime("1700000000"), 1700000000);
