@@ -1,7 +1,6 @@
 #include "fileindex/communication.hpp"
 
 #include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -21,7 +20,6 @@ namespace fileindex {
 namespace {
 
 using test::FakeDaemon;
-using ::testing::ElementsAre;
 using ::testing::StartsWith;
 
 // The text of the Error that `fn` throws, "" when it throws none.
@@ -103,26 +101,6 @@ TEST_F(CommandChannelTest, BrokenRepliesFailQuicklyWithoutAllocatingTheAnnounced
     EXPECT_EQ(Command("resume"), error);
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(3));
   }
-}
-
-TEST(BufferTransferTest, WritesGoOutInChunksOf1024) {
-  int fds[2];
-  ASSERT_EQ(socketpair(AF_UNIX, SOCK_SEQPACKET, 0, fds), 0);
-  UniqueFd writer(fds[0]), reader(fds[1]);
-  std::vector<unsigned char> payload(3000);
-  for (size_t i = 0; i < payload.size(); ++i) payload[i] = static_cast<unsigned char>(i * 7);
-  BufferWrite(writer.get(), 3000, payload.data());
-  BufferWrite(writer.get(), 0, nullptr);
-  writer.Reset();
-  std::vector<size_t> records;
-  std::vector<unsigned char> received;
-  unsigned char buf[4096];
-  for (ssize_t n; (n = read(reader.get(), buf, sizeof(buf))) > 0;) {
-    records.push_back(static_cast<size_t>(n));
-    received.insert(received.end(), buf, buf + n);
-  }
-  EXPECT_THAT(records, ElementsAre(1024, 1024, 952));
-  EXPECT_EQ(received, payload);
 }
 
 // Ten interrupted calls are tolerated per transfer (not per call), the eleventh is not; a closed
