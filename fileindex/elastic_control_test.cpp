@@ -169,17 +169,17 @@ TEST_F(ElasticControlTest, DocumentCommandsCarryTheExtractedDocument) {
   EXPECT_EQ(doc["QUIXMDSearchAncestor"], doc["QUIXMDParent"]);
   EXPECT_EQ(doc["QUIXMDExtension"], "jpg");
   EXPECT_EQ(doc["QUIXMDFSSize"].asInt(), 4);
-  Json::Value del = Parse(R"({"command":"document_del_by_id","data":{"id":"fileindex_photo"}})");
-  del["data"]["doc_id"] = file;
-  EXPECT_EQ(sent[1], del);
-  // The prefix ends in "/": /v/s/ab is not below /v/s/a.
-  EXPECT_EQ(sent[2], Parse(R"({"command":"document_del_by_query","data":{"id":"fileindex_photo",
-                               "query":{"qsl":{"prefix":{"QUIXMDPath":"/v/s/a/"}}}}})"));
-  Json::Value exists_query = Parse(R"({"command":"document_get_by_query","data":{
-      "id":"fileindex_photo","query":{"qsl":{"term":{}}}}})");
-  exists_query["data"]["query"]["qsl"]["term"]["QUIXMDPath"] = file;
-  EXPECT_EQ(sent[3], exists_query);  // refused with 917 before any extraction
-  EXPECT_EQ(sent[4], exists_query);
+  const std::string quoted = JsonToString(Json::Value(file));
+  const std::string exists_query = R"({"command":"document_get_by_query","data":{"id":)"
+      R"("fileindex_photo","query":{"qsl":{"term":{"QUIXMDPath":)" + quoted + "}}}}}";
+  // The prefix ends in "/": /v/s/ab is not below /v/s/a. The refused attribute update sent
+  // only its question, before any extraction.
+  const std::vector<std::string> texts = engine.texts();
+  EXPECT_THAT(std::vector<std::string>(texts.begin() + 1, texts.begin() + 5),
+              ElementsAre(R"({"command":"document_del_by_id","data":{"doc_id":)" + quoted +
+                              R"(,"id":"fileindex_photo"}})",
+                          R"({"command":"document_del_by_query","data":{"id":"fileindex_photo","query":{"qsl":{"prefix":{"QUIXMDPath":"/v/s/a/"}}}}})",
+                          exists_query, exists_query));
   EXPECT_EQ(sent[5]["command"], "document_set_by_id");
   EXPECT_EQ(sent[5]["data"]["data"]["QUIXMDSearchFileName"], doc["QUIXMDFSName"]);
 
@@ -201,7 +201,7 @@ TEST_F(ElasticControlTest, DocumentCommandsCarryTheExtractedDocument) {
   EXPECT_EQ(engine.requests().size(), 9u);
 }
 
-TEST_F(ElasticControlTest, QueryRepliesWithoutADataArrayAre916) {
+TEST_F(ElasticControlTest, QueryRepliesWithoutADataArrayAre916AndBadHitsAreSkipped) {
   for (const Json::Value& reply : {Ok(), Hits(R"({"a":1})"), Hits(Json::Value("x"))}) {
     Engine engine(Sock(), [&](const Json::Value&) { return reply; });
     EXPECT_EQ(std::string(ErrorOf([] { IsDocumentExists("photo", "/p"); }).what()),
@@ -210,9 +210,7 @@ TEST_F(ElasticControlTest, QueryRepliesWithoutADataArrayAre916) {
     EXPECT_EQ(ErrorOf([&] { IndexGetByPrefixPath("db", "/d", paths); }).code, kErrNoQueryData);
     EXPECT_EQ(ErrorOf([] { IndexRename("photo", "/n", "/o"); }).code, kErrNoQueryData);
   }
-}
-
-TEST_F(ElasticControlTest, PrefixListingKeepsEarlierPathsAndSkipsHitsWithoutOne) {
+  // Hits without a usable path are skipped; earlier entries stay.
   Engine engine(Sock(), [](const Json::Value&) {
     return Hits(R"([{"QUIXMDPath":"/d/1"},{"other":1},{"QUIXMDPath":"/d/2"},{"QUIXMDPath":{}}])");
   });
@@ -270,11 +268,9 @@ TEST_F(ElasticControlTest, RenameRepathsDescendantsInBatchesWithCommitsBetween) 
 }
 
 TEST_F(ElasticControlTest, RenameEndsOnAShortPassAndRefusesWhatItCannotMove) {
-  {
-    Engine engine(Sock(), RenamePasses({10000, 0}));
-    IndexRename("s", "/v/s/b", "/v/s/a");
-    EXPECT_EQ(engine.requests().size(), 6u);  // exists, set, query, compound, commit, empty query
-  }
+  Engine passes(Sock(), RenamePasses({10000, 0}));
+  IndexRename("s", "/v/s/b", "/v/s/a");
+  EXPECT_EQ(passes.requests().size(), 6u);  // exists, set, query, compound, commit, empty query
   // A rename of what was never indexed is refused before anything changes.
   Engine engine(Sock(), [](const Json::Value& req) {
     if (req["data"]["query"]["qsl"].isMember("term")) {
