@@ -11,7 +11,6 @@
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
 #include <functional>
 #include <map>
 #include <tuple>
@@ -30,6 +29,7 @@ namespace {
 
 using test::System;
 using test::WaitFor;
+using test::WriteFile;
 
 // What a document must say about its file: name, parent and size (-1 for a directory).
 using Entry = std::tuple<std::string, std::string, int64_t>;
@@ -37,13 +37,10 @@ using Listing = std::map<std::string, Entry>;
 
 std::string Show(const Listing& l) {
   std::string out;
-  for (const auto& [path, e] : l) out += "\n  " + path + " (" + std::to_string(std::get<2>(e)) + ")";
+  for (const auto& [path, e] : l) {
+    out += "\n  " + path + " (" + std::to_string(std::get<2>(e)) + ")";
+  }
   return out;
-}
-
-void Write(const std::string& path, const std::string& text) {
-  MakeParentDirs(path);
-  std::ofstream(path) << text;
 }
 
 int Shell(const std::string& cmd) { return std::system(cmd.c_str()); }
@@ -77,7 +74,8 @@ Listing Index(const std::string& share) {
   Json::Value q(Json::objectValue);
   q["id"] = "fileindex_" + share;
   q["query"]["qsl"]["match_all"] = Json::Value(Json::objectValue);
-  for (const char* f : {"QUIXMDPath", "QUIXMDFSName", "QUIXMDParent", "QUIXMDFSSize", "QUIXMDIsDir"}) {
+  for (const char* f :
+       {"QUIXMDPath", "QUIXMDFSName", "QUIXMDParent", "QUIXMDFSSize", "QUIXMDIsDir"}) {
     q["query"]["load_field"].append(f);
   }
   q["size"] = 10000;  // the most one page holds, more than any of these tests makes
@@ -147,25 +145,25 @@ class EndToEndTest : public ::testing::Test {
 
 TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
   // Files there before the folders are added, and files no folder covers.
-  Write(D("proj/readme.txt"), "hello");
-  Write(D("proj/src/main.c"), "int main() { return 0; }");
-  Write(D("proj/@eaDir/thumb.jpg"), "not ours");
-  Write(D("outside/notes.txt"), "not indexed");
-  Write(M("song.mp3"), "not really audio");
-  Write(M("#recycle/deleted.txt"), "in the recycle bin");
+  WriteFile(D("proj/readme.txt"), "hello");
+  WriteFile(D("proj/src/main.c"), "int main() { return 0; }");
+  WriteFile(D("proj/@eaDir/thumb.jpg"), "not ours");
+  WriteFile(D("outside/notes.txt"), "not indexed");
+  WriteFile(M("song.mp3"), "not really audio");
+  WriteFile(M("#recycle/deleted.txt"), "in the recycle bin");
   fileindex::FolderAdd(Folder("/docs/proj", false), false);
   fileindex::FolderAdd(Folder("/media", false), false);
   ExpectSettled("docs", D("proj"));
   ExpectSettled("media", sys_.Vol("media"));
 
   // Creates, writes, renames of files and directories, deletes, moves in and out.
-  Write(D("proj/new.txt"), "new");
-  Write(D("proj/readme.txt"), "hello again, now longer");
+  WriteFile(D("proj/new.txt"), "new");
+  WriteFile(D("proj/readme.txt"), "hello again, now longer");
   ASSERT_EQ(0, rename(D("proj/new.txt").c_str(), D("proj/renamed.txt").c_str()));
   ASSERT_EQ(0, rename(D("proj/src").c_str(), D("proj/source").c_str()));
-  Write(D("proj/source/lib/util.c"), "void f(void) {}");
+  WriteFile(D("proj/source/lib/util.c"), "void f(void) {}");
   ASSERT_EQ(0, unlink(D("proj/source/main.c").c_str()));
-  Write(D("outside/incoming/a.txt"), "moved in");
+  WriteFile(D("outside/incoming/a.txt"), "moved in");
   ASSERT_EQ(0, rename(D("outside/incoming").c_str(), D("proj/incoming").c_str()));
   ASSERT_EQ(0, rename(D("proj/renamed.txt").c_str(), D("outside/left.txt").c_str()));
   ASSERT_EQ(0, chmod(D("proj/readme.txt").c_str(), 0600));
@@ -174,7 +172,7 @@ TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
   // A tar archive extracted into the folder, then a tree removed with rm -rf.
   const std::string src = sys_.root() + "/tarsrc";
   for (int i = 0; i < 40; ++i) {
-    Write(src + "/pkg/dir" + std::to_string(i % 5) + "/f" + std::to_string(i) + ".txt",
+    WriteFile(src + "/pkg/dir" + std::to_string(i % 5) + "/f" + std::to_string(i) + ".txt",
           std::string(i, 'x'));
   }
   ASSERT_EQ(0, Shell("tar -C " + src + " -cf " + sys_.root() + "/pkg.tar pkg"));
@@ -196,13 +194,13 @@ TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
 }
 
 TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
-  Write(D("proj/seed.txt"), "s");
+  WriteFile(D("proj/seed.txt"), "s");
   fileindex::FolderAdd(Folder("/docs/proj", false), false);
   ExpectSettled("docs", D("proj"));
 
   // A large batch; the indexing daemon is killed while it works on it.
   for (int i = 0; i < 3000; ++i) {
-    Write(D("proj/big/d" + std::to_string(i % 30) + "/f" + std::to_string(i) + ".txt"), "b");
+    WriteFile(D("proj/big/d" + std::to_string(i % 30) + "/f" + std::to_string(i) + ".txt"), "b");
   }
   WaitFor([&] { return IsFileExist(sys_.Queue("docs") + ".tmp"); }, 10000);
   indexd_->Signal(SIGKILL);
@@ -213,10 +211,10 @@ TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
   notifyd_->Signal(SIGKILL);
   notifyd_ = sys_.StartNotifyd();
   WaitFor([&] {
-    Write(D("proj/probe.txt"), "p");
+    WriteFile(D("proj/probe.txt"), "p");
     return Index("docs").count(D("proj/probe.txt")) > 0;
   }, 20000);
-  Write(D("proj/after/restart.txt"), "after");
+  WriteFile(D("proj/after/restart.txt"), "after");
   ASSERT_EQ(0, Shell("rm -rf " + D("proj/big/d7")));
   ExpectSettled("docs", D("proj"));
 }
@@ -226,7 +224,7 @@ TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
   constexpr int kFlat = 2500;
   for (int i = 0; i < kFlat + 500; ++i) {
     const std::string dir = i < kFlat ? "big" : "big/d" + std::to_string(i % 5);
-    Write(D(dir + "/f" + std::to_string(i) + ".txt"), "x");
+    WriteFile(D(dir + "/f" + std::to_string(i) + ".txt"), "x");
   }
   const std::string side_file = sys_.Queue("docs") + ".tmp";
   // Stops the crawl with `stop` once its first documents are in, and checks that it ends
@@ -252,7 +250,7 @@ TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
   EXPECT_EQ(0u, test::Command("status", Json::Value())["data"]["shares"].size());
   // The disk changes while no worker runs; created again, the worker settles both.
   ASSERT_EQ(0, Shell("rm -rf " + D("big/d3")));
-  Write(D("big/late.txt"), "late");
+  WriteFile(D("big/late.txt"), "late");
   EXPECT_TRUE(test::Command("worker_create", docs)["success"].asBool());
   ExpectSettled("docs", D("big"));
 
@@ -263,7 +261,7 @@ TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
   int status = -1;
   stop_mid_crawl([&] { status = indexd_->Signal(SIGTERM); });
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
-  Write(D("big/d1/later.txt"), "later");
+  WriteFile(D("big/d1/later.txt"), "later");
   indexd_ = sys_.StartIndexd();
   ExpectSettled("docs", D("big"));
 }

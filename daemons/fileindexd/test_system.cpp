@@ -9,6 +9,7 @@
 
 #include <chrono>
 #include <cstring>
+#include <fstream>
 #include <thread>
 
 #include "common/comm.hpp"
@@ -60,6 +61,11 @@ bool ChildProcess::Exited(int timeout_ms) {
   return gone;
 }
 
+void WriteFile(const std::string& path, const std::string& text) {
+  MakeParentDirs(path);
+  std::ofstream(path) << text;
+}
+
 bool WaitFor(const std::function<bool()>& pred, int timeout_ms) {
   const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeout_ms);
   while (std::chrono::steady_clock::now() < end) {
@@ -87,6 +93,12 @@ void System::WriteFolders(const Json::Value& folders) const {
   JsonValue value(folders);
   MakeParentDirs(RootedPath("/var/packages/Orvane/etc/fileindex.folders"));
   value.toFile(RootedPath("/var/packages/Orvane/etc/fileindex.folders"));
+}
+
+void System::WriteFolders(std::initializer_list<Json::Value> folders) const {
+  Json::Value list(Json::arrayValue);
+  for (const Json::Value& f : folders) list.append(f);
+  WriteFolders(list);
 }
 
 Json::Value System::Folder(const std::string& share_path, bool meta) {

@@ -8,6 +8,7 @@
 #include <json/json.h>
 
 #include <functional>
+#include <initializer_list>
 #include <set>
 #include <string>
 #include <vector>
@@ -36,6 +37,9 @@ class ChildProcess {
   pid_t pid_ = -1;
 };
 
+// Writes `text` to the file at `path`, making its parent folders.
+void WriteFile(const std::string& path, const std::string& text);
+
 // Polls `pred` every 20 ms until it holds or `timeout_ms` passes; returns its last answer.
 bool WaitFor(const std::function<bool()>& pred, int timeout_ms);
 
@@ -52,6 +56,7 @@ class System {
   std::string Queue(const std::string& share) const;
   // Replaces the folder file with these folders ({"path", "name", "document", ...} each).
   void WriteFolders(const Json::Value& folders) const;
+  void WriteFolders(std::initializer_list<Json::Value> folders) const;
   static Json::Value Folder(const std::string& share_path, bool meta);
 
   // The search engine (waits until it answers) and the two other daemons.
