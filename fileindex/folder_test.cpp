@@ -11,7 +11,7 @@ namespace {
 
 using testenv::ErrorOf;
 
-class FolderTest : public testenv::AdminTestEnv {};
+using FolderTest = testenv::AdminTestEnv;
 
 TEST_F(FolderTest, RecordsFromJsonAndTheirPaths) {
   Folder minimal(FolderJson("/photo/trips", "Trips", true, false, true, false));
@@ -28,17 +28,9 @@ TEST_F(FolderTest, RecordsFromJsonAndTheirPaths) {
   expected["paused"] = false;
   EXPECT_EQ(Folder(full).GetData(), expected);
 
-  Json::Value bad_switch = full;
-  bad_switch["document"] = "yes";
-  Json::Value no_name = full;
-  no_name.removeMember("name");
-  EXPECT_EQ(ErrorOf([&] { Folder f(bad_switch); }).code, kErrInvalidParam);
-  EXPECT_EQ(ErrorOf([&] { Folder f(no_name); }).code, kErrInvalidParam);
-  test::LogCapture log;
   full["group"] = "all";
   EXPECT_EQ(ErrorOf([&] { Folder f(full); }).message,
             "Orvane error, code=120, reason=[\"all\" is reserved group name]");
-  EXPECT_TRUE(log.Contains("Failed [kAll == group_]"));
 
   // Only the leading share component is renamed, and a new path forgets the cached share.
   Folder deep(FolderJson("/photo/trips/photo", "P", true, true, true, true));
@@ -49,8 +41,6 @@ TEST_F(FolderTest, RecordsFromJsonAndTheirPaths) {
   deep.SetPath("/music/live");
   EXPECT_EQ(deep.GetShare(), "music");
   EXPECT_EQ(deep.GetFullPath(), vol_ + "/music/live");
-  Folder unknown(FolderJson("/nosuch/x", "N", true, true, true, true));
-  EXPECT_EQ(ErrorOf([&] { unknown.GetFullPath(); }).code, kErrShareGet);
 }
 
 TEST_F(FolderTest, StatusRulesInOrderAndAsAdditionalMember) {
@@ -93,10 +83,8 @@ TEST_F(FolderTest, StatusRulesInOrderAndAsAdditionalMember) {
   EXPECT_EQ(JsonToString(with_status["additional"]), R"({"status":{"text":"finished"}})");
   with_status.removeMember("additional");
   EXPECT_EQ(with_status, family.GetData());
-  test::LogCapture log;
   EXPECT_EQ(ErrorOf([&] { family.GetDataWithAdditional(Parse(R"({"a": 1})")); }).message,
             "Orvane error, code=120, reason=[{\"a\":1}]");
-  EXPECT_TRUE(log.Contains("Failed [!addiitionals.isArray()]"));
   EXPECT_EQ(ErrorOf([&] { family.GetDataWithAdditional(Parse(R"(["status", 7])")); }).message,
             "Orvane error, code=120, reason=[7]");
   EXPECT_EQ(ErrorOf([&] { family.GetDataWithAdditional(Parse(R"(["size"])")); }).message,
