@@ -251,9 +251,12 @@ TEST_F(IndexMgrTest, ConcurrentAdministratorsLoseNothing) {
   for (int p = 0; p < kProcs; ++p) {
     for (int i = 0; i < kFolders; ++i) ASSERT_TRUE(MakeParentDirs(vol_ + path_of(p, i) + "/x"));
   }
-  // Every child is forked before any of them starts: once one talks to the fixture's daemon
-  // threads, a fork could copy a lock one of those threads holds (the allocator's) into the next
-  // child, which would then wait on it forever.
+  // A fork copies only the calling thread, so a lock a daemon thread held at that moment (the
+  // allocator's, even while the thread is still starting) would stay held in the child for ever.
+  // The daemons are stopped while the children are forked and started again before the children
+  // are let go, all at once.
+  indexd_.reset();
+  engine_.reset();
   int start[2];
   ASSERT_EQ(pipe(start), 0);
   std::vector<pid_t> children;
@@ -283,6 +286,7 @@ TEST_F(IndexMgrTest, ConcurrentAdministratorsLoseNothing) {
     }
     children.push_back(pid);
   }
+  StartDaemons();
   close(start[0]);
   close(start[1]);  // the children read end-of-file and start together
   for (pid_t pid : children) {
