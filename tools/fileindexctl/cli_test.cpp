@@ -168,7 +168,7 @@ TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
   EXPECT_THAT(r.err, StartsWith("fileindexctl: the search engine cannot be reached (error 913)"));
 }
 
-TEST_F(CtlTest, StatusWithNothingRunning) {
+TEST_F(CtlTest, StatusShowsEachShareFromBothDaemonsOrDashesWithoutThem) {
   Result r = Run({"status"});
   ASSERT_EQ(r.status, 0) << r.err;
   EXPECT_THAT(r.out, AllOf(HasSubstr("quixelasticd"), HasSubstr("stopped"),
@@ -176,6 +176,45 @@ TEST_F(CtlTest, StatusWithNothingRunning) {
   r = Run({"status", "--wait", "--timeout", "5"});
   EXPECT_EQ(r.status, 0) << r.err;
   EXPECT_THAT(r.out, HasSubstr("indexing is idle"));
+
+  // Each stand-in answers the one question status asks it, and success to anything else.
+  auto answering = [](const std::string& key, const std::string& reply) {
+    return [key, reply](int fd, const std::string& request) {
+      test::FakeDaemon::WriteFrame(fd, request.find(key) != std::string::npos
+                                           ? reply
+                                           : R"({"success":true,"data":{}})");
+    };
+  };
+  auto engine = std::make_unique<test::FakeDaemon>(
+      dir_.Path("var/run/quixelasticd.sock"),
+      answering("index_list", R"({"success":true,"data":[{"id":"fileindex_docs",)"
+                              R"("state":"damaged","documents":1234}]})"));
+  test::FakeDaemon indexer(
+      dir_.Path("var/run/fileindexd.sock"),
+      answering("\"status\"", R"({"success":true,"data":{"paused":false,"shares":[{"share":)"
+                              R"("docs","ops_pending":7,"ops_done":42,"errors":2,"last_pass":0,)"
+                              R"("last_error":"skipped upsert of /x: disk said no",)"
+                              R"("documents_written":99,"out_of_space":true}]}})"));
+  ASSERT_EQ(Run({"folder", "add", "/docs/reports"}).status, 0);
+  r = Run({"status"});
+  ASSERT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("SHARE  FOLDERS  QUEUED  PENDING  DONE  DOCUMENTS  ERRORS  "
+                               "LAST PASS  STATE\n"
+                               "docs   1        1       7        42    1234       2       -    "
+                               "      out of space, index damaged\n"));
+  EXPECT_THAT(r.out, HasSubstr("last errors:\n  docs: skipped upsert of /x: disk said no\n"));
+  JsonValue json;
+  ASSERT_TRUE(json.fromString(Run({"--json", "status"}).out));
+  EXPECT_EQ(json["indexes"][0]["documents"], 1234);
+
+  // Without the engine its column cannot be known; nor can a finished wait be told apart from
+  // a queue that never drains, which --timeout ends with exit status 1 and a line on each stream.
+  engine.reset();
+  r = Run({"status", "--wait", "--timeout", "1"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_THAT(r.out, HasSubstr("1 change(s) queued, 99 document(s) written\n"));
+  EXPECT_THAT(r.err, HasSubstr("still 1 change(s) queued after 1 s"));
+  EXPECT_THAT(Run({"status"}).out, HasSubstr("42    -          2"));
 }
 
 TEST(CliTest, ValuesPeopleType) {
