@@ -1,6 +1,6 @@
 #include "fileindex/queue_mgr.hpp"
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -29,15 +29,9 @@ std::vector<std::string> Paths(QueueMgr& mgr, bool tmp, size_t* count = nullptr)
   return out;
 }
 
-// The Error that `fn` throws; code 0 when it throws none.
-template <typename Fn>
-Error ErrorOf(Fn fn) {
-  try {
-    fn();
-  } catch (const Error& e) {
-    return e;
-  }
-  return Error(static_cast<ErrorCode>(0), "no error");
+// Matches a call that throws an Error of `code`.
+auto ThrowsCode(int code) {
+  return ::testing::Throws<Error>(::testing::Field(&Error::code, static_cast<ErrorCode>(code)));
 }
 
 class QueueMgrTest : public ::testing::Test {
@@ -47,26 +41,15 @@ class QueueMgrTest : public ::testing::Test {
   std::string queue_ = dir_.Path("share/@eaDir/@fileindex/queue");
 };
 
-TEST_F(QueueMgrTest, PassTakesTheLiveQueueAndNewEventsStartAFreshFile) {
+// A side file left by an interrupted pass goes first and the live queue waits; the next pass
+// takes the live queue, so that new events start a fresh file.
+TEST_F(QueueMgrTest, LeftoverSideFileGoesFirstThenTheLiveQueueIsTaken) {
   QueueMgr idle(queue_);
   size_t count = 7;
   EXPECT_TRUE(Paths(idle, true, &count).empty());
   EXPECT_EQ(count, 0u);
   EXPECT_FALSE(idle.IsFullPathProcessing("/v/s"));
 
-  dir_.Write("share/@eaDir/@fileindex/queue", Line(2, "/v/s/a"));
-  QueueMgr mgr(queue_);
-  EXPECT_EQ(Paths(mgr, true), std::vector<std::string>{"/v/s/a"});
-  EXPECT_FALSE(IsFileExist(queue_));
-  EXPECT_TRUE(IsFileExist(queue_ + ".tmp"));
-  dir_.Write("share/@eaDir/@fileindex/queue", Line(2, "/v/s/b"));
-  mgr.DeleteTmp();
-  EXPECT_FALSE(IsFileExist(queue_ + ".tmp"));
-  QueueMgr next(queue_);
-  EXPECT_EQ(Paths(next, true), std::vector<std::string>{"/v/s/b"});
-}
-
-TEST_F(QueueMgrTest, LeftoverSideFileGoesFirstAndLiveQueueWaits) {
   dir_.Write("share/@eaDir/@fileindex/queue.tmp", Line(2, "/v/s/old"));
   dir_.Write("share/@eaDir/@fileindex/queue", Line(2, "/v/s/new"));
   QueueMgr mgr(queue_);
@@ -74,7 +57,12 @@ TEST_F(QueueMgrTest, LeftoverSideFileGoesFirstAndLiveQueueWaits) {
   EXPECT_EQ(test::ReadFile(queue_), Line(2, "/v/s/new"));
   // Reading the live queue in place neither renames nor locks it away.
   EXPECT_EQ(Paths(mgr, false), std::vector<std::string>{"/v/s/new"});
-  EXPECT_TRUE(IsFileExist(queue_));
+  mgr.DeleteTmp();
+  EXPECT_FALSE(IsFileExist(queue_ + ".tmp"));
+  QueueMgr next(queue_);
+  EXPECT_EQ(Paths(next, true), std::vector<std::string>{"/v/s/new"});
+  EXPECT_FALSE(IsFileExist(queue_));
+  EXPECT_TRUE(IsFileExist(queue_ + ".tmp"));
 }
 
 // An unprivileged daemon meeting a queue folder it may read but not change, and a side file it
@@ -91,13 +79,20 @@ TEST_F(QueueMgrTest, RenameAndOpenFailuresAre502AndLeaveTheFiles) {
         "Orvane error, code=502, reason=[Failed to open queue, reason=Permission denied]";
     QueueMgr mgr(queue_);
     QueueMgr other(dir_.Path("other"));
-    if (ErrorOf([&] { mgr.PrepareTmpQueue(); }).what() !=
-        std::string("Orvane error, code=502, reason=[rename failed, reason=Permission denied]")) {
+    using ::testing::ThrowsMessage;
+    if (!::testing::Value([&] { mgr.PrepareTmpQueue(); },
+                          ThrowsMessage<Error>("Orvane error, code=502, reason=[rename failed, "
+                                               "reason=Permission denied]"))) {
       return 1;
     }
-    if (ErrorOf([&] { other.ProcessOP([](std::shared_ptr<OP>) {}, true); }).what() != open_failed)
+    if (!::testing::Value([&] { other.ProcessOP([](std::shared_ptr<OP>) {}, true); },
+                          ThrowsMessage<Error>(open_failed))) {
       return 2;
-    return ErrorOf([&] { other.IsFullPathProcessing("/v/s/a"); }).what() != open_failed ? 3 : 0;
+    }
+    return ::testing::Value([&] { other.IsFullPathProcessing("/v/s/a"); },
+                            ThrowsMessage<Error>(open_failed))
+               ? 0
+               : 3;
   });
   chmod(folder.c_str(), 0755);
   EXPECT_EQ(result, 0);
@@ -135,10 +130,10 @@ TEST_F(QueueMgrTest, PendingPathQuestions) {
 
   // A malformed line is not skipped here: the question cannot be answered.
   dir_.Write("share/@eaDir/@fileindex/queue", "garbage\n");
-  EXPECT_EQ(ErrorOf([&] { mgr.IsFullPathHasReindex("/v/s/zzz"); }).code, kErrMalformedEvent);
+  EXPECT_THAT([&] { mgr.IsFullPathHasReindex("/v/s/zzz"); }, ThrowsCode(kErrMalformedEvent));
   // Nor can it with a broken folder configuration.
   dir_.Write("var/packages/Orvane/etc/fileindex.folders", "[{");
-  EXPECT_EQ(ErrorOf([&] { mgr.IsFullPathProcessing("/v/s"); }).code, kErrLoadConfig);
+  EXPECT_THAT([&] { mgr.IsFullPathProcessing("/v/s"); }, ThrowsCode(kErrLoadConfig));
 }
 
 // The indexing daemon's whole pass, with a writer appending from another process meanwhile:

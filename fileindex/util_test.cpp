@@ -1,6 +1,6 @@
 #include "fileindex/util.hpp"
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 #include <sys/mount.h>
 #include <unistd.h>
 
@@ -19,32 +19,26 @@ namespace {
 
 using platform::Fault;
 using platform::ScopedFaults;
+using ::testing::ThrowsMessage;
 
-// The Error that `fn` throws, or a failure.
-template <typename Fn>
-Error ErrorOf(Fn fn) {
-  try {
-    fn();
-  } catch (const Error& e) {
-    return e;
-  }
-  ADD_FAILURE() << "no Error thrown";
-  return Error(kErrInvalidParam);
+// Matches a call that throws an Error of `code`.
+auto ThrowsCode(int code) {
+  return ::testing::Throws<Error>(::testing::Field(&Error::code, static_cast<ErrorCode>(code)));
 }
 
 TEST(PathPiecesTest, ShareNamesShareRenamesAndPreservedNames) {
   EXPECT_EQ(GetShareNameByPath("/music"), "music");
   EXPECT_EQ(GetShareNameByPath("/my music é/x"), "my music é");
   EXPECT_EQ(GetShareNameByPath("//x"), "");
-  EXPECT_EQ(ErrorOf([] { GetShareNameByPath(""); }).message, "Orvane error, code=120");
-  EXPECT_EQ(ErrorOf([] { GetShareNameByPath("music/a"); }).message,
-            "Orvane error, code=120, reason=[music/a]");
+  EXPECT_THAT([] { GetShareNameByPath(""); }, ThrowsMessage<Error>("Orvane error, code=120"));
+  EXPECT_THAT([] { GetShareNameByPath("music/a"); },
+              ThrowsMessage<Error>("Orvane error, code=120, reason=[music/a]"));
 
   EXPECT_EQ(ReplacePathShare("/old", "new", "old"), "/new");
   EXPECT_EQ(ReplacePathShare("/old/x", "new", "old"), "/new/x");
   EXPECT_EQ(ReplacePathShare("/s/old/x", "new", "old"), "/s/new/x");  // first match anywhere
-  EXPECT_EQ(ErrorOf([] { ReplacePathShare("/ab/c", "x", "a"); }).message,
-            "Orvane error, code=120, reason=[Cannot find share: a]");
+  EXPECT_THAT([] { ReplacePathShare("/ab/c", "x", "a"); },
+              ThrowsMessage<Error>("Orvane error, code=120, reason=[Cannot find share: a]"));
 
   for (const char* name : {"@eaDir", ".DS_Store", ".HFS+ Private Directory Data"})
     EXPECT_TRUE(IsSystemPreservedFileName(name)) << name;
@@ -61,10 +55,10 @@ TEST(FileTypeTest, LookupsByLowerCasedExtension) {
     const char* path;
     FileType type;
   } cases[] = {
-      {"/v/s/Report.PDF", kDocument}, {"/v/s/a.MP3", kAudio},         {"/v/s/README", kDocument},
-      {"/v/s/archive.", kDocument},   {"/v/s.d/file", kDocument},     {"/v/s/x.tar.gz", kDocument},
-      {"/v/s/x.heic", kOther},        {"/v/s/movie.dvr-ms", kVideo},  {"/v/s/a.q&a", kDocument},
-      {"/v/s/a.TX?", kDocument},      {"/v/s/.bashrc", kOther},       {"/v/s/a.Ä", kOther},
+      {"/v/s/Report.PDF", kDocument}, {"/v/s/a.MP3", kAudio},        {"/v/s/README", kDocument},
+      {"/v/s/archive.", kDocument},   {"/v/s.d/file", kDocument},    {"/v/s/x.tar.gz", kDocument},
+      {"/v/s/x.heic", kOther},        {"/v/s/movie.dvr-ms", kVideo}, {"/v/s/a.q&a", kDocument},
+      {"/v/s/a.TX?", kDocument},      {"/v/s/.bashrc", kOther},      {"/v/s/a.Ä", kOther},
       {"/v/s/raw.X3F", kPhoto},       {"/v/s/", kDocument},
   };
   for (const auto& c : cases) EXPECT_EQ(GetFileTypeByFullPath(c.path), c.type) << c.path;
@@ -96,8 +90,8 @@ class IndexRulesTest : public ::testing::Test {
 
   // Mounts a small tmpfs on `dir` (read-only when asked); false when the machine refuses.
   bool MountTmpfs(const std::string& dir, bool read_only) {
-    const bool ok = mount("fileindex-test", dir.c_str(), "tmpfs", read_only ? MS_RDONLY : 0,
-                          "size=1m") == 0;
+    const bool ok =
+        mount("fileindex-test", dir.c_str(), "tmpfs", read_only ? MS_RDONLY : 0, "size=1m") == 0;
     if (ok) mounts_.push_back(dir);
     return ok;
   }
@@ -116,22 +110,23 @@ class IndexRulesTest : public ::testing::Test {
 TEST_F(IndexRulesTest, FullPathsSharePathsAndRecycleBins) {
   EXPECT_EQ(GetFullPath("/music/a b/c"), vol_ + "/music/a b/c");
   EXPECT_EQ(GetFullPath("/music"), vol_ + "/music");
-  EXPECT_EQ(ErrorOf([] { GetFullPath("/nope/a"); }).code, kErrShareGet);
-  EXPECT_EQ(ErrorOf([] { GetFullPath("music"); }).code, kErrInvalidParam);
+  EXPECT_THAT([] { GetFullPath("/nope/a"); }, ThrowsCode(kErrShareGet));
+  EXPECT_THAT([] { GetFullPath("music"); }, ThrowsCode(kErrInvalidParam));
 
   std::string name;
   std::string path;
   GetShareNamePathByFullPath(name, path, vol_ + "/music/live/x");
   EXPECT_EQ(name + " " + path, "music " + vol_ + "/music");
-  EXPECT_EQ(ErrorOf([&] { GetShareNamePathByFullPath(name, path, vol_ + "/elsewhere"); }).message,
-            "Orvane error, code=502, reason=[QUIXShareNamePathGet failed, full_path=" + vol_ +
-                "/elsewhere]");
+  EXPECT_THAT([&] { GetShareNamePathByFullPath(name, path, vol_ + "/elsewhere"); },
+              ThrowsMessage<Error>(
+                  "Orvane error, code=502, reason=[QUIXShareNamePathGet failed, full_path=" + vol_ +
+                  "/elsewhere]"));
 
   EXPECT_TRUE(IsFullPathInRecycleBin(vol_ + "/music/#recycle"));
   EXPECT_TRUE(IsFullPathInRecycleBin(vol_ + "/homes/nobody/#recycle/f"));
   EXPECT_FALSE(IsFullPathInRecycleBin(vol_ + "/music/live"));
   EXPECT_FALSE(IsFullPathInRecycleBin(vol_ + "/homes/nobody/docs"));
-  EXPECT_EQ(ErrorOf([&] { IsFullPathInRecycleBin(vol_ + "/none"); }).code, kErrSystem);
+  EXPECT_THAT([&] { IsFullPathInRecycleBin(vol_ + "/none"); }, ThrowsCode(kErrSystem));
   // With the recycle bin switched off, "#recycle" is an ordinary folder.
   test::WritePlatformConfig(root_.path(), R"({"shares": [
     {"name": "music", "path": ")" + vol_ + R"(/music"}]})");
@@ -153,16 +148,29 @@ TEST_F(IndexRulesTest, EachRuleRefusesItsPaths) {
   std::string long_path = "music";
   while (long_path.size() <= PATH_MAX) long_path += "/abcdefghijklmnopqrstuvwxyz";
   const std::string refused[] = {
-      "ro", "vault/inner", "music/#recycle/old", "homes/nobody/#recycle/f", "music/.git/objects",
-      "music/@eaDir/x", "music/live/Thumbs.db", "music/", "music//live", "music/./live",
-      "music/live/../live", "music/link", "music/loop1", "music/gone.mp3", long_path};
+      "ro",
+      "vault/inner",
+      "music/#recycle/old",
+      "homes/nobody/#recycle/f",
+      "music/.git/objects",
+      "music/@eaDir/x",
+      "music/live/Thumbs.db",
+      "music/",
+      "music//live",
+      "music/./live",
+      "music/live/../live",
+      "music/link",
+      "music/loop1",
+      "music/gone.mp3",
+      long_path,
+  };
   for (const std::string& rel : refused) {
     EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/" + rel)) << rel;
   }
 
   // A path in no share, or in a share that vanished from the configuration, is an error.
-  EXPECT_EQ(ErrorOf([&] { CanFullPathBeIndexed(vol_); }).code, kErrSystem);
-  EXPECT_EQ(ErrorOf([] { CanPathBeIndexed("/gone/x"); }).code, kErrShareGet);
+  EXPECT_THAT([&] { CanFullPathBeIndexed(vol_); }, ThrowsCode(kErrSystem));
+  EXPECT_THAT([] { CanPathBeIndexed("/gone/x"); }, ThrowsCode(kErrShareGet));
 }
 
 TEST_F(IndexRulesTest, PlatformAnswersDecideSnapshotsAndFileSystems) {
@@ -177,15 +185,17 @@ TEST_F(IndexRulesTest, PlatformAnswersDecideSnapshotsAndFileSystems) {
   EXPECT_TRUE(CanFullPathBeIndexed(daily));
   faults.Arm("QLIBFhsPathInSnapshot", Fault{0, 0, 0, 1, true});
   EXPECT_FALSE(CanFullPathBeIndexed(daily));
-  faults.Arm("QLIBFhsPathInSnapshot", Fault{-1, EIO, 0, 1, true});  // a failing call does not refuse
+  // A failing call does not refuse.
+  faults.Arm("QLIBFhsPathInSnapshot", Fault{-1, EIO, 0, 1, true});
   EXPECT_TRUE(CanFullPathBeIndexed(daily));
   EXPECT_TRUE(CanFullPathBeIndexed(live));
   EXPECT_EQ(platform::CallCount("QLIBFhsPathInSnapshot"), 3);  // only asked for "#snapshot" paths
 
   faults.Arm("QUIXGetFSType", Fault{-1, EIO});
   EXPECT_FALSE(CanFullPathBeIndexed(live));
-  for (int type : {platform::FS_TYPE_NFS, platform::FS_TYPE_CIFS, platform::FS_TYPE_FUSE_REMOTE,
-                   platform::FS_TYPE_ISO9660, platform::FS_TYPE_SQUASHFS, platform::FS_TYPE_PSEUDO}) {
+  for (int type :
+       {platform::FS_TYPE_NFS, platform::FS_TYPE_CIFS, platform::FS_TYPE_FUSE_REMOTE,
+        platform::FS_TYPE_ISO9660, platform::FS_TYPE_SQUASHFS, platform::FS_TYPE_PSEUDO}) {
     faults.Arm("QUIXGetFSType", Fault{type, 0});
     EXPECT_FALSE(CanFullPathBeIndexed(live)) << type;
   }
@@ -193,23 +203,26 @@ TEST_F(IndexRulesTest, PlatformAnswersDecideSnapshotsAndFileSystems) {
   EXPECT_TRUE(CanFullPathBeIndexed(live));
 
   faults.Arm("QLIBShareIsReadOnlyGet", Fault{-1, EIO});
-  EXPECT_EQ(ErrorOf([&] { CanFullPathBeIndexed(live); }).code, kErrSystem);
+  EXPECT_THAT([&] { CanFullPathBeIndexed(live); }, ThrowsCode(kErrSystem));
   faults.Arm("QUIXFSDirIsMntPoint", Fault{1, 0});
   EXPECT_FALSE(CanFullPathBeIndexed(live));
   faults.Arm("QUIXFSDirIsMntPoint", Fault{1, 0});
-  EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/open/sub"));  // an encryption share's mounts are its own
+  EXPECT_TRUE(
+      CanFullPathBeIndexed(vol_ + "/open/sub"));  // an encryption share's mounts are its own
 }
 
 TEST_F(IndexRulesTest, RealMountPointsAndSnapshots) {
   if (geteuid() != 0) GTEST_SKIP() << "mounting needs root; running as " << geteuid();
-  if (!MountTmpfs(vol_ + "/music/live", false)) GTEST_SKIP() << "this machine refuses a tmpfs mount";
+  if (!MountTmpfs(vol_ + "/music/live", false))
+    GTEST_SKIP() << "this machine refuses a tmpfs mount";
   EXPECT_FALSE(CanFullPathBeIndexed(vol_ + "/music/live"));
   ASSERT_TRUE(MountTmpfs(vol_ + "/open", false));
   EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/open"));  // the unlocked encryption share's root
   // A read-only view below "#snapshot" is a snapshot.
   ASSERT_TRUE(MountTmpfs(vol_ + "/music/#snapshot/daily", true));
   int in_snapshot = -1;
-  EXPECT_EQ(platform::QLIBFhsPathInSnapshot((vol_ + "/music/#snapshot/daily").c_str(), &in_snapshot), 0);
+  EXPECT_EQ(
+      platform::QLIBFhsPathInSnapshot((vol_ + "/music/#snapshot/daily").c_str(), &in_snapshot), 0);
   EXPECT_EQ(in_snapshot, 1);
 }
 
