@@ -220,8 +220,9 @@ void OPTree::InsertLine(const std::string& line) {
     Log(LOG_ERR, "%s:%d Got event: %s", SourceName(__FILE__), __LINE__, line.c_str());
   }
   if (line.size() > kMaxEventLineLength) {
-    const Error error(kErrMalformedEvent,
-                      "Event line too long: " + std::to_string(line.size()) + " bytes");
+    // The reader keeps one byte past the limit, so the line's real length is not known here.
+    const Error error(kErrMalformedEvent, "Event line too long: over " +
+                                              std::to_string(kMaxEventLineLength) + " bytes");
     LogInsertFailure(line.substr(0, 256) + "...", error.code, error.what());
     return;
   }

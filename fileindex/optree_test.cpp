@@ -193,7 +193,7 @@ TEST(OPTreeTest, BadLinesAreLoggedAndSkipped) {
   EXPECT_THAT(Drain(queue), ElementsAre("[02] /v/ok", "[02] /v/\xff\xfe"));
   EXPECT_EQ(log.Count("InsertEvent failed"), static_cast<int>(std::size(bad)));
   EXPECT_EQ(log.Count("event_raw=" + std::string(256, '{') + "..., code=906, reason=Orvane "
-                      "error, code=906, reason=[Event line too long: 131073 bytes]"),
+                      "error, code=906, reason=[Event line too long: over 131072 bytes]"),
             1);
   // Exact text of one skipped line.
   EXPECT_THAT(log.Lines(), ::testing::Contains(::testing::MatchesRegex(
