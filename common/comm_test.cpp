@@ -140,15 +140,14 @@ TEST_F(CommTest, OddlyTypedRepliesAreHandled) {
   Json::Value compound_req;
   compound_req["compound"].append(Req("sub"));
   FakeDaemon engine(
-      SockPath(),
-      FakeDaemon::Replies(
-          {R"({"success":false,"error":"x"})",
-           R"({"success":false,"error":{"code":"1400","msg":"m"}})",
-           R"({"success":true,"has_fail":true,"data":{"a":1}})",
-           R"({"success":true,"has_fail":"yes","data":[{"success":false}]})",
-           R"({"success":true,"has_fail":true,"data":[1,{"success":"no"}]})",
-           R"({"success":true,"has_fail":true,"data":[{"success":false,"error":{}}]})",
-           R"({"success":false,"error":{"code":609}})"}));
+      SockPath(), FakeDaemon::Replies(
+                      {R"({"success":false,"error":"x"})",
+                       R"({"success":false,"error":{"code":"1400","msg":"m"}})",
+                       R"({"success":true,"has_fail":true,"data":{"a":1}})",
+                       R"({"success":true,"has_fail":"yes","data":[{"success":false}]})",
+                       R"({"success":true,"has_fail":true,"data":[1,{"success":"no"}]})",
+                       R"({"success":true,"has_fail":true,"data":[{"success":false,"error":{}}]})",
+                       R"({"success":false,"error":{"code":609}})"}));
   EXPECT_THAT(ImplError(Req("commit")).what(), HasSubstr("Not an object, data=\"x\""));
   EXPECT_THAT(ImplError(Req("commit")).what(), HasSubstr("Not a string"));
   Json::Value res;
@@ -234,7 +233,8 @@ TEST_F(CommTest, BusyIsRetriedForFifteenToNineteenMinutesAndNotifiesOncePerCall)
   ASSERT_EQ(env_.sleeps().size(), 12u);
   for (int i = 0; i < 12; ++i) EXPECT_EQ(env_.sleeps()[i], (900 + 60 * (i % 5)) * 1000000LL);
   EXPECT_EQ(log_.Count("] since quixelasticd is busy. Command: document_upsert_by_id, "
-                       "db: fileindex_photo"), 12);
+                       "db: fileindex_photo"),
+            12);
   EXPECT_TRUE(log_.Contains("Retry[11] since"));
   EXPECT_THAT(Notified(), ElementsAre("-c QUIX.Orvane.Application @administrators app:displayname "
                                       "error:lack_of_memory"));

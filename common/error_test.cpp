@@ -52,8 +52,10 @@ TEST(ErrorTest, ThrowSiteAndLoggedOnlyFormsLogOneLine) {
   const std::string reason = "reason: Orvane error, code=502, reason=\\[negative\\]";
   const auto lines = log.Lines();
   ASSERT_EQ(lines.size(), 4u);
-  EXPECT_THAT(lines[0], MatchesRegex(prefix + "\\(ThrowWhenNegative\\) Failed \\[0 > v\\], " + reason));
-  EXPECT_THAT(lines[1], MatchesRegex(prefix + ".*" + reason + " \\[err: No such file or directory\\]"));
+  EXPECT_THAT(lines[0],
+              MatchesRegex(prefix + "\\(ThrowWhenNegative\\) Failed \\[0 > v\\], " + reason));
+  EXPECT_THAT(lines[1],
+              MatchesRegex(prefix + ".*" + reason + " \\[err: No such file or directory\\]"));
   EXPECT_THAT(lines[2], MatchesRegex(prefix + "\\(TestBody\\) Failed \\[1 \\+ 1 == 2\\]"));
   EXPECT_THAT(lines[3], MatchesRegex(".*Failed \\[true\\] \\[err: Permission denied\\]"));
 }

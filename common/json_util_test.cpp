@@ -6,10 +6,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <csignal>
 #include <cmath>
-#include <functional>
+#include <csignal>
 #include <filesystem>
+#include <functional>
 #include <limits>
 #include <memory>
 
@@ -125,17 +125,64 @@ void ExpectSameAsLibrary(const std::string& text) {
 }
 
 TEST(JsonUtilTest, ReaderAgreesWithTheLibraryReader) {
-  for (const char* text :
-       {"{}", "[]", " {\"a\" : [1, -2, 3.5, true, false, null, \"x\"]} ", "\"\\u00e9\\u0000z\"",
-        "\"\\ud83d\\ude00\"", "\"\\udc00\"", "\"\\ud800x\"", "\"\\/\\b\\f\\n\\r\\t\\\"\\\\\"",
-        "\"\\q\"", "\"raw\x01\ttab\xff\"", "0", "-0", "01", "1.", ".5", "-", "1e5", "1E+05", "2e-3",
-        "9223372036854775807", "9223372036854775808", "18446744073709551615",
-        "18446744073709551616", "-9223372036854775808", "-9223372036854775809", "1e400",
-        "-1e400", "1e-400", "4.9e-324", "0.1", "123456789012345678901234567890.5", "[1,]",
-        "{\"a\":1,}", "{\"a\":1 \"b\":2}", "{\"a\":1}x", "{\"a\":1}\n", "// c\n{}", "{/*c*/}",
-        "\xef\xbb\xbf{}", "{\"a\":{\"x\":1},\"a\":{\"y\":2}}", "tru", "nul", "{\"a\"}", "{1:2}",
-        "[1 2]", "", "   ", "\"unterminated", "'single'", "NaN", "Infinity", "-Infinity", "+1",
-        "0x10", "1e", "1e+", "[\"a\",]", "{\"p\":\"caf\xc3\xa9\"}"}) {
+  for (const char* text : {"{}",
+                           "[]",
+                           " {\"a\" : [1, -2, 3.5, true, false, null, \"x\"]} ",
+                           "\"\\u00e9\\u0000z\"",
+                           "\"\\ud83d\\ude00\"",
+                           "\"\\udc00\"",
+                           "\"\\ud800x\"",
+                           "\"\\/\\b\\f\\n\\r\\t\\\"\\\\\"",
+                           "\"\\q\"",
+                           "\"raw\x01\ttab\xff\"",
+                           "0",
+                           "-0",
+                           "01",
+                           "1.",
+                           ".5",
+                           "-",
+                           "1e5",
+                           "1E+05",
+                           "2e-3",
+                           "9223372036854775807",
+                           "9223372036854775808",
+                           "18446744073709551615",
+                           "18446744073709551616",
+                           "-9223372036854775808",
+                           "-9223372036854775809",
+                           "1e400",
+                           "-1e400",
+                           "1e-400",
+                           "4.9e-324",
+                           "0.1",
+                           "123456789012345678901234567890.5",
+                           "[1,]",
+                           "{\"a\":1,}",
+                           "{\"a\":1 \"b\":2}",
+                           "{\"a\":1}x",
+                           "{\"a\":1}\n",
+                           "// c\n{}",
+                           "{/*c*/}",
+                           "\xef\xbb\xbf{}",
+                           "{\"a\":{\"x\":1},\"a\":{\"y\":2}}",
+                           "tru",
+                           "nul",
+                           "{\"a\"}",
+                           "{1:2}",
+                           "[1 2]",
+                           "",
+                           "   ",
+                           "\"unterminated",
+                           "'single'",
+                           "NaN",
+                           "Infinity",
+                           "-Infinity",
+                           "+1",
+                           "0x10",
+                           "1e",
+                           "1e+",
+                           "[\"a\",]",
+                           "{\"p\":\"caf\xc3\xa9\"}"}) {
     ExpectSameAsLibrary(text);
   }
   // Nesting is bounded: deep texts fail like the library's rather than overflow the stack.

@@ -134,10 +134,11 @@ TEST_F(ContentTest, PhotoExif) {
     image->setExifData(exif);
     image->writeMetadata();
   }
-  EXPECT_EQ(JsonToString(ExtractContent(path)),
-            R"({"QUIXMDAcquisitionMake":"Maker","QUIXMDAcquisitionModel":"Model 5",)"
-            R"("QUIXMDAperture":"f/2.8","QUIXMDContentCreationDate":1714979289,)"
-            R"("QUIXMDExposureTimeString":"1/60","QUIXMDISOSpeed":200,"QUIXMDMediaTypes":"Image"})");
+  EXPECT_EQ(
+      JsonToString(ExtractContent(path)),
+      R"({"QUIXMDAcquisitionMake":"Maker","QUIXMDAcquisitionModel":"Model 5",)"
+      R"("QUIXMDAperture":"f/2.8","QUIXMDContentCreationDate":1714979289,)"
+      R"("QUIXMDExposureTimeString":"1/60","QUIXMDISOSpeed":200,"QUIXMDMediaTypes":"Image"})");
 }
 
 TEST_F(ContentTest, KindsWithNothingToExtract) {

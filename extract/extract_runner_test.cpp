@@ -127,7 +127,8 @@ TEST_F(ExtractRunnerTest, RealHelperStartsCleanUnderItsLimits) {
   }
   // Standard input, output and error, and the two private copies of the request channel.
   int open_fds = 0;
-  for (const auto& fd : std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/fd")) {
+  for (const auto& fd :
+       std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/fd")) {
     ++open_fds;
     std::error_code ec;
     EXPECT_NE(std::filesystem::read_symlink(fd.path(), ec).string(), leak_path);
@@ -213,9 +214,9 @@ done)");
   pid_t last = fields_["pid"].asInt();
   ASSERT_TRUE(RunWith(helper, "/b", quick)) << error_;
   EXPECT_EQ(fields_["pid"].asInt(), last);
-  const std::pair<const char*, const char*> failing[] = {
-      {"/crash", "killed by Segmentation fault"}, {"/hang", "timed out after 500 ms"},
-      {"/error", "cannot open"}};
+  const std::pair<const char*, const char*> failing[] = {{"/crash", "killed by Segmentation fault"},
+                                                         {"/hang", "timed out after 500 ms"},
+                                                         {"/error", "cannot open"}};
   for (const auto& [path, error] : failing) {
     EXPECT_FALSE(RunWith(helper, path, quick));
     EXPECT_EQ(error_, error);

@@ -56,12 +56,13 @@ TEST_F(RealEngineTest, EveryDocumentMovesAcrossRenamePasses) {
   const std::string dir = share_ + "/big";
   std::vector<Json::Value> bulk;
   for (unsigned i = 0; i < kRenameBatchSize + 5; ++i)
-    bulk.push_back(tc::Upsert(dir + (i % 3 ? "" : "/deeper") + "/f" + std::to_string(i),
-                              "fileindex_photo"));
+    bulk.push_back(
+        tc::Upsert(dir + (i % 3 ? "" : "/deeper") + "/f" + std::to_string(i), "fileindex_photo"));
   SendRequest(tc::Compound(bulk));
   const std::string odd = volume_.Write("photo/big/sub/b \"q\"\n.txt", "t");
   const std::string sibling = volume_.Write("photo/bigx.txt", "x");
-  for (const std::string& path : {dir, dir + "/sub", odd, sibling}) IndexUpsert("photo", path, true);
+  for (const std::string& path : {dir, dir + "/sub", odd, sibling})
+    IndexUpsert("photo", path, true);
   IndexCommit("photo");
   EXPECT_TRUE(IsDocumentExists("photo", odd));
   IndexAttr("photo", odd);

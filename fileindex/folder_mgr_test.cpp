@@ -64,9 +64,14 @@ TEST_F(FolderMgrTest, MostSuitableFolderIsTheDeepestThenTheEarliest) {
   FolderMgr mgr;
   const std::string t = vol_ + "/photo/trips";
   const std::vector<std::pair<std::string, std::string>> governing = {
-      {t + "/2024/c", "B"}, {t + "/2024", "B"}, {t + "/2024x", "A"}, {t, "A"},
+      {t + "/2024/c", "B"},
+      {t + "/2024", "B"},
+      {t + "/2024x", "A"},
+      {t, "A"},
       {t + "/", "C"},  // only a spelling with the slash matches "/photo/trips/"
-      {vol_ + "/photo", ""}, {vol_ + "/photos/trips", ""}, {"", ""},
+      {vol_ + "/photo", ""},
+      {vol_ + "/photos/trips", ""},
+      {"", ""},
       {vol_ + "/music/a.mp3", "M"}};  // equal paths: the earlier one
   for (const auto& c : governing) {
     auto f = mgr.GetMostSuitableCfg(c.first);
@@ -77,10 +82,14 @@ TEST_F(FolderMgrTest, MostSuitableFolderIsTheDeepestThenTheEarliest) {
   EXPECT_FALSE(mgr.IsFullPathHasOwnCfg(t + "/2024/c"));
 
   // Metadata by file kind under A (document only) and B (audio only); other kinds always.
-  for (const auto& c : std::vector<std::pair<std::string, bool>>{
-           {t + "/a.pdf", true}, {t + "/a.mp3", false}, {t + "/2024/a.mp3", true},
-           {t + "/2024/a.jpg", false}, {t + "/2024/a.pdf", false}, {t + "/2024/a.zzqq", true},
-           {vol_ + "/photo/family/a.pdf", false}}) {
+  for (const auto& c :
+       std::vector<std::pair<std::string, bool>>{{t + "/a.pdf", true},
+                                                 {t + "/a.mp3", false},
+                                                 {t + "/2024/a.mp3", true},
+                                                 {t + "/2024/a.jpg", false},
+                                                 {t + "/2024/a.pdf", false},
+                                                 {t + "/2024/a.zzqq", true},
+                                                 {vol_ + "/photo/family/a.pdf", false}}) {
     EXPECT_EQ(mgr.IsFullPathNeedMeta(c.first), c.second) << c.first;
   }
   EXPECT_EQ(mgr.GetIndexedShares(), (std::set<std::string>{"music", "photo"}));

@@ -65,8 +65,8 @@ TEST_F(FolderTest, StatusRulesInOrderAndAsAdditionalMember) {
     Json::Value data = Parse(R"({"share": {}})");
     data["resume_time"] = Json::Int64(resume_time);
     ASSERT_TRUE(JsonValue(data).toFile(Rooted(kFileIndexStatusCfgPath)));
-    EXPECT_EQ(status_of(trips), resume_time == now ? R"({"text":"processing"})"
-                                                   : R"({"text":"paused"})")
+    EXPECT_EQ(status_of(trips),
+              resume_time == now ? R"({"text":"processing"})" : R"({"text":"paused"})")
         << resume_time;
   }
 

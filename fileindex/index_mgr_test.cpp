@@ -194,9 +194,8 @@ TEST_F(IndexMgrTest, ReindexRebuildsOnlyWholeShares) {
   EXPECT_TRUE(NewEngine().empty());
 
   FolderReindex(Parse(R"(["/photo/family", "/photo/trips", "/music"])"));
-  EXPECT_EQ(NewEngine(),
-            (Strings{"index_delete fileindex_music", "index_create fileindex_music",
-                     "index_delete fileindex_photo", "index_create fileindex_photo"}));
+  EXPECT_EQ(NewEngine(), (Strings{"index_delete fileindex_music", "index_create fileindex_music",
+                                  "index_delete fileindex_photo", "index_create fileindex_photo"}));
   EXPECT_EQ(NewIndexd(),
             (Strings{Worker("worker_create", "music"), Worker("worker_create", "photo")}));
   // The trips' re-index is still queued, so only the family is added.
@@ -273,7 +272,8 @@ TEST_F(IndexMgrTest, ConcurrentAdministratorsLoseNothing) {
         const std::string path = path_of(p, i);
         try {
           FolderAdd(List({FolderJson(path, "n", true, true, true, true)}), false);
-          if (i % 3 == 1) FolderSet(List({FolderJson(path, "set", true, false, true, true)}), false);
+          if (i % 3 == 1)
+            FolderSet(List({FolderJson(path, "set", true, false, true, true)}), false);
           if (i % 3 == 2) FolderDelete(List({Json::Value(path)}));
           done += std::string(i % 3 == 0 ? "n " : i % 3 == 1 ? "set " : "deleted ") + path + "\n";
         } catch (const Error&) {

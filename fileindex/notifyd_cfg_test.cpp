@@ -61,9 +61,9 @@ TEST_F(NotifydCfgTest, EventsAreWrittenPerShareUnlessAQueuedReindexCoversThem) {
                    {0x10000, vol_ + "/ro/x", "", Json::Value()},  // a share that cannot index
                    {0x100, vol_ + "/photo/family", vol_ + "/photo/f", Json::Value()}});
   const Strings photo = Events("photo");
-  EXPECT_EQ(Strings(photo.begin() + 1, photo.end()),
-            (Strings{"65536 /photo/trips/2024", "65536 /photo/trips",
-                     "256 /photo/family <- /photo/f"}));
+  EXPECT_EQ(
+      Strings(photo.begin() + 1, photo.end()),
+      (Strings{"65536 /photo/trips/2024", "65536 /photo/trips", "256 /photo/family <- /photo/f"}));
   EXPECT_FALSE(IsFileExist(Queue("ro")));
 
   // A path in no share ends the batch: what came before it is written, the rest is not.
@@ -111,8 +111,9 @@ TEST_F(NotifydCfgTest, ServicesFollowTheFolderFileAndFailuresAreOnlyLogged) {
   EXPECT_NE(test::ReadFile(smb).find("spotlight = yes"), std::string::npos);
   SetupRelatedServices(true);  // already on: no restart of file sharing
   SetupRelatedServices(false);
-  EXPECT_EQ(Actions(), "stop-fi\nrestart-smb\nstart-ce\nstart-fi\nstart-ce\nstart-fi\n"
-                       "restart-smb\nstop-fi\n");
+  EXPECT_EQ(Actions(),
+            "stop-fi\nrestart-smb\nstart-ce\nstart-fi\nstart-ce\nstart-fi\n"
+            "restart-smb\nstop-fi\n");
   EXPECT_EQ(test::ReadFile(smb).find("spotlight = yes"), std::string::npos);
 
   const std::string before = Actions();

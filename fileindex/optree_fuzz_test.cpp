@@ -15,9 +15,14 @@ std::string RandomQueue(std::mt19937& rng) {
   static const char* const kNames[] = {"a", "b", "c", "d", "\xc3\xa9", ".", ".."};
   static const uint32_t kBits[] = {0x2,     0x4,     0x8,    0x40, 0x80, 0x100, 0x200,
                                    0x10000, 0x20000, 0x1000, 0x42, 0x84, 0x144};
-  static const char* const kBroken[] = {
-      "", "{", "[]", "{\"event\":2}", "{\"path\":\"/a\"}", "{\"event\":-4,\"path\":\"/a\"}",
-      "\xff\xfe\x00", "{\"event\":2,\"path\":\"a//b\"}"};
+  static const char* const kBroken[] = {"",
+                                        "{",
+                                        "[]",
+                                        "{\"event\":2}",
+                                        "{\"path\":\"/a\"}",
+                                        "{\"event\":-4,\"path\":\"/a\"}",
+                                        "\xff\xfe\x00",
+                                        "{\"event\":2,\"path\":\"a//b\"}"};
   auto pick = [&rng](size_t n) { return static_cast<size_t>(rng() % n); };
   auto path = [&]() {
     std::string p;

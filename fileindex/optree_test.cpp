@@ -177,12 +177,21 @@ TEST(OPTreeTest, BadLinesAreLoggedAndSkipped) {
   test::LogCapture log;
   errno = 0;
   const std::string bad[] = {
-      "", "not json", R"({"event":2})", R"({"path":"/v/a"})", R"({"event":"2","path":"/v/a"})",
-      R"({"event":-1,"path":"/v/a"})", R"({"event":2,"path":["/v/a"]})",
-      R"({"event":2,"path":"v/a"})", R"({"event":2,"path":"/v//a"})",
-      R"({"event":2,"path":"/v/a/"})", R"({"event":2,"path":"/"})",
-      R"({"event":256,"path":"/v/a"})", R"({"event":256,"path":"/v/b","path_old":"/v//a"})",
-      "[1,2,3]", std::string("{\"event\":2,\"path\":\"/v/a\"") + '\0' + "}",
+      "",
+      "not json",
+      R"({"event":2})",
+      R"({"path":"/v/a"})",
+      R"({"event":"2","path":"/v/a"})",
+      R"({"event":-1,"path":"/v/a"})",
+      R"({"event":2,"path":["/v/a"]})",
+      R"({"event":2,"path":"v/a"})",
+      R"({"event":2,"path":"/v//a"})",
+      R"({"event":2,"path":"/v/a/"})",
+      R"({"event":2,"path":"/"})",
+      R"({"event":256,"path":"/v/a"})",
+      R"({"event":256,"path":"/v/b","path_old":"/v//a"})",
+      "[1,2,3]",
+      std::string("{\"event\":2,\"path\":\"/v/a\"") + '\0' + "}",
       "{\"event\":2,\"path\":\"/" + std::string(5000, 'p') + "\"}",
       std::string(kMaxEventLineLength + 10, '{'),
   };
@@ -192,14 +201,16 @@ TEST(OPTreeTest, BadLinesAreLoggedAndSkipped) {
   queue += Modify("/v/\xff\xfe");
   EXPECT_THAT(Drain(queue), ElementsAre("[02] /v/ok", "[02] /v/\xff\xfe"));
   EXPECT_EQ(log.Count("InsertEvent failed"), static_cast<int>(std::size(bad)));
-  EXPECT_EQ(log.Count("event_raw=" + std::string(256, '{') + "..., code=906, reason=Orvane "
+  EXPECT_EQ(log.Count("event_raw=" + std::string(256, '{') +
+                      "..., code=906, reason=Orvane "
                       "error, code=906, reason=[Event line too long: over 131072 bytes]"),
             1);
   // Exact text of one skipped line.
-  EXPECT_THAT(log.Lines(), ::testing::Contains(::testing::MatchesRegex(
-                               "optree\\.cpp:[0-9]+ \\([0-9]+, [0-9]+\\) \\(BuildTree\\) InsertEvent "
-                               "failed, event_raw=not json, code=906, reason=Orvane error, "
-                               "code=906, reason=\\[Malformed event_raw: not json\\]")));
+  EXPECT_THAT(log.Lines(),
+              ::testing::Contains(::testing::MatchesRegex(
+                  "optree\\.cpp:[0-9]+ \\([0-9]+, [0-9]+\\) \\(BuildTree\\) InsertEvent "
+                  "failed, event_raw=not json, code=906, reason=Orvane error, "
+                  "code=906, reason=\\[Malformed event_raw: not json\\]")));
   EXPECT_TRUE(
       log.Contains("code=9999, reason=Orvane error, code=9999, reason=[GetNodeByPath "
                    "failed, path=/v//a]"));

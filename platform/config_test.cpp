@@ -81,11 +81,13 @@ TEST(PlatformConfigTest, EveryFaultIsAnErrorNamingTheFile) {
       {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/../b\"}]}", "is not a clean absolute path"},
       {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/c\"}]}",
        "the last component of \"path\" \"/a/c\" is not the share name"},
-      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/b\"}, {\"name\": \"b\", \"path\": \"/c/b\"}]}",
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/b\"}, {\"name\": \"b\", \"path\": "
+       "\"/c/b\"}]}",
        "two shares are named \"b\""},
       {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/b\", \"readonly\": \"yes\"}]}",
        "share \"b\": \"readonly\" is not true or false"},
-      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/b\", \"access\": {\"users\": {\"x\": \"w\"}}}]}",
+      {"{\"shares\": [{\"name\": \"b\", \"path\": \"/a/b\", \"access\": {\"users\": {\"x\": "
+       "\"w\"}}}]}",
        "access must be \"rw\", \"ro\" or \"na\""},
       {"{\"admin_group\": 7}", "\"admin_group\" is not a non-empty string"},
       {"{\"services\": {\"samba\": {\"start\": \"/bin/true\"}}}",

@@ -50,8 +50,10 @@ class PlatformServiceTest : public ::testing::Test {
     const std::string record = R"(["/bin/sh", "-c", "echo $0 >> )" + log_ + R"(", )";
     test::WritePlatformConfig(root_.path(), R"({"samba_conf": ")" + dir_.Path("smb.conf") +
                                                 R"(", "services": {
-      "quixcontentextractd": {"start": )" + record + R"("start-ce"]},
-      "pkg-Orvane-fileindexd": {"start": )" + record + R"("start-fi"], "stop": )" + record +
+      "quixcontentextractd": {"start": )" + record +
+                                                R"("start-ce"]},
+      "pkg-Orvane-fileindexd": {"start": )" + record +
+                                                R"("start-fi"], "stop": )" + record +
                                                 R"("stop-fi"]},
       "samba": {"start": )" + record + R"("start-smb"], "restart": ["/bin/false"]}
     }})");
@@ -83,8 +85,8 @@ TEST_F(PlatformServiceTest, ConfiguredCommandsWithoutSystemd) {
 // for it and records how it was called.
 TEST_F(PlatformServiceTest, SystemctlWhenSystemdRuns) {
   ASSERT_TRUE(MakeParentDirs(root_.path() + "/run/systemd/system/x"));
-  const std::string systemctl =
-      root_.Write("usr/bin/systemctl", "#!/bin/sh\necho \"$@\" >> " + log_ + "\n[ \"$2\" != bad ]\n");
+  const std::string systemctl = root_.Write(
+      "usr/bin/systemctl", "#!/bin/sh\necho \"$@\" >> " + log_ + "\n[ \"$2\" != bad ]\n");
   ASSERT_EQ(chmod(systemctl.c_str(), 0755), 0);
   EXPECT_EQ(QLIBServicectlStart("pkg-Orvane-fileindexd", QLIB_SERVICECTL_UPSTART), 0);
   EXPECT_EQ(QLIBServiceRestart("samba"), 0);
@@ -136,10 +138,11 @@ TEST_F(PlatformServiceTest, NotifierProgramRecordsNotifications) {
   ASSERT_EQ(all.size(), 2u);
   EXPECT_TRUE(all[0]["time"].isIntegral());
   all[0].removeMember("time");
-  EXPECT_EQ(JsonToString(all[0]),
-            R"({"app":"QUIX.Orvane.Application","args":["<a data-quix-app=\"QUIX.Orvane.)"
-            R"(Application\" data-quix-fn=\"preference\">","</a>"],"b":"true","e":"false",)"
-            R"("message":"error:index_no_space","title":"app:displayname","to":"@administrators"})");
+  EXPECT_EQ(
+      JsonToString(all[0]),
+      R"({"app":"QUIX.Orvane.Application","args":["<a data-quix-app=\"QUIX.Orvane.)"
+      R"(Application\" data-quix-fn=\"preference\">","</a>"],"b":"true","e":"false",)"
+      R"("message":"error:index_no_space","title":"app:displayname","to":"@administrators"})");
   EXPECT_EQ(all[1]["message"].asString(), "error:lack_of_memory");
   EXPECT_FALSE(all[1].isMember("b"));
 }

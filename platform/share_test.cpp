@@ -6,11 +6,11 @@
 
 #include <memory>
 
+#include "common/root.hpp"
 #include "platform/fault.hpp"
 #include "platform/fileidx.hpp"
 #include "platform/platform_error.hpp"
 #include "platform/quota.hpp"
-#include "common/root.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -72,9 +72,9 @@ TEST_F(PlatformShareTest, LookUpsByNameAndByPathFindTheDeepestShareOnWholeCompon
   EXPECT_EQ(find("relative/music"), "-");
   EXPECT_EQ(errno, EINVAL);
   char tiny[4];
-  EXPECT_EQ(QUIXShareNamePathGet((vol_ + "/music/x").c_str(), tiny, sizeof(tiny), path,
-                                 sizeof(path)),
-            -1);
+  EXPECT_EQ(
+      QUIXShareNamePathGet((vol_ + "/music/x").c_str(), tiny, sizeof(tiny), path, sizeof(path)),
+      -1);
   EXPECT_EQ(errno, ERANGE);
   EXPECT_STREQ(tiny, "");
 }
@@ -119,7 +119,8 @@ TEST_F(PlatformShareTest, RecycleBins) {
   EXPECT_EQ(QUIXShareIsShareRecycle("nope"), -1);
 
   const std::string bin = vol_ + "/homes/nobody/#recycle";
-  const int kFlags = RECYCLE_HOME_CHECK_PATH | RECYCLE_HOME_CHECK_EXIST | RECYCLE_HOME_CHECK_ENABLED;
+  const int kFlags =
+      RECYCLE_HOME_CHECK_PATH | RECYCLE_HOME_CHECK_EXIST | RECYCLE_HOME_CHECK_ENABLED;
   EXPECT_EQ(QUIXRecycleUserHomePathIsExist((bin + "/x").c_str(), kFlags), 0);  // not there yet
   EXPECT_EQ(QUIXRecycleUserHomePathIsExist((bin + "/x").c_str(), RECYCLE_HOME_CHECK_PATH), 1);
   ASSERT_TRUE(MakeParentDirs(bin + "/x"));

@@ -29,7 +29,8 @@ class SDKCredentialsTest : public ::testing::Test {
   }
   void TearDown() override {
     // Whatever a test did, the next one starts as root.
-    if (getuid() == 0 && geteuid() != 0) ASSERT_TRUE(platform::ResetCredentialsByName("root", true));
+    if (getuid() == 0 && geteuid() != 0)
+      ASSERT_TRUE(platform::ResetCredentialsByName("root", true));
   }
 
   test::TempDir root_;
@@ -114,7 +115,8 @@ TEST_F(SDKCredentialsTest, FailedLookupsAndSwitchesAreErrorsOrLogLines) {
     saved.AsUser("nobody");
     faults.Arm("ResetCredentialsByName", Fault{0, EPERM});
   }
-  EXPECT_TRUE(log.Contains("Failed [!ResetCredentialsByName(username_)] [err: Operation not permitted]"));
+  EXPECT_TRUE(
+      log.Contains("Failed [!ResetCredentialsByName(username_)] [err: Operation not permitted]"));
   EXPECT_EQ(geteuid(), kNobody);
 }
 

@@ -24,7 +24,8 @@ class SDKShareTest : public ::testing::Test {
       {"name": "vault", "path": ")" + vol_ + R"(/vault", "encrypted": true, "encryption": true},
       {"name": "ro", "path": ")" + vol_ + R"(/ro", "readonly": true, "hide_unreadable": true},
       {"name": "open", "path": ")" + vol_ + R"(/open", "encryption": true},
-      {"name": "my music é", "path": ")" + vol_ + R"(/my music é"}
+      {"name": "my music é", "path": ")" + vol_ +
+                                                R"(/my music é"}
     ]})");
   }
 
@@ -88,10 +89,12 @@ TEST_F(SDKShareTest, PlatformFailuresBecomeErrors) {
   SDKShare music("music");
   const Fault fail{-1, EIO};
   faults.Arm("QLIBShareIsEncryptedGet", fail);
-  ExpectError([&] { music.CanBeIndexed(); }, kErrSystem, "QLIBShareis_encryptedGet failed, share=music");
+  ExpectError([&] { music.CanBeIndexed(); }, kErrSystem,
+              "QLIBShareis_encryptedGet failed, share=music");
   EXPECT_TRUE(log.Contains("[err: Input/output error]"));
   faults.Arm("QLIBShareIsReadOnlyGet", fail);
-  ExpectError([&] { music.CanBeIndexed(); }, kErrSystem, "QLIBShareis_readonlyGet failed, share=music");
+  ExpectError([&] { music.CanBeIndexed(); }, kErrSystem,
+              "QLIBShareis_readonlyGet failed, share=music");
   faults.Arm("QLIBShareRecycleStatusGet", fail);
   ExpectError([&] { music.IsEnableRecycleBin(); }, kErrSystem,
               "QLIBShareRecycleStatusGet failed, share=music");
@@ -99,7 +102,8 @@ TEST_F(SDKShareTest, PlatformFailuresBecomeErrors) {
   EXPECT_FALSE(music.IsHideUnReadable());
 
   faults.Arm("FILEIDXQueuePathCompose", fail);
-  ExpectError([&] { music.GetQueuePath(); }, kErrSystem, "FILEIDXQueuePathCompose failed, share=music");
+  ExpectError([&] { music.GetQueuePath(); }, kErrSystem,
+              "FILEIDXQueuePathCompose failed, share=music");
   EXPECT_TRUE(log.Contains(
       "Failed [0 > FILEIDXQueuePathCompose(share_info_->szPath, path, sizeof(path))]"));
   faults.Arm("FILEIDXGetIndexID", fail);

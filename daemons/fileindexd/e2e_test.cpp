@@ -173,7 +173,7 @@ TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
   const std::string src = sys_.root() + "/tarsrc";
   for (int i = 0; i < 40; ++i) {
     WriteFile(src + "/pkg/dir" + std::to_string(i % 5) + "/f" + std::to_string(i) + ".txt",
-          std::string(i, 'x'));
+              std::string(i, 'x'));
   }
   ASSERT_EQ(0, Shell("tar -C " + src + " -cf " + sys_.root() + "/pkg.tar pkg"));
   ASSERT_EQ(0, Shell("tar -C " + D("proj") + " -xf " + sys_.root() + "/pkg.tar"));
@@ -210,10 +210,12 @@ TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
   // The file-change daemon killed and started again goes on watching.
   notifyd_->Signal(SIGKILL);
   notifyd_ = sys_.StartNotifyd();
-  WaitFor([&] {
-    WriteFile(D("proj/probe.txt"), "p");
-    return Index("docs").count(D("proj/probe.txt")) > 0;
-  }, 20000);
+  WaitFor(
+      [&] {
+        WriteFile(D("proj/probe.txt"), "p");
+        return Index("docs").count(D("proj/probe.txt")) > 0;
+      },
+      20000);
   WriteFile(D("proj/after/restart.txt"), "after");
   ASSERT_EQ(0, Shell("rm -rf " + D("proj/big/d7")));
   ExpectSettled("docs", D("proj"));

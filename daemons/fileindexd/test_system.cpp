@@ -41,7 +41,6 @@ ChildProcess::ChildProcess(const std::string& root, std::vector<std::string> arg
   }
 }
 
-
 ChildProcess::~ChildProcess() { Signal(SIGKILL); }
 
 int ChildProcess::Signal(int sig) {

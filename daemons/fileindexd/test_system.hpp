@@ -4,8 +4,8 @@
 #ifndef ORVANE_DAEMONS_FILEINDEXD_TEST_SYSTEM_HPP_
 #define ORVANE_DAEMONS_FILEINDEXD_TEST_SYSTEM_HPP_
 
-#include <sys/types.h>
 #include <json/json.h>
+#include <sys/types.h>
 
 #include <functional>
 #include <initializer_list>

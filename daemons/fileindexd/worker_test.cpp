@@ -7,7 +7,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"

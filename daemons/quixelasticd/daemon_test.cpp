@@ -153,7 +153,8 @@ TEST_F(DaemonTest, RunsAsAServiceWithAPidFile) {
   EXPECT_NE(pid, launcher);
   EXPECT_TRUE(Eventually([&] {
     return Request(dir_.Path("var/run/quixelasticd.sock"),
-                   Cmd("index_list", Json::Value()))["success"].asBool();
+                   Cmd("index_list", Json::Value()))["success"]
+        .asBool();
   }));
   // A second daemon on the same root refuses to start while the first holds the pid file.
   tc::DaemonProcess second(dir_.path());
@@ -194,10 +195,12 @@ TEST_F(DaemonTest, OrdinaryUsersOnlySearchAndOnlySeeWhatTheyCanOpen) {
     return tc::RequestAs(socket, request, nobody->pw_uid, nobody->pw_gid);
   };
   // Real files: one readable, one unreadable, one in a folder nobody cannot enter.
-  const std::vector<std::pair<std::string, mode_t>> modes = {
-      {"share/pub/report open.txt", 0644}, {"share/pub/report closed.txt", 0600},
-      {"share/priv/report hidden.txt", 0644}, {"share", 0755}, {"share/pub", 0755},
-      {"share/priv", 0700}};
+  const std::vector<std::pair<std::string, mode_t>> modes = {{"share/pub/report open.txt", 0644},
+                                                             {"share/pub/report closed.txt", 0600},
+                                                             {"share/priv/report hidden.txt", 0644},
+                                                             {"share", 0755},
+                                                             {"share/pub", 0755},
+                                                             {"share/priv", 0700}};
   std::vector<Json::Value> upserts;
   for (const auto& [rel, mode] : modes) {
     if (rel.find(".txt") != std::string::npos) {

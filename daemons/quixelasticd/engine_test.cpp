@@ -25,8 +25,7 @@ using ::testing::HasSubstr;
 
 const char kId[] = "fileindex_share";
 
-Json::Value Query(const std::string& form, const std::string& value,
-                  const std::string& id = kId) {
+Json::Value Query(const std::string& form, const std::string& value, const std::string& id = kId) {
   Json::Value r = OnIndex("document_get_by_query", id);
   r["data"]["query"]["qsl"][form]["QUIXMDPath"] = value;
   r["data"]["query"]["load_field"].append("QUIXMDPath");
@@ -82,8 +81,11 @@ class EngineTest : public ::testing::Test {
 
 TEST_F(EngineTest, MalformedAndForbiddenRequestsGetErrorReplies) {
   const std::vector<std::pair<std::string, int>> cases = {
-      {"{", kCodeMalformed}, {"[1]", kCodeMalformed}, {R"({"data":{}})", kCodeMalformed},
-      {R"({"command":7})", kCodeMalformed}, {R"({"compound":{}})", kCodeMalformed},
+      {"{", kCodeMalformed},
+      {"[1]", kCodeMalformed},
+      {R"({"data":{}})", kCodeMalformed},
+      {R"({"command":7})", kCodeMalformed},
+      {R"({"compound":{}})", kCodeMalformed},
       {R"({"command":"commit","data":[]})", kCodeMalformed},
       {R"({"command":"nope","data":{}})", kCodeUnknownCommand},
       {R"({"command":"commit","data":{}})", kCodeInvalidParam},
@@ -161,10 +163,10 @@ TEST_F(EngineTest, CompoundAnswersEachInOrderAndUndoesOnlyWhatFailed) {
   const Json::Value no_suggestion = Parse(R"({"command":"update_term_suggestion",
       "data":{"doc_id_field":"/v/share/gone","db_name":"fileindex_share"}})");
 
-  const Json::Value r = Send(Compound(
-      {Upsert("/v/share/a"), rekey, del, bad_doc, missing, Query("prefix", "/v/share/"),
-       Parse(R"({"compound": []})"), Cmd("no_such_command", Json::Value()), no_suggestion,
-       Upsert("/v/share/b")}));
+  const Json::Value r =
+      Send(Compound({Upsert("/v/share/a"), rekey, del, bad_doc, missing,
+                     Query("prefix", "/v/share/"), Parse(R"({"compound": []})"),
+                     Cmd("no_such_command", Json::Value()), no_suggestion, Upsert("/v/share/b")}));
   ASSERT_EQ(r["data"].size(), 10u) << JsonToString(r);
   EXPECT_EQ(r["success"], true);
   EXPECT_EQ(r["has_fail"], true);
@@ -183,10 +185,10 @@ TEST_F(EngineTest, CompoundAnswersEachInOrderAndUndoesOnlyWhatFailed) {
 
   // Commands that need the index's lock, or read committed data, follow a batch's writes
   // without waiting on the batch itself, and see them.
-  const Json::Value m = Send(Compound(
-      {Upsert("/v/share/c"), Cmd("list_term_sugg_db", Json::Value(Json::objectValue)),
-       Cmd("index_list", Json::Value(Json::objectValue)), Upsert("/v/share/d"),
-       Parse(R"({"command":"search","data":{"name":"d"}})")}));
+  const Json::Value m =
+      Send(Compound({Upsert("/v/share/c"), Cmd("list_term_sugg_db", Json::Value(Json::objectValue)),
+                     Cmd("index_list", Json::Value(Json::objectValue)), Upsert("/v/share/d"),
+                     Parse(R"({"command":"search","data":{"name":"d"}})")}));
   EXPECT_EQ(m["has_fail"], false) << JsonToString(m);
   EXPECT_EQ(m["data"][4]["data"]["total"], 1);
 }

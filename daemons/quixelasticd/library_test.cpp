@@ -39,7 +39,8 @@ class LibraryTest : public ::testing::Test {
     share_ = volume_.Path("photo");
     test::WritePlatformConfig(dir_.path(), R"({"shares": [
       {"name": "photo", "path": ")" + share_ + R"("},
-      {"name": "pics", "path": ")" + volume_.Path("pics") + R"("}]})");
+      {"name": "pics", "path": ")" + volume_.Path("pics") +
+                                               R"("}]})");
   }
   void SetUp() override {
     daemon_ = std::make_unique<tc::DaemonProcess>(dir_.path());
@@ -57,7 +58,8 @@ class LibraryTest : public ::testing::Test {
     el::IndexUpsert("photo", path, false);
     return path;
   }
-  std::vector<std::string> Below(const std::string& dir, const std::string& db = "fileindex_photo") {
+  std::vector<std::string> Below(const std::string& dir,
+                                 const std::string& db = "fileindex_photo") {
     std::vector<std::string> paths;
     el::IndexGetByPrefixPath(db, dir, paths);
     std::sort(paths.begin(), paths.end());

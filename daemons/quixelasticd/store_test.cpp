@@ -126,8 +126,8 @@ TEST_F(StoreTest, SetFieldsRekeysAndReplacesTheDocumentAtTheNewPath) {
   store_->SetFields("/v/s/old.txt", fields);
   EXPECT_EQ(CodeOf([&] { store_->SetFields("/v/s/old.txt", fields); }), kCodeDocNotFound);
   txn.Commit();
-  const Json::Value hits = store_->GetByQuery(DocQuery(), {"QUIXMDSecret", "QUIXMDPath",
-                                                           "QUIXMDFSSize"}, 0, 10);
+  const Json::Value hits =
+      store_->GetByQuery(DocQuery(), {"QUIXMDSecret", "QUIXMDPath", "QUIXMDFSSize"}, 0, 10);
   ASSERT_EQ(hits.size(), 1u);
   EXPECT_EQ(hits[0]["QUIXMDPath"], "/v/s/new.txt");
   EXPECT_EQ(hits[0]["QUIXMDFSSize"], 10);  // the moved file's own attributes are kept
@@ -157,10 +157,10 @@ TEST_F(StoreTest, AFullDiskFailsTheWriteAndKeepsWhatWasThere) {
   Put(FileDoc("/v/s/kept.txt"));
   // The page limit stands in for a full disk: SQLite answers SQLITE_FULL the same way.
   store_->writer().Exec("PRAGMA max_page_count = " + std::to_string([&] {
-    Stmt st(store_->writer(), "PRAGMA page_count");
-    st.Step();
-    return st.Int(0);
-  }()));
+                          Stmt st(store_->writer(), "PRAGMA page_count");
+                          st.Step();
+                          return st.Int(0);
+                        }()));
   bool full = false;
   try {
     WriteTxn txn(*store_);

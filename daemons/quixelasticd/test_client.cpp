@@ -66,8 +66,7 @@ Json::Value Request(const std::string& socket, const Json::Value& request) {
   return reply;
 }
 
-Json::Value RequestAs(const std::string& socket, const Json::Value& request, uid_t uid,
-                      gid_t gid) {
+Json::Value RequestAs(const std::string& socket, const Json::Value& request, uid_t uid, gid_t gid) {
   int pipe_fds[2];
   if (::pipe(pipe_fds) != 0) return Json::Value();
   const pid_t pid = ::fork();

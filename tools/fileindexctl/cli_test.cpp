@@ -76,10 +76,10 @@ class CtlTest : public ::testing::Test {
 using Case = std::pair<std::vector<std::string>, std::string>;
 
 TEST_F(CtlTest, HelpAndCommandLineMistakes) {
-  for (const auto& [args, text] : std::vector<Case>{
-           {{"--help"}, "\n  folder add "},
-           {{"folder", "--help"}, "\n  folder reindex "},
-           {{"search", "--help"}, "usage: fileindexctl search [KEYWORDS...]"}}) {
+  for (const auto& [args, text] :
+       std::vector<Case>{{{"--help"}, "\n  folder add "},
+                         {{"folder", "--help"}, "\n  folder reindex "},
+                         {{"search", "--help"}, "usage: fileindexctl search [KEYWORDS...]"}}) {
     const Result r = Run(args);
     EXPECT_EQ(r.status, 0) << text;
     EXPECT_THAT(r.out, HasSubstr(text));
@@ -180,9 +180,8 @@ TEST_F(CtlTest, StatusShowsEachShareFromBothDaemonsOrDashesWithoutThem) {
   // Each stand-in answers the one question status asks it, and success to anything else.
   auto answering = [](const std::string& key, const std::string& reply) {
     return [key, reply](int fd, const std::string& request) {
-      test::FakeDaemon::WriteFrame(fd, request.find(key) != std::string::npos
-                                           ? reply
-                                           : R"({"success":true,"data":{}})");
+      test::FakeDaemon::WriteFrame(
+          fd, request.find(key) != std::string::npos ? reply : R"({"success":true,"data":{}})");
     };
   };
   auto engine = std::make_unique<test::FakeDaemon>(
