@@ -83,8 +83,6 @@ TEST(JsonUtilTest, ApplyChangesAndArrayConversions) {
 
 // The text must stay byte for byte what the library's compact writer produces: stored
 // documents and queue lines written before are compared and re-read as text.
-// The text must stay byte for byte what the library's compact writer produces: stored
-// documents and queue lines written before are compared and re-read as text.
 TEST(JsonUtilTest, WriterMatchesTheLibraryWriter) {
   Json::StreamWriterBuilder builder;
   builder["indentation"] = "";
@@ -97,7 +95,6 @@ TEST(JsonUtilTest, WriterMatchesTheLibraryWriter) {
   v["reals"].append(std::nan(""));
   v["reals"].append(-std::numeric_limits<double>::infinity());
   EXPECT_EQ(JsonToString(v), Json::writeString(builder, v));
-  EXPECT_EQ(JsonToString(Json::Value("x")), "\"x\"");
 }
 
 // The general reader with the settings the system has always parsed with. Random texts are
@@ -125,64 +122,20 @@ void ExpectSameAsLibrary(const std::string& text) {
 }
 
 TEST(JsonUtilTest, ReaderAgreesWithTheLibraryReader) {
-  for (const char* text : {"{}",
-                           "[]",
-                           " {\"a\" : [1, -2, 3.5, true, false, null, \"x\"]} ",
-                           "\"\\u00e9\\u0000z\"",
-                           "\"\\ud83d\\ude00\"",
-                           "\"\\udc00\"",
-                           "\"\\ud800x\"",
-                           "\"\\/\\b\\f\\n\\r\\t\\\"\\\\\"",
-                           "\"\\q\"",
-                           "\"raw\x01\ttab\xff\"",
-                           "0",
-                           "-0",
-                           "01",
-                           "1.",
-                           ".5",
-                           "-",
-                           "1e5",
-                           "1E+05",
-                           "2e-3",
-                           "9223372036854775807",
-                           "9223372036854775808",
-                           "18446744073709551615",
-                           "18446744073709551616",
-                           "-9223372036854775808",
-                           "-9223372036854775809",
-                           "1e400",
-                           "-1e400",
-                           "1e-400",
-                           "4.9e-324",
-                           "0.1",
-                           "123456789012345678901234567890.5",
-                           "[1,]",
-                           "{\"a\":1,}",
-                           "{\"a\":1 \"b\":2}",
-                           "{\"a\":1}x",
-                           "{\"a\":1}\n",
-                           "// c\n{}",
-                           "{/*c*/}",
-                           "\xef\xbb\xbf{}",
-                           "{\"a\":{\"x\":1},\"a\":{\"y\":2}}",
-                           "tru",
-                           "nul",
-                           "{\"a\"}",
-                           "{1:2}",
-                           "[1 2]",
-                           "",
-                           "   ",
-                           "\"unterminated",
-                           "'single'",
-                           "NaN",
-                           "Infinity",
-                           "-Infinity",
-                           "+1",
-                           "0x10",
-                           "1e",
-                           "1e+",
-                           "[\"a\",]",
-                           "{\"p\":\"caf\xc3\xa9\"}"}) {
+  for (const char* text :
+       {// Strings: escapes, surrogates paired and lone, raw control and non-UTF-8 bytes.
+        "\"\\u00e9\\u0000z\"", "\"\\ud83d\\ude00\"", "\"\\udc00\"", "\"\\ud800x\"",
+        "\"\\/\\b\\f\\n\\r\\t\\\"\\\\\"", "\"\\q\"", "\"raw\x01\ttab\xff\"",
+        "{\"p\":\"caf\xc3\xa9\"}", "'single'", "\"unterminated",
+        // Numbers at the edges of their types and of the grammar.
+        "-0", "01", "1.", ".5", "1E+05", "2e-3", "9223372036854775807", "9223372036854775808",
+        "18446744073709551615", "18446744073709551616", "-9223372036854775808",
+        "-9223372036854775809", "1e400", "-1e400", "1e-400", "4.9e-324", "0.1",
+        "123456789012345678901234567890.5", "NaN", "-Infinity", "+1", "0x10", "1e+",
+        // Structure: trailing commas and text, comments, a byte-order mark, repeated keys.
+        " {\"a\" : [1, -2, 3.5, true, false, null, \"x\"]} ", "[1,]", "{\"a\":1,}",
+        "{\"a\":1 \"b\":2}", "{\"a\":1}x", "{\"a\":1}\n", "// c\n{}", "{/*c*/}", "\xef\xbb\xbf{}",
+        "{\"a\":{\"x\":1},\"a\":{\"y\":2}}", "tru", "{\"a\"}", "{1:2}", "", "   "}) {
     ExpectSameAsLibrary(text);
   }
   // Nesting is bounded: deep texts fail like the library's rather than overflow the stack.
@@ -193,26 +146,19 @@ TEST(JsonUtilTest, ReaderAgreesWithTheLibraryReader) {
   ExpectSameAsLibrary(std::string("{\"a\":1}\0garbage", 15));
 }
 
-TEST(JsonUtilTest, FileRoundTripCreatesParents) {
+// A file-size limit makes the write come up short exactly as a full disk does.
+TEST(JsonUtilTest, FilesRoundTripAndAFullDiskKeepsTheOldFile) {
   test::TempDir dir;
   const std::string path = dir.Path("etc/sub/cfg.json");
-  JsonValue v = Parse(R"({"k":[1,2,3]})");
-  ASSERT_TRUE(v.toFile(path));
+  const JsonValue old = Parse(R"({"k":[1,2,3]})");
+  ASSERT_TRUE(old.toFile(path));  // parents are created
   struct stat st;
   ASSERT_EQ(stat(path.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 0777, 0644u);
   JsonValue back;
-  ASSERT_TRUE(back.fromFile(path));
-  EXPECT_EQ(back, v);
   EXPECT_FALSE(back.fromFile(dir.Path("missing.json")));
   EXPECT_FALSE(back.fromFile(dir.Write("bad.json", "{\"k\":")));
-}
 
-TEST(JsonUtilTest, WriteToFullDiskFailsAndKeepsTheOldFile) {
-  // A file-size limit makes the write come up short exactly as a full disk does.
-  test::TempDir dir;
-  const std::string path = dir.Path("cfg.json");
-  ASSERT_TRUE(Parse(R"({"old":true})").toFile(path));
   pid_t pid = fork();
   if (pid == 0) {
     signal(SIGXFSZ, SIG_IGN);
@@ -225,10 +171,10 @@ TEST(JsonUtilTest, WriteToFullDiskFailsAndKeepsTheOldFile) {
   int status = 0;
   waitpid(pid, &status, 0);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-  JsonValue back;
   ASSERT_TRUE(back.fromFile(path));
-  EXPECT_EQ(back, Parse(R"({"old":true})"));
-  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.path()), {}), 1);  // no temporary
+  EXPECT_EQ(back, old);
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir.Path("etc/sub")), {}),
+            1);  // no temporary
 }
 
 }  // namespace
