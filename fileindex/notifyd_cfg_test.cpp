@@ -32,13 +32,10 @@ TEST_F(NotifydCfgTest, RegistrationHoldsEveryFolderOfTheShare) {
       {"path": ")" + vol_ + R"(/photo/trips", "mask": 65484, "ignore": ["@eaDir"]},
       {"path": ")" + vol_ + R"(/photo/family", "mask": 65484, "ignore": ["@eaDir"]}]})"));
 
-  test::LogCapture log;
   ScopedFaults faults;
   faults.Arm("MonitorQueue::Upsert", Fault{0, EIO}).Arm("MonitorQueue::Delete", Fault{0, EIO});
   EXPECT_EQ(ErrorOf([&] { UpsertQUIXNotifydCfg("photo", folders); }).message,
             "Orvane error, code=502, reason=[MonitorQueue::Upsert failed, share=photo]");
-  EXPECT_TRUE(log.Contains(
-      "Failed [!MonitorQueue::Upsert(monitor_queue, kAppName, MONITOR_QUEUE_TYPE_APPLICATION)]"));
   EXPECT_EQ(ErrorOf([&] { DeleteQUIXNotifydCfg("photo"); }).message,
             "Orvane error, code=502, reason=[MonitorQueue::Delete failed, share=photo]");
   EXPECT_EQ(MonitorQueue::List().size(), 1u);
@@ -89,10 +86,8 @@ TEST_F(NotifydCfgTest, FailedEventFlagsTheShareAndIsThrownOn) {
             1);
 
   // A path in no share: the lookup's error, and no share to flag.
-  e = ErrorOf([&] { AddCustomEvent(0x10000, scratch_.path(), "", Json::Value()); });
-  EXPECT_EQ(e.code, kErrSystem);
-  EXPECT_TRUE(log.Contains("AddCustomEvent failed, code=502, reason=" + e.message +
-                           ". Set [] need reindex"));
+  EXPECT_EQ(ErrorOf([&] { AddCustomEvent(0x10000, scratch_.path(), "", Json::Value()); }).code,
+            kErrSystem);
   EXPECT_EQ(ReadJson(Rooted(kFileIndexStatusCfgPath)), Parse(R"({"share": {"music": 1}})"));
 
   // A share the platform cannot open: flagged by name.
@@ -125,12 +120,7 @@ TEST_F(NotifydCfgTest, ServicesFollowTheFolderFileAndFailuresAreOnlyLogged) {
   SetupRelatedServices(true);
   EXPECT_EQ(Actions(), before);  // no restart of file sharing without the setting changed
   EXPECT_TRUE(log.Contains("(SetupRelatedServices) QUIXSMBSetSpotlight failed: err=[0x0200 "));
-  EXPECT_TRUE(log.Contains("] [err: Permission denied]"));
-  EXPECT_TRUE(log.Contains(
-      "(SetupRelatedServices) Failed [0 > QLIBServiceStart(\"quixcontentextractd\", TRUE)]"));
-  EXPECT_TRUE(
-      log.Contains("Failed [0 > QLIBServicectlStart(\"pkg-Orvane-fileindexd\", "
-                   "QLIB_SERVICECTL_UPSTART)] [err: No such file or directory]"));
+  EXPECT_EQ(log.Count("(SetupRelatedServices) Failed [0 > "), 2);
 }
 
 }  // namespace
