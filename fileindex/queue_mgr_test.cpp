@@ -75,24 +75,18 @@ TEST_F(QueueMgrTest, RenameAndOpenFailuresAre502AndLeaveTheFiles) {
   ASSERT_EQ(chmod(folder.c_str(), 0555), 0);
   ASSERT_EQ(chmod(unreadable.c_str(), 0), 0);
   const int result = test::RunAsUser("nobody", [this] {
+    auto fails = [](const std::function<void()>& fn, const std::string& message) {
+      return !::testing::Value(fn, ::testing::ThrowsMessage<Error>(message));
+    };
     const std::string open_failed =
         "Orvane error, code=502, reason=[Failed to open queue, reason=Permission denied]";
     QueueMgr mgr(queue_);
     QueueMgr other(dir_.Path("other"));
-    using ::testing::ThrowsMessage;
-    if (!::testing::Value([&] { mgr.PrepareTmpQueue(); },
-                          ThrowsMessage<Error>("Orvane error, code=502, reason=[rename failed, "
-                                               "reason=Permission denied]"))) {
-      return 1;
-    }
-    if (!::testing::Value([&] { other.ProcessOP([](std::shared_ptr<OP>) {}, true); },
-                          ThrowsMessage<Error>(open_failed))) {
-      return 2;
-    }
-    return ::testing::Value([&] { other.IsFullPathProcessing("/v/s/a"); },
-                            ThrowsMessage<Error>(open_failed))
-               ? 0
-               : 3;
+    // A bit per failed check.
+    return fails([&] { mgr.PrepareTmpQueue(); },
+                 "Orvane error, code=502, reason=[rename failed, reason=Permission denied]") +
+           2 * fails([&] { other.ProcessOP([](std::shared_ptr<OP>) {}, true); }, open_failed) +
+           4 * fails([&] { other.IsFullPathProcessing("/v/s/a"); }, open_failed);
   });
   chmod(folder.c_str(), 0755);
   EXPECT_EQ(result, 0);
