@@ -90,17 +90,13 @@ TEST_F(CommTest, SuccessfulExchangeReturnsTheWholeReplyAndKeepsEveryByteOfTheReq
   EXPECT_EQ(res["data"][0]["a"].asInt(), 1);
   ASSERT_EQ(engine.json_requests().size(), 1u);
   EXPECT_EQ(engine.json_requests()[0], req);
-  EXPECT_EQ(engine.json_requests()[0]["data"]["doc_id"].asString(), path);
   EXPECT_TRUE(env_.sleeps().empty());
   EXPECT_TRUE(log_.Lines().empty());
 }
 
-// Malformed replies, a daemon that closes without answering or in the middle of a frame, and
-// one that announces an impossible length all end in Error 913 with the text as parsed.
-TEST_F(CommTest, BrokenRepliesAndFramesAreError913) {
-  auto write = [](std::string bytes) -> FakeDaemon::Handler {
-    return [bytes](int fd, const std::string&) { FakeDaemon::WriteAll(fd, bytes); };
-  };
+// Malformed replies and a daemon that closes without answering end in Error 913 with the text
+// as parsed; the ways a frame can break are the socket client's own to tell apart.
+TEST_F(CommTest, BrokenRepliesAreError913) {
   const std::vector<std::pair<FakeDaemon::Handler, std::string>> cases = {
       {FakeDaemon::Replies({"garbage"}), "null"},
       {FakeDaemon::Replies({"[true]"}), "[true]"},
@@ -108,8 +104,6 @@ TEST_F(CommTest, BrokenRepliesAndFramesAreError913) {
       {FakeDaemon::Replies({"{}"}), "{}"},
       {FakeDaemon::Replies({R"({"success":"yes"})"}), R"({"success":"yes"})"},
       {[](int, const std::string&) {}, "null"},
-      {write(std::string("\x40\x00\x00\x00{\"su", 8)), "null"},
-      {write(std::string("\xff\xff\xff\xff{}", 6)), "null"},
   };
   for (const auto& [handler, parsed] : cases) {
     SCOPED_TRACE(parsed);

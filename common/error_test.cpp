@@ -13,16 +13,6 @@ namespace {
 
 using ::testing::MatchesRegex;
 
-TEST(ErrorTest, MessageCarriesCodeAndOptionalReasonVerbatim) {
-  EXPECT_STREQ(Error(kErrSystem).what(), "Orvane error, code=502");
-  EXPECT_STREQ(Error(kErrSystem, "").what(), "Orvane error, code=502");
-  const Error original(kErrMalformedEvent, "bad ] line [x]");
-  const Error copy(original);
-  EXPECT_EQ(copy.code, kErrMalformedEvent);
-  EXPECT_STREQ(copy.what(), "Orvane error, code=906, reason=[bad ] line [x]]");
-  EXPECT_STREQ(static_cast<const std::runtime_error&>(copy).what(), copy.what());
-}
-
 void ThrowWhenNegative(int v) { ORVANE_THROW_IF(0 > v, kErrSystem, "negative"); }
 
 // The throw site logs where, who and why; errno, when set, is named and then cleared.
