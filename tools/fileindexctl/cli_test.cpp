@@ -128,15 +128,11 @@ TEST_F(CtlTest, FolderLifecycleWithHumanAndJsonOutput) {
   EXPECT_TRUE(json["photo"].asBool());
 
   ASSERT_EQ(Run({"folder", "delete", "/docs/reports"}).status, 0);
+  // A failure is one line: what it means, the library's reason, and what to do.
   r = Run({"folder", "get", "/docs/reports"});
   EXPECT_EQ(r.status, 1);
-  EXPECT_THAT(r.err, StartsWith("fileindexctl: the folder is not indexed (error 902)"));
-  EXPECT_THAT(r.err, HasSubstr("\"fileindexctl folder list\" shows indexed folders"));
-  EXPECT_EQ(std::count(r.err.begin(), r.err.end(), '\n'), 1);
-
-  r = Run({"folder", "add", "/nosuchshare/x"});
-  EXPECT_EQ(r.status, 1);
-  EXPECT_THAT(r.err, StartsWith("fileindexctl: "));
+  EXPECT_EQ(r.err, "fileindexctl: the folder is not indexed (error 902): /docs/reports; "
+                   "\"fileindexctl folder list\" shows indexed folders\n");
 }
 
 TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
@@ -160,12 +156,6 @@ TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
   for (const std::string& key : want.getMemberNames()) {
     EXPECT_EQ(req["data"][key], want[key]) << key;
   }
-
-  // No engine at all: one clear line.
-  test::TempDir empty;
-  r = RunCtl(empty.path(), {"search", "x"});
-  EXPECT_EQ(r.status, 1);
-  EXPECT_THAT(r.err, StartsWith("fileindexctl: the search engine cannot be reached (error 913)"));
 }
 
 TEST_F(CtlTest, StatusShowsEachShareFromBothDaemonsOrDashesWithoutThem) {
@@ -223,7 +213,6 @@ TEST(CliTest, ValuesPeopleType) {
   EXPECT_GT(ParseTime("2024-05-06"), 1700000000);
   EXPECT_THROW(ParseTime("yesterday"), UsageError);
   EXPECT_EQ(HumanSize(912), "912 B");
-  EXPECT_EQ(ReasonOf("Orvane error, code=902, reason=[/docs/x]"), "/docs/x");
   EXPECT_EQ(ReasonOf("Orvane error, code=902"), "Orvane error, code=902");
   Args args({"a", "--size", "3", "--desc", "--name=x", "--", "--literal"}, {"desc"});
   EXPECT_EQ(args.positional(), (std::vector<std::string>{"a", "--literal"}));
