@@ -1,7 +1,7 @@
 // The library's own index commands against the real daemon: real files on a configured share,
-// extracted by the library and indexed through the daemon's socket. The document commands are
-// checked by effect through the indexing daemon's worker, which runs them against this daemon,
-// and the rename passes by the library's own real-engine test.
+// extracted by the library and indexed through the daemon's socket. The other document commands
+// are checked by effect through the indexing daemon's worker, which runs them against this
+// daemon.
 #include <sqlite3.h>
 
 #include <gmock/gmock.h>
@@ -107,6 +107,37 @@ TEST_F(LibraryTest, IndexLifecycleSearchAndSuggestions) {
   el::ShareIndexDelete("pics");
   el::ShareIndexDelete("pics");
   EXPECT_THAT([&] { el::IsDocumentExists("pics", a); }, ThrowsCode(kCodeIndexNotFound));
+}
+
+// More documents than one rename pass, and a sibling whose name only begins like the renamed
+// folder's (with a quote and a newline in it, which the wire must carry as they are).
+TEST_F(LibraryTest, RenameMovesEveryDocumentAcrossPasses) {
+  el::ShareIndexCreate("photo");
+  const std::string big = Dirname(Dirname(AddFile("big/s0/real.txt")));
+  el::IndexUpsert("photo", big, false);
+  std::vector<Json::Value> bulk;
+  for (unsigned i = 0; i < el::kRenameBatchSize + 5; ++i) {
+    bulk.push_back(tc::Upsert(volume_.Path("photo/big/s" + std::to_string(i % 3) + "/f") +
+                                  std::to_string(i),
+                              "fileindex_photo"));
+  }
+  ASSERT_EQ(tc::Request(daemon_->socket(), tc::Compound(bulk))["has_fail"], false);
+  const std::string sibling = AddFile("big \"q\"\n.txt");
+  el::IndexRename("photo", volume_.Path("photo/moved"), big);
+  el::IndexCommit("photo");
+  // Counted a sub-folder at a time: one query returns at most a page of the rename's size.
+  auto count = [&](const std::string& prefix) {
+    Json::Value req = tc::OnIndex("document_get_by_query", "fileindex_photo");
+    req["data"]["query"]["qsl"]["prefix"]["QUIXMDPath"] = prefix;
+    req["data"]["query"]["size"] = el::kRenameBatchSize;
+    return tc::Request(daemon_->socket(), req)["data"].size();
+  };
+  EXPECT_EQ(count(big + "/"), 0u);
+  EXPECT_EQ(count(volume_.Path("photo/moved/s0/")) + count(volume_.Path("photo/moved/s1/")) +
+                count(volume_.Path("photo/moved/s2/")),
+            el::kRenameBatchSize + 5 + 1);
+  EXPECT_TRUE(el::IsDocumentExists("photo", volume_.Path("photo/moved/s0/real.txt")));
+  EXPECT_TRUE(el::IsDocumentExists("photo", sibling));
 }
 
 }  // namespace

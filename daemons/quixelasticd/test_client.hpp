@@ -17,8 +17,7 @@ namespace elasticd {
 namespace tc {
 
 // Sends raw bytes to the socket and returns the raw reply payload ("" when the daemon closed
-// the connection without a reply). `as_uid` other than -1 runs the exchange in a child process
-// with that user's identity.
+// the connection without a reply).
 std::string RawExchange(const std::string& socket, const std::string& bytes);
 // One request frame (JSON text + NUL) and its parsed reply; null on a closed connection.
 Json::Value Request(const std::string& socket, const Json::Value& request);

