@@ -31,8 +31,10 @@ class LibraryTest : public ::testing::Test {
  protected:
   LibraryTest() : root_(dir_.path()) {
     test::WritePlatformConfig(dir_.path(), R"({"shares": [
-      {"name": "photo", "path": ")" + volume_.Path("photo") + R"("},
-      {"name": "pics", "path": ")" + volume_.Path("pics") + R"("}]})");
+      {"name": "photo", "path": ")" + volume_.Path("photo") +
+                                               R"("},
+      {"name": "pics", "path": ")" + volume_.Path("pics") +
+                                               R"("}]})");
   }
   void SetUp() override {
     daemon_ = std::make_unique<tc::DaemonProcess>(dir_.path());
@@ -109,17 +111,18 @@ TEST_F(LibraryTest, IndexLifecycleSearchAndSuggestions) {
   EXPECT_THAT([&] { el::IsDocumentExists("pics", a); }, ThrowsCode(kCodeIndexNotFound));
 }
 
-// More documents than one rename pass, and a sibling whose name only begins like the renamed
-// folder's (with a quote and a newline in it, which the wire must carry as they are).
-TEST_F(LibraryTest, RenameMovesEveryDocumentAcrossPasses) {
+// More documents than one rename pass (then all of them emptied out), and a sibling whose name only
+// begins like the renamed folder's (with a quote and a newline in it, which the wire must carry as
+// they are).
+TEST_F(LibraryTest, RenameAndEmptyingAFolderReachEveryDocumentBelowIt) {
   el::ShareIndexCreate("photo");
   const std::string big = Dirname(Dirname(AddFile("big/s0/real.txt")));
   el::IndexUpsert("photo", big, false);
   std::vector<Json::Value> bulk;
   for (unsigned i = 0; i < el::kRenameBatchSize + 5; ++i) {
-    bulk.push_back(tc::Upsert(volume_.Path("photo/big/s" + std::to_string(i % 3) + "/f") +
-                                  std::to_string(i),
-                              "fileindex_photo"));
+    bulk.push_back(
+        tc::Upsert(volume_.Path("photo/big/s" + std::to_string(i % 3) + "/f") + std::to_string(i),
+                   "fileindex_photo"));
   }
   ASSERT_EQ(tc::Request(daemon_->socket(), tc::Compound(bulk))["has_fail"], false);
   const std::string sibling = AddFile("big \"q\"\n.txt");
@@ -138,6 +141,14 @@ TEST_F(LibraryTest, RenameMovesEveryDocumentAcrossPasses) {
             el::kRenameBatchSize + 5 + 1);
   EXPECT_TRUE(el::IsDocumentExists("photo", volume_.Path("photo/moved/s0/real.txt")));
   EXPECT_TRUE(el::IsDocumentExists("photo", sibling));
+
+  // Emptying the folder keeps its own document and a file whose name begins like it.
+  const std::string neighbour = AddFile("moved.txt");
+  el::IndexDelDir("photo", volume_.Path("photo/moved"));
+  el::IndexCommit("photo");
+  EXPECT_EQ(count(volume_.Path("photo/moved/")), 0u);
+  EXPECT_TRUE(el::IsDocumentExists("photo", volume_.Path("photo/moved")));
+  EXPECT_TRUE(el::IsDocumentExists("photo", neighbour));
 }
 
 }  // namespace
