@@ -243,17 +243,7 @@ class AdminOpsTest : public AdminTestEnv {
   static constexpr const char* kAll = R"({"audio":true,"document":true,"photo":true,"video":true})";
 };
 
-// The Error that `fn` throws, or a test failure.
-template <typename Fn>
-Error ErrorOf(Fn fn) {
-  try {
-    fn();
-  } catch (const Error& e) {
-    return e;
-  }
-  ADD_FAILURE() << "no Error thrown";
-  return Error(kErrInvalidParam);
-}
+using test::ErrorOf;
 
 }  // namespace testenv
 }  // namespace fileindex

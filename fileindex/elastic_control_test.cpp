@@ -42,10 +42,7 @@ Json::Value Fail(int code) {
   return res;
 }
 
-// Matches a call that throws an Error of `code`.
-auto ThrowsCode(int code) {
-  return ::testing::Throws<Error>(::testing::Field(&Error::code, static_cast<ErrorCode>(code)));
-}
+using test::ThrowsCode;
 
 // A scripted search engine on the real socket path: `answer` maps each parsed request to its
 // reply.

@@ -29,10 +29,7 @@ std::vector<std::string> Paths(QueueMgr& mgr, bool tmp, size_t* count = nullptr)
   return out;
 }
 
-// Matches a call that throws an Error of `code`.
-auto ThrowsCode(int code) {
-  return ::testing::Throws<Error>(::testing::Field(&Error::code, static_cast<ErrorCode>(code)));
-}
+using test::ThrowsCode;
 
 class QueueMgrTest : public ::testing::Test {
  protected:

@@ -21,10 +21,7 @@ using platform::Fault;
 using platform::ScopedFaults;
 using ::testing::ThrowsMessage;
 
-// Matches a call that throws an Error of `code`.
-auto ThrowsCode(int code) {
-  return ::testing::Throws<Error>(::testing::Field(&Error::code, static_cast<ErrorCode>(code)));
-}
+using test::ThrowsCode;
 
 TEST(PathPiecesTest, ShareNamesShareRenamesAndPreservedNames) {
   EXPECT_EQ(GetShareNameByPath("/music"), "music");

@@ -10,7 +10,10 @@
 #include <string>
 #include <vector>
 
+#include <gmock/gmock.h>
+
 #include "common/env.hpp"
+#include "common/error.hpp"
 #include "common/log.hpp"
 
 namespace orvane {
@@ -106,6 +109,23 @@ class ScopedRoot {
   bool had_;
   std::string old_;
 };
+
+// The Error that `fn` throws; a test failure (and a placeholder Error) when it throws none.
+template <typename Fn>
+Error ErrorOf(Fn fn) {
+  try {
+    fn();
+  } catch (const Error& e) {
+    return e;
+  }
+  ADD_FAILURE() << "no Error thrown";
+  return Error(kErrInvalidParam);
+}
+
+// Matches a call that throws an Error of `code`.
+inline auto ThrowsCode(int code) {
+  return ::testing::Throws<Error>(::testing::Field(&Error::code, static_cast<ErrorCode>(code)));
+}
 
 }  // namespace test
 }  // namespace orvane

@@ -23,9 +23,7 @@ namespace {
 namespace el = ::orvane::fileindex::elastic;
 using ::testing::ElementsAre;
 
-auto ThrowsCode(int code) {
-  return ::testing::Throws<Error>(::testing::Field(&Error::code, static_cast<ErrorCode>(code)));
-}
+using test::ThrowsCode;
 
 class LibraryTest : public ::testing::Test {
  protected:
