@@ -139,10 +139,10 @@ TEST_F(IndexRulesTest, EachRuleRefusesItsPaths) {
   }
 
   // A path in no share, or in a share that vanished from the configuration, is an error.
-  EXPECT_THAT([&] { CanFullPathBeIndexed(vol_); },
-              ThrowsMessage<Error>(
-                  "Orvane error, code=502, reason=[QUIXShareNamePathGet failed, full_path=" + vol_ +
-                  "]"));
+  EXPECT_THAT(
+      [&] { CanFullPathBeIndexed(vol_); },
+      ThrowsMessage<Error>(
+          "Orvane error, code=502, reason=[QUIXShareNamePathGet failed, full_path=" + vol_ + "]"));
   EXPECT_THAT([] { CanPathBeIndexed("/gone/x"); }, ThrowsCode(kErrShareGet));
   // With the recycle bin switched off, "#recycle" is an ordinary folder.
   test::WritePlatformConfig(root_.path(), R"({"shares": [
