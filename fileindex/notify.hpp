@@ -4,6 +4,8 @@
 #ifndef ORVANE_FILEINDEX_NOTIFY_HPP_
 #define ORVANE_FILEINDEX_NOTIFY_HPP_
 
+#include <string>
+
 namespace orvane {
 namespace fileindex {
 
@@ -11,6 +13,9 @@ namespace fileindex {
 void SendZRMNotify();
 // The search engine lacks memory (it keeps answering that it is busy).
 void NotifyLackOfMemory();
+// The inotify watch limit leaves directories below `folder` unwatched: fs.inotify.max_user_watches
+// must be raised to `needed` (-1 when not known).
+void NotifyWatchLimit(const std::string& folder, long long needed);
 
 }  // namespace fileindex
 }  // namespace orvane

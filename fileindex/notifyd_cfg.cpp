@@ -66,6 +66,12 @@ struct QueueBatch {
   std::string lines;
 };
 
+// A re-index that only asks for the differences between a folder and its index. It does not
+// stand in for a plain re-index, which reads every file again.
+bool IsReconcile(uint32_t event, const Json::Value& data) {
+  return event == kEventReindex && data.isObject() && data["reconcile"].asBool();
+}
+
 // Reads the plain re-index paths of one queue file; malformed lines fail as they would for the
 // queue's own questions.
 void CollectReindexes(const std::string& path, std::unordered_set<std::string>& out) {
@@ -79,7 +85,9 @@ void CollectReindexes(const std::string& path, std::unordered_set<std::string>& 
       throw Error(kErrMalformedEvent, "Event line too long: " + line.substr(0, 256) + "...");
     }
     Event event(line);
-    if (event.event == kEventReindex) out.insert(event.path);
+    if (event.event == kEventReindex && !IsReconcile(event.event, event.data)) {
+      out.insert(event.path);
+    }
   }
 }
 
@@ -175,8 +183,13 @@ void AddCustomEvents(const std::vector<CustomEvent>& events) {
       line["path"] = custom.path;
       line["path_old"] = custom.path_old;
       line["data"] = custom.data;
+      const auto bits = static_cast<uint32_t>(custom.event);
+      // A reconciliation is always of a folder.
+      if (IsReconcile(bits, custom.data)) line["is_dir"] = true;
       batch.lines += JsonToString(line) + "\n";
-      if (static_cast<uint32_t>(custom.event) == kEventReindex) batch.reindexed.insert(custom.path);
+      if (bits == kEventReindex && !IsReconcile(bits, custom.data)) {
+        batch.reindexed.insert(custom.path);
+      }
     } catch (const Error& e) {
       // What was gathered before the failure is still written.
       try {

@@ -73,6 +73,22 @@ TEST_F(NotifydCfgTest, EventsAreWrittenPerShareUnlessAQueuedReindexCoversThem) {
   EXPECT_EQ(Events("music"), (Strings{"131072 /music/live 2", "131072 /music/a"}));
 }
 
+// A reconciliation only sends the differences: a plain re-index asked after it, and what lies
+// below it, must still be written.
+TEST_F(NotifydCfgTest, AQueuedReconciliationStandsInForNoReindex) {
+  StatusMgr::CreateIfMissing();
+  const std::string trips = vol_ + "/photo/trips";
+  Json::Value reconcile(Json::objectValue);
+  reconcile["reconcile"] = true;
+  AddCustomEvents({{0x10000, trips, "", reconcile}, {0x20000, trips + "/a", "", Json::Value(1)}});
+  AddCustomEvent(0x10000, trips, "", Json::Value());
+  AddCustomEvent(0x20000, trips + "/b", "", Json::Value(2));
+  EXPECT_EQ(Events("photo"),
+            (Strings{R"(65536 /photo/trips {"reconcile":true})", "131072 /photo/trips/a 1",
+                     "65536 /photo/trips"}));
+  EXPECT_TRUE(QueueLines("photo")[0]["is_dir"].asBool());
+}
+
 TEST_F(NotifydCfgTest, FailedEventFlagsTheShareAndIsThrownOn) {
   StatusMgr::CreateIfMissing();
   // A folder in the queue's place cannot be opened for appending.

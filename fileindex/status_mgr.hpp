@@ -18,6 +18,12 @@ extern const char kStatusCfgLockPath[];
 
 // Share flag: the share's index must be rebuilt.
 constexpr int kShareStatusNeedReindex = 1;
+// Share flag: the share's queue cannot be written for lack of space on its volume; changes are
+// no longer queued one by one and the share's folders are reconciled once it can be written.
+constexpr int kShareStatusQueueNoSpace = 4;
+// Share flag: the inotify watch limit leaves directories of a folder of the share unwatched;
+// the folder is reconciled periodically until every directory is watched.
+constexpr int kShareStatusWatchLimit = 8;
 
 class StatusMgr {
  public:

@@ -13,6 +13,8 @@
 #include "daemons/fileindexd/server.hpp"
 #include "fileindex/folder.hpp"
 #include "fileindex/folder_mgr.hpp"
+#include "fileindex/notifyd_cfg.hpp"
+#include "fileindex/optree.hpp"
 #include "fileindex/status_mgr.hpp"
 
 namespace orvane {
@@ -132,6 +134,24 @@ void IndexDaemon::StopAll() {
   // Ask all first, so their operations end together rather than one after another.
   for (auto& [share, worker] : workers) worker->RequestStop();
   workers.clear();
+}
+
+void IndexDaemon::ReconcileAll() {
+  try {
+    fileindex::FolderMgr folders;
+    Json::Value reconcile(Json::objectValue);
+    reconcile["reconcile"] = true;
+    std::vector<fileindex::CustomEvent> events;
+    for (const auto& folder : folders.folders()) {
+      events.push_back({static_cast<int>(fileindex::kEventReindex), folder->GetFullPath(), "",
+                        reconcile});
+    }
+    fileindex::AddCustomEvents(events);
+    Log(LOG_INFO, "fileindexd: reconciliation of %zu folders queued", events.size());
+  } catch (const Error& e) {
+    Log(LOG_ERR, "fileindexd: cannot queue the reconciliation of the indexed folders: %s",
+        e.what());
+  }
 }
 
 bool IndexDaemon::IsPaused() const {

@@ -40,6 +40,10 @@ class IndexDaemon {
   // refused (103) to anyone but root and the daemon's own user.
   Json::Value Handle(const Json::Value& command, uid_t peer_uid);
 
+  // Queues a reconciliation of every indexed folder of every share, for a start after an
+  // unclean stop. Failures are logged (and the share flagged for re-index), never thrown.
+  static void ReconcileAll();
+
   bool IsPaused() const;
   std::set<std::string> running_shares() const;
 

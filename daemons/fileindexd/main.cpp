@@ -5,10 +5,12 @@
 //
 // Runs in the foreground (a service manager puts it in the background), logs to syslog and to
 // standard error, re-reads the folder configuration on SIGHUP, stops cleanly on SIGTERM or
-// SIGINT. Fixed paths follow ORVANE_ROOT.
+// SIGINT. A start that finds the pid file of a run that did not stop cleanly queues a
+// reconciliation of every indexed folder. Fixed paths follow ORVANE_ROOT.
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/file.h>
+#include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -47,6 +49,10 @@ int main(int argc, char** argv) {
   signal(SIGPIPE, SIG_IGN);
 
   const std::string pid_path = orvane::RootedPathForWrite(pid_file);
+  // Every clean stop removes the pid file: one with a pid in it is left by a run that was
+  // killed or crashed. Judged once the lock is held, so a daemon still running does not count.
+  struct stat pid_stat;
+  const bool unclean = stat(pid_path.c_str(), &pid_stat) == 0 && pid_stat.st_size > 0;
   orvane::UniqueFd pid_fd(open(pid_path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
   if (!pid_fd.valid() || flock(pid_fd.get(), LOCK_EX | LOCK_NB) != 0) {
     orvane::Log(LOG_ERR, "fileindexd: %s is locked or cannot be opened: another daemon runs?",
@@ -67,6 +73,13 @@ int main(int argc, char** argv) {
     orvane::fileindexd::CommandServer server(
         orvane::RootedPath(orvane::fileindexd::kFileIndexdSockPath),
         [&daemon](const Json::Value& command, uid_t uid) { return daemon.Handle(command, uid); });
+    if (unclean) {
+      orvane::Log(LOG_WARNING,
+                  "fileindexd: %s was left behind, the last run did not stop cleanly: every "
+                  "indexed folder is reconciled",
+                  pid_path.c_str());
+      orvane::fileindexd::IndexDaemon::ReconcileAll();
+    }
     // Workers first, so that whoever reaches the socket sees them.
     daemon.Start();
     server.Start();

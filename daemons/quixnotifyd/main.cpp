@@ -1,7 +1,9 @@
 // quixnotifyd: the file-change daemon. It appends one event line per change below every
-// registered folder to that registration's queue file.
+// registered folder to that registration's queue file, and a reconcile line for every folder
+// when it starts (what changed while nobody watched), when the kernel lost events, and, for a
+// folder the inotify watch limit leaves partly unwatched, every --limit-retry seconds (300).
 //
-//   quixnotifyd [--pid-file PATH]
+//   quixnotifyd [--pid-file PATH] [--limit-retry SECONDS]
 //
 // Runs in the foreground (a service manager puts it in the background), logs to syslog and to
 // standard error, re-reads the registrations on SIGHUP or when they change, stops on SIGTERM or
@@ -12,6 +14,7 @@
 
 #include <atomic>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <string>
@@ -31,11 +34,16 @@ void OnStop(int) { g_stop.store(true); }
 
 int main(int argc, char** argv) {
   std::string pid_file = "/var/run/quixnotifyd.pid";
+  orvane::quixnotifyd::WatcherOptions options;
   for (int i = 1; i < argc; ++i) {
+    char* end = nullptr;
     if (std::strcmp(argv[i], "--pid-file") == 0 && i + 1 < argc) {
       pid_file = argv[++i];
+    } else if (std::strcmp(argv[i], "--limit-retry") == 0 && i + 1 < argc &&
+               std::strtol(argv[i + 1], &end, 10) > 0 && *end == '\0') {
+      options.limit_retry_micros = std::strtol(argv[++i], nullptr, 10) * 1000000LL;
     } else {
-      std::fprintf(stderr, "usage: quixnotifyd [--pid-file PATH]\n");
+      std::fprintf(stderr, "usage: quixnotifyd [--pid-file PATH] [--limit-retry SECONDS]\n");
       return 2;
     }
   }
@@ -55,7 +63,10 @@ int main(int argc, char** argv) {
   sigaction(SIGHUP, &hup, nullptr);
 
   try {
-    orvane::quixnotifyd::Watcher watcher;
+    orvane::quixnotifyd::Watcher watcher(options);
+    // Whatever changed while no watcher ran (a stop, a crash, a reboot) is found by comparing
+    // every folder with its index; the watches are in place first.
+    watcher.ReconcileAll();
     const std::string pid_path = orvane::RootedPathForWrite(pid_file);
     std::ofstream(pid_path, std::ios::trunc) << getpid() << "\n";
     while (!g_stop.load()) {

@@ -9,13 +9,19 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <fstream>
 
+#include "common/env.hpp"
 #include "common/error.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
+#include "fileindex/notify.hpp"
 #include "fileindex/queue_file.hpp"
+#include "fileindex/status_mgr.hpp"
+#include "fileindex/util.hpp"
+#include "platform/fault.hpp"
 #include "platform/monitor_queue.hpp"
 
 namespace orvane {
@@ -33,9 +39,49 @@ constexpr uint32_t kDirEvents = IN_ATTRIB | IN_CLOSE_WRITE | IN_CREATE | IN_DELE
 // of the watched folders. The kernel queues both halves together, so this is rarely needed.
 constexpr int kMovePairMillis = 20;
 
+constexpr char kMaxWatchesPath[] = "/proc/sys/fs/inotify/max_user_watches";
+
+// Through the fault seam, so that tests can run out of watches without touching the machine's
+// limit.
+int AddWatch(int fd, const std::string& path, uint32_t mask) {
+  if (auto fault = platform::FaultFor("inotify_add_watch")) {
+    errno = fault->err;
+    return fault->result;
+  }
+  return inotify_add_watch(fd, path.c_str(), mask);
+}
+
+std::string ReconcileLine(const std::string& folder) {
+  Json::Value line(Json::objectValue);
+  line["event"] = kReindex;
+  line["path"] = folder;
+  line["is_dir"] = true;
+  line["data"]["reconcile"] = true;
+  return JsonToString(line) + "\n";
+}
+
+// The share holding `path`; "" when the platform does not know it.
+std::string ShareOf(const std::string& path) {
+  try {
+    std::string share;
+    std::string share_path;
+    fileindex::GetShareNamePathByFullPath(share, share_path, path);
+    return share;
+  } catch (const Error&) {
+    return "";
+  }
+}
+
+long long MaxUserWatches() {
+  long long limit = -1;
+  std::ifstream(kMaxWatchesPath) >> limit;
+  return limit;
+}
+
 }  // namespace
 
-Watcher::Watcher() : fd_(inotify_init1(IN_NONBLOCK | IN_CLOEXEC)) {
+Watcher::Watcher(const WatcherOptions& options)
+    : options_(options), fd_(inotify_init1(IN_NONBLOCK | IN_CLOEXEC)) {
   ORVANE_THROW_IF(!fd_.valid(), kErrSystem,
                   std::string("inotify_init1 failed, reason=") + std::strerror(errno));
   const std::string registry = RootedPath(QUIX::QUIXNOTIFYD::kRegistrationDir);
@@ -44,11 +90,13 @@ Watcher::Watcher() : fd_(inotify_init1(IN_NONBLOCK | IN_CLOEXEC)) {
                                    IN_CLOSE_WRITE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE);
   ORVANE_THROW_IF(registry_wd_ < 0, kErrSystem,
                   "cannot watch " + registry + ", reason=" + std::strerror(errno));
+  ClearStaleFlags();
   Reload();
 }
 
 void Watcher::Reload() {
   reload_ = false;
+  unwatched_.clear();
   for (const auto& [wd, dir] : dirs_) inotify_rm_watch(fd_.get(), wd);
   dirs_.clear();
   moves_.clear();
@@ -69,6 +117,31 @@ void Watcher::Reload() {
   for (size_t i = 0; i < targets_.size(); ++i) WatchTree(targets_[i].root, {i}, true);
   Log(LOG_INFO, "%s:%d watching %zu folders of %zu registrations in %zu directories",
       SourceName(__FILE__), __LINE__, targets_.size(), records.size(), dirs_.size());
+  UpdateLimitMarks();
+}
+
+void Watcher::ReconcileAll() {
+  for (size_t t = 0; t < targets_.size(); ++t) EmitReconcile(t);
+}
+
+std::set<std::string> Watcher::limited_folders() const { return limited_; }
+
+void Watcher::ClearStaleFlags() {
+  // Only this daemon sets these flags, so every one found is a former run's.
+  const unsigned int ours = fileindex::kShareStatusQueueNoSpace | fileindex::kShareStatusWatchLimit;
+  try {
+    fileindex::StatusMgr status;
+    const Json::Value& flags = status.data()["share"];
+    if (!flags.isObject()) return;
+    for (const std::string& share : flags.getMemberNames()) {
+      if (flags[share].isUInt() && (flags[share].asUInt() & ours) != 0) {
+        fileindex::StatusMgr().UnsetShareStatus(share, static_cast<int>(ours));
+      }
+    }
+  } catch (const Error& e) {
+    Log(LOG_ERR, "%s:%d cannot clear the flags of a former run in the status file: %s",
+        SourceName(__FILE__), __LINE__, e.what());
+  }
 }
 
 void Watcher::WatchTree(const std::string& root, const std::vector<size_t>& targets, bool is_root) {
@@ -76,23 +149,28 @@ void Watcher::WatchTree(const std::string& root, const std::vector<size_t>& targ
   while (!stack.empty()) {
     const std::string path = std::move(stack.back());
     stack.pop_back();
-    const int wd = inotify_add_watch(fd_.get(), path.c_str(), watch_mask_);
-    if (wd < 0) {
-      // A folder that vanished meanwhile is reported by its parent; a full watch table is not,
-      // and needs the administrator (fs.inotify.max_user_watches).
+    const int wd = AddWatch(fd_.get(), path, watch_mask_);
+    if (wd < 0 && errno == ENOSPC) {
+      // Out of watches: the folder is reconciled periodically instead. The walk goes on below,
+      // so that the administrator is told how many watches are missing.
+      for (size_t t : targets) ++unwatched_[targets_[t].root];
+      errno = 0;
+    } else if (wd < 0) {
+      // A folder that vanished meanwhile is reported by its parent.
       if (errno != ENOENT && errno != ENOTDIR) {
         Log(LOG_ERR, "%s:%d cannot watch %s [err: %m]", SourceName(__FILE__), __LINE__,
             path.c_str());
       }
       errno = 0;
       continue;
-    }
-    Dir& dir = dirs_[wd];
-    dir.path = path;
-    dir.is_root = dir.is_root || (is_root && path == root);
-    for (size_t t : targets) {
-      if (std::find(dir.targets.begin(), dir.targets.end(), t) == dir.targets.end()) {
-        dir.targets.push_back(t);
+    } else {
+      Dir& dir = dirs_[wd];
+      dir.path = path;
+      dir.is_root = dir.is_root || (is_root && path == root);
+      for (size_t t : targets) {
+        if (std::find(dir.targets.begin(), dir.targets.end(), t) == dir.targets.end()) {
+          dir.targets.push_back(t);
+        }
       }
     }
     DIR* d = opendir(path.c_str());
@@ -125,6 +203,110 @@ void Watcher::UnwatchTree(const std::string& path) {
   }
 }
 
+std::vector<size_t> Watcher::TargetsOf(const std::string& root) const {
+  std::vector<size_t> found;
+  for (size_t t = 0; t < targets_.size(); ++t) {
+    if (targets_[t].root == root) found.push_back(t);
+  }
+  return found;
+}
+
+void Watcher::EmitReconcile(size_t t) {
+  const Target& target = targets_[t];
+  // A queue on a full volume already holds the reconciliation of all its folders.
+  if (no_space_.count(target.queue) != 0) return;
+  pending_[target.queue] += ReconcileLine(target.root);
+}
+
+std::string Watcher::ReconcileLines(const std::string& queue) const {
+  std::string lines;
+  std::set<std::string> seen;
+  for (const Target& target : targets_) {
+    if (target.queue == queue && seen.insert(target.root).second) {
+      lines += ReconcileLine(target.root);
+    }
+  }
+  return lines;
+}
+
+void Watcher::FlagShare(const std::string& path, int bits, bool set) {
+  const std::string share = ShareOf(path);
+  try {
+    ORVANE_THROW_IF(share.empty(), kErrInvalidParam, "no share holds " + path);
+    // The watcher may be the first to flag anything on a new system.
+    fileindex::StatusMgr::CreateIfMissing();
+    fileindex::StatusMgr status;
+    if (set) {
+      status.SetShareStatus(share, bits);
+    } else {
+      status.UnsetShareStatus(share, bits);
+    }
+  } catch (const Error& e) {
+    Log(LOG_ERR, "%s:%d cannot record the state of share %s in the status file: %s",
+        SourceName(__FILE__), __LINE__, share.c_str(), e.what());
+  }
+}
+
+void Watcher::UpdateLimitMarks() {
+  const bool none_before = limited_.empty();
+  size_t missing = 0;
+  std::vector<std::string> marked;
+  for (const auto& [root, count] : unwatched_) {
+    if (count == 0) continue;
+    missing += count;
+    if (limited_.insert(root).second) marked.push_back(root);
+  }
+  std::vector<std::string> unmarked;
+  for (auto it = limited_.begin(); it != limited_.end();) {
+    auto found = unwatched_.find(*it);
+    if (found != unwatched_.end() && found->second > 0) {
+      ++it;
+      continue;
+    }
+    unmarked.push_back(*it);
+    it = limited_.erase(it);
+  }
+  for (const std::string& root : unmarked) {
+    Log(LOG_INFO, "%s:%d every directory below %s is watched again: its periodic reconciliation ends",
+        SourceName(__FILE__), __LINE__, root.c_str());
+    const std::string share = ShareOf(root);
+    // The share keeps its mark while another of its folders is still short of watches.
+    if (std::none_of(limited_.begin(), limited_.end(),
+                     [&](const std::string& r) { return ShareOf(r) == share; })) {
+      FlagShare(root, fileindex::kShareStatusWatchLimit, false);
+    }
+  }
+  if (marked.empty()) return;
+  if (none_before) next_limit_retry_ = Env::Current()->NowMicros() + options_.limit_retry_micros;
+  const long long limit = MaxUserWatches();
+  const long long needed = limit > 0 ? limit + static_cast<long long>(missing) : -1;
+  for (const std::string& root : marked) {
+    Log(LOG_ERR,
+        "%s:%d %zu directories below %s are not watched: the inotify watch limit is reached. "
+        "Raise fs.inotify.max_user_watches (now %lld) to at least %lld, e.g. in "
+        "/etc/sysctl.d/ and with sysctl -w; until then the folder is reconciled every %lld s",
+        SourceName(__FILE__), __LINE__, unwatched_[root], root.c_str(), limit, needed,
+        static_cast<long long>(options_.limit_retry_micros / 1000000));
+    FlagShare(root, fileindex::kShareStatusWatchLimit, true);
+  }
+  // One notification for the folders found short together, not one per folder.
+  fileindex::NotifyWatchLimit(marked.front(), needed);
+}
+
+void Watcher::CheckWatchLimit() {
+  if (!limited_.empty() && Env::Current()->NowMicros() >= next_limit_retry_) {
+    next_limit_retry_ = Env::Current()->NowMicros() + options_.limit_retry_micros;
+    for (const std::string& root : std::set<std::string>(limited_)) {
+      // Watches first, so that the reconciliation reads the disk after the changes it misses.
+      unwatched_[root] = 0;
+      const std::vector<size_t> targets = TargetsOf(root);
+      WatchTree(root, targets, true);
+      for (size_t t : targets) EmitReconcile(t);
+    }
+  }
+  UpdateLimitMarks();
+}
+
 bool Watcher::Ignored(const std::vector<size_t>& targets, const std::string& name) const {
   for (size_t t : targets) {
     const auto& ignore = targets_[t].ignore;
@@ -138,7 +320,8 @@ void Watcher::Emit(const std::vector<size_t>& targets, uint32_t bits, const std:
   std::vector<const std::string*> written;
   for (size_t t : targets) {
     const Target& target = targets_[t];
-    if ((target.mask & bits) == 0) continue;
+    // A queue on a full volume gets one reconciliation instead of its lines.
+    if ((target.mask & bits) == 0 || no_space_.count(target.queue) != 0) continue;
     // Nested folders of one registration share its queue: one line per queue.
     if (std::any_of(written.begin(), written.end(),
                     [&](const std::string* q) { return *q == target.queue; })) {
@@ -153,11 +336,10 @@ void Watcher::Emit(const std::vector<size_t>& targets, uint32_t bits, const std:
     std::string& pending = pending_[target.queue];
     pending += JsonToString(line) + "\n";
     if (pending.size() > kMaxPendingBytes) {
-      Json::Value overflow(Json::objectValue);
-      overflow["event"] = kOverflow;
-      overflow["path"] = target.root;
-      pending = JsonToString(overflow) + "\n";
-      Log(LOG_ERR, "%s:%d queue %s cannot be written: too many changes held, marked overflowed",
+      pending = ReconcileLines(target.queue);
+      Log(LOG_ERR,
+          "%s:%d queue %s cannot be written: too many changes held, dropped for a "
+          "reconciliation of its folders",
           SourceName(__FILE__), __LINE__, target.queue.c_str());
     }
   }
@@ -165,8 +347,10 @@ void Watcher::Emit(const std::vector<size_t>& targets, uint32_t bits, const std:
 
 void Watcher::Handle(const struct inotify_event& event) {
   if (event.mask & IN_Q_OVERFLOW) {
-    // Changes were lost: every queue must be re-indexed whole.
-    for (size_t t = 0; t < targets_.size(); ++t) Emit({t}, kOverflow, targets_[t].root, "", true);
+    // Changes were lost and nothing says where: every folder is compared with its index.
+    Log(LOG_WARNING, "%s:%d the kernel's event queue overflowed: every folder is reconciled",
+        SourceName(__FILE__), __LINE__);
+    ReconcileAll();
     return;
   }
   if (event.wd == registry_wd_) {
@@ -254,13 +438,33 @@ void Watcher::FinishMoves() {
 
 void Watcher::Flush() {
   for (auto it = pending_.begin(); it != pending_.end();) {
-    if (it->second.empty() || fileindex::QueueFileAppend(it->first, it->second)) {
+    const std::string& queue = it->first;
+    if (it->second.empty() || fileindex::QueueFileAppend(queue, it->second)) {
+      if (no_space_.erase(queue) != 0) {
+        Log(LOG_INFO, "%s:%d queue %s can be written again: its folders are reconciled",
+            SourceName(__FILE__), __LINE__, queue.c_str());
+        FlagShare(queue, fileindex::kShareStatusQueueNoSpace, false);
+      }
       it = pending_.erase(it);
       continue;
     }
-    // Kept and tried again on the next pass; Emit() bounds what is kept.
-    Log(LOG_ERR, "%s:%d cannot append to queue %s [err: %m]", SourceName(__FILE__), __LINE__,
-        it->first.c_str());
+    if (errno == ENOSPC || errno == EDQUOT) {
+      // However long the volume stays full, one reconciliation written once there is room finds
+      // every change again; holding the lines meanwhile would only fill memory.
+      if (no_space_.insert(queue).second) {
+        Log(LOG_ERR,
+            "%s:%d cannot append to queue %s [err: %m]: its changes are no longer queued and "
+            "its folders will be reconciled once it can be written; free space on its volume",
+            SourceName(__FILE__), __LINE__, queue.c_str());
+        FlagShare(queue, fileindex::kShareStatusQueueNoSpace, true);
+        fileindex::SendZRMNotify();
+      }
+      it->second = ReconcileLines(queue);
+    } else {
+      // Kept and tried again on the next pass; Emit() bounds what is kept.
+      Log(LOG_ERR, "%s:%d cannot append to queue %s [err: %m]", SourceName(__FILE__), __LINE__,
+          queue.c_str());
+    }
     errno = 0;
     ++it;
   }
@@ -269,6 +473,7 @@ void Watcher::Flush() {
 bool Watcher::RunOnce(int timeout_ms) {
   alignas(struct inotify_event) char buf[64 * 1024];
   struct pollfd pfd = {fd_.get(), POLLIN, 0};
+  // Lines held for a queue that cannot be written are tried again every second.
   int wait = pending_.empty() ? timeout_ms : std::min(timeout_ms, 1000);
   for (;;) {
     const int ready = poll(&pfd, 1, wait);
@@ -286,6 +491,7 @@ bool Watcher::RunOnce(int timeout_ms) {
     wait = kMovePairMillis;
   }
   FinishMoves();
+  CheckWatchLimit();
   Flush();
   if (reload_) Reload();
   return true;

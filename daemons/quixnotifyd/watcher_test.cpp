@@ -3,11 +3,14 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <fcntl.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cstdlib>
 #include <fstream>
 #include <sstream>
 
@@ -15,6 +18,8 @@
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "fileindex/optree.hpp"
+#include "fileindex/status_mgr.hpp"
+#include "platform/fault.hpp"
 #include "platform/monitor_queue.hpp"
 #include "test/test_util.hpp"
 
@@ -26,7 +31,8 @@ using QUIX::QUIXNOTIFYD::MONITOR_QUEUE_TYPE_APPLICATION;
 using QUIX::QUIXNOTIFYD::MonitorQueue;
 using ::testing::ElementsAre;
 
-// "bits path" or "bits old -> new" per queue line, paths relative to the share.
+// "bits path" or "bits old -> new" per queue line, paths relative to the share, with
+// " reconcile" for a reconciliation.
 std::vector<std::string> QueueLines(const std::string& queue, const std::string& share) {
   std::vector<std::string> out;
   std::istringstream in(test::ReadFile(queue));
@@ -39,6 +45,7 @@ std::vector<std::string> QueueLines(const std::string& queue, const std::string&
     s << std::hex << e.event << std::dec << (e.is_dir ? " dir " : " ");
     if (!e.path_old.empty()) s << rel(e.path_old) << " -> ";
     s << rel(e.path);
+    if (e.data.isObject() && e.data["reconcile"].asBool()) s << " reconcile";
     out.push_back(s.str());
   }
   return out;
@@ -64,7 +71,15 @@ class WatcherTest : public ::testing::Test {
     for (const char* rel : {"", "/docs", "/other"}) Mkdir(rel);
     ASSERT_TRUE(MonitorQueue::Upsert(Record(queue_, {share_ + "/docs"}), "fileindex",
                                      MONITOR_QUEUE_TYPE_APPLICATION));
+    // The share, for the flags in the status file, and a notifier that records its calls.
+    test::WritePlatformConfig(dir_.path(),
+                              R"({"shares": [{"name": "share", "path": ")" + share_ + "\"}]})");
+    const std::string notifier = dir_.Write(
+        "usr/quix/bin/quixzrmnotify", "#!/bin/sh\necho \"$*\" >> \"$(dirname \"$0\")/notified\"\n");
+    chmod(notifier.c_str(), 0755);
   }
+  std::string Notified() const { return test::ReadFile(dir_.Path("usr/quix/bin/notified")); }
+  int ShareFlags() const { return fileindex::StatusMgr().GetShareStatus("share"); }
 
   // Runs the watcher until the queue holds at least `n` lines (or a generous bound passes).
   std::vector<std::string> Drain(Watcher& w, size_t n) {
@@ -123,7 +138,17 @@ TEST_F(WatcherTest, ChangesBecomeQueueLines) {
   EXPECT_EQ(w.watch_count(), 2u);
 }
 
-TEST_F(WatcherTest, LostChangesBecomeOneOverflowLine) {
+TEST_F(WatcherTest, AtStartEveryFolderIsReconciledBeforeTheChangesThatFollow) {
+  ASSERT_TRUE(MonitorQueue::Upsert(Record(queue_, {share_ + "/docs", share_ + "/other"}),
+                                   "fileindex", MONITOR_QUEUE_TYPE_APPLICATION));
+  Watcher w;
+  w.ReconcileAll();
+  Touch("/other/a.txt");
+  EXPECT_THAT(Drain(w, 4), ElementsAre("10000 dir /docs reconcile", "10000 dir /other reconcile",
+                                       "40 /other/a.txt", "8 /other/a.txt"));
+}
+
+TEST_F(WatcherTest, LostChangesBecomeOneReconciliation) {
   Watcher w;
   // More changes than the kernel holds for a reader that is late.
   int kernel_queue = 0;
@@ -132,7 +157,138 @@ TEST_F(WatcherTest, LostChangesBecomeOneOverflowLine) {
   for (int i = 0; i < kernel_queue / 2 + 100; ++i) Touch("/docs/f" + std::to_string(i), "");
   for (int i = 0; i < 20; ++i) w.RunOnce(50);
   const std::vector<std::string> lines = QueueLines(queue_, share_);
-  EXPECT_EQ(std::count(lines.begin(), lines.end(), "200 dir /docs"), 1);
+  EXPECT_EQ(std::count(lines.begin(), lines.end(), "10000 dir /docs reconcile"), 1);
+}
+
+TEST_F(WatcherTest, FolderShortOfWatchesIsMarkedAndReconciledUntilTheyFit) {
+  for (const char* rel : {"/docs/a", "/docs/a/b", "/docs/c"}) Mkdir(rel);
+  test::FakeEnv env;
+  test::LogCapture log;
+  platform::ScopedFaults faults;
+  // The folder gets its watch; the table is full for every directory below it.
+  faults.Arm("inotify_add_watch", platform::Fault{-1, ENOSPC}, 1, -1);
+  WatcherOptions options;
+  options.limit_retry_micros = 60 * 1000000LL;
+  Watcher w(options);
+  EXPECT_EQ(w.watch_count(), 1u);
+  EXPECT_THAT(w.limited_folders(), ElementsAre(share_ + "/docs"));
+  long long limit = 0;
+  std::ifstream("/proc/sys/fs/inotify/max_user_watches") >> limit;
+  EXPECT_TRUE(log.Contains("3 directories below " + share_ + "/docs are not watched"));
+  EXPECT_TRUE(log.Contains("Raise fs.inotify.max_user_watches (now " + std::to_string(limit) +
+                           ") to at least " + std::to_string(limit + 3)));
+  EXPECT_EQ(ShareFlags(), fileindex::kShareStatusWatchLimit);
+  EXPECT_EQ(Notified(), "-c QUIX.Orvane.Application @administrators app:displayname "
+                        "error:watch_limit " + share_ + "/docs fs.inotify.max_user_watches " +
+                        std::to_string(limit + 3) + "\n");
+
+  // Reconciled when the interval is over, however the retry goes; told only once.
+  w.RunOnce(20);
+  EXPECT_FALSE(IsFileExist(queue_));
+  env.Advance(61 * 1000000LL);
+  w.RunOnce(20);
+  EXPECT_THAT(QueueLines(queue_, share_), ElementsAre("10000 dir /docs reconcile"));
+  EXPECT_EQ(w.limited_folders().size(), 1u);
+  EXPECT_EQ(ShareFlags(), fileindex::kShareStatusWatchLimit);
+
+  // The limit raised: the next retry watches everything, reconciles once more and clears the
+  // mark; changes deep below are seen again.
+  platform::ClearFaults();
+  env.Advance(61 * 1000000LL);
+  w.RunOnce(20);
+  EXPECT_EQ(w.watch_count(), 4u);
+  EXPECT_TRUE(w.limited_folders().empty());
+  EXPECT_EQ(ShareFlags(), 0);
+  EXPECT_TRUE(log.Contains("every directory below " + share_ + "/docs is watched again"));
+  Unlink(queue_);
+  Touch("/docs/a/b/deep.txt");
+  env.Advance(61 * 1000000LL);
+  EXPECT_THAT(Drain(w, 2), ElementsAre("40 /docs/a/b/deep.txt", "8 /docs/a/b/deep.txt"));
+  const std::string notified = Notified();
+  EXPECT_EQ(std::count(notified.begin(), notified.end(), '\n'), 1);
+}
+
+// A small ext4 image mounted on `dir` for its lifetime, unmounted and removed in all cases.
+// Mounted only for root with a loop device at hand.
+class LoopVolume {
+ public:
+  LoopVolume(const std::string& image, const std::string& dir) : image_(image), dir_(dir) {
+    // No journal: freed blocks are then free at once, not after the next commit.
+    const std::string mkfs =
+        "truncate -s 8M '" + image + "' && mkfs.ext4 -q -F -O ^has_journal '" + image + "'";
+    if (geteuid() != 0 || std::system((mkfs + " >/dev/null 2>&1").c_str()) != 0) return;
+    const std::string mount = "mount -o loop '" + image + "' '" + dir + "' 2>/dev/null";
+    mounted_ = std::system(mount.c_str()) == 0;
+  }
+  ~LoopVolume() {
+    if (mounted_ && umount(dir_.c_str()) != 0) umount2(dir_.c_str(), MNT_DETACH);
+    unlink(image_.c_str());
+  }
+  LoopVolume(const LoopVolume&) = delete;
+  LoopVolume& operator=(const LoopVolume&) = delete;
+
+  bool mounted() const { return mounted_; }
+  // Writes files until the volume has no block (or inode) left; false if it never said so. The
+  // large file leaves what the file system keeps in reserve for its growth, small files then
+  // take the rest.
+  bool Fill() const {
+    for (int i = 0; i < 100000; ++i) {
+      const int fd = open(Filler(i).c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
+      if (fd < 0) return errno == ENOSPC;
+      const std::string chunk(i == 0 ? 4096 : 1024, 'f');
+      ssize_t n = 0;
+      while ((n = write(fd, chunk.data(), chunk.size())) > 0 && i == 0) {
+      }
+      const int err = errno;
+      close(fd);
+      if (n < 0 && err != ENOSPC) return false;
+    }
+    return false;
+  }
+  void Free() const {
+    for (int i = 0; unlink(Filler(i).c_str()) == 0; ++i) {
+    }
+  }
+
+ private:
+  std::string Filler(int i) const { return dir_ + "/filler" + std::to_string(i); }
+
+  std::string image_;
+  std::string dir_;
+  bool mounted_ = false;
+};
+
+TEST_F(WatcherTest, FullVolumeFlagsTheShareOnceAndReconcilesWhenThereIsRoom) {
+  Mkdir("/@eaDir");
+  LoopVolume volume(dir_.Path("queue-volume.img"), share_ + "/@eaDir");
+  if (!volume.mounted()) GTEST_SKIP() << "needs root, mkfs.ext4 and a loop device";
+  Mkdir("/@eaDir/@fileindex");
+  ASSERT_TRUE(volume.Fill());
+  test::LogCapture log;
+  Watcher w;
+  // Changes while the volume is full: each pass tries again, the administrator is told once.
+  for (int i = 0; i < 3; ++i) {
+    Touch("/docs/lost" + std::to_string(i) + ".txt");
+    w.RunOnce(50);
+  }
+  EXPECT_THAT(QueueLines(queue_, share_), ElementsAre());
+  EXPECT_EQ(ShareFlags(), fileindex::kShareStatusQueueNoSpace);
+  EXPECT_EQ(log.Count("cannot append to queue " + queue_), 1);
+  EXPECT_TRUE(log.Contains("free space on its volume"));
+  EXPECT_NE(Notified().find("error:index_no_space"), std::string::npos);
+  const std::string notified = Notified();
+  EXPECT_EQ(std::count(notified.begin(), notified.end(), '\n'), 1);
+
+  // Room again: the reconciliation, written first, stands for everything not queued (what
+  // changes before it is written is on the disk it reads); then lines as before.
+  volume.Free();
+  Touch("/docs/meanwhile.txt");
+  EXPECT_THAT(Drain(w, 1), ElementsAre("10000 dir /docs reconcile"));
+  EXPECT_EQ(ShareFlags(), 0);
+  EXPECT_TRUE(log.Contains("queue " + queue_ + " can be written again"));
+  Touch("/docs/after.txt");
+  EXPECT_THAT(Drain(w, 3),
+              ElementsAre("10000 dir /docs reconcile", "40 /docs/after.txt", "8 /docs/after.txt"));
 }
 
 TEST_F(WatcherTest, FollowsRegistrationChangesAndWritesOneLinePerQueue) {
