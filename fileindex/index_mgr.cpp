@@ -433,6 +433,8 @@ Json::Value FolderSummary() {
     entry["status"] = bits;
     entry["need_reindex"] = (bits & kShareStatusNeedReindex) != 0;
     entry["volume_paused"] = (bits & kShareStatusVolumePaused) != 0;
+    entry["queue_no_space"] = (bits & kShareStatusQueueNoSpace) != 0;
+    entry["watch_limit"] = (bits & kShareStatusWatchLimit) != 0;
     shares.append(entry);
   }
   return summary;

@@ -61,7 +61,8 @@ Json::Value FolderGet(const std::string& path, const Json::Value& additionals);
 Json::Value FolderListGroups();
 // An overview: {"folder_count", "resume_time", "paused", "shares": [{"share", "folder_count",
 // "queue_length" (events waiting in the live queue and the batch being worked off), "status"
-// (the share's flag bits), "need_reindex", "volume_paused"}]}, shares in name order.
+// (the share's flag bits), "need_reindex", "volume_paused", "queue_no_space" (its queue's volume
+// is full), "watch_limit" (directories left unwatched)}]}, shares in name order.
 Json::Value FolderSummary();
 // Whether a configured folder still has indexing work: {"path", "text" (and "desc") as for the
 // "status" additional, "pending" (the queue holds events at or below it)}. Error 902 for a path

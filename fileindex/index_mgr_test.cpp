@@ -223,11 +223,14 @@ TEST_F(IndexMgrTest, ListingSummaryAndProcessingStatus) {
   EXPECT_EQ(FolderGetProcessingStatus("/photo/family"),
             Parse(R"({"path": "/photo/family", "text": "paused", "pending": true})"));
   StatusMgr().SetShareStatus("music", kShareStatusNeedReindex);
+  StatusMgr().SetShareStatus("photo", kShareStatusQueueNoSpace | kShareStatusWatchLimit);
   EXPECT_EQ(FolderSummary(), Parse(R"({"folder_count": 3, "resume_time": 0, "paused": true,
       "shares": [{"share": "music", "folder_count": 1, "queue_length": 1, "status": 1,
-                  "need_reindex": true, "volume_paused": false},
-                 {"share": "photo", "folder_count": 2, "queue_length": 2, "status": 0,
-                  "need_reindex": false, "volume_paused": false}]})"));
+                  "need_reindex": true, "volume_paused": false, "queue_no_space": false,
+                  "watch_limit": false},
+                 {"share": "photo", "folder_count": 2, "queue_length": 2, "status": 12,
+                  "need_reindex": false, "volume_paused": false, "queue_no_space": true,
+                  "watch_limit": true}]})"));
 }
 
 TEST_F(IndexMgrTest, ConcurrentAdministratorsLoseNothing) {

@@ -480,6 +480,8 @@ std::string ShareState(const Json::Value& summary, const Json::Value& worker,
   if (worker["paused"].asBool() || summary["volume_paused"].asBool()) notes.push_back("paused");
   if (summary["need_reindex"].asBool()) notes.push_back("needs re-index");
   if (worker["out_of_space"].asBool()) notes.push_back("out of space");
+  if (summary["queue_no_space"].asBool()) notes.push_back("queue volume full");
+  if (summary["watch_limit"].asBool()) notes.push_back("watch limit reached");
   const std::string engine = index["state"].asString();
   if (!engine.empty() && engine != "ready") notes.push_back("index " + engine);
   std::string text;
