@@ -11,6 +11,7 @@
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <functional>
 #include <map>
 #include <tuple>
@@ -214,6 +215,76 @@ TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
   WriteFile(D("proj/after/restart.txt"), "after");
   ASSERT_EQ(0, Shell("rm -rf " + D("proj/big/d7")));
   ExpectSettled("docs", D("proj"));
+}
+
+// Whatever changed while a daemon was away is in the index once it is back: the file-change
+// daemon killed, stopped cleanly, all three stopped, the engine down.
+TEST_F(EndToEndTest, ChangesMadeWhileDaemonsAreAwayAreFoundWhenTheyAreBack) {
+  WriteFile(D("proj/keep.txt"), "k");
+  for (int i = 0; i < 4; ++i) {
+    for (int j = 0; j < 50; ++j) {
+      WriteFile(D("proj/doomed" + std::to_string(i) + "/f" + std::to_string(j) + ".txt"), "d");
+    }
+  }
+  fileindex::FolderAdd(Folder("/docs/proj", false), false);
+  ExpectSettled("docs", D("proj"));
+  // A tree deleted, one created, a file grown, one renamed: each round its own.
+  int round = 0;
+  const auto change = [&] {
+    const std::string n = std::to_string(round++);
+    ASSERT_EQ(0, Shell("rm -rf " + D("proj/doomed" + n)));
+    WriteFile(D("proj/new" + n + "/sub/f.txt"), "new");
+    WriteFile(D("proj/keep.txt"), "grown in round " + n);
+    ASSERT_EQ(0, rename(D("proj/new" + n + "/sub/f.txt").c_str(),
+                        D("proj/new" + n + "/g.txt").c_str()));
+  };
+
+  notifyd_->Signal(SIGKILL);
+  change();
+  notifyd_ = sys_.StartNotifyd();
+  ExpectSettled("docs", D("proj"));
+
+  EXPECT_TRUE(WIFEXITED(notifyd_->Signal(SIGTERM)));
+  change();
+  notifyd_ = sys_.StartNotifyd();
+  ExpectSettled("docs", D("proj"));
+
+  EXPECT_TRUE(WIFEXITED(indexd_->Signal(SIGTERM)));
+  EXPECT_TRUE(WIFEXITED(notifyd_->Signal(SIGTERM)));
+  engine_->Signal(SIGTERM);
+  change();
+  engine_ = sys_.StartEngine();
+  notifyd_ = sys_.StartNotifyd();
+  indexd_ = sys_.StartIndexd();
+  ExpectSettled("docs", D("proj"));
+
+  // The changes wait in the queue while the engine is down; the indexer's back-off after its
+  // failed passes is what the generous bound allows for.
+  engine_->Signal(SIGTERM);
+  change();
+  engine_ = sys_.StartEngine();
+  ExpectSettled("docs", D("proj"), 90000);
+}
+
+// Changes beyond what the kernel holds for a reader that is late: the events are lost, the
+// folders are reconciled instead.
+TEST_F(EndToEndTest, AfterTheKernelLostEventsTheIndexEqualsTheDisk) {
+  WriteFile(D("proj/seed.txt"), "s");
+  for (int i = 0; i < 100; ++i) WriteFile(D("proj/old/f" + std::to_string(i) + ".txt"), "o");
+  fileindex::FolderAdd(Folder("/docs/proj", false), false);
+  ExpectSettled("docs", D("proj"));
+  int kernel_queue = 0;
+  std::ifstream("/proc/sys/fs/inotify/max_queued_events") >> kernel_queue;
+  ASSERT_GT(kernel_queue, 0);
+  ASSERT_LT(kernel_queue, 20000) << "too many files to index for this test";
+  // A create and a close per file, while the watcher cannot read.
+  kill(notifyd_->pid(), SIGSTOP);
+  ASSERT_EQ(0, Shell("rm -rf " + D("proj/old")));
+  for (int i = 0; i < kernel_queue / 2 + 100; ++i) {
+    WriteFile(D("proj/burst/d" + std::to_string(i % 20) + "/f" + std::to_string(i)), "");
+  }
+  kill(notifyd_->pid(), SIGCONT);
+  ExpectSettled("docs", D("proj"), 90000);
 }
 
 TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
