@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <fstream>
+#include <sstream>
 
 #include "common/json_util.hpp"
 #include "common/root.hpp"
@@ -136,6 +137,36 @@ TEST_F(DaemonTest, FollowsTheQueueAndAnswersItsCommands) {
   EXPECT_TRUE(WIFEXITED(wstatus) && WEXITSTATUS(wstatus) == 0) << wstatus;
   EXPECT_FALSE(IsFileExist(RootedPath("/var/run/fileindexd.sock")));
   EXPECT_FALSE(IsFileExist(RootedPath("/var/run/fileindexd.pid")));
+}
+
+// A start after a kill queues a reconciliation of every indexed folder, paused ones included;
+// a start after a clean stop queues nothing. With the engine down the lines stay in the queue
+// (or the side file of the pass that failed) to be read.
+TEST_F(DaemonTest, AStartAfterAnUncleanStopReconcilesEveryFolder) {
+  engine_->Signal(SIGTERM);
+  const auto reconciled = [&] {
+    std::set<std::string> paths;
+    for (const std::string& share : {"docs", "music"}) {
+      for (const std::string& file : {sys_.Queue(share), sys_.Queue(share) + ".tmp"}) {
+        std::istringstream lines(orvane::test::ReadFile(file));
+        for (std::string line; std::getline(lines, line);) {
+          const fileindex::Event e(line);
+          if (e.event == fileindex::kEventReindex && e.data["reconcile"].asBool()) {
+            paths.insert(e.path);
+          }
+        }
+      }
+    }
+    return paths;
+  };
+  auto indexd = sys_.StartIndexd();
+  EXPECT_TRUE(WIFEXITED(indexd->Signal(SIGTERM)));
+  indexd = sys_.StartIndexd();
+  EXPECT_EQ(std::set<std::string>(), reconciled());
+
+  indexd->Signal(SIGKILL);
+  indexd = sys_.StartIndexd();
+  EXPECT_EQ((std::set<std::string>{V("a"), sys_.Vol("music")}), reconciled());
 }
 
 TEST_F(DaemonTest, SighupReReadsTheFolderConfiguration) {
