@@ -2,7 +2,9 @@
 // registered queues. It reads the registrations at start and again whenever they change, keeps
 // one inotify watch per directory below each registered folder (never inside an ignored name),
 // pairs the two halves of a rename, and appends each pass's lines to every queue in one locked
-// write. Single-threaded: Run() and RunOnce() belong to one thread.
+// write. Where changes cannot be followed one by one (nobody watched, the kernel dropped events,
+// the watch limit, a full queue volume) it queues a reconciliation of the folder instead.
+// Single-threaded: every member belongs to one thread.
 #ifndef ORVANE_DAEMONS_QUIXNOTIFYD_WATCHER_HPP_
 #define ORVANE_DAEMONS_QUIXNOTIFYD_WATCHER_HPP_
 
