@@ -1,16 +1,23 @@
 // The daemon binary itself, through its real sockets: framing, signals, crashes and the
 // identity of callers (root and nobody).
+#include <grp.h>
+#include <poll.h>
 #include <pwd.h>
 #include <signal.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 
+#include <chrono>
 #include <cstring>
+#include <sstream>
 #include <thread>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include "common/fd.hpp"
 #include "common/json_util.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
@@ -34,6 +41,94 @@ Json::Value Batch(const std::string& dir, int first, int count) {
   }
   return tc::Compound(upserts);
 }
+
+// A connection to a Unix socket that gives up after `timeout_s` for connecting and each read.
+UniqueFd Connect(const std::string& socket, int timeout_s) {
+  UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  struct timeval tv = {timeout_s, 0};
+  ::setsockopt(fd.get(), SOL_SOCKET, SO_SNDTIMEO, &tv, sizeof(tv));
+  ::setsockopt(fd.get(), SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof(tv));
+  struct sockaddr_un addr;
+  std::memset(&addr, 0, sizeof(addr));
+  addr.sun_family = AF_UNIX;
+  std::strncpy(addr.sun_path, socket.c_str(), sizeof(addr.sun_path) - 1);
+  if (::connect(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0) {
+    fd.Close();
+  }
+  return fd;
+}
+
+// Another process, running as `uid`, that opens `count` connections to `socket`, sends nothing
+// on them and holds them until Release() or 30 s. Counts() says how many the daemon answered
+// at once with 1401 and how many it left open.
+class Flood {
+ public:
+  Flood(const std::string& socket, int count, uid_t uid, gid_t gid) {
+    int report[2], release[2];
+    if (::pipe(report) != 0 || ::pipe(release) != 0) return;
+    pid_ = ::fork();
+    if (pid_ == 0) {
+      ::close(report[0]);
+      ::close(release[1]);
+      if (::setgroups(0, nullptr) != 0 || ::setgid(gid) != 0 || ::setuid(uid) != 0) _exit(3);
+      std::vector<UniqueFd> conns;
+      std::vector<struct pollfd> fds;
+      for (int i = 0; i < count; ++i) {
+        conns.push_back(Connect(socket, 5));
+        if (conns.back().valid()) fds.push_back({conns.back().get(), POLLIN, 0});
+      }
+      // The daemon answers the connections it refuses as it accepts them; the others stay
+      // silent. Ten seconds bound the wait for the last answers.
+      int refused = 0, closed = 0;
+      const auto until = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+      while (std::chrono::steady_clock::now() < until && refused + closed < count - 16) {
+        if (::poll(fds.data(), fds.size(), 100) <= 0) continue;
+        for (struct pollfd& p : fds) {
+          if (p.fd < 0 || p.revents == 0) continue;
+          char buf[4096];
+          const ssize_t n = ::recv(p.fd, buf, sizeof(buf), 0);
+          const std::string got(buf, n > 0 ? static_cast<size_t>(n) : 0);
+          (got.find("\"code\":1401") != std::string::npos ? refused : closed) += 1;
+          p.fd = -1;
+        }
+      }
+      const std::string counts = std::to_string(fds.size()) + " " + std::to_string(refused) + " " +
+                                 std::to_string(closed) + "\n";
+      if (::write(report[1], counts.data(), counts.size()) < 0) _exit(4);
+      struct pollfd wait = {release[0], POLLIN, 0};
+      ::poll(&wait, 1, 30000);
+      _exit(0);
+    }
+    ::close(report[1]);
+    ::close(release[0]);
+    report_.Reset(report[0]);
+    release_.Reset(release[1]);
+  }
+  ~Flood() { Release(); }
+
+  // Waits for the flood to be in place: connected, refused at once, closed without an answer.
+  std::vector<int> Counts() {
+    std::string text;
+    char c;
+    while (::read(report_.get(), &c, 1) == 1 && c != '\n') text += c;
+    std::istringstream in(text);
+    std::vector<int> out;
+    for (int n; in >> n;) out.push_back(n);
+    return out;
+  }
+  void Release() {
+    if (pid_ <= 0) return;
+    release_.Close();
+    int status = 0;
+    ::waitpid(pid_, &status, 0);
+    pid_ = -1;
+  }
+
+ private:
+  pid_t pid_ = -1;
+  UniqueFd report_;
+  UniqueFd release_;
+};
 
 class DaemonTest : public ::testing::Test {
  protected:
@@ -224,6 +319,53 @@ TEST_F(DaemonTest, OrdinaryUsersOnlySearchAndOnlySeeWhatTheyCanOpen) {
   suggest["data"]["prefix"] = "hid";
   EXPECT_EQ(as_nobody(daemon_->public_socket(), suggest)["data"]["suggestions"].size(), 0u);
   EXPECT_EQ(Send(suggest)["data"]["suggestions"].size(), 1u);
+}
+
+// 400 idle connections of one user to the public socket: the daemon keeps 16 of them and
+// refuses the rest at once; the library's requests on the main socket and other users'
+// searches are served meanwhile, and the user's own places come back when it lets go.
+TEST_F(DaemonTest, PublicFloodLeavesRoomForTheMainSocketAndOtherUsers) {
+  const struct passwd* nobody = ::getpwnam("nobody");
+  ASSERT_NE(nobody, nullptr);
+  // The idle time-out is lengthened so that the held connections stay while they are counted.
+  Launch({"--public-timeout-ms", "60000"});
+  ASSERT_EQ(CreateIndex()["success"], true);
+  const Json::Value search = tc::Parse(R"({"command": "search", "data": {"name": "flood"}})");
+
+  Flood flood(daemon_->public_socket(), 400, nobody->pw_uid, nobody->pw_gid);
+  EXPECT_THAT(flood.Counts(), ::testing::ElementsAre(400, 384, 0));
+  const auto start = std::chrono::steady_clock::now();
+  ASSERT_EQ(Send(tc::Upsert(dir_.Write("share/flood.txt", "x")))["success"], true);
+  ::chmod(dir_.Path("share").c_str(), 0755);
+  EXPECT_EQ(tc::Request(daemon_->public_socket(), search)["data"]["total"], 1);
+  // A bound that only keeps the test from passing after a retry-length stall.
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
+  const Json::Value refused =
+      tc::RequestAs(daemon_->public_socket(), search, nobody->pw_uid, nobody->pw_gid);
+  EXPECT_EQ(refused["error"]["code"], kCodeOverloaded) << JsonToString(refused);
+  EXPECT_THAT(
+      refused["error"]["msg"].asString(),
+      ::testing::HasSubstr("too many connections from uid " + std::to_string(nobody->pw_uid)));
+  flood.Release();
+  EXPECT_TRUE(Eventually([&] {
+    return tc::RequestAs(daemon_->public_socket(), search, nobody->pw_uid,
+                         nobody->pw_gid)["data"]["total"] == 1;
+  }));
+}
+
+// A public connection that sends nothing, or half a request, is closed without an answer once
+// its time is up; one that asks at once is answered.
+TEST_F(DaemonTest, PublicSocketClosesIdleConnections) {
+  Launch({"--public-timeout-ms", "300"});
+  UniqueFd idle = Connect(daemon_->public_socket(), 10);
+  UniqueFd half = Connect(daemon_->public_socket(), 10);
+  ASSERT_TRUE(idle.valid() && half.valid());
+  ASSERT_EQ(::send(half.get(), "\x40\0", 2, MSG_NOSIGNAL), 2);
+  char c;
+  EXPECT_EQ(::recv(idle.get(), &c, 1, 0), 0);
+  EXPECT_EQ(::recv(half.get(), &c, 1, 0), 0);
+  const Json::Value list = tc::Parse(R"({"command": "search", "data": {"name": "abc"}})");
+  EXPECT_EQ(tc::Request(daemon_->public_socket(), list)["success"], true);
 }
 
 }  // namespace

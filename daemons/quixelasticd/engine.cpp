@@ -101,6 +101,17 @@ bool IsOneIndexBatch(const Json::Value& list) {
 
 // Root sees every hit; anyone else only the files they could open. The checker lives as long
 // as the request's function, so its folder answers are shared by every hit of the request.
+// Runs a read; a statement the guard interrupted is answered with why it stopped.
+template <typename Fn>
+auto Guarded(QueryGuard* guard, Fn fn) -> decltype(fn()) {
+  try {
+    return fn();
+  } catch (const StoreError&) {
+    if (guard != nullptr && guard->stopped() != QueryGuard::Stop::kNone) guard->Throw();
+    throw;
+  }
+}
+
 VisibleFn VisibleTo(const Caller& caller) {
   if (caller.uid == 0) return VisibleFn();
   auto checker = std::make_shared<AccessChecker>(caller.uid, caller.gid);
@@ -175,6 +186,10 @@ class Engine::Session {
   // caller must then roll back as a whole.
   void SetSavepoints(bool on) { savepoints_ = on; }
   bool savepoints() const { return savepoints_; }
+
+  // What stops the request's searches (its time budget, its client hanging up); may be null.
+  void SetQueryGuard(QueryGuard* guard) { guard_ = guard; }
+  QueryGuard* query_guard() const { return guard_; }
 
   IndexStore& Acquire(const std::string& id) {
     if (entry_ && entry_->id == id && txn_) return *entry_->store;
@@ -265,6 +280,7 @@ class Engine::Session {
   std::vector<size_t> pending_;
   LostFn lost_;
   bool savepoints_ = true;
+  QueryGuard* guard_ = nullptr;
 };
 
 Engine::Engine(EngineOptions options) : options_(std::move(options)) {
@@ -508,8 +524,13 @@ Json::Value Engine::HandleValue(const Json::Value& request, const Caller& caller
     }
   } guard{writes ? &write_backlog_ : nullptr};
 
-  if (compound) return RunCompound(request["compound"], caller);
+  // One budget for all the searches of the request, so a batch of them cannot multiply it.
+  const int64_t budget = options_.search_budget_micros;
+  QueryGuard query_guard(budget > 0 ? Env::Current()->NowMicros() + budget : 0, caller.peer_fd,
+                         budget);
+  if (compound) return RunCompound(request["compound"], caller, &query_guard);
   Session session(*this);
+  session.SetQueryGuard(&query_guard);
   // A failed request is rolled back whole when the session ends unfinished.
   session.SetSavepoints(false);
   Json::Value reply = RunSingle(request, caller, session);
@@ -555,25 +576,26 @@ Json::Value Engine::RunSingle(const Json::Value& request, const Caller& caller,
   }
 }
 
-Json::Value Engine::RunCompound(const Json::Value& list, const Caller& caller) {
+Json::Value Engine::RunCompound(const Json::Value& list, const Caller& caller, QueryGuard* guard) {
   // A savepoint makes the full-text tables write their pending terms out as a segment of their
   // own, which for small documents costs more than the documents themselves. A batch on one
   // index therefore first runs as a single transaction without them; only when one of its
   // commands fails is all of it rolled back and run again with a savepoint per command.
   if (IsOneIndexBatch(list)) {
-    Json::Value reply = RunCompoundPass(list, caller, false);
+    Json::Value reply = RunCompoundPass(list, caller, false, guard);
     if (!reply.isNull()) return reply;
   }
-  return RunCompoundPass(list, caller, true);
+  return RunCompoundPass(list, caller, true, guard);
 }
 
-Json::Value Engine::RunCompoundPass(const Json::Value& list, const Caller& caller,
-                                    bool savepoints) {
+Json::Value Engine::RunCompoundPass(const Json::Value& list, const Caller& caller, bool savepoints,
+                                    QueryGuard* guard) {
   Json::Value reply;
   reply["success"] = true;
   reply["data"] = Json::Value(Json::arrayValue);
   Json::Value& results = reply["data"];
   Session session(*this);
+  session.SetQueryGuard(guard);
   session.SetSavepoints(savepoints);
   session.SetLostHandler([&](const std::vector<size_t>& which, int code, const std::string& msg) {
     for (size_t i : which) results[static_cast<Json::ArrayIndex>(i)] = ErrorReply(code, msg);
@@ -615,8 +637,8 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
   if (command == "index_list") return IndexList();
   if (command == "commit") return Commit(data, session);
   if (command == "list_term_sugg_db") return ListTermSuggDb();
-  if (command == "search") return Search(data, caller);
-  if (command == "suggest") return Suggest(data, caller);
+  if (command == "search") return Search(data, caller, session.query_guard());
+  if (command == "suggest") return Suggest(data, caller, session.query_guard());
 
   Json::Value result(Json::objectValue);
   if (command == "update_term_suggestion") {
@@ -972,7 +994,7 @@ std::vector<std::shared_ptr<IndexStore>> Engine::SearchTargets(const Json::Value
   return stores;
 }
 
-Json::Value Engine::Search(const Json::Value& data, const Caller& caller) {
+Json::Value Engine::Search(const Json::Value& data, const Caller& caller, QueryGuard* guard) {
   SearchParams p;
   const Json::Value& d = data.isObject() ? data : Json::Value(Json::objectValue);
   auto str = [&](const char* key) {
@@ -1070,11 +1092,13 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller) {
   SearchParams each = p;
   each.from = 0;
   each.size = p.from + p.size;
+  // With one index its page is the answer from `from` on; merged pages may take any of theirs.
+  each.snippet_from = stores.size() == 1 ? p.from : 0;
   int64_t total = 0;
   bool exact = true;
   std::vector<Json::Value> hits;
   for (auto& store : stores) {
-    SearchPage page = store->Search(each, visible);
+    SearchPage page = Guarded(guard, [&] { return store->Search(each, visible, guard); });
     total += page.total;
     exact = exact && page.total_exact;
     for (Json::Value& h : page.hits) hits.push_back(std::move(h));
@@ -1110,7 +1134,7 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller) {
   return result;
 }
 
-Json::Value Engine::Suggest(const Json::Value& data, const Caller& caller) {
+Json::Value Engine::Suggest(const Json::Value& data, const Caller& caller, QueryGuard* guard) {
   const Json::Value& d = data.isObject() ? data : Json::Value(Json::objectValue);
   const std::string prefix = RequireString(d, "prefix");
   const int64_t size = std::min<int64_t>(OptionalInt(d, "size", 10), 100);
@@ -1118,7 +1142,9 @@ Json::Value Engine::Suggest(const Json::Value& data, const Caller& caller) {
   const VisibleFn visible = VisibleTo(caller);
   std::vector<std::string> terms;
   for (auto& store : stores) {
-    for (const std::string& t : store->Suggest(prefix, static_cast<size_t>(size), visible)) {
+    for (const std::string& t : Guarded(guard, [&] {
+           return store->Suggest(prefix, static_cast<size_t>(size), visible, guard);
+         })) {
       if (std::find(terms.begin(), terms.end(), t) == terms.end()) terms.push_back(t);
     }
   }

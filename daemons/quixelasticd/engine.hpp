@@ -30,6 +30,9 @@ struct Caller {
   gid_t gid = 0;
   // Root or the service account: may run index and document commands.
   bool privileged = false;
+  // The client's connection, watched while its searches run: a search whose client hung up is
+  // stopped. -1: none (in-process callers).
+  int peer_fd = -1;
 };
 
 struct EngineOptions {
@@ -46,6 +49,9 @@ struct EngineOptions {
   std::string index_root;
   int64_t default_page_size = 1000;
   int64_t max_page_size = 10000;
+  // Time a request's searches and suggestions may take together before they are stopped and
+  // answered 1402; 0: no limit.
+  int64_t search_budget_micros = 10 * 1000000LL;
 };
 
 class Engine {
@@ -110,9 +116,10 @@ class Engine {
   Json::Value Dispatch(const std::string& command, const Json::Value& data, const Caller& caller,
                        Session& session);
   Json::Value RunSingle(const Json::Value& request, const Caller& caller, Session& session);
-  Json::Value RunCompound(const Json::Value& list, const Caller& caller);
+  Json::Value RunCompound(const Json::Value& list, const Caller& caller, QueryGuard* guard);
   // One run of a batch; without savepoints it gives up (null) at the first failed command.
-  Json::Value RunCompoundPass(const Json::Value& list, const Caller& caller, bool savepoints);
+  Json::Value RunCompoundPass(const Json::Value& list, const Caller& caller, bool savepoints,
+                              QueryGuard* guard);
 
   Json::Value IndexCreate(const Json::Value& data);
   Json::Value IndexDelete(const Json::Value& data);
@@ -120,8 +127,8 @@ class Engine {
   Json::Value IndexConfigSet(const Json::Value& data);
   Json::Value Commit(const Json::Value& data, Session& session);
   Json::Value ListTermSuggDb();
-  Json::Value Search(const Json::Value& data, const Caller& caller);
-  Json::Value Suggest(const Json::Value& data, const Caller& caller);
+  Json::Value Search(const Json::Value& data, const Caller& caller, QueryGuard* guard);
+  Json::Value Suggest(const Json::Value& data, const Caller& caller, QueryGuard* guard);
   Json::Value IndexList();
 
   std::shared_ptr<Entry> Find(const std::string& id);

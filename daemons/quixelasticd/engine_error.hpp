@@ -26,7 +26,9 @@ enum ResultCode : int {
   kCodeIndexDamaged = 609,      // set aside; needs a rebuild (delete and create)
   kCodeIndexMoving = 610,
   kCodeOutOfMemory = 1400,
-  kCodeOverloaded = 1401,
+  kCodeOverloaded = 1401,        // too many requests or connections (of this user, or of all)
+  kCodeSearchTooLong = 1402,     // a search ran past its time budget and was stopped
+  kCodeCallerGone = 1403,        // the client hung up while its search ran; never sent
 };
 
 class EngineError : public std::runtime_error {

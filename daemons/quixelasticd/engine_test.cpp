@@ -1,10 +1,15 @@
 #include "daemons/quixelasticd/engine.hpp"
 
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <chrono>
 #include <fstream>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include "common/fd.hpp"
 #include "common/json_util.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
@@ -241,6 +246,80 @@ TEST_F(EngineTest, DamagedStoreIsSetAsideAndRebuilt) {
   ASSERT_EQ(CodeOf(Send(OnIndex("index_delete"))), 0);
   ASSERT_EQ(CodeOf(Create()), 0);
   EXPECT_EQ(CodeOf(Send(Upsert("/v/share/a.txt"))), 0);
+}
+
+// One word 200,000 times in one document: ranking and the snippet cost one pass over it, and
+// the snippet still finds the rare word near its end.
+TEST_F(EngineTest, HugeRepetitionIsRankedAndSnippedInOnePass) {
+  ASSERT_EQ(CodeOf(Create()), 0);
+  std::string text;
+  for (int i = 0; i < 200000; ++i) text += "hello ";
+  text += "the quarterly figures";
+  Json::Value big = Upsert("/v/share/big.txt");
+  big["data"]["data"]["QUIXMDTextContent"] = text;
+  Json::Value small = Upsert("/v/share/small.txt");
+  small["data"]["data"]["QUIXMDTextContent"] = "hello world, quarterly";
+  ASSERT_EQ(Send(Compound({big, small}))["has_fail"], false);
+
+  const auto start = std::chrono::steady_clock::now();
+  Json::Value r;
+  EXPECT_THAT(Found(R"({"keyword": "quarterly hello", "size": 5, "sort": "name"})", &r),
+              ElementsAre("big.txt", "small.txt"));
+  // Generous: before, this search took minutes of CPU.
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(30));
+  const std::string snippet = r["data"]["hits"][0]["snippet"].asString();
+  EXPECT_THAT(snippet, HasSubstr("<b>hello</b> the <b>quarterly</b>"));
+  EXPECT_EQ(snippet.rfind("...", 0), 0u) << snippet;
+  EXPECT_LT(snippet.size(), 400u) << snippet;
+  // The catch-all text begins with the file's name.
+  EXPECT_EQ(r["data"]["hits"][1]["snippet"].asString(),
+            "small.txt\n<b>hello</b> world, <b>quarterly</b>");
+  // The window holds the most matches it can, and ends with an ellipsis when words follow.
+  EXPECT_THAT(Found(R"({"keyword": "hello", "size": 1})", &r), ElementsAre("big.txt"));
+  std::string hellos = "<b>hello</b>";
+  for (int i = 1; i < 12; ++i) hellos += " <b>hello</b>";
+  EXPECT_THAT(r["data"]["hits"][0]["snippet"].asString(), ::testing::EndsWith(hellos + "..."));
+}
+
+// A search is stopped, and nothing of it left running, when its time budget is spent or its
+// client hangs up; a client that only closed its writing side still gets the answer.
+TEST_F(EngineTest, SearchStopsAtItsBudgetOrWhenItsClientHangsUp) {
+  ASSERT_EQ(CodeOf(Create()), 0);
+  // Enough rows that the query runs well past one look of the progress handler.
+  std::vector<Json::Value> docs;
+  for (int i = 0; i < 2000; ++i) {
+    Json::Value d = Upsert("/v/share/f" + std::to_string(i) + ".txt");
+    d["data"]["data"]["QUIXMDTextContent"] = "budget words " + std::to_string(i);
+    docs.push_back(d);
+  }
+  ASSERT_EQ(Send(Compound(docs))["has_fail"], false);
+  const Json::Value search = Cmd("search", Parse(R"({"keyword": "budget", "sort": "name"})"));
+  int pair[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
+  UniqueFd server_end(pair[0]);
+  UniqueFd client_end(pair[1]);
+  Caller caller = root_;
+  caller.peer_fd = server_end.get();
+
+  // Half-closed after the request: still waiting for the reply.
+  ASSERT_EQ(::shutdown(client_end.get(), SHUT_WR), 0);
+  EXPECT_EQ(engine_->HandleValue(search, caller)["data"]["total"], 2000);
+  client_end.Close();
+  Json::Value r = engine_->HandleValue(search, caller);
+  EXPECT_EQ(CodeOf(r), kCodeCallerGone) << JsonToString(r);
+  // In a batch the stop answers the search, not the batch.
+  r = engine_->HandleValue(Compound({search, OnIndex("commit")}), caller);
+  EXPECT_EQ(CodeOf(r["data"][0]), kCodeCallerGone);
+  EXPECT_EQ(CodeOf(r["data"][1]), 0);
+
+  EngineOptions options;
+  options.search_budget_micros = 1;
+  engine_.reset();
+  StartEngine(options);
+  r = Send(search);
+  EXPECT_EQ(CodeOf(r), kCodeSearchTooLong);
+  EXPECT_EQ(r["error"]["msg"].asString().rfind("the search took longer than 1 s", 0), 0u)
+      << JsonToString(r);
 }
 
 }  // namespace

@@ -30,7 +30,10 @@ const char kUsage[] =
     "usage: quixelasticd [--foreground] [--socket PATH] [--public-socket PATH|none]\n"
     "                    [--pid-file PATH] [--state-dir DIR] [--service-user NAME]\n"
     "                    [--max-frame-bytes N] [--memory-limit-mb N] [--max-write-backlog N]\n"
-    "                    [--max-connections N] [--io-timeout-s N] [--index-root DIR]\n";
+    "                    [--max-connections N] [--io-timeout-s N] [--index-root DIR]\n"
+    "                    [--max-public-connections N] [--max-public-connections-per-user N]\n"
+    "                    [--max-public-requests-per-user N] [--public-timeout-ms N]\n"
+    "                    [--search-budget-ms N]\n";
 
 struct Flags {
   bool foreground = false;
@@ -45,6 +48,11 @@ struct Flags {
   long long backlog = 64;
   long long connections = 256;
   long long io_timeout_s = 30;
+  long long public_connections = 128;
+  long long public_per_user = 16;
+  long long public_requests_per_user = 4;
+  long long public_timeout_ms = 2000;
+  long long search_budget_ms = 10000;
 };
 
 bool ParseNumber(const char* text, long long min, long long* out) {
@@ -84,6 +92,11 @@ bool ParseFlags(int argc, char** argv, Flags* f) {
     else if (arg == "--max-write-backlog") ok = number(0, &f->backlog);
     else if (arg == "--max-connections") ok = number(1, &f->connections);
     else if (arg == "--io-timeout-s") ok = number(1, &f->io_timeout_s);
+    else if (arg == "--max-public-connections") ok = number(1, &f->public_connections);
+    else if (arg == "--max-public-connections-per-user") ok = number(1, &f->public_per_user);
+    else if (arg == "--max-public-requests-per-user") ok = number(1, &f->public_requests_per_user);
+    else if (arg == "--public-timeout-ms") ok = number(1, &f->public_timeout_ms);
+    else if (arg == "--search-budget-ms") ok = number(0, &f->search_budget_ms);
     else ok = false;
     if (!ok) {
       std::cerr << "quixelasticd: bad or incomplete option " << arg << "\n" << kUsage;
@@ -153,6 +166,7 @@ int main(int argc, char** argv) {
   engine_options.memory_limit_bytes = flags.memory_mb << 20;
   engine_options.max_write_backlog = static_cast<int>(flags.backlog);
   engine_options.index_root = flags.index_root;
+  engine_options.search_budget_micros = flags.search_budget_ms * 1000;
   orvane::elasticd::ServerOptions server_options;
   server_options.socket_path = orvane::RootedPath(flags.socket);
   if (flags.public_socket != "none") {
@@ -161,6 +175,10 @@ int main(int argc, char** argv) {
   server_options.max_frame_bytes = static_cast<uint32_t>(flags.max_frame);
   server_options.max_connections = static_cast<int>(flags.connections);
   server_options.io_timeout_micros = flags.io_timeout_s * 1000000LL;
+  server_options.max_public_connections = static_cast<int>(flags.public_connections);
+  server_options.max_public_connections_per_user = static_cast<int>(flags.public_per_user);
+  server_options.max_public_requests_per_user = static_cast<int>(flags.public_requests_per_user);
+  server_options.public_request_timeout_micros = flags.public_timeout_ms * 1000;
   if (struct passwd* pw = ::getpwnam(flags.service_user.c_str())) {
     server_options.service_uid = pw->pw_uid;
     server_options.service_gid = pw->pw_gid;

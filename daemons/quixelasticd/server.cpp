@@ -8,6 +8,7 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstring>
 
 #include "common/env.hpp"
@@ -64,7 +65,51 @@ void Server::Start() {
       options_.socket_path.c_str());
 }
 
+namespace {
+
+// The peer's uid from SO_PEERCRED; false when unknown.
+bool PeerUid(int fd, uid_t* uid, gid_t* gid) {
+  struct ucred cred;
+  socklen_t len = sizeof(cred);
+  if (::getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) return false;
+  *uid = cred.uid;
+  *gid = cred.gid;
+  return true;
+}
+
+// Answers a connection that gets no place, without waiting for it: the reply fits in the
+// socket's empty buffer, and a peer that is not reading simply loses it.
+void Refuse(int fd, const std::string& why) {
+  const std::string payload = JsonToString(Engine::ErrorReply(kCodeOverloaded, why)) + '\0';
+  const uint32_t length = static_cast<uint32_t>(payload.size());
+  std::string frame(reinterpret_cast<const char*>(&length), sizeof(length));
+  frame += payload;
+  // Best effort: a full buffer or a peer already gone changes nothing.
+  (void)!::send(fd, frame.data(), frame.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+}
+
+}  // namespace
+
+bool Server::AdmitPublic(uid_t uid, std::string* why) {
+  std::lock_guard<std::mutex> lock(mu_);
+  if (public_active_ >= options_.max_public_connections) {
+    *why = "too many connections to the search socket: try again shortly";
+    return false;
+  }
+  int& mine = public_by_user_[uid];
+  if (mine >= options_.max_public_connections_per_user) {
+    *why = "too many connections from uid " + std::to_string(uid) + " (at most " +
+           std::to_string(options_.max_public_connections_per_user) + "): close some and try again";
+    return false;
+  }
+  ++mine;
+  ++public_active_;
+  ++active_;
+  return true;
+}
+
 void Server::AcceptLoop() {
+  uint64_t refused = 0;
   for (;;) {
     struct pollfd fds[3] = {{stop_read_.get(), POLLIN, 0},
                             {main_fd_.get(), POLLIN, 0},
@@ -78,8 +123,8 @@ void Server::AcceptLoop() {
     if (fds[0].revents != 0) return;
     for (int i = 1; i < 3; ++i) {
       if ((fds[i].revents & POLLIN) == 0) continue;
-      const int fd = ::accept4(fds[i].fd, nullptr, nullptr, SOCK_CLOEXEC);
-      if (fd < 0) {
+      UniqueFd fd(::accept4(fds[i].fd, nullptr, nullptr, SOCK_CLOEXEC));
+      if (!fd.valid()) {
         if (errno != EINTR && errno != EAGAIN) {
           Log(LOG_ERR, "%s:%d accept failed [err: %m]", SourceName(__FILE__), __LINE__);
           // Out of descriptors: give connections in flight a moment to close some.
@@ -87,15 +132,44 @@ void Server::AcceptLoop() {
         }
         continue;
       }
-      {
-        std::lock_guard<std::mutex> lock(mu_);
-        ++active_;
+      if (i == 1) {
+        {
+          std::lock_guard<std::mutex> lock(mu_);
+          ++active_;
+          ++main_active_;
+        }
+        std::thread([this, conn = fd.Release()] {
+          Serve(conn, false);
+          ::close(conn);
+          std::lock_guard<std::mutex> lock(mu_);
+          --main_active_;
+          if (--active_ == 0) idle_cv_.notify_all();
+        }).detach();
+        continue;
       }
-      const bool is_public = i == 2;
-      std::thread([this, fd, is_public] {
-        Serve(fd, is_public);
-        ::close(fd);
+      // The public socket: the place is decided here, before any thread, so that a flood of
+      // connections costs the daemon one accept and one close each.
+      uid_t uid;
+      gid_t gid;
+      std::string why;
+      if (!PeerUid(fd.get(), &uid, &gid)) continue;
+      if (!AdmitPublic(uid, &why)) {
+        Refuse(fd.get(), why);
+        // Counted, not logged one by one: a flood must not flood the log too.
+        ++refused;
+        if ((refused & (refused - 1)) == 0) {
+          Log(LOG_WARNING, "%s:%d search socket: %llu connections refused so far, the last: %s",
+              SourceName(__FILE__), __LINE__, static_cast<unsigned long long>(refused),
+              why.c_str());
+        }
+        continue;
+      }
+      std::thread([this, conn = fd.Release(), uid] {
+        Serve(conn, true);
+        ::close(conn);
         std::lock_guard<std::mutex> lock(mu_);
+        --public_active_;
+        if (--public_by_user_[uid] == 0) public_by_user_.erase(uid);
         if (--active_ == 0) idle_cv_.notify_all();
       }).detach();
     }
@@ -103,30 +177,62 @@ void Server::AcceptLoop() {
 }
 
 void Server::Serve(int fd, bool public_socket) {
-  const int64_t deadline = Env::Current()->NowMicros() + options_.io_timeout_micros;
+  const int64_t wait =
+      public_socket ? options_.public_request_timeout_micros : options_.io_timeout_micros;
+  const int64_t deadline = Env::Current()->NowMicros() + wait;
+  const uint32_t max_frame =
+      public_socket ? std::min(options_.max_frame_bytes, options_.max_public_frame_bytes)
+                    : options_.max_frame_bytes;
   auto reply = [&](const Json::Value& r) {
     WriteFrame(fd, JsonToString(r), Env::Current()->NowMicros() + options_.io_timeout_micros);
   };
   uint32_t length = 0;
   if (ReadFrameLength(fd, &length, deadline) != IoStatus::kOk) return;
-  if (length > options_.max_frame_bytes) {
+  if (length > max_frame) {
     // The payload is not read: answer and close, the peer sees the reply or a reset.
     reply(Engine::ErrorReply(kCodeTooLarge, "request of " + std::to_string(length) +
-                                                 " bytes is longer than the limit of " +
-                                                 std::to_string(options_.max_frame_bytes)));
+                                                " bytes is longer than the limit of " +
+                                                std::to_string(max_frame)));
     return;
   }
-  bool busy;
+  uid_t uid = 0;
+  gid_t gid = 0;
+  const bool known = PeerUid(fd, &uid, &gid);
+  std::string busy;
+  bool running = false;
   {
     std::lock_guard<std::mutex> lock(mu_);
-    busy = active_ > options_.max_connections;
+    if (!public_socket) {
+      if (main_active_ > options_.max_connections) busy = "too many connections";
+    } else if (known) {
+      int& mine = running_by_user_[uid];
+      if (mine >= options_.max_public_requests_per_user) {
+        busy = "too many searches of uid " + std::to_string(uid) + " in progress (at most " +
+               std::to_string(options_.max_public_requests_per_user) + "): try again shortly";
+        if (mine == 0) running_by_user_.erase(uid);
+      } else {
+        ++mine;
+        running = true;
+      }
+    }
   }
-  const int refused = busy ? static_cast<int>(kCodeOverloaded) : engine_.AdmitFrame(length);
+  // Leaves the user's count of running requests as it found it, whichever way Serve returns.
+  struct Running {
+    Server* server;
+    uid_t uid;
+    bool on;
+    ~Running() {
+      if (!on) return;
+      std::lock_guard<std::mutex> lock(server->mu_);
+      if (--server->running_by_user_[uid] == 0) server->running_by_user_.erase(uid);
+    }
+  } running_guard{this, uid, running};
+  const int refused =
+      !busy.empty() ? static_cast<int>(kCodeOverloaded) : engine_.AdmitFrame(length);
   if (refused != 0) {
     if (Discard(fd, length, deadline) != IoStatus::kOk) return;
-    reply(Engine::ErrorReply(refused, refused == kCodeOutOfMemory
-                                          ? "the daemon is short of memory"
-                                          : "too many connections"));
+    reply(Engine::ErrorReply(refused,
+                             refused == kCodeOutOfMemory ? "the daemon is short of memory" : busy));
     return;
   }
   std::string payload(length, '\0');
@@ -135,17 +241,16 @@ void Server::Serve(int fd, bool public_socket) {
     engine_.ReleaseFrame(length);
     return;
   }
-  Caller caller;
-  struct ucred cred;
-  socklen_t len = sizeof(cred);
-  if (::getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
+  if (!known) {
     engine_.ReleaseFrame(length);
     reply(Engine::ErrorReply(kCodePermissionDenied, "the caller's identity is unknown"));
     return;
   }
-  caller.uid = cred.uid;
-  caller.gid = cred.gid;
-  caller.privileged = !public_socket && (cred.uid == 0 || cred.uid == options_.service_uid);
+  Caller caller;
+  caller.uid = uid;
+  caller.gid = gid;
+  caller.privileged = !public_socket && (uid == 0 || uid == options_.service_uid);
+  caller.peer_fd = fd;
   Json::Value result;
   try {
     result = engine_.Handle(payload, caller);
@@ -158,6 +263,11 @@ void Server::Serve(int fd, bool public_socket) {
   payload.clear();
   payload.shrink_to_fit();
   engine_.ReleaseFrame(length);
+  if (!result["success"].asBool() && result["error"]["code"].asInt() == kCodeCallerGone) {
+    Log(LOG_INFO, "%s:%d search of uid %u stopped: its client hung up", SourceName(__FILE__),
+        __LINE__, static_cast<unsigned>(uid));
+    return;
+  }
   reply(result);
 }
 

@@ -13,6 +13,7 @@
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/snippet.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -512,6 +513,7 @@ std::unique_ptr<Db> IndexStore::TakeReader() {
   db->Exec("PRAGMA query_only=1");
   db->Exec("PRAGMA cache_size=-16384");
   db->Exec(kMmapPragma);
+  RegisterSnippetFunction(db->get());
   return db;
 }
 
@@ -537,16 +539,13 @@ Json::Value HitOf(Stmt& st, bool has_keywords) {
   hit["mtime"] = static_cast<Json::Int64>(st.Int(3));
   hit["is_dir"] = st.Int(4) != 0;
   hit["ext"] = st.Text(5);
-  if (has_keywords) {
-    hit["snippet"] = st.Text(6);
-    hit["score"] = -st.Double(7);
-  }
+  if (has_keywords) hit["score"] = -st.Double(6);
   return hit;
 }
 
 }  // namespace
 
-SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
+SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard) {
   const std::string match = MatchExpression(p.keywords);
   const bool has_keywords = !match.empty();
   const std::string name = AsciiLower(p.name);
@@ -554,9 +553,12 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
   auto text = [&](const std::string& v) { args.push_back({true, v, 0}); };
   auto number = [&](int64_t v) { args.push_back({false, std::string(), v}); };
 
-  std::string sql = "SELECT d.path, d.name, d.size, d.mtime, d.is_dir, d.ext";
-  sql += has_keywords ? ", snippet(fts_all, 0, '<b>', '</b>', '...', 12), bm25(fts_all)" : "";
-  sql += " FROM docs d";
+  // Snippets are made for the returned page only, after the rows are chosen: counting and
+  // sorting never pay for them.
+  const std::string columns =
+      std::string("SELECT d.path, d.name, d.size, d.mtime, d.is_dir, d.ext") +
+      (has_keywords ? ", bm25(fts_all), d.rowid" : "");
+  std::string sql = " FROM docs d";
   std::string where = " WHERE 1";
   if (has_keywords) {
     sql += " JOIN fts_all ON fts_all.rowid = d.rowid";
@@ -612,7 +614,7 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
   bound(p.mtime_min, " AND d.mtime >= ?");
   bound(p.mtime_max, " AND d.mtime <= ?");
   if (p.is_dir) where += *p.is_dir ? " AND d.is_dir = 1" : " AND d.is_dir = 0";
-  const std::string base = sql + where;
+  const std::string base = columns + sql + where;
   const char* dir = p.desc ? " DESC" : " ASC";
   std::string order;
   switch (p.sort) {
@@ -645,9 +647,15 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
 
   std::unique_ptr<Db> db = TakeReader();
   SearchPage page;
+  std::vector<int64_t> rowids;
+  auto add_hit = [&](Stmt& st) {
+    page.hits.push_back(HitOf(st, has_keywords));
+    if (has_keywords) rowids.push_back(st.Int(7));
+  };
+  const ScopedQueryGuard scoped(*db, guard);
   if (!visible) {
     // Counting stops at a bound, so that a one-letter search over a million names stays fast.
-    Stmt count(*db, "SELECT count(*) FROM (" + base + " LIMIT " +
+    Stmt count(*db, "SELECT count(*) FROM (SELECT d.rowid" + sql + where + " LIMIT " +
                         std::to_string(kCountLimit + 1) + ")");
     bind_all(count);
     if (count.Step()) page.total = count.Int(0);
@@ -658,7 +666,7 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
     Stmt st(*db, base + order + " LIMIT ? OFFSET ?");
     const int next = bind_all(st);
     st.Bind(next, p.size).Bind(next + 1, p.from);
-    while (st.Step()) page.hits.push_back(HitOf(st, has_keywords));
+    while (st.Step()) add_hit(st);
   } else {
     // Hits the user may not open are skipped before paging, so counts and pages only ever
     // reflect what this user can see.
@@ -674,22 +682,34 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible) {
       }
       if (!visible(st.Text(0))) continue;
       ++seen;
-      if (seen > p.from && seen <= p.from + p.size) page.hits.push_back(HitOf(st, has_keywords));
+      if (seen > p.from && seen <= p.from + p.size) add_hit(st);
     }
     page.total = seen;
+  }
+  if (has_keywords && !page.hits.empty()) {
+    Stmt snip(*db, std::string("SELECT ") + kSnippetFunction +
+                       "(fts_all, '<b>', '</b>', '...', 12) FROM fts_all"
+                       " WHERE fts_all MATCH ? AND rowid = ?");
+    for (size_t i = static_cast<size_t>(std::max<int64_t>(p.snippet_from, 0)); i < page.hits.size();
+         ++i) {
+      snip.Reset();
+      snip.Bind(1, match).Bind(2, rowids[i]);
+      page.hits[i]["snippet"] = snip.Step() ? snip.Text(0) : std::string();
+    }
   }
   GiveBackReader(std::move(db));
   return page;
 }
 
 std::vector<std::string> IndexStore::Suggest(const std::string& prefix, size_t limit,
-                                             const VisibleFn& visible) {
+                                             const VisibleFn& visible, QueryGuard* guard) {
   std::vector<std::string> out;
   const std::string low = AsciiLower(prefix);
   const std::optional<std::string> upper = PrefixUpperBound(low);
   if (!upper) return out;
   std::unique_ptr<Db> db = TakeReader();
   {
+    const ScopedQueryGuard scoped(*db, guard);
     std::vector<std::pair<int64_t, std::string>> candidates;
     Stmt st(*db, "SELECT term, doc FROM sugg WHERE term >= ? AND term < ?");
     st.Bind(1, low).Bind(2, *upper);

@@ -19,6 +19,7 @@
 #include <string>
 #include <vector>
 
+#include "daemons/quixelasticd/query_guard.hpp"
 #include "daemons/quixelasticd/schema.hpp"
 #include "daemons/quixelasticd/sqlite_util.hpp"
 
@@ -48,6 +49,8 @@ struct SearchParams {
   bool desc = false;
   int64_t from = 0;
   int64_t size = 20;
+  // Hits before this position of the page get no snippet (the caller drops them).
+  int64_t snippet_from = 0;
 };
 
 struct SearchPage {
@@ -109,11 +112,12 @@ class IndexStore {
   // Checks the database structure; false with a detail when damaged.
   bool QuickCheck(std::string* detail);
 
-  // --- reader side: any thread.
-  SearchPage Search(const SearchParams& p, const VisibleFn& visible);
+  // --- reader side: any thread. A `guard` (may be null) stops the work early: its statement
+  // then fails with a StoreError of SQLITE_INTERRUPT and the guard says why.
+  SearchPage Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard = nullptr);
   // Completions of `prefix` (lower case), most used first.
   std::vector<std::string> Suggest(const std::string& prefix, size_t limit,
-                                   const VisibleFn& visible);
+                                   const VisibleFn& visible, QueryGuard* guard = nullptr);
 
  private:
   explicit IndexStore(std::string dir);
