@@ -353,6 +353,32 @@ TEST_F(DaemonTest, PublicFloodLeavesRoomForTheMainSocketAndOtherUsers) {
   }));
 }
 
+// Requests of one user begun on the public socket are capped; another user and the main socket
+// are not held back by them.
+TEST_F(DaemonTest, PublicRequestsInProgressAreCappedPerUser) {
+  const struct passwd* nobody = ::getpwnam("nobody");
+  ASSERT_NE(nobody, nullptr);
+  Launch({"--public-timeout-ms", "60000", "--max-public-requests-per-user", "2"});
+  const Json::Value search = tc::Parse(R"({"command": "search", "data": {"name": "abc"}})");
+  // Two requests of root begun and never finished.
+  std::vector<UniqueFd> begun;
+  for (int i = 0; i < 2; ++i) {
+    begun.push_back(Connect(daemon_->public_socket(), 10));
+    ASSERT_EQ(::send(begun.back().get(), "\x40\0\0\0", 4, MSG_NOSIGNAL), 4);
+  }
+  EXPECT_TRUE(Eventually([&] {
+    const Json::Value r = tc::Request(daemon_->public_socket(), search);
+    return r["error"]["msg"].asString().find("too many searches of uid 0") != std::string::npos;
+  }));
+  EXPECT_EQ(tc::RequestAs(daemon_->public_socket(), search, nobody->pw_uid,
+                          nobody->pw_gid)["success"],
+            true);
+  EXPECT_EQ(Send(Cmd("index_list", Json::Value()))["success"], true);
+  begun.clear();
+  EXPECT_TRUE(Eventually(
+      [&] { return tc::Request(daemon_->public_socket(), search)["success"].asBool(); }));
+}
+
 // A public connection that sends nothing, or half a request, is closed without an answer once
 // its time is up; one that asks at once is answered.
 TEST_F(DaemonTest, PublicSocketClosesIdleConnections) {
