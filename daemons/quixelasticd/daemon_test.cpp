@@ -370,9 +370,9 @@ TEST_F(DaemonTest, PublicRequestsInProgressAreCappedPerUser) {
     const Json::Value r = tc::Request(daemon_->public_socket(), search);
     return r["error"]["msg"].asString().find("too many searches of uid 0") != std::string::npos;
   }));
-  EXPECT_EQ(tc::RequestAs(daemon_->public_socket(), search, nobody->pw_uid,
-                          nobody->pw_gid)["success"],
-            true);
+  EXPECT_EQ(
+      tc::RequestAs(daemon_->public_socket(), search, nobody->pw_uid, nobody->pw_gid)["success"],
+      true);
   EXPECT_EQ(Send(Cmd("index_list", Json::Value()))["success"], true);
   begun.clear();
   EXPECT_TRUE(Eventually(
