@@ -83,9 +83,8 @@ TEST_F(NotifydCfgTest, AQueuedReconciliationStandsInForNoReindex) {
   AddCustomEvents({{0x10000, trips, "", reconcile}, {0x20000, trips + "/a", "", Json::Value(1)}});
   AddCustomEvent(0x10000, trips, "", Json::Value());
   AddCustomEvent(0x20000, trips + "/b", "", Json::Value(2));
-  EXPECT_EQ(Events("photo"),
-            (Strings{R"(65536 /photo/trips {"reconcile":true})", "131072 /photo/trips/a 1",
-                     "65536 /photo/trips"}));
+  EXPECT_EQ(Events("photo"), (Strings{R"(65536 /photo/trips {"reconcile":true})",
+                                      "131072 /photo/trips/a 1", "65536 /photo/trips"}));
   EXPECT_TRUE(QueueLines("photo")[0]["is_dir"].asBool());
 }
 

@@ -235,8 +235,8 @@ TEST_F(EndToEndTest, ChangesMadeWhileDaemonsAreAwayAreFoundWhenTheyAreBack) {
     ASSERT_EQ(0, Shell("rm -rf " + D("proj/doomed" + n)));
     WriteFile(D("proj/new" + n + "/sub/f.txt"), "new");
     WriteFile(D("proj/keep.txt"), "grown in round " + n);
-    ASSERT_EQ(0, rename(D("proj/new" + n + "/sub/f.txt").c_str(),
-                        D("proj/new" + n + "/g.txt").c_str()));
+    ASSERT_EQ(
+        0, rename(D("proj/new" + n + "/sub/f.txt").c_str(), D("proj/new" + n + "/g.txt").c_str()));
   };
 
   notifyd_->Signal(SIGKILL);

@@ -143,8 +143,8 @@ void IndexDaemon::ReconcileAll() {
     reconcile["reconcile"] = true;
     std::vector<fileindex::CustomEvent> events;
     for (const auto& folder : folders.folders()) {
-      events.push_back({static_cast<int>(fileindex::kEventReindex), folder->GetFullPath(), "",
-                        reconcile});
+      events.push_back(
+          {static_cast<int>(fileindex::kEventReindex), folder->GetFullPath(), "", reconcile});
     }
     fileindex::AddCustomEvents(events);
     Log(LOG_INFO, "fileindexd: reconciliation of %zu folders queued", events.size());

@@ -97,8 +97,11 @@ Watcher::Watcher(const WatcherOptions& options)
 void Watcher::Reload() {
   reload_ = false;
   unwatched_.clear();
-  for (const auto& [wd, dir] : dirs_) inotify_rm_watch(fd_.get(), wd);
-  dirs_.clear();
+  // The watches of directories still wanted are kept (adding a watch again returns its
+  // descriptor), so that no change is missed while the registrations are read again; the others
+  // go once the new ones are in place.
+  std::unordered_map<int, Dir> former;
+  former.swap(dirs_);
   moves_.clear();
   targets_.clear();
   watch_mask_ = kDirEvents;
@@ -117,6 +120,9 @@ void Watcher::Reload() {
   for (size_t i = 0; i < targets_.size(); ++i) WatchTree(targets_[i].root, {i}, true);
   Log(LOG_INFO, "%s:%d watching %zu folders of %zu registrations in %zu directories",
       SourceName(__FILE__), __LINE__, targets_.size(), records.size(), dirs_.size());
+  for (const auto& entry : former) {
+    if (dirs_.count(entry.first) == 0) inotify_rm_watch(fd_.get(), entry.first);
+  }
   UpdateLimitMarks();
 }
 
@@ -267,7 +273,7 @@ void Watcher::UpdateLimitMarks() {
     it = limited_.erase(it);
   }
   for (const std::string& root : unmarked) {
-    Log(LOG_INFO, "%s:%d every directory below %s is watched again: its periodic reconciliation ends",
+    Log(LOG_INFO, "%s:%d %s is no longer short of watches: its periodic reconciliation ends",
         SourceName(__FILE__), __LINE__, root.c_str());
     const std::string share = ShareOf(root);
     // The share keeps its mark while another of its folders is still short of watches.
