@@ -43,14 +43,13 @@ void NotifyLackOfMemory() {
                        static_cast<const char*>(nullptr));
 }
 
-void NotifyWatchLimit(const std::string& folder, long long needed) {
+void NotifyWatchLimit(const std::string& folder, const std::string& setting, long long needed) {
   KeepErrno keep;
   const std::string notifier = RootedPath(platform::kNotifierPath);
   const std::string at_least = needed > 0 ? std::to_string(needed) : "more";
   platform::QLIBCExecl(notifier.c_str(), kNotifierExecFlags, "-c", "QUIX.Orvane.Application",
                        "@administrators", "app:displayname", "error:watch_limit", folder.c_str(),
-                       "fs.inotify.max_user_watches", at_least.c_str(),
-                       static_cast<const char*>(nullptr));
+                       setting.c_str(), at_least.c_str(), static_cast<const char*>(nullptr));
 }
 
 }  // namespace fileindex

@@ -13,9 +13,9 @@ namespace fileindex {
 void SendZRMNotify();
 // The search engine lacks memory (it keeps answering that it is busy).
 void NotifyLackOfMemory();
-// The inotify watch limit leaves directories below `folder` unwatched: fs.inotify.max_user_watches
-// must be raised to `needed` (-1 when not known).
-void NotifyWatchLimit(const std::string& folder, long long needed);
+// The inotify watch limit leaves directories below `folder` unwatched: the sysctl `setting` must
+// be raised to `needed` (-1 when not known).
+void NotifyWatchLimit(const std::string& folder, const std::string& setting, long long needed);
 
 }  // namespace fileindex
 }  // namespace orvane

@@ -39,8 +39,6 @@ constexpr uint32_t kDirEvents = IN_ATTRIB | IN_CLOSE_WRITE | IN_CREATE | IN_DELE
 // of the watched folders. The kernel queues both halves together, so this is rarely needed.
 constexpr int kMovePairMillis = 20;
 
-constexpr char kMaxWatchesPath[] = "/proc/sys/fs/inotify/max_user_watches";
-
 // Through the fault seam, so that tests can run out of watches without touching the machine's
 // limit.
 int AddWatch(int fd, const std::string& path, uint32_t mask) {
@@ -72,9 +70,26 @@ std::string ShareOf(const std::string& path) {
   }
 }
 
-long long MaxUserWatches() {
-  long long limit = -1;
-  std::ifstream(kMaxWatchesPath) >> limit;
+long long ReadNumber(const char* path) {
+  long long value = -1;
+  std::ifstream(path) >> value;
+  return value;
+}
+
+// The inotify watch limit in force and the setting that holds it: the machine's, or a lower one
+// of the user namespace the daemon runs in (a container).
+struct WatchLimit {
+  const char* setting;
+  long long value;
+};
+
+WatchLimit CurrentWatchLimit() {
+  WatchLimit limit{"fs.inotify.max_user_watches",
+                   ReadNumber("/proc/sys/fs/inotify/max_user_watches")};
+  const long long own = ReadNumber("/proc/sys/user/max_inotify_watches");
+  if (own > 0 && (limit.value <= 0 || own < limit.value)) {
+    limit = WatchLimit{"user.max_inotify_watches", own};
+  }
   return limit;
 }
 
@@ -284,19 +299,19 @@ void Watcher::UpdateLimitMarks() {
   }
   if (marked.empty()) return;
   if (none_before) next_limit_retry_ = Env::Current()->NowMicros() + options_.limit_retry_micros;
-  const long long limit = MaxUserWatches();
-  const long long needed = limit > 0 ? limit + static_cast<long long>(missing) : -1;
+  const WatchLimit limit = CurrentWatchLimit();
+  const long long needed = limit.value > 0 ? limit.value + static_cast<long long>(missing) : -1;
   for (const std::string& root : marked) {
     Log(LOG_ERR,
         "%s:%d %zu directories below %s are not watched: the inotify watch limit is reached. "
-        "Raise fs.inotify.max_user_watches (now %lld) to at least %lld, e.g. in "
-        "/etc/sysctl.d/ and with sysctl -w; until then the folder is reconciled every %lld s",
-        SourceName(__FILE__), __LINE__, unwatched_[root], root.c_str(), limit, needed,
-        static_cast<long long>(options_.limit_retry_micros / 1000000));
+        "Raise %s (now %lld) to at least %lld, e.g. in /etc/sysctl.d/ and with sysctl -w; "
+        "until then the folder is reconciled every %lld s",
+        SourceName(__FILE__), __LINE__, unwatched_[root], root.c_str(), limit.setting, limit.value,
+        needed, static_cast<long long>(options_.limit_retry_micros / 1000000));
     FlagShare(root, fileindex::kShareStatusWatchLimit, true);
   }
   // One notification for the folders found short together, not one per folder.
-  fileindex::NotifyWatchLimit(marked.front(), needed);
+  fileindex::NotifyWatchLimit(marked.front(), limit.setting, needed);
 }
 
 void Watcher::CheckWatchLimit() {

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sched.h>
 #include <signal.h>
 #include <sys/mount.h>
 #include <sys/stat.h>
@@ -12,6 +13,7 @@
 #include <algorithm>
 #include <cstdlib>
 #include <fstream>
+#include <functional>
 #include <sstream>
 
 #include "common/json_util.hpp"
@@ -172,14 +174,20 @@ TEST_F(WatcherTest, FolderShortOfWatchesIsMarkedAndReconciledUntilTheyFit) {
   Watcher w(options);
   EXPECT_EQ(w.watch_count(), 1u);
   EXPECT_THAT(w.limited_folders(), ElementsAre(share_ + "/docs"));
+  // The limit in force: the machine's, or a lower one of a user namespace the test runs in.
   long long limit = 0;
+  long long own = 0;
   std::ifstream("/proc/sys/fs/inotify/max_user_watches") >> limit;
+  std::ifstream("/proc/sys/user/max_inotify_watches") >> own;
+  const std::string setting =
+      own > 0 && own < limit ? "user.max_inotify_watches" : "fs.inotify.max_user_watches";
+  if (own > 0 && own < limit) limit = own;
   EXPECT_TRUE(log.Contains("3 directories below " + share_ + "/docs are not watched"));
-  EXPECT_TRUE(log.Contains("Raise fs.inotify.max_user_watches (now " + std::to_string(limit) +
+  EXPECT_TRUE(log.Contains("Raise " + setting + " (now " + std::to_string(limit) +
                            ") to at least " + std::to_string(limit + 3)));
   EXPECT_EQ(ShareFlags(), fileindex::kShareStatusWatchLimit);
-  const std::string told = "error:watch_limit " + share_ + "/docs fs.inotify.max_user_watches " +
-                           std::to_string(limit + 3);
+  const std::string told =
+      "error:watch_limit " + share_ + "/docs " + setting + " " + std::to_string(limit + 3);
   EXPECT_EQ(Notified(),
             "-c QUIX.Orvane.Application @administrators app:displayname " + told + "\n");
 
@@ -374,6 +382,92 @@ TEST_F(WatcherTest, DaemonRunsAndStops) {
   waitpid(pid, &status, 0);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
   EXPECT_FALSE(IsFileExist(pid_file));
+}
+
+// The real daemon under a real limit: in a user namespace of its own whose watch limit leaves
+// most directories unwatched, raised while it runs. Skipped where user namespaces are refused.
+TEST_F(WatcherTest, DaemonUnderARealWatchLimitMarksTheShareUntilTheLimitIsRaised) {
+  for (int i = 0; i < 6; ++i) Mkdir("/docs/d" + std::to_string(i));
+  int ready[2];
+  int go[2];
+  ASSERT_EQ(0, pipe2(ready, O_CLOEXEC));
+  ASSERT_EQ(0, pipe2(go, O_CLOEXEC));
+  const pid_t pid = fork();
+  if (pid == 0) {
+    // Every id maps to itself, so the daemon is root as before, under a limit of its own of
+    // three watches: the registrations folder, the share's folder and one directory of six.
+    char c = 0;
+    if (unshare(CLONE_NEWUSER) != 0 || write(ready[1], "u", 1) != 1 || read(go[0], &c, 1) != 1) {
+      _exit(126);
+    }
+    const int limit = open("/proc/sys/user/max_inotify_watches", O_WRONLY | O_CLOEXEC);
+    if (limit < 0 || write(limit, "3\n", 2) != 2) _exit(126);
+    const int null = open("/dev/null", O_WRONLY | O_CLOEXEC);
+    if (null >= 0 && getenv("WATCHER_TEST_STDERR") == nullptr) dup2(null, 2);
+    execl(QUIXNOTIFYD_BIN, "quixnotifyd", "--limit-retry", "1", static_cast<char*>(nullptr));
+    _exit(127);
+  }
+  close(ready[1]);
+  close(go[0]);
+  char c = 0;
+  const bool unshared = read(ready[0], &c, 1) == 1;
+  for (const char* map : {"uid_map", "gid_map"}) {
+    std::ofstream("/proc/" + std::to_string(pid) + "/" + map) << "0 0 4294967295\n";
+  }
+  EXPECT_EQ(1, write(go[1], "g", 1));
+  close(ready[0]);
+  close(go[1]);
+  if (!unshared) {
+    waitpid(pid, nullptr, 0);
+    GTEST_SKIP() << "no user namespace here";
+  }
+  const auto flags = [this] {
+    try {
+      return ShareFlags();
+    } catch (const Error&) {
+      return -1;  // no status file yet
+    }
+  };
+  const auto wait_for = [](const std::function<bool()>& pred) {
+    for (int i = 0; i < 500 && !pred(); ++i) usleep(20000);
+    return pred();
+  };
+  int status = 0;
+  if (!wait_for([&] {
+        return flags() == fileindex::kShareStatusWatchLimit ||
+               waitpid(pid, &status, WNOHANG) == pid;
+      }) ||
+      flags() != fileindex::kShareStatusWatchLimit) {
+    if (waitpid(pid, &status, WNOHANG) == pid || kill(pid, 0) != 0) {
+      GTEST_SKIP() << "no user namespace with a watch limit of its own here";
+    }
+    kill(pid, SIGKILL);
+    waitpid(pid, &status, 0);
+    FAIL() << "the share was never marked";
+  }
+  // Told after the mark is set.
+  const std::string told = "error:watch_limit " + share_ + "/docs user.max_inotify_watches 8\n";
+  EXPECT_TRUE(wait_for([&] { return Notified().find(told) != std::string::npos; })) << Notified();
+  // Reconciled at start and again every second while the limit holds.
+  EXPECT_TRUE(wait_for([&] {
+    const std::vector<std::string> lines = QueueLines(queue_, share_);
+    return std::count(lines.begin(), lines.end(), "10000 dir /docs reconcile") >= 3;
+  }));
+
+  ASSERT_EQ(0, std::system(("nsenter -U -t " + std::to_string(pid) +
+                            " sh -c 'echo 100 > /proc/sys/user/max_inotify_watches'")
+                               .c_str()));
+  EXPECT_TRUE(wait_for([&] { return flags() == 0; }));
+  Touch("/docs/d5/late.txt");
+  EXPECT_TRUE(wait_for([&] {
+    const std::vector<std::string> lines = QueueLines(queue_, share_);
+    return std::count(lines.begin(), lines.end(), "40 /docs/d5/late.txt") == 1;
+  }));
+  const std::string notified = Notified();
+  EXPECT_EQ(std::count(notified.begin(), notified.end(), '\n'), 1);
+  kill(pid, SIGTERM);
+  waitpid(pid, &status, 0);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
 }
 
 }  // namespace
