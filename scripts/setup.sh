@@ -9,7 +9,7 @@ packages=(
   libgtest-dev libgmock-dev googletest libbenchmark-dev
   libmagic-dev libpoppler-cpp-dev libtag1-dev libexiv2-dev libarchive-dev
   libxml2-dev libuchardet-dev libmediainfo-dev
-  e2fsprogs mount util-linux
+  e2fsprogs mount util-linux acl passwd
 )
 
 missing=()

@@ -1,14 +1,55 @@
 #include "daemons/quixelasticd/access.hpp"
 
+#include <endian.h>
+#include <errno.h>
 #include <grp.h>
+#include <linux/posix_acl.h>
+#include <linux/posix_acl_xattr.h>
 #include <pwd.h>
-#include <sys/stat.h>
+#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+
+#include "platform/fault.hpp"
 
 namespace orvane {
 namespace elasticd {
+
+namespace {
+
+constexpr const char kIndexInShare[] = "/@eaDir/@fileindex/db";
+constexpr const char kAclName[] = "system.posix_acl_access";
+// The kernel gives up resolving a path after this many symlinks.
+constexpr int kMaxLinks = 40;
+
+// Absolute, without empty, "." or ".." components: the walk below lstat()s each prefix, and
+// such a component (or a trailing slash, which makes lstat follow a symlink) would make a prefix
+// name something else than the folder the path goes through.
+bool IsPlainPath(const std::string& path) {
+  if (path.empty() || path[0] != '/') return false;
+  if (path == "/") return true;
+  size_t start = 1;
+  while (start <= path.size()) {
+    size_t end = path.find('/', start);
+    if (end == std::string::npos) end = path.size();
+    const size_t len = end - start;
+    if (len == 0) return false;
+    if (len <= 2 && path.compare(start, len, std::string(len, '.')) == 0) return false;
+    start = end + 1;
+  }
+  return true;
+}
+
+std::string ParentOf(const std::string& path) {
+  const size_t slash = path.find_last_of('/');
+  return slash == 0 ? "/" : path.substr(0, slash);
+}
+
+}  // namespace
 
 AccessChecker::AccessChecker(uid_t uid, gid_t gid) : uid_(uid), groups_{gid} {
   struct passwd pw;
@@ -24,42 +65,159 @@ AccessChecker::AccessChecker(uid_t uid, gid_t gid) : uid_(uid), groups_{gid} {
     groups.resize(std::max(n, 0));
     groups_.insert(groups_.end(), groups.begin(), groups.end());
   }
+  std::sort(groups_.begin(), groups_.end());
+  groups_.erase(std::unique(groups_.begin(), groups_.end()), groups_.end());
 }
 
-int AccessChecker::Bits(const std::string& path) {
-  struct stat st;
-  if (::stat(path.c_str(), &st) != 0) return -1;
-  if (st.st_uid == uid_) return (st.st_mode >> 6) & 7;
-  if (std::find(groups_.begin(), groups_.end(), st.st_gid) != groups_.end()) {
-    return (st.st_mode >> 3) & 7;
+AccessChecker::AccessChecker(uid_t uid, std::vector<gid_t> groups)
+    : uid_(uid), groups_(std::move(groups)) {
+  std::sort(groups_.begin(), groups_.end());
+  groups_.erase(std::unique(groups_.begin(), groups_.end()), groups_.end());
+}
+
+std::string AccessChecker::ShareRootOf(const std::string& index_dir) {
+  std::string dir = index_dir;
+  while (dir.size() > 1 && dir.back() == '/') dir.pop_back();
+  const size_t n = sizeof(kIndexInShare) - 1;
+  if (dir.size() <= n || dir.compare(dir.size() - n, n, kIndexInShare) != 0) return "";
+  const std::string root = dir.substr(0, dir.size() - n);
+  return IsPlainPath(root) ? root : "";
+}
+
+bool AccessChecker::InGroup(gid_t gid) const {
+  return std::binary_search(groups_.begin(), groups_.end(), gid);
+}
+
+int AccessChecker::AclBits(const std::string& path, const struct stat& st) {
+  // Most files carry no ACL; the small buffer holds the common ones without an allocation.
+  char small[sizeof(posix_acl_xattr_header) + 16 * sizeof(posix_acl_xattr_entry)];
+  std::unique_ptr<char[]> large;
+  char* buf = small;
+  ssize_t n;
+  if (auto fault = platform::FaultFor("AccessAclGet")) {
+    n = fault->result;
+    errno = fault->err;
+  } else {
+    // lgetxattr: the walk has found no symlink here; should one have been swapped in since,
+    // its (absent) ACL is read rather than its target's.
+    n = ::lgetxattr(path.c_str(), kAclName, small, sizeof(small));
+    if (n < 0 && errno == ERANGE) {
+      const ssize_t want = ::lgetxattr(path.c_str(), kAclName, nullptr, 0);
+      if (want > 0) {
+        large.reset(new char[static_cast<size_t>(want)]);
+        buf = large.get();
+        n = ::lgetxattr(path.c_str(), kAclName, buf, static_cast<size_t>(want));
+      }
+    }
   }
+  if (n < 0) return errno == ENODATA || errno == ENOTSUP ? -1 : 0;
+
+  // The kernel's stored form: a version, then entries in the order user owner, named users,
+  // owning group, named groups, mask, other. Anything else is refused as the kernel would.
+  posix_acl_xattr_header header;
+  if (static_cast<size_t>(n) < sizeof(header)) return 0;
+  std::memcpy(&header, buf, sizeof(header));
+  const size_t count = (static_cast<size_t>(n) - sizeof(header)) / sizeof(posix_acl_xattr_entry);
+  if (le32toh(header.a_version) != POSIX_ACL_XATTR_VERSION ||
+      sizeof(header) + count * sizeof(posix_acl_xattr_entry) != static_cast<size_t>(n)) {
+    return 0;
+  }
+  int mask = 7;
+  int other = 0;
+  int user = -1;   // a named entry for this user
+  int group = -1;  // the union of the group entries that match
+  for (size_t i = 0; i < count; ++i) {
+    posix_acl_xattr_entry e;
+    std::memcpy(&e, buf + sizeof(header) + i * sizeof(e), sizeof(e));
+    const int perm = le16toh(e.e_perm) & 7;
+    const uint32_t id = le32toh(e.e_id);
+    switch (le16toh(e.e_tag)) {
+      case ACL_USER_OBJ:
+        break;  // the owner was decided from the mode bits, which mirror this entry
+      case ACL_USER:
+        if (id == uid_ && user < 0) user = perm;
+        break;
+      case ACL_GROUP_OBJ:
+        if (InGroup(st.st_gid)) group = std::max(group, 0) | perm;
+        break;
+      case ACL_GROUP:
+        if (InGroup(id)) group = std::max(group, 0) | perm;
+        break;
+      case ACL_MASK:
+        mask = perm;
+        break;
+      case ACL_OTHER:
+        other = perm;
+        break;
+      default:
+        return 0;
+    }
+  }
+  // A named user entry wins over every group; a matching group (any of them, each asked for
+  // one permission at a time) wins over other, and both are limited by the mask. Taking the
+  // union of the matching groups is exact because every question asked here is a single bit.
+  if (user >= 0) return user & mask;
+  if (group >= 0) return group & mask;
+  return other;
+}
+
+int AccessChecker::Bits(const std::string& path, const struct stat& st) {
+  if (st.st_uid == uid_) return (st.st_mode >> 6) & 7;
+  // With no group class bits the kernel does not look at the ACL at all.
+  if ((st.st_mode & S_IRWXG) != 0) {
+    const int acl = AclBits(path, st);
+    if (acl >= 0) return acl;
+  }
+  if (InGroup(st.st_gid)) return (st.st_mode >> 3) & 7;
   return st.st_mode & 7;
 }
 
-bool AccessChecker::CanEnter(const std::string& dir) {
-  auto it = dirs_.find(dir);
-  if (it != dirs_.end()) return it->second;
-  bool ok = true;
-  if (dir != "/") {
-    const size_t slash = dir.find_last_of('/');
-    if (slash == std::string::npos) return false;
-    ok = CanEnter(slash == 0 ? "/" : dir.substr(0, slash));
+AccessChecker::Folder AccessChecker::FolderOf(const std::string& dir, int links) {
+  auto it = folders_.find(dir);
+  if (it != folders_.end()) return it->second;
+  Folder parent;
+  parent.enter = true;
+  if (dir != "/") parent = FolderOf(ParentOf(dir), links);
+  Folder f;
+  struct stat st;
+  if (parent.enter && ::lstat(dir.c_str(), &st) == 0) {
+    if (S_ISDIR(st.st_mode)) {
+      const int bits = Bits(dir, st);
+      f.enter = (bits & 1) != 0;
+      f.list = (bits & 4) != 0;
+      f.link_end = parent.link_end;
+    } else if (S_ISLNK(st.st_mode) && links < kMaxLinks) {
+      // Whether this link may be followed depends on the share it is asked for; the answer
+      // for its target is what the kernel would find, and the link is remembered.
+      std::unique_ptr<char, decltype(&std::free)> real(::realpath(dir.c_str(), nullptr),
+                                                        &std::free);
+      if (real && IsPlainPath(real.get())) {
+        f = FolderOf(real.get(), links + 1);
+        f.link_end = dir.size();
+      }
+    }
   }
-  if (ok) {
-    const int bits = Bits(dir);
-    ok = bits >= 0 && (bits & 1) != 0;
-  }
-  dirs_[dir] = ok;
-  return ok;
+  folders_[dir] = f;
+  return f;
 }
 
-bool AccessChecker::CanOpen(const std::string& path) {
+bool AccessChecker::CanOpen(const std::string& path, const std::string& share_root) {
   if (uid_ == 0) return true;
-  if (path.empty() || path[0] != '/') return false;
-  const size_t slash = path.find_last_of('/');
-  if (!CanEnter(slash == 0 ? "/" : path.substr(0, slash))) return false;
-  const int bits = Bits(path);
-  return bits >= 0 && (bits & 4) != 0;
+  if (!IsPlainPath(path) || path == "/") return false;
+  const Folder parent = FolderOf(ParentOf(path), 0);
+  if (!parent.enter || !parent.list) return false;
+  // A symlink at or above the share's root is the administrator's; one below it is not.
+  size_t followed = 0;
+  if (!share_root.empty() && path.size() > share_root.size() &&
+      path.compare(0, share_root.size(), share_root) == 0 &&
+      (share_root == "/" || path[share_root.size()] == '/')) {
+    followed = share_root.size();
+  }
+  if (parent.link_end > followed) return false;
+  struct stat st;
+  if (::lstat(path.c_str(), &st) != 0) return false;
+  if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) return false;
+  return (Bits(path, st) & 4) != 0;
 }
 
 }  // namespace elasticd

@@ -1,14 +1,17 @@
-// AccessChecker answers whether one local user could open a file: read permission on the file
-// (and search permission on a folder) plus search permission on every folder above it, from
-// the mode bits, owner and group of each, against the user's groups.
+// AccessChecker answers whether one local user could open a file now, decided as the kernel
+// decides it: search permission on every folder from "/" down, read permission on the file's
+// own folder (to list its name) and on the file, from the owner, group, mode bits and POSIX
+// ACL of each, against the user's groups. Below the share's root no symlink is followed: a
+// symlink on the way, or as the file itself, hides the file.
 // One checker serves one request; it caches folder answers and is not thread-safe.
 #ifndef ORVANE_DAEMONS_QUIXELASTICD_ACCESS_HPP_
 #define ORVANE_DAEMONS_QUIXELASTICD_ACCESS_HPP_
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
-#include <map>
 #include <string>
+#include <unordered_map>
 #include <vector>
 
 namespace orvane {
@@ -16,22 +19,40 @@ namespace elasticd {
 
 class AccessChecker {
  public:
-  // Loads the supplementary groups of `uid` from the user database.
+  // Loads the supplementary groups of `uid` from the user database; `gid` is the caller's own.
   AccessChecker(uid_t uid, gid_t gid);
+  // Exactly these groups, for a caller whose groups are known.
+  AccessChecker(uid_t uid, std::vector<gid_t> groups);
   AccessChecker(const AccessChecker&) = delete;
   AccessChecker& operator=(const AccessChecker&) = delete;
 
-  // False for a file that is gone, unreadable or behind a folder the user cannot enter.
-  bool CanOpen(const std::string& path);
+  // False for a file that is gone, unreadable, a symlink, in a folder the user cannot list or
+  // behind one the user cannot enter. Symlinks at or above `share_root` are followed as the
+  // kernel follows them; with no share root none is. `path` must be absolute and plain (no
+  // empty, "." or ".." component), as the indexer writes it.
+  bool CanOpen(const std::string& path, const std::string& share_root = std::string());
+
+  // The share root of an index kept in its share's own folder ("<share>/@eaDir/@fileindex/db"),
+  // "" for an index kept anywhere else.
+  static std::string ShareRootOf(const std::string& index_dir);
 
  private:
-  // The permission bits (4 read, 2 write, 1 search) that apply to this user, or -1.
-  int Bits(const std::string& path);
-  bool CanEnter(const std::string& dir);
+  struct Folder {
+    bool enter = false;   // this folder and every one above it may be searched
+    bool list = false;    // and this one may be read
+    size_t link_end = 0;  // length of the deepest symlink on the way to it, 0 when none
+  };
+
+  Folder FolderOf(const std::string& dir, int links);
+  // The permission bits (4 read, 2 write, 1 search) the user has on the inode `st` of `path`.
+  int Bits(const std::string& path, const struct stat& st);
+  // The bits an access ACL gives a user who does not own the file; -1 when there is no ACL.
+  int AclBits(const std::string& path, const struct stat& st);
+  bool InGroup(gid_t gid) const;
 
   uid_t uid_;
-  std::vector<gid_t> groups_;
-  std::map<std::string, bool> dirs_;
+  std::vector<gid_t> groups_;  // sorted, unique
+  std::unordered_map<std::string, Folder> folders_;
 };
 
 }  // namespace elasticd

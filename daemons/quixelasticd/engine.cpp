@@ -99,8 +99,6 @@ bool IsOneIndexBatch(const Json::Value& list) {
   return !first.empty();
 }
 
-// Root sees every hit; anyone else only the files they could open. The checker lives as long
-// as the request's function, so its folder answers are shared by every hit of the request.
 // Runs a read; a statement the guard interrupted is answered with why it stopped.
 template <typename Fn>
 auto Guarded(QueryGuard* guard, Fn fn) -> decltype(fn()) {
@@ -112,10 +110,19 @@ auto Guarded(QueryGuard* guard, Fn fn) -> decltype(fn()) {
   }
 }
 
-VisibleFn VisibleTo(const Caller& caller) {
-  if (caller.uid == 0) return VisibleFn();
-  auto checker = std::make_shared<AccessChecker>(caller.uid, caller.gid);
-  return [checker](const std::string& path) { return checker->CanOpen(path); };
+// Root sees every hit (no checker); anyone else only the files they could open. One checker
+// serves the whole request, so its folder answers are shared by every hit of every index.
+std::shared_ptr<AccessChecker> CheckerFor(const Caller& caller) {
+  if (caller.uid == 0) return nullptr;
+  return std::make_shared<AccessChecker>(caller.uid, caller.gid);
+}
+
+// The check for the hits of one index: symlinks are followed only down to its share's root.
+VisibleFn VisibleIn(const std::shared_ptr<AccessChecker>& checker, const IndexStore& store) {
+  if (!checker) return VisibleFn();
+  return [checker, root = AccessChecker::ShareRootOf(store.dir())](const std::string& path) {
+    return checker->CanOpen(path, root);
+  };
 }
 
 const char* StateText(int code) {
@@ -1087,7 +1094,7 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller, QueryG
   }
 
   std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
-  const VisibleFn visible = VisibleTo(caller);
+  const std::shared_ptr<AccessChecker> checker = CheckerFor(caller);
   // Each index gives its best from + size hits; the merge keeps the global order.
   SearchParams each = p;
   each.from = 0;
@@ -1098,7 +1105,8 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller, QueryG
   bool exact = true;
   std::vector<Json::Value> hits;
   for (auto& store : stores) {
-    SearchPage page = Guarded(guard, [&] { return store->Search(each, visible, guard); });
+    SearchPage page =
+        Guarded(guard, [&] { return store->Search(each, VisibleIn(checker, *store), guard); });
     total += page.total;
     exact = exact && page.total_exact;
     for (Json::Value& h : page.hits) hits.push_back(std::move(h));
@@ -1139,11 +1147,12 @@ Json::Value Engine::Suggest(const Json::Value& data, const Caller& caller, Query
   const std::string prefix = RequireString(d, "prefix");
   const int64_t size = std::min<int64_t>(OptionalInt(d, "size", 10), 100);
   std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
-  const VisibleFn visible = VisibleTo(caller);
+  const std::shared_ptr<AccessChecker> checker = CheckerFor(caller);
   std::vector<std::string> terms;
   for (auto& store : stores) {
     for (const std::string& t : Guarded(guard, [&] {
-           return store->Suggest(prefix, static_cast<size_t>(size), visible, guard);
+           return store->Suggest(prefix, static_cast<size_t>(size), VisibleIn(checker, *store),
+                                 guard);
          })) {
       if (std::find(terms.begin(), terms.end(), t) == terms.end()) terms.push_back(t);
     }

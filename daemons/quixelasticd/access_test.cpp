@@ -1,0 +1,284 @@
+// The search-time permission check against real files, real ACLs, real symlinks and real
+// users (nobody, and a user and group this test creates and removes), compared with what the
+// kernel itself lets that user open.
+#include "daemons/quixelasticd/access.hpp"
+
+#include <fcntl.h>
+#include <grp.h>
+#include <pwd.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <functional>
+
+#include <gtest/gtest.h>
+
+#include "platform/fault.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace elasticd {
+namespace {
+
+int Shell(const std::string& command) {
+  const int rc = std::system(command.c_str());
+  return WIFEXITED(rc) ? WEXITSTATUS(rc) : -1;
+}
+
+// A group and a user who belongs to it besides its own primary group "nogroup", created with
+// groupadd/useradd for the test and always removed.
+class ScopedUser {
+ public:
+  ScopedUser() : name_("fiacc" + std::to_string(::getpid())) {
+    ok_ = Shell("groupadd " + name_ + "g") == 0 &&
+          Shell("useradd -M -N -g nogroup -G " + name_ + "g -s /usr/sbin/nologin " + name_) == 0;
+    const struct passwd* pw = ::getpwnam(name_.c_str());
+    const struct group* gr = ::getgrnam((name_ + "g").c_str());
+    ok_ = ok_ && pw != nullptr && gr != nullptr;
+    if (ok_) {
+      uid_ = pw->pw_uid;
+      gid_ = pw->pw_gid;
+      group_ = gr->gr_gid;
+    }
+  }
+  ~ScopedUser() {
+    Shell("userdel " + name_ + " 2>/dev/null");
+    Shell("groupdel " + name_ + "g 2>/dev/null");
+  }
+  ScopedUser(const ScopedUser&) = delete;
+  ScopedUser& operator=(const ScopedUser&) = delete;
+
+  bool ok() const { return ok_; }
+  const std::string& name() const { return name_; }
+  std::string group_name() const { return name_ + "g"; }
+  uid_t uid() const { return uid_; }
+  gid_t gid() const { return gid_; }
+  gid_t group() const { return group_; }
+
+ private:
+  std::string name_;
+  bool ok_ = false;
+  uid_t uid_ = 0;
+  gid_t gid_ = 0;
+  gid_t group_ = 0;
+};
+
+// Runs `fn` in a child with the full identity of `user` (its groups from the user database,
+// as a login gives them); its return value, or -1.
+int AsUser(const std::string& user, const std::function<int()>& fn) {
+  const struct passwd* pw = ::getpwnam(user.c_str());
+  if (pw == nullptr) return -1;
+  const uid_t uid = pw->pw_uid;
+  const gid_t gid = pw->pw_gid;
+  const pid_t pid = ::fork();
+  if (pid == 0) {
+    if (::initgroups(user.c_str(), gid) != 0 || ::setgid(gid) != 0 || ::setuid(uid) != 0) {
+      _exit(255);
+    }
+    _exit(fn() & 0xff);
+  }
+  int status = 0;
+  if (pid < 0 || ::waitpid(pid, &status, 0) != pid || !WIFEXITED(status) ||
+      WEXITSTATUS(status) == 255) {
+    return -1;
+  }
+  return WEXITSTATUS(status);
+}
+
+// What the kernel lets `user` do: list the file's folder and open the file for reading.
+bool KernelLets(const std::string& user, const std::string& path) {
+  return AsUser(user, [&] {
+           const std::string parent = path.substr(0, path.find_last_of('/'));
+           const int dir = ::open(parent.c_str(), O_RDONLY | O_DIRECTORY);
+           const int fd = ::open(path.c_str(), O_RDONLY | O_NONBLOCK);
+           return dir >= 0 && fd >= 0 ? 1 : 0;
+         }) == 1;
+}
+
+class AccessTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (::geteuid() != 0) GTEST_SKIP() << "needs root to create users and switch to them";
+    ASSERT_TRUE(user_.ok()) << "groupadd/useradd failed";
+    ::chmod(dir_.path().c_str(), 0755);
+  }
+  // A file (or folder, for a name ending in '/') owned by root and `gid`, with `mode`, then
+  // `acl` applied with setfacl -m (USER and GROUP in it stand for the test user and group).
+  std::string Make(const std::string& rel, mode_t mode, std::string acl = "", gid_t gid = 0) {
+    std::string path = dir_.Path(rel);
+    if (path.back() == '/') {
+      path.pop_back();
+      EXPECT_EQ(Shell("mkdir -p '" + path + "'"), 0);
+    } else {
+      dir_.Write(rel, "x");
+    }
+    EXPECT_EQ(::chown(path.c_str(), 0, gid), 0);
+    EXPECT_EQ(::chmod(path.c_str(), mode), 0);
+    for (const auto& [from, to] : {std::pair<std::string, std::string>{"USER", user_.name()},
+                                   {"GROUP", user_.group_name()}}) {
+      for (size_t at; (at = acl.find(from)) != std::string::npos;) acl.replace(at, from.size(), to);
+    }
+    if (!acl.empty()) EXPECT_EQ(Shell("setfacl -m " + acl + " '" + path + "'"), 0) << acl;
+    return path;
+  }
+  AccessChecker Checker() { return AccessChecker(user_.uid(), user_.gid()); }
+
+  ScopedUser user_;
+  orvane::test::TempDir dir_;
+};
+
+TEST_F(AccessTest, ModesAndAclsDecideAsTheKernelDoes) {
+  struct Case {
+    std::string rel;
+    mode_t mode;
+    std::string acl;
+    bool visible;
+    bool group_owned = false;
+  };
+  const std::vector<Case> cases = {
+      {"plain/open.txt", 0644, "", true},
+      {"plain/closed.txt", 0600, "", false},
+      {"acl/denied.txt", 0644, "u:USER:---", false},
+      {"acl/granted.txt", 0600, "u:USER:r--", true},
+      {"acl/group granted.txt", 0600, "g:GROUP:r--", true},
+      {"acl/group denied.txt", 0644, "g:GROUP:---", false},
+      {"acl/masked.txt", 0600, "u:USER:r--,m::---", false},
+      {"acl/group masked.txt", 0600, "g:GROUP:r--,m::-w-", false},
+      // A named user entry wins over a group that would grant.
+      {"acl/user over group.txt", 0600, "u:USER:---,g:GROUP:r--", false},
+      // One matching group grants although another matching one does not.
+      {"acl/two groups.txt", 0600, "g:nogroup:---,g:GROUP:r--", true},
+      // A mask of nothing leaves no group class bits: the kernel then reads the mode alone,
+      // and "other" may read.
+      {"acl/empty mask.txt", 0604, "u:USER:---,m::---", true},
+      // The owning group's entry, not the mask shown in the mode, decides for its members.
+      {"acl/owning group.txt", 0600, "g::---,u:nobody:r--", false, true},
+      {"list/x only/file.txt", 0644, "", false},
+      {"list/acl list/file.txt", 0644, "", true},
+      {"list/acl no list/file.txt", 0644, "", false},
+      {"enter/acl no search/sub/file.txt", 0644, "", false},
+  };
+  Make("list/x only/", 0711);
+  Make("list/acl list/", 0700, "u:USER:r-x");
+  Make("list/acl no list/", 0750, "u:USER:--x,g:GROUP:r-x");
+  Make("enter/acl no search/", 0755, "u:USER:r--");
+  for (const Case& c : cases) Make(c.rel, c.mode, c.acl, c.group_owned ? user_.group() : 0);
+  Make("enter/acl no search/sub/", 0755);
+  AccessChecker checker = Checker();
+  for (const Case& c : cases) {
+    const std::string path = dir_.Path(c.rel);
+    EXPECT_EQ(KernelLets(user_.name(), path), c.visible) << c.rel;
+    EXPECT_EQ(checker.CanOpen(path), c.visible) << c.rel;
+  }
+
+  // The owner is judged by the owner bits alone, whatever the others may do.
+  const std::string own = Make("plain/own.txt", 0044);
+  ASSERT_EQ(::chown(own.c_str(), user_.uid(), 0), 0);
+  EXPECT_FALSE(KernelLets(user_.name(), own));
+  EXPECT_FALSE(Checker().CanOpen(own));
+}
+
+TEST_F(AccessTest, FoldersOnlyTheirOwnersMayListHideNamesBelowThem) {
+  // 711 and 733 let others reach a file whose name they know, but not list it: the names
+  // stay hidden from other users, not from the owner.
+  Make("x711/", 0711);
+  Make("x733/", 0733);
+  const std::string in711 = Make("x711/inside.txt", 0644);
+  const std::string in733 = Make("x733/inside.txt", 0644);
+  const std::string deep = Make("x711/sub/deep.txt", 0644);
+  AccessChecker user = Checker();
+  const struct passwd* nobody = ::getpwnam("nobody");
+  ASSERT_NE(nobody, nullptr);
+  AccessChecker other(nobody->pw_uid, nobody->pw_gid);
+  for (const std::string& path : {in711, in733}) {
+    EXPECT_FALSE(user.CanOpen(path)) << path;
+    EXPECT_FALSE(other.CanOpen(path)) << path;
+  }
+  // Below a 711 folder a listable one shows its names again: only search was needed above.
+  EXPECT_TRUE(user.CanOpen(deep));
+  EXPECT_TRUE(KernelLets(user_.name(), deep));
+  ASSERT_EQ(::chown(dir_.Path("x733").c_str(), user_.uid(), 0), 0);
+  EXPECT_TRUE(Checker().CanOpen(in733));
+}
+
+TEST_F(AccessTest, SymlinksBelowTheShareAreNeverFollowed) {
+  // A team folder the user may write, without the sticky bit: the user replaces root's secret
+  // with a link to a file anyone may read. The kernel would now open the link's target; the
+  // index still holds the secret's words under the secret's path.
+  const std::string team = Make("vol/share/team/", 0777);
+  const std::string secret = Make("vol/share/team/secret.txt", 0600);
+  const std::string readable = Make("vol/share/team/readable.txt", 0644);
+  ASSERT_EQ(AsUser(user_.name(), [&] {
+              return ::symlink("readable.txt", (team + "/.t").c_str()) == 0 &&
+                             ::rename((team + "/.t").c_str(), secret.c_str()) == 0
+                         ? 1
+                         : 0;
+            }),
+            1);
+  ASSERT_TRUE(KernelLets(user_.name(), secret));
+  const std::string share = dir_.Path("vol/share");
+  EXPECT_FALSE(Checker().CanOpen(secret, share));
+  EXPECT_TRUE(Checker().CanOpen(readable, share));
+
+  // A folder replaced by a link hides everything below it.
+  Make("vol/share/pub/", 0755);
+  const std::string pub = Make("vol/share/pub/doc.txt", 0644);
+  ASSERT_EQ(::symlink("pub", dir_.Path("vol/share/linked").c_str()), 0);
+  AccessChecker checker = Checker();
+  EXPECT_FALSE(checker.CanOpen(dir_.Path("vol/share/linked/doc.txt"), share));
+  EXPECT_TRUE(checker.CanOpen(pub, share));
+
+  // Links at or above the share's root are the administrator's: followed as the kernel
+  // follows them, with the target's own folders checked. Without a share root none is.
+  ASSERT_EQ(::symlink("vol", dir_.Path("volume").c_str()), 0);
+  const std::string via = dir_.Path("volume/share/pub/doc.txt");
+  EXPECT_TRUE(checker.CanOpen(via, dir_.Path("volume/share")));
+  EXPECT_FALSE(checker.CanOpen(via, share));
+  EXPECT_FALSE(Checker().CanOpen(via));
+  EXPECT_FALSE(checker.CanOpen(dir_.Path("volume/share/linked/doc.txt"), dir_.Path("volume/share")));
+  Make("closed/", 0700);
+  Make("closed/vol/share/", 0755);
+  const std::string behind = dir_.Path("behind");
+  ASSERT_EQ(::symlink("closed/vol", behind.c_str()), 0);
+  Make("closed/vol/share/doc.txt", 0644);
+  EXPECT_FALSE(Checker().CanOpen(behind + "/share/doc.txt", behind + "/share"));
+
+  // Paths that are not plain never pass: ".." would climb out of a folder the walk checked.
+  for (const std::string& odd : {pub + "/", dir_.Path("vol/share//pub/doc.txt"),
+                                 dir_.Path("vol/share/team/../pub/doc.txt"),
+                                 std::string("vol/share/pub/doc.txt")}) {
+    EXPECT_FALSE(Checker().CanOpen(odd, share)) << odd;
+  }
+}
+
+TEST_F(AccessTest, AnAclThatCannotBeReadHidesTheFile) {
+  const std::string path = Make("plain/open.txt", 0644);
+  // The first answer leaves the folders known, so the faults below meet the file's ACL alone.
+  AccessChecker checker = Checker();
+  ASSERT_TRUE(checker.CanOpen(path));
+  {
+    platform::ScopedFaults faults;
+    faults.Arm("AccessAclGet", platform::Fault{-1, EIO}, 0, -1);
+    EXPECT_FALSE(checker.CanOpen(path));
+    EXPECT_EQ(platform::CallCount("AccessAclGet"), 1);
+  }
+  {
+    // No ACL at all: the mode bits decide.
+    platform::ScopedFaults faults;
+    faults.Arm("AccessAclGet", platform::Fault{-1, ENODATA}, 0, -1);
+    EXPECT_TRUE(checker.CanOpen(path));
+  }
+}
+
+TEST(AccessShareRootTest, IsTheFolderHoldingTheIndexFolder) {
+  EXPECT_EQ(AccessChecker::ShareRootOf("/volume1/docs/@eaDir/@fileindex/db"), "/volume1/docs");
+  EXPECT_EQ(AccessChecker::ShareRootOf("/volume1/docs/@eaDir/@fileindex/db//"), "/volume1/docs");
+  EXPECT_EQ(AccessChecker::ShareRootOf("/var/lib/index/db"), "");
+  EXPECT_EQ(AccessChecker::ShareRootOf("/@eaDir/@fileindex/db"), "");
+  EXPECT_EQ(AccessChecker::ShareRootOf("/v/../@eaDir/@fileindex/db"), "");
+}
+
+}  // namespace
+}  // namespace elasticd
+}  // namespace orvane
