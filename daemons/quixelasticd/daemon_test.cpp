@@ -394,6 +394,102 @@ TEST_F(DaemonTest, PublicSocketClosesIdleConnections) {
   EXPECT_EQ(tc::Request(daemon_->public_socket(), list)["success"], true);
 }
 
+TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLinks) {
+  const struct passwd* nobody = ::getpwnam("nobody");
+  ASSERT_NE(nobody, nullptr);
+  const uid_t uid = nobody->pw_uid;
+  const gid_t gid = nobody->pw_gid;
+  // The share is reached through a link above it, as a volume may be; its index lies in the
+  // share's own folder, which tells the engine where the share begins.
+  ASSERT_EQ(::mkdir(dir_.Path("disk").c_str(), 0755), 0);
+  ASSERT_EQ(::symlink("disk", dir_.Path("vol").c_str()), 0);
+  struct File {
+    std::string rel;
+    mode_t mode;
+    std::string acl;
+  };
+  const std::vector<File> files = {
+      {"pub/memo granted.txt", 0600, "u:nobody:r--"},
+      {"pub/memo grouped.txt", 0600, "g:" + std::to_string(gid) + ":r--"},
+      {"pub/memo denied.txt", 0644, "u:nobody:---"},
+      {"pub/memo masked.txt", 0600, "u:nobody:r--,m::---"},
+      {"team/memo open.txt", 0644, ""},
+      {"team/memo swapped.txt", 0600, ""},
+      {"x711/memo listless.txt", 0644, ""},
+      {"x733/memo writeonly.txt", 0644, ""},
+  };
+  std::vector<Json::Value> upserts;
+  for (const File& f : files) {
+    const std::string path = dir_.Write("disk/share/" + f.rel, "x");
+    ASSERT_EQ(::chmod(path.c_str(), f.mode), 0);
+    if (!f.acl.empty()) {
+      ASSERT_EQ(std::system(("setfacl -m " + f.acl + " '" + path + "'").c_str()), 0) << f.acl;
+    }
+    const std::string word = f.rel.substr(f.rel.find(' ') + 1, f.rel.find('.') - f.rel.find(' ') - 1);
+    Json::Value upsert = tc::Upsert(dir_.Path("vol/share/" + f.rel));
+    upsert["data"]["data"]["QUIXMDTextContent"] = "memo about " + word + "stuff";
+    upserts.push_back(upsert);
+  }
+  for (const auto& [rel, mode] : std::vector<std::pair<std::string, mode_t>>{
+           {"disk/share", 0755}, {"disk/share/pub", 0755}, {"disk/share/team", 0777},
+           {"disk/share/x711", 0711}, {"disk/share/x733", 0733}}) {
+    ASSERT_EQ(::chmod(dir_.Path(rel).c_str(), mode), 0);
+  }
+  Launch();
+  Json::Value create = OnIndex("index_create");
+  create["data"]["path"] = dir_.Path("vol/share/@eaDir/@fileindex/db");
+  create["data"]["mappings"] = tc::FileMappings();
+  ASSERT_EQ(Send(create)["success"], true);
+  ASSERT_EQ(Send(tc::Compound(upserts))["has_fail"], false);
+  // In the team folder anyone may write, nobody renames a link to a readable file over the
+  // indexed secret; the index still holds the secret's words under its name.
+  ASSERT_EQ(orvane::test::RunAsUser("nobody", [&] {
+              const std::string team = dir_.Path("disk/share/team");
+              return ::symlink("memo open.txt", (team + "/.t").c_str()) == 0 &&
+                     ::rename((team + "/.t").c_str(), (team + "/memo swapped.txt").c_str()) == 0;
+            }),
+            1);
+
+  auto search = [&](const std::string& data, bool as_root) {
+    const Json::Value req = tc::Parse(R"({"command": "search", "data": )" + data + "}");
+    const Json::Value reply = as_root ? Send(req) : tc::RequestAs(daemon_->public_socket(), req,
+                                                                   uid, gid);
+    EXPECT_EQ(reply["success"], true) << JsonToString(reply);
+    return reply["data"];
+  };
+  // By name and by words, with their snippets: the three files nobody may open, no more.
+  const Json::Value by_name = search(R"({"name": "memo", "sort": "name"})", false);
+  EXPECT_EQ(by_name["total"], 3) << JsonToString(by_name);
+  std::vector<std::string> names;
+  for (const Json::Value& hit : by_name["hits"]) names.push_back(hit["name"].asString());
+  EXPECT_THAT(names, ::testing::ElementsAre("memo granted.txt", "memo grouped.txt",
+                                            "memo open.txt"));
+  EXPECT_EQ(search(R"({"name": "memo"})", true)["total"], 8);
+  const Json::Value by_word = search(R"({"keyword": "memo", "sort": "name", "from": 2})", false);
+  EXPECT_EQ(by_word["total"], 3);
+  ASSERT_EQ(by_word["hits"].size(), 1u) << JsonToString(by_word);
+  EXPECT_EQ(by_word["hits"][0]["path"], dir_.Path("vol/share/team/memo open.txt"));
+  EXPECT_THAT(by_word["hits"][0]["snippet"].asString(), ::testing::HasSubstr("about openstuff"));
+  for (const char* hidden : {"deniedstuff", "maskedstuff", "swappedstuff", "listlessstuff",
+                             "writeonlystuff"}) {
+    const std::string query = std::string(R"({"keyword": ")") + hidden + "\"}";
+    EXPECT_EQ(search(query, false)["total"], 0) << hidden;
+    EXPECT_EQ(search(query, true)["total"], 1) << hidden;
+  }
+
+  // Suggestions offer no word found only in files nobody may not open.
+  Json::Value suggest = tc::Parse(R"({"command": "suggest", "data": {"prefix": "", "size": 100}})");
+  std::vector<std::string> offered;
+  for (const char* prefix : {"gran", "grou", "deni", "mask", "swap", "listl", "writeo", "open"}) {
+    suggest["data"]["prefix"] = prefix;
+    const Json::Value reply = tc::RequestAs(daemon_->public_socket(), suggest, uid, gid);
+    for (const Json::Value& word : reply["data"]["suggestions"]) offered.push_back(word.asString());
+    EXPECT_FALSE(Send(suggest)["data"]["suggestions"].empty()) << prefix;
+  }
+  EXPECT_THAT(offered, ::testing::UnorderedElementsAre("granted", "grantedstuff", "grouped",
+                                                       "groupedstuff", "open", "openstuff"));
+}
+
 }  // namespace
 }  // namespace elasticd
 }  // namespace orvane
