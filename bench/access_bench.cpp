@@ -159,11 +159,12 @@ int main(int argc, char** argv) {
   for (int pass = 0; pass < 2; ++pass) {
     const Figures r = Measure(engine, root, names);
     const Figures u = Measure(engine, user, names);
-    std::printf("name search, 300 queries, page of 50: root p50 %.1f ms, p95 %.1f ms, max %.1f"
-                " ms, mean total %lld; nobody p50 %.1f ms, p95 %.1f ms, max %.1f ms, mean total"
-                " %lld\n",
-                r.p50, r.p95, r.max, static_cast<long long>(r.mean_total), u.p50, u.p95, u.max,
-                static_cast<long long>(u.mean_total));
+    std::printf(
+        "name search, 300 queries, page of 50: root p50 %.1f ms, p95 %.1f ms, max %.1f"
+        " ms, mean total %lld; nobody p50 %.1f ms, p95 %.1f ms, max %.1f ms, mean total"
+        " %lld\n",
+        r.p50, r.p95, r.max, static_cast<long long>(r.mean_total), u.p50, u.p95, u.max,
+        static_cast<long long>(u.mean_total));
   }
 
   for (int pass = 0; pass < 3; ++pass) {
@@ -172,9 +173,10 @@ int main(int argc, char** argv) {
     size_t shown = 0;
     for (const std::string& path : paths) shown += checker.CanOpen(path) ? 1 : 0;
     const double ms = Millis(t);
-    std::printf("the check alone, one request over every file: %.1f ms, %.2f us per file, %zu"
-                " of %zu shown\n",
-                ms, ms * 1000 / paths.size(), shown, paths.size());
+    std::printf(
+        "the check alone, one request over every file: %.1f ms, %.2f us per file, %zu"
+        " of %zu shown\n",
+        ms, ms * 1000 / paths.size(), shown, paths.size());
   }
   engine.Shutdown();
   std::system(("rm -rf '" + dir + "'").c_str());

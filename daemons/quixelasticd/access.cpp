@@ -190,7 +190,7 @@ AccessChecker::Folder AccessChecker::FolderOf(const std::string& dir, int links)
       // Whether this link may be followed depends on the share it is asked for; the answer
       // for its target is what the kernel would find, and the link is remembered.
       std::unique_ptr<char, decltype(&std::free)> real(::realpath(dir.c_str(), nullptr),
-                                                        &std::free);
+                                                       &std::free);
       if (real && IsPlainPath(real.get())) {
         f = FolderOf(real.get(), links + 1);
         f.link_end = dir.size();

@@ -209,13 +209,11 @@ TEST_F(AccessTest, SymlinksBelowTheShareAreNeverFollowed) {
   const std::string team = Make("vol/share/team/", 0777);
   const std::string secret = Make("vol/share/team/secret.txt", 0600);
   const std::string readable = Make("vol/share/team/readable.txt", 0644);
-  ASSERT_EQ(AsUser(user_.name(), [&] {
-              return ::symlink("readable.txt", (team + "/.t").c_str()) == 0 &&
-                             ::rename((team + "/.t").c_str(), secret.c_str()) == 0
-                         ? 1
-                         : 0;
-            }),
-            1);
+  const auto swap = [&] {
+    return ::symlink("readable.txt", (team + "/.t").c_str()) == 0 &&
+           ::rename((team + "/.t").c_str(), secret.c_str()) == 0;
+  };
+  ASSERT_EQ(AsUser(user_.name(), swap), 1);
   ASSERT_TRUE(KernelLets(user_.name(), secret));
   const std::string share = dir_.Path("vol/share");
   EXPECT_FALSE(Checker().CanOpen(secret, share));
@@ -236,7 +234,8 @@ TEST_F(AccessTest, SymlinksBelowTheShareAreNeverFollowed) {
   EXPECT_TRUE(checker.CanOpen(via, dir_.Path("volume/share")));
   EXPECT_FALSE(checker.CanOpen(via, share));
   EXPECT_FALSE(Checker().CanOpen(via));
-  EXPECT_FALSE(checker.CanOpen(dir_.Path("volume/share/linked/doc.txt"), dir_.Path("volume/share")));
+  EXPECT_FALSE(
+      checker.CanOpen(dir_.Path("volume/share/linked/doc.txt"), dir_.Path("volume/share")));
   Make("closed/", 0700);
   Make("closed/vol/share/", 0755);
   const std::string behind = dir_.Path("behind");
@@ -245,9 +244,9 @@ TEST_F(AccessTest, SymlinksBelowTheShareAreNeverFollowed) {
   EXPECT_FALSE(Checker().CanOpen(behind + "/share/doc.txt", behind + "/share"));
 
   // Paths that are not plain never pass: ".." would climb out of a folder the walk checked.
-  for (const std::string& odd : {pub + "/", dir_.Path("vol/share//pub/doc.txt"),
-                                 dir_.Path("vol/share/team/../pub/doc.txt"),
-                                 std::string("vol/share/pub/doc.txt")}) {
+  for (const std::string& odd :
+       {pub + "/", dir_.Path("vol/share//pub/doc.txt"), dir_.Path("vol/share/team/../pub/doc.txt"),
+        std::string("vol/share/pub/doc.txt")}) {
     EXPECT_FALSE(Checker().CanOpen(odd, share)) << odd;
   }
 }

@@ -425,7 +425,8 @@ TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLink
     if (!f.acl.empty()) {
       ASSERT_EQ(std::system(("setfacl -m " + f.acl + " '" + path + "'").c_str()), 0) << f.acl;
     }
-    const std::string word = f.rel.substr(f.rel.find(' ') + 1, f.rel.find('.') - f.rel.find(' ') - 1);
+    const size_t space = f.rel.find(' ');
+    const std::string word = f.rel.substr(space + 1, f.rel.find('.') - space - 1);
     Json::Value upsert = tc::Upsert(dir_.Path("vol/share/" + f.rel));
     upsert["data"]["data"]["QUIXMDTextContent"] = "memo about " + word + "stuff";
     upserts.push_back(upsert);
