@@ -2,14 +2,18 @@
 
 #include <endian.h>
 #include <errno.h>
+#include <fcntl.h>
 #include <grp.h>
 #include <linux/posix_acl.h>
 #include <linux/posix_acl_xattr.h>
 #include <pwd.h>
+#include <sys/syscall.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cstdint>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
@@ -26,9 +30,9 @@ constexpr const char kAclName[] = "system.posix_acl_access";
 // The kernel gives up resolving a path after this many symlinks.
 constexpr int kMaxLinks = 40;
 
-// Absolute, without empty, "." or ".." components: the walk below lstat()s each prefix, and
-// such a component (or a trailing slash, which makes lstat follow a symlink) would make a prefix
-// name something else than the folder the path goes through.
+// Absolute, without empty, "." or ".." components: the folder answers are kept by path, and
+// such a component would make one path name a folder that another path also names, or climb
+// back out of a folder after its check.
 bool IsPlainPath(const std::string& path) {
   if (path.empty() || path[0] != '/') return false;
   if (path == "/") return true;
@@ -47,6 +51,37 @@ bool IsPlainPath(const std::string& path) {
 std::string ParentOf(const std::string& path) {
   const size_t slash = path.find_last_of('/');
   return slash == 0 ? "/" : path.substr(0, slash);
+}
+
+#ifdef SYS_getxattrat
+constexpr long kSysGetxattrat = SYS_getxattrat;
+#else
+constexpr long kSysGetxattrat = 464;  // one number on every architecture since Linux 6.13
+#endif
+
+struct XattrArgs {
+  uint64_t value;
+  uint32_t size;
+  uint32_t flags;
+};
+
+// The access ACL of `name` in the folder `dir_fd` (not following a symlink), as getxattr()
+// answers. Kernels without getxattrat() reach it through an O_PATH descriptor's /proc link.
+ssize_t GetAcl(int dir_fd, const char* name, char* buf, size_t size) {
+  XattrArgs args{reinterpret_cast<uintptr_t>(buf), static_cast<uint32_t>(size), 0};
+  long n;
+  if (auto fault = platform::FaultFor("getxattrat")) {
+    n = fault->result;
+    errno = fault->err;
+  } else {
+    n = ::syscall(kSysGetxattrat, dir_fd, name, AT_SYMLINK_NOFOLLOW, kAclName, &args, sizeof(args));
+  }
+  if (n >= 0 || errno != ENOSYS) return n;
+  const UniqueFd fd(::openat(dir_fd, name, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  if (!fd.valid()) return -1;
+  char link[32];
+  std::snprintf(link, sizeof(link), "/proc/self/fd/%d", fd.get());
+  return ::getxattr(link, kAclName, buf, size);
 }
 
 }  // namespace
@@ -88,29 +123,30 @@ bool AccessChecker::InGroup(gid_t gid) const {
   return std::binary_search(groups_.begin(), groups_.end(), gid);
 }
 
-int AccessChecker::AclBits(const std::string& path, const struct stat& st) {
+int AccessChecker::AclBits(int dir_fd, const char* name, const struct stat& st) {
   // Most files carry no ACL; the small buffer holds the common ones without an allocation.
   char small[sizeof(posix_acl_xattr_header) + 16 * sizeof(posix_acl_xattr_entry)];
   std::unique_ptr<char[]> large;
   char* buf = small;
-  ssize_t n;
-  if (auto fault = platform::FaultFor("AccessAclGet")) {
-    n = fault->result;
-    errno = fault->err;
-  } else {
-    // lgetxattr: the walk has found no symlink here; should one have been swapped in since,
-    // its (absent) ACL is read rather than its target's.
-    n = ::lgetxattr(path.c_str(), kAclName, small, sizeof(small));
-    if (n < 0 && errno == ERANGE) {
-      const ssize_t want = ::lgetxattr(path.c_str(), kAclName, nullptr, 0);
-      if (want > 0) {
-        large.reset(new char[static_cast<size_t>(want)]);
-        buf = large.get();
-        n = ::lgetxattr(path.c_str(), kAclName, buf, static_cast<size_t>(want));
-      }
+  ssize_t n = GetAcl(dir_fd, name, small, sizeof(small));
+  if (n < 0 && errno == ERANGE) {
+    const ssize_t want = GetAcl(dir_fd, name, nullptr, 0);
+    if (want > 0) {
+      large.reset(new char[static_cast<size_t>(want)]);
+      buf = large.get();
+      n = GetAcl(dir_fd, name, buf, static_cast<size_t>(want));
     }
   }
-  if (n < 0) return errno == ENODATA || errno == ENOTSUP ? -1 : 0;
+  if (n < 0 && errno != ENODATA && errno != ENOTSUP) return 0;
+  // The ACL was read by name: it is this inode's only if the name still holds the inode, and
+  // the inode was not moved away and back meanwhile (a rename or link changes its ctime).
+  struct stat again;
+  if (::fstatat(dir_fd, name, &again, AT_SYMLINK_NOFOLLOW) != 0 || again.st_dev != st.st_dev ||
+      again.st_ino != st.st_ino || again.st_ctim.tv_sec != st.st_ctim.tv_sec ||
+      again.st_ctim.tv_nsec != st.st_ctim.tv_nsec) {
+    return 0;
+  }
+  if (n < 0) return -1;
 
   // The kernel's stored form: a version, then entries in the order user owner, named users,
   // owning group, named groups, mask, other. Anything else is refused as the kernel would.
@@ -161,31 +197,53 @@ int AccessChecker::AclBits(const std::string& path, const struct stat& st) {
   return other;
 }
 
-int AccessChecker::Bits(const std::string& path, const struct stat& st) {
+int AccessChecker::Bits(int dir_fd, const char* name, const struct stat& st) {
   if (st.st_uid == uid_) return (st.st_mode >> 6) & 7;
   // With no group class bits the kernel does not look at the ACL at all.
   if ((st.st_mode & S_IRWXG) != 0) {
-    const int acl = AclBits(path, st);
+    const int acl = AclBits(dir_fd, name, st);
     if (acl >= 0) return acl;
   }
   if (InGroup(st.st_gid)) return (st.st_mode >> 3) & 7;
   return st.st_mode & 7;
 }
 
+int AccessChecker::FolderFd(const std::string& dir, const Folder& f) {
+  if (fd_.valid() && fd_dir_ == dir) return fd_.get();
+  fd_.Reset(::open(dir.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  fd_dir_ = dir;
+  struct stat st;
+  // A different inode now: the folders were moved since they were checked, and what the
+  // path leads to has not been.
+  if (fd_.valid() && (::fstat(fd_.get(), &st) != 0 || st.st_dev != f.dev || st.st_ino != f.ino)) {
+    fd_.Reset();
+  }
+  return fd_.get();
+}
+
 AccessChecker::Folder AccessChecker::FolderOf(const std::string& dir, int links) {
   auto it = folders_.find(dir);
   if (it != folders_.end()) return it->second;
+  Folder f;
   Folder parent;
   parent.enter = true;
-  if (dir != "/") parent = FolderOf(ParentOf(dir), links);
-  Folder f;
+  int up_fd = AT_FDCWD;  // "/" is looked at by its absolute name
+  const char* name = dir.c_str();
+  if (dir != "/") {
+    const std::string up = ParentOf(dir);
+    parent = FolderOf(up, links);
+    up_fd = parent.enter ? FolderFd(up, parent) : -1;
+    name = dir.c_str() + dir.find_last_of('/') + 1;
+  }
   struct stat st;
-  if (parent.enter && ::lstat(dir.c_str(), &st) == 0) {
+  if (up_fd != -1 && ::fstatat(up_fd, name, &st, AT_SYMLINK_NOFOLLOW) == 0) {
     if (S_ISDIR(st.st_mode)) {
-      const int bits = Bits(dir, st);
+      const int bits = Bits(up_fd, name, st);
       f.enter = (bits & 1) != 0;
       f.list = (bits & 4) != 0;
       f.link_end = parent.link_end;
+      f.dev = st.st_dev;
+      f.ino = st.st_ino;
     } else if (S_ISLNK(st.st_mode) && links < kMaxLinks) {
       // Whether this link may be followed depends on the share it is asked for; the answer
       // for its target is what the kernel would find, and the link is remembered.
@@ -204,7 +262,8 @@ AccessChecker::Folder AccessChecker::FolderOf(const std::string& dir, int links)
 bool AccessChecker::CanOpen(const std::string& path, const std::string& share_root) {
   if (uid_ == 0) return true;
   if (!IsPlainPath(path) || path == "/") return false;
-  const Folder parent = FolderOf(ParentOf(path), 0);
+  const std::string dir = ParentOf(path);
+  const Folder parent = FolderOf(dir, 0);
   if (!parent.enter || !parent.list) return false;
   // A symlink at or above the share's root is the administrator's; one below it is not.
   size_t followed = 0;
@@ -214,10 +273,13 @@ bool AccessChecker::CanOpen(const std::string& path, const std::string& share_ro
     followed = share_root.size();
   }
   if (parent.link_end > followed) return false;
+  const int dir_fd = FolderFd(dir, parent);
+  if (dir_fd < 0) return false;
+  const char* name = path.c_str() + path.find_last_of('/') + 1;
   struct stat st;
-  if (::lstat(path.c_str(), &st) != 0) return false;
+  if (::fstatat(dir_fd, name, &st, AT_SYMLINK_NOFOLLOW) != 0) return false;
   if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) return false;
-  return (Bits(path, st) & 4) != 0;
+  return (Bits(dir_fd, name, st) & 4) != 0;
 }
 
 }  // namespace elasticd

@@ -2,8 +2,11 @@
 // decides it: search permission on every folder from "/" down, read permission on the file's
 // own folder (to list its name) and on the file, from the owner, group, mode bits and POSIX
 // ACL of each, against the user's groups. Below the share's root no symlink is followed: a
-// symlink on the way, or as the file itself, hides the file.
-// One checker serves one request; it caches folder answers and is not thread-safe.
+// symlink on the way, or as the file itself, hides the file. Each folder and file is looked up
+// in a descriptor of the folder above it as checked, so swapping folders during a check cannot
+// pass off one inode's contents under another's permissions.
+// One checker serves one request; it caches folder answers and one folder descriptor and is
+// not thread-safe.
 #ifndef ORVANE_DAEMONS_QUIXELASTICD_ACCESS_HPP_
 #define ORVANE_DAEMONS_QUIXELASTICD_ACCESS_HPP_
 
@@ -13,6 +16,8 @@
 #include <string>
 #include <unordered_map>
 #include <vector>
+
+#include "common/fd.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -41,18 +46,27 @@ class AccessChecker {
     bool enter = false;   // this folder and every one above it may be searched
     bool list = false;    // and this one may be read
     size_t link_end = 0;  // length of the deepest symlink on the way to it, 0 when none
+    dev_t dev = 0;        // the inode that was checked
+    ino_t ino = 0;
   };
 
   Folder FolderOf(const std::string& dir, int links);
-  // The permission bits (4 read, 2 write, 1 search) the user has on the inode `st` of `path`.
-  int Bits(const std::string& path, const struct stat& st);
-  // The bits an access ACL gives a user who does not own the file; -1 when there is no ACL.
-  int AclBits(const std::string& path, const struct stat& st);
+  // An O_PATH descriptor of `dir` when the path still leads to the inode `f` checked, else -1.
+  // Owned by the checker, valid until the next call.
+  int FolderFd(const std::string& dir, const Folder& f);
+  // The permission bits (4 read, 2 write, 1 search) the user has on `name` in the folder
+  // `dir_fd`, whose status is `st`.
+  int Bits(int dir_fd, const char* name, const struct stat& st);
+  // The bits an access ACL gives a user who does not own the inode; -1 when there is no ACL.
+  int AclBits(int dir_fd, const char* name, const struct stat& st);
   bool InGroup(gid_t gid) const;
 
   uid_t uid_;
   std::vector<gid_t> groups_;  // sorted, unique
   std::unordered_map<std::string, Folder> folders_;
+  // One folder descriptor at a time, so that many requests at once hold few descriptors.
+  std::string fd_dir_;
+  UniqueFd fd_;
 };
 
 }  // namespace elasticd

@@ -96,6 +96,13 @@ bool KernelLets(const std::string& user, const std::string& path) {
          }) == 1;
 }
 
+// Grants to 40 numbered users, then to the test user.
+std::string LongAcl() {
+  std::string acl;
+  for (int uid = 70001; uid <= 70040; ++uid) acl += "u:" + std::to_string(uid) + ":r--,";
+  return acl + "u:USER:r--";
+}
+
 class AccessTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -154,6 +161,8 @@ TEST_F(AccessTest, ModesAndAclsDecideAsTheKernelDoes) {
       {"acl/empty mask.txt", 0604, "u:USER:---,m::---", true},
       // The owning group's entry, not the mask shown in the mode, decides for its members.
       {"acl/owning group.txt", 0600, "g::---,u:nobody:r--", false, true},
+      // More entries than the first read of the ACL takes.
+      {"acl/long.txt", 0600, LongAcl(), true},
       {"list/x only/file.txt", 0644, "", false},
       {"list/acl list/file.txt", 0644, "", true},
       {"list/acl no list/file.txt", 0644, "", false},
@@ -251,22 +260,54 @@ TEST_F(AccessTest, SymlinksBelowTheShareAreNeverFollowed) {
   }
 }
 
-TEST_F(AccessTest, AnAclThatCannotBeReadHidesTheFile) {
-  const std::string path = Make("plain/open.txt", 0644);
+TEST_F(AccessTest, AFolderSwappedDuringARequestHidesWhatIsBelowIt) {
+  // Root's folder in a team folder anyone may write holds a secret and a public file; the user
+  // has a folder of their own with a readable file under the secret's name.
+  Make("team/", 0777);
+  Make("team/root/", 0755);
+  const std::string secret = Make("team/root/secret.txt", 0600);
+  const std::string shown = Make("team/root/public.txt", 0644);
+  Make("team/mine/secret.txt", 0644);
+  const std::string note = Make("team/note.txt", 0644);
+  AccessChecker checker = Checker();
+  ASSERT_TRUE(checker.CanOpen(shown));
+  // Between two hits of one request the user puts their folder in the place of root's: the
+  // folder answer the checker keeps is for root's folder, not for what the path now leads to.
+  const std::string team = dir_.Path("team");
+  ASSERT_EQ(AsUser(user_.name(),
+                   [&] {
+                     return ::rename((team + "/root").c_str(), (team + "/old").c_str()) == 0 &&
+                            ::rename((team + "/mine").c_str(), (team + "/root").c_str()) == 0;
+                   }),
+            1);
+  EXPECT_FALSE(checker.CanOpen(secret));
+  // Also once the checker has looked elsewhere and must find the folder again by its path.
+  EXPECT_TRUE(checker.CanOpen(note));
+  EXPECT_FALSE(checker.CanOpen(secret));
+  EXPECT_TRUE(KernelLets(user_.name(), secret));
+}
+
+TEST_F(AccessTest, AclsAreReadOnOlderKernelsAndAFailedReadHidesTheFile) {
+  const std::string open = Make("plain/open.txt", 0644);
+  const std::string denied = Make("acl/denied.txt", 0644, "u:USER:---");
+  const std::string granted = Make("acl/granted.txt", 0600, "u:USER:r--");
   // The first answer leaves the folders known, so the faults below meet the file's ACL alone.
   AccessChecker checker = Checker();
-  ASSERT_TRUE(checker.CanOpen(path));
+  ASSERT_TRUE(checker.CanOpen(open));
   {
     platform::ScopedFaults faults;
-    faults.Arm("AccessAclGet", platform::Fault{-1, EIO}, 0, -1);
-    EXPECT_FALSE(checker.CanOpen(path));
-    EXPECT_EQ(platform::CallCount("AccessAclGet"), 1);
+    faults.Arm("getxattrat", platform::Fault{-1, EIO}, 0, -1);
+    EXPECT_FALSE(checker.CanOpen(open));
+    EXPECT_EQ(platform::CallCount("getxattrat"), 1);
   }
   {
-    // No ACL at all: the mode bits decide.
+    // A kernel without getxattrat(): the ACLs are read another way and decide the same.
     platform::ScopedFaults faults;
-    faults.Arm("AccessAclGet", platform::Fault{-1, ENODATA}, 0, -1);
-    EXPECT_TRUE(checker.CanOpen(path));
+    faults.Arm("getxattrat", platform::Fault{-1, ENOSYS}, 0, -1);
+    AccessChecker old_kernel = Checker();
+    EXPECT_TRUE(old_kernel.CanOpen(open));
+    EXPECT_FALSE(old_kernel.CanOpen(denied));
+    EXPECT_TRUE(old_kernel.CanOpen(granted));
   }
 }
 
