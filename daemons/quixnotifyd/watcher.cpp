@@ -356,7 +356,7 @@ void Watcher::Emit(const std::vector<size_t>& targets, uint32_t bits, const std:
     line["is_dir"] = is_dir;
     std::string& pending = pending_[target.queue];
     pending += JsonToString(line) + "\n";
-    if (pending.size() > kMaxPendingBytes) {
+    if (pending.size() > options_.max_pending_bytes) {
       pending = ReconcileLines(target.queue);
       Log(LOG_ERR,
           "%s:%d queue %s cannot be written: too many changes held, dropped for a "

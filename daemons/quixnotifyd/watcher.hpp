@@ -33,11 +33,10 @@ constexpr uint32_t kDelete = 0x80;
 constexpr uint32_t kRename = 0x100;
 constexpr uint32_t kReindex = 0x10000;
 
-// Lines kept for a queue that cannot be written are bounded; past this they are dropped for a
-// reconciliation of the queue's folders, written once the queue can be written again.
-constexpr size_t kMaxPendingBytes = 16 * 1024 * 1024;
-
 struct WatcherOptions {
+  // Lines kept for a queue that cannot be written are bounded; past this they are dropped for a
+  // reconciliation of the queue's folders, written once the queue can be written again.
+  size_t max_pending_bytes = 16 * 1024 * 1024;
   // How often a folder that could not be watched whole (the inotify watch limit) is reconciled
   // and its missing watches tried again.
   int64_t limit_retry_micros = 300 * 1000000LL;

@@ -338,6 +338,28 @@ TEST_F(WatcherTest, UnwritableQueueKeepsLinesUntilItCanBeWritten) {
   EXPECT_THAT(Drain(w, 2), ElementsAre("40 /docs/kept.txt", "8 /docs/kept.txt"));
 }
 
+TEST_F(WatcherTest, TooManyLinesHeldGiveWayToAReconciliation) {
+  ASSERT_TRUE(MonitorQueue::Upsert(Record(queue_, {share_ + "/docs", share_ + "/other"}),
+                                   "fileindex", MONITOR_QUEUE_TYPE_APPLICATION));
+  WatcherOptions options;
+  options.max_pending_bytes = 1024;
+  Watcher w(options);
+  Mkdir("/@eaDir");
+  Touch("/@eaDir/@fileindex", "in the way");
+  test::LogCapture log;
+  for (int i = 0; i < 20; ++i) Touch("/docs/f" + std::to_string(i) + ".txt");
+  w.RunOnce(200);
+  EXPECT_TRUE(log.Contains("too many changes held, dropped for a reconciliation of its folders"));
+  ASSERT_EQ(unlink((share_ + "/@eaDir/@fileindex").c_str()), 0);
+  // Both folders are reconciled (the lines dropped may have been of either), then the lines
+  // held since.
+  const std::vector<std::string> lines = Drain(w, 2);
+  ASSERT_GE(lines.size(), 2u);
+  EXPECT_THAT(std::vector<std::string>(lines.begin(), lines.begin() + 2),
+              ElementsAre("10000 dir /docs reconcile", "10000 dir /other reconcile"));
+  EXPECT_LT(lines.size(), 20u);
+}
+
 // What a stored record holds is checked where the library writes it; here, what is refused.
 TEST(MonitorQueueTest, RegistrationRecordsAreCheckedAndReplacedPerQueue) {
   test::TempDir dir;
