@@ -3,12 +3,14 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <memory>
 #include <vector>
 
 #include "common/env.hpp"
 #include "common/error.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
+#include "common/sdk/sdk_mutex.hpp"
 #include "common/sdk/share.hpp"
 #include "daemons/fileindexd/server.hpp"
 #include "fileindex/folder.hpp"
@@ -16,6 +18,7 @@
 #include "fileindex/notifyd_cfg.hpp"
 #include "fileindex/optree.hpp"
 #include "fileindex/status_mgr.hpp"
+#include "platform/user.hpp"
 
 namespace orvane {
 namespace fileindexd {
@@ -36,7 +39,31 @@ std::string ShareOf(const Json::Value& data) {
   return share.asString();
 }
 
+// The members of a worker's report that everyone may see: counts and states. The rest (the last
+// error's text) names files of the share, which only administrators may know of.
+const char* const kPublicReportMembers[] = {
+    "share",  "queue_length", "ops_pending", "ops_done",  "documents_written", "documents_deleted",
+    "last_pass", "errors",    "paused",      "out_of_space", "long_paths"};
+
+Json::Value PublicReport(const Json::Value& report) {
+  Json::Value r(Json::objectValue);
+  for (const char* key : kPublicReportMembers) {
+    if (report.isMember(key)) r[key] = report[key];
+  }
+  return r;
+}
+
 }  // namespace
+
+bool IsPrivilegedCaller(uid_t uid) {
+  if (uid == 0 || uid == geteuid()) return true;
+  LockMutex lock(sdk::SDKMutex());
+  platform::PQUIXUSER user = nullptr;
+  if (platform::QUIXUserGetByUID(uid, &user) != 0 || user == nullptr) return false;
+  std::unique_ptr<platform::QUIXUSER, void (*)(platform::PQUIXUSER)> owned(user,
+                                                                          platform::QUIXUserFree);
+  return platform::QLIBGroupIsAdminGroupMem(user->szName, 0) == 1;
+}
 
 IndexDaemon::IndexDaemon() = default;
 
@@ -166,20 +193,24 @@ std::set<std::string> IndexDaemon::running_shares() const {
   return shares;
 }
 
-Json::Value IndexDaemon::Status() const {
+Json::Value IndexDaemon::Status(bool details) const {
   Json::Value r(Json::objectValue);
   r["paused"] = IsPaused();
   r["resume_time"] = Json::Int64(resume_time_.load());
   r["shares"] = Json::Value(Json::arrayValue);
   std::lock_guard<std::mutex> lock(mu_);
-  for (const auto& entry : workers_) r["shares"].append(entry.second->Report());
+  for (const auto& entry : workers_) {
+    const Json::Value report = entry.second->Report();
+    r["shares"].append(details ? report : PublicReport(report));
+  }
+  r["details"] = details;
   return r;
 }
 
 Json::Value IndexDaemon::Handle(const Json::Value& command, uid_t peer_uid) {
   const std::string type = command["type"].asString();
   const Json::Value& data = command["data"];
-  if (type == "status") return Ok(Status());
+  if (type == "status") return Ok(Status(IsPrivilegedCaller(peer_uid)));
   if (peer_uid != 0 && peer_uid != geteuid()) {
     Log(LOG_WARNING, "fileindexd: \"%s\" refused to user %u", type.c_str(), peer_uid);
     return CommandServer::ErrorReply(103, "not permitted");

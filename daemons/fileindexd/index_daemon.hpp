@@ -22,6 +22,10 @@ namespace fileindexd {
 constexpr char kFileIndexdSockPath[] = "/var/run/fileindexd.sock";
 constexpr char kFileIndexdPidPath[] = "/var/run/fileindexd.pid";
 
+// Root, the daemon's own user and members of the platform's administrators group: the callers
+// who see the details of files in the status (the text of the last errors).
+bool IsPrivilegedCaller(uid_t uid);
+
 class IndexDaemon {
  public:
   IndexDaemon();
@@ -37,7 +41,8 @@ class IndexDaemon {
   void Reload();
 
   // Answers one command ({"type", "data"}) from the caller `peer_uid`. Control commands are
-  // refused (103) to anyone but root and the daemon's own user.
+  // refused (103) to anyone but root and the daemon's own user; "status" is for everyone, with
+  // the details of files only for privileged callers.
   Json::Value Handle(const Json::Value& command, uid_t peer_uid);
 
   // Queues a reconciliation of every indexed folder of every share, for a start after an
@@ -52,7 +57,7 @@ class IndexDaemon {
   static void ReadShares(std::set<std::string>* indexed, std::set<std::string>* paused);
   void StartWorker(const std::string& share);
   void StopWorker(const std::string& share);
-  Json::Value Status() const;
+  Json::Value Status(bool details) const;
 
   std::atomic<long long> resume_time_{-1};
   mutable std::mutex mu_;

@@ -5,7 +5,9 @@
 #include <syslog.h>
 
 #include <cerrno>
+#include <climits>
 #include <cstring>
+#include <functional>
 #include <utility>
 
 #include "common/comm.hpp"
@@ -24,6 +26,9 @@ namespace el = fileindex::elastic;
 using fileindex::OP;
 
 namespace {
+
+// Whether a path is too long for the kernel to take by name (its NUL included).
+bool TooLong(const std::string& path) { return path.size() >= PATH_MAX; }
 
 bool IsSubPath(const std::string& path, const std::string& dir) {
   return StringStartWith(path + "/", dir + "/");
@@ -146,9 +151,18 @@ void Indexer::Apply(const OP& op) {
   }
 }
 
+void Indexer::NoteLongPath(const std::string& path) {
+  if (long_paths_.insert(std::hash<std::string>()(path)).second && first_long_path_.empty()) {
+    first_long_path_ = path;
+  }
+}
+
 void Indexer::Upsert(const std::string& path) {
   struct stat st;
-  if (lstat(path.c_str(), &st) != 0) return;  // gone again; its delete is queued
+  if (lstat(path.c_str(), &st) != 0) {
+    if (errno == ENAMETOOLONG) NoteLongPath(path);
+    return;  // gone again; its delete is queued
+  }
   if (!folders_->GetMostSuitableCfg(path) || !fileindex::CanFullPathBeIndexed(path)) return;
   if (S_ISDIR(st.st_mode)) {
     Crawl(path, CrawlMode(), false);
@@ -161,7 +175,10 @@ void Indexer::Upsert(const std::string& path) {
 
 void Indexer::Attr(const std::string& path) {
   struct stat st;
-  if (lstat(path.c_str(), &st) != 0) return;
+  if (lstat(path.c_str(), &st) != 0) {
+    if (errno == ENAMETOOLONG) NoteLongPath(path);
+    return;
+  }
   if (!folders_->GetMostSuitableCfg(path) || !fileindex::CanFullPathBeIndexed(path)) return;
   try {
     el::IndexAttr(share_, path);
@@ -240,6 +257,7 @@ void Indexer::Crawl(const std::string& root, const CrawlMode& mode, bool reconci
   if (reconcile) stale = ListDocuments(share_, root);
   Batch batch(this);
   struct stat st;
+  if (TooLong(root)) NoteLongPath(root);
   if (lstat(root.c_str(), &st) == 0) {
     if (S_ISDIR(st.st_mode)) {
       CrawlDir(root, st.st_dev, mode, batch, reconcile ? &stale : nullptr);
@@ -290,6 +308,13 @@ void Indexer::CrawlDir(const std::string& dir, dev_t dev, const CrawlMode& mode,
     const std::string name = entry->d_name;
     if (name == "." || name == "..") continue;
     const std::string path = dir + "/" + name;
+    if (TooLong(path)) {
+      // Neither it nor anything below it can be reached by name; a file of a folder the rules
+      // leave out would not have been indexed anyway.
+      const bool may_be_dir = entry->d_type == DT_DIR || entry->d_type == DT_UNKNOWN;
+      if (indexable || may_be_dir) NoteLongPath(path);
+      continue;
+    }
     struct stat st;
     if (lstat(path.c_str(), &st) != 0) continue;
     if (S_ISDIR(st.st_mode)) {

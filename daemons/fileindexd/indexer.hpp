@@ -42,6 +42,10 @@ class Indexer {
   // The document commands the indexer sent, for the status report.
   uint64_t documents_written() const { return documents_written_; }
   uint64_t documents_deleted() const { return documents_deleted_; }
+  // The paths too long to open (PATH_MAX and more) that were met and skipped, as hashes of
+  // their text, and the first of them in full.
+  const std::unordered_set<size_t>& long_paths() const { return long_paths_; }
+  const std::string& first_long_path() const { return first_long_path_; }
 
   // The paths of every document at or below `dir` in `share`'s index, paged.
   static std::unordered_set<std::string> ListDocuments(const std::string& share,
@@ -68,12 +72,15 @@ class Indexer {
   bool HasFolderBelow(const std::string& dir) const;
   bool KindSwitched(const CrawlMode& mode, const std::string& path) const;
   bool Stopping() const { return stop_ != nullptr && stop_->load(); }
+  void NoteLongPath(const std::string& path);
 
   std::string share_;
   const std::atomic<bool>* stop_;
   std::unique_ptr<fileindex::FolderMgr> folders_;
   uint64_t documents_written_ = 0;
   uint64_t documents_deleted_ = 0;
+  std::unordered_set<size_t> long_paths_;
+  std::string first_long_path_;
 };
 
 }  // namespace fileindexd

@@ -1,16 +1,21 @@
 // CommandServer serves the indexing daemon's Unix-domain command socket: one frame in (4-byte
-// host-order length, JSON text, NUL), one frame out, per connection, on its own thread. Frames
-// are bounded and a slow client is cut off, so no caller can stall the daemon. The handler runs
-// on the server's thread.
+// host-order length, JSON text, NUL), one frame out, per connection. Connections are served
+// concurrently, each on a thread of its own, so an idle or slow client holds only its own
+// connection; frames are bounded, a client must send its command within a short time, and
+// callers other than root and the daemon's own user have a cap of connections each and together.
+// The handler may run on several threads at once.
 #ifndef ORVANE_DAEMONS_FILEINDEXD_SERVER_HPP_
 #define ORVANE_DAEMONS_FILEINDEXD_SERVER_HPP_
 
 #include <sys/types.h>
 #include <json/json.h>
 
-#include <atomic>
+#include <condition_variable>
 #include <cstdint>
 #include <functional>
+#include <map>
+#include <mutex>
+#include <set>
 #include <string>
 #include <thread>
 
@@ -21,12 +26,20 @@ namespace fileindexd {
 
 // The longest command accepted; commands are small JSON objects.
 constexpr uint32_t kMaxCommandFrame = 1 << 20;
-// A client must send its command, and take the reply, within this time.
-constexpr int kClientTimeoutMillis = 2000;
+// A client must have sent its whole command this long after it connected, and take each part
+// of the reply within it.
+constexpr int kClientTimeoutMillis = 1000;
+// Connections served at once for callers other than root and the daemon's own user: in all,
+// and for one user. Root and the daemon's user are never turned away.
+constexpr int kMaxConnections = 64;
+constexpr int kMaxConnectionsPerUser = 8;
+// The reply to a connection over those caps.
+constexpr int kErrTooManyConnections = 105;
 
 class CommandServer {
  public:
-  // Gets the parsed command and the caller's user id; returns the reply object.
+  // Gets the parsed command and the caller's user id; returns the reply object. It is sent only
+  // once the handler has returned, so a command's effect precedes its reply.
   using Handler = std::function<Json::Value(const Json::Value& command, uid_t peer_uid)>;
 
   CommandServer(const std::string& socket_path, Handler handler);
@@ -37,7 +50,8 @@ class CommandServer {
   // Binds the socket (mode 0666: "status" is for everyone; the handler checks the caller) and
   // starts serving. Throws Error 502 when the socket cannot be set up.
   void Start();
-  // Stops serving and removes the socket file.
+  // Stops accepting, cuts off clients still sending, waits for the commands being handled and
+  // removes the socket file.
   void Stop();
 
   // An error reply {"success": false, "error": {"code", "msg"}}.
@@ -45,7 +59,8 @@ class CommandServer {
 
  private:
   void Serve();
-  void ServeOne(int fd);
+  // Runs on the connection's own thread; `privileged` callers are outside the caps.
+  void ServeOne(UniqueFd conn, uid_t uid, bool privileged);
 
   std::string path_;
   Handler handler_;
@@ -53,6 +68,13 @@ class CommandServer {
   UniqueFd stop_read_;
   UniqueFd stop_write_;
   std::thread thread_;
+
+  std::mutex mu_;  // guards the connection book-keeping below
+  std::condition_variable idle_cv_;
+  int active_ = 0;                  // connection threads running
+  int capped_ = 0;                  // ... of them, of callers under the caps
+  std::map<uid_t, int> per_user_;   // capped connections by user
+  std::set<int> open_fds_;          // descriptors of running connections, shut down by Stop
 };
 
 }  // namespace fileindexd

@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <climits>
 #include <cstring>
 #include <fstream>
 #include <memory>
@@ -104,6 +105,7 @@ Json::Value Worker::Report() const {
   r["last_error"] = last_error_;
   r["paused"] = gate_.paused ? gate_.paused() : false;
   r["out_of_space"] = out_of_space_;
+  r["long_paths"] = Json::UInt64(long_paths_.size());
   return r;
 }
 
@@ -158,6 +160,7 @@ bool Worker::RunPass() {
   const uint64_t written_before = indexer.documents_written();
   const uint64_t deleted_before = indexer.documents_deleted();
   auto account = [&] {
+    TakeLongPaths(indexer);
     std::lock_guard<std::mutex> lock(mu_);
     documents_written_ += indexer.documents_written() - written_before;
     documents_deleted_ += indexer.documents_deleted() - deleted_before;
@@ -246,6 +249,21 @@ void Worker::Backoff(int64_t micros) {
     Env::Current()->SleepMicros(step);
     micros -= step;
   }
+}
+
+void Worker::TakeLongPaths(const Indexer& indexer) {
+  size_t added = 0;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    for (size_t hash : indexer.long_paths()) added += long_paths_.insert(hash).second ? 1 : 0;
+  }
+  if (added == 0) return;
+  // The path itself may be long beyond what a log line keeps: its start and its length find it.
+  const std::string& first = indexer.first_long_path();
+  Log(LOG_WARNING,
+      "fileindexd: share %s: %zu more path(s) of %d bytes or more cannot be indexed; the first "
+      "(%zu bytes) begins %.512s",
+      share_.c_str(), added, PATH_MAX, first.size(), first.c_str());
 }
 
 void Worker::RecordError(const std::string& text) {

@@ -15,11 +15,14 @@
 #include <mutex>
 #include <string>
 #include <thread>
+#include <unordered_set>
 
 #include "common/fd.hpp"
 
 namespace orvane {
 namespace fileindexd {
+
+class Indexer;
 
 // How often a failing operation is tried before it is recorded and skipped, and the first
 // back-off (doubled after every failure).
@@ -54,7 +57,9 @@ class Worker {
   // Makes the worker look at its queue (and the pause) now.
   void Wake();
   // {"share", "queue_length", "ops_pending", "ops_done", "documents_written",
-  //  "documents_deleted", "last_pass", "errors", "last_error", "paused", "out_of_space"}.
+  //  "documents_deleted", "last_pass", "errors", "last_error", "paused", "out_of_space",
+  //  "long_paths"}; "long_paths" counts the paths of PATH_MAX bytes and more met since the start,
+  //  which cannot be indexed.
   Json::Value Report() const;
   const std::string& share() const { return share_; }
 
@@ -68,6 +73,8 @@ class Worker {
   void Wait(int timeout_ms);
   void Backoff(int64_t micros);
   void RecordError(const std::string& text);
+  // Adds the over-long paths a pass met to the worker's count; logs the first new one.
+  void TakeLongPaths(const Indexer& indexer);
 
   const std::string share_;
   const std::string queue_path_;
@@ -87,6 +94,7 @@ class Worker {
   std::string last_error_;
   time_t last_pass_ = 0;
   bool out_of_space_ = false;
+  std::unordered_set<size_t> long_paths_;
 };
 
 }  // namespace fileindexd
