@@ -18,6 +18,8 @@ enum ErrorCode : int32_t {
   kErrLoadConfig = 504,
   kErrSaveConfig = 505,
   kErrLockFile = 506,
+  // The search engine's answer for an index it found damaged and set aside; passed through.
+  kErrIndexDamaged = 609,
   kErrShareGet = 800,
   kErrChown = 801,
   kErrFolderInvalid = 901,

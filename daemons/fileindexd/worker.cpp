@@ -38,7 +38,16 @@ struct PassAborted {
 // Failures that are about the engine or the volume, not about one file: skipping the operation
 // would lose it, so the whole batch waits instead.
 bool IsPassFailure(const Error& e) {
-  return e.code == kErrElastic || e.code == kErrSpaceNotEnough;
+  return e.code == kErrElastic || e.code == kErrSpaceNotEnough || e.code == kErrIndexDamaged;
+}
+
+// What the status says of a pass that could not be done.
+std::string PassFailureText(const std::string& share, const Error& e) {
+  if (e.code == kErrIndexDamaged) {
+    return "the index of share " + share + " cannot be read and was set aside; the changes " +
+           "wait until \"fileindexctl share rebuild " + share + "\" builds it again";
+  }
+  return e.what();
 }
 
 uint64_t CountLines(const std::string& path) {
@@ -176,7 +185,7 @@ bool Worker::RunPass() {
               indexer.Apply(*op);
               break;
             } catch (const Error& e) {
-              if (IsPassFailure(e)) throw PassAborted{true, e.what()};
+              if (IsPassFailure(e)) throw PassAborted{true, PassFailureText(share_, e)};
               std::ostringstream what;
               what << op;
               if (attempt >= kOpAttempts) {
@@ -216,7 +225,7 @@ bool Worker::RunPass() {
         // One notification per spell of full disk, not one per retried pass.
         if (first) fileindex::SendZRMNotify();
       }
-      RecordError(std::string("commit: ") + e.what());
+      RecordError(std::string("commit: ") + PassFailureText(share_, e));
       return false;
     }
   }

@@ -190,6 +190,9 @@ ErrorAdvice AdviceFor(int code) {
     case 917:
       return {"the search index does not hold what was expected",
               "rebuild the share's index (\"fileindexctl share rebuild\")"};
+    case 609:
+      return {"a share's search index is damaged",
+              "the rebuild indexes the share's files again from the disk"};
     case 1003:
       return {"the share is short of space", "free some space on the share's volume"};
     default:

@@ -124,6 +124,30 @@ bool Exchange(const std::string& socket, const std::string& payload, Json::Value
   return true;
 }
 
+// The share whose index is `id`; empty when the id is not one of ours.
+std::string ShareOfIndex(const std::string& id) {
+  const std::string prefix = elastic::GetFileIndexID("");
+  return StringStartWith(id, prefix) && id.size() > prefix.size() ? id.substr(prefix.size()) : "";
+}
+
+std::string RebuildCommand(const std::string& share) {
+  return "\"fileindexctl share rebuild " + share + "\"";
+}
+
+// The engine names the index in its message ("index fileindex_docs is damaged ..."); people
+// need the share and the command that builds it again.
+std::string DamagedIndexText(const std::string& engine_msg) {
+  std::string share;
+  const size_t at = engine_msg.find(elastic::GetFileIndexID(""));
+  if (at != std::string::npos) {
+    const size_t end = engine_msg.find(' ', at);
+    share = ShareOfIndex(engine_msg.substr(at, end == std::string::npos ? end : end - at));
+  }
+  if (share.empty()) return engine_msg + " (run \"fileindexctl status\" as root to see which)";
+  return "the index of share " + share + " cannot be read and was set aside; " +
+         RebuildCommand(share) + " builds it again";
+}
+
 // A people's command to the search engine, on its public socket when there is one.
 Json::Value AskEngine(const std::string& command, const Json::Value& data) {
   Json::Value req(Json::objectValue);
@@ -136,6 +160,11 @@ Json::Value AskEngine(const std::string& command, const Json::Value& data) {
   if (!Exchange(socket, JsonToString(req), reply, error)) throw Error(kErrElastic, error);
   if (!reply["success"].isBool() || !reply["success"].asBool()) {
     const Json::Value& err = reply["error"];
+    // A damaged index is not an engine out of reach: the engine set its files aside and it
+    // stays unusable until it is built again.
+    if (err.isObject() && err["code"].asInt() == kErrIndexDamaged) {
+      throw Error(kErrIndexDamaged, DamagedIndexText(err["msg"].asString()));
+    }
     throw Error(kErrElastic, err.isObject() ? err["msg"].asString() + " (engine code " +
                                                   std::to_string(err["code"].asInt()) + ")"
                                             : JsonToString(reply));
@@ -376,17 +405,37 @@ void SuggestCmd(const Args& args, Output& out) {
 
 // ---- pause and services
 
+Json::Value DaemonState(const std::string& name);
+
+// Runs a pause or resume, which records the choice in the status file and then tells the
+// indexing daemon. A daemon that is not running reads the file when it starts, so the choice
+// holds; one that is running and did not take it is a failure, though the file has it.
+void TellIndexer(const std::function<void()>& change, const std::string& done, Output& out) {
+  try {
+    change();
+  } catch (const Error& e) {
+    if (e.code != kErrSystem) throw;
+    if (DaemonState("fileindexd")["running"].asBool()) {
+      throw Error(kErrSystem, "recorded, but the running fileindexd did not take it: " +
+                                  ReasonOf(e.message) + "; it applies at fileindexd's next start");
+    }
+    out.Done(done + " (fileindexd is not running: it applies when fileindexd starts)");
+    return;
+  }
+  out.Done(done);
+}
+
 void PauseCmd(const Args& args, Output& out) {
   const long long hours = args.GetInt("hours", 0);
   if (hours < 0 || hours > 24 * 365) throw UsageError("--hours takes 0 to 8760");
-  StatusMgr().Pause(static_cast<int>(hours));
-  out.Done(hours == 0 ? "indexing paused until \"fileindexctl resume\""
-                      : "indexing paused for " + std::to_string(hours) + " hour(s)");
+  TellIndexer([hours] { StatusMgr().Pause(static_cast<int>(hours)); },
+              hours == 0 ? "indexing paused until \"fileindexctl resume\""
+                         : "indexing paused for " + std::to_string(hours) + " hour(s)",
+              out);
 }
 
 void ResumeCmd(const Args&, Output& out) {
-  StatusMgr().Resume();
-  out.Done("indexing resumed");
+  TellIndexer([] { StatusMgr().Resume(); }, "indexing resumed", out);
 }
 
 void ServicesPrepareCmd(const Args&, Output& out) {
@@ -511,6 +560,8 @@ void PrintStatus(const Json::Value& status, std::ostream& os) {
   Table shares({"SHARE", "FOLDERS", "QUEUED", "PENDING", "DONE", "DOCUMENTS", "ERRORS", "LAST PASS",
                 "STATE"});
   std::vector<std::string> errors;
+  std::vector<std::string> notes;
+  bool errors_hidden = false;
   for (const Json::Value& s : summary["shares"]) {
     const std::string name = s["share"].asString();
     const Json::Value& worker = EntryWith(status["indexer"]["data"]["shares"], "share", name);
@@ -525,6 +576,17 @@ void PrintStatus(const Json::Value& status, std::ostream& os) {
                 ShareState(s, worker, index)});
     if (worker["errors"].asUInt64() > 0 && !worker["last_error"].asString().empty()) {
       errors.push_back(name + ": " + worker["last_error"].asString());
+    } else if (worker["errors"].asUInt64() > 0 && !worker.isMember("last_error")) {
+      errors_hidden = true;  // the daemon keeps the texts, which name files, for administrators
+    }
+    if (index["state"].asString() == "damaged") {
+      notes.push_back(name + ": the search index cannot be read and was set aside; " +
+                      RebuildCommand(name) + " builds it again");
+    }
+    if (worker["long_paths"].asUInt64() > 0) {
+      notes.push_back(name + ": " + std::to_string(worker["long_paths"].asUInt64()) +
+                      " path(s) of " + std::to_string(PATH_MAX) +
+                      " bytes or more cannot be indexed (the system log names the first)");
     }
   }
   if (!shares.empty()) {
@@ -540,9 +602,16 @@ void PrintStatus(const Json::Value& status, std::ostream& os) {
   } else {
     folders.Print(os);
   }
+  if (!notes.empty()) {
+    os << "\nnotes:\n";
+    for (const std::string& line : notes) os << "  " << line << '\n';
+  }
   if (!errors.empty()) {
     os << "\nlast errors:\n";
     for (const std::string& line : errors) os << "  " << line << '\n';
+  }
+  if (errors_hidden) {
+    os << "\nthe texts of the errors name files: root and the administrators group see them\n";
   }
 }
 
