@@ -1,23 +1,40 @@
 // The daemon binary on its real socket: its commands, who may send them, following a queue
-// without being told, the pause, re-reading the folder file on SIGHUP, and a clean stop.
+// without being told, the pause, re-reading the folder file on SIGHUP, and a clean stop; many
+// clients at once, what the status shows to whom, a damaged index and paths too long to index.
+#include <dirent.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
+#include <climits>
+#include <cstdio>
+#include <cstring>
 #include <fstream>
+#include <memory>
 #include <sstream>
+#include <tuple>
+#include <vector>
 
+#include "common/fd.hpp"
 #include "common/json_util.hpp"
 #include "common/root.hpp"
+#include "common/sdk/share.hpp"
 #include "common/util.hpp"
+#include "daemons/fileindexd/index_daemon.hpp"
+#include "daemons/fileindexd/server.hpp"
 #include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/notifyd_cfg.hpp"
 #include "fileindex/optree.hpp"
 #include "fileindex/queue_file.hpp"
+#include "test/fake_daemon.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -50,6 +67,48 @@ std::set<std::string> Running() {
 // The reply to a frame of `payload` behind a length of `length`.
 std::string RawFrame(uint32_t length, const std::string& payload) {
   return test::RawCommand(std::string(reinterpret_cast<const char*>(&length), 4) + payload);
+}
+
+// A connection to the daemon's socket that sends nothing (or `bytes`) and waits.
+UniqueFd Connect(const std::string& bytes = "") {
+  UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  const std::string path = RootedPath(kFileIndexdSockPath);
+  std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
+  if (connect(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) return UniqueFd();
+  if (!bytes.empty()) (void)!send(fd.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL);
+  return fd;
+}
+
+// Whether the daemon closed the connection: an end of stream within `timeout_ms`.
+bool ClosedByDaemon(int fd, int timeout_ms) {
+  return WaitFor(
+      [fd] {
+        char byte;
+        return recv(fd, &byte, 1, MSG_DONTWAIT) == 0;
+      },
+      timeout_ms);
+}
+
+// Runs fileindexctl with `args` (shell words); its standard output and error together, and its
+// exit status.
+std::pair<std::string, int> Ctl(const std::string& args) {
+  FILE* pipe = popen((std::string(FILEINDEXCTL_BIN) + " " + args + " 2>&1").c_str(), "r");
+  std::string out;
+  char buf[4096];
+  size_t n;
+  while ((n = fread(buf, 1, sizeof(buf), pipe)) > 0) out.append(buf, n);
+  const int status = pclose(pipe);
+  return {out, WIFEXITED(status) ? WEXITSTATUS(status) : -1};
+}
+
+// Makes the scratch root's socket folder reachable for other users.
+void OpenSocketFolder(const std::string& root) {
+  for (const std::string& dir : {root, root + "/var", root + "/var/run"}) {
+    MakeParentDirs(dir + "/x");
+    chmod(dir.c_str(), 0755);
+  }
 }
 
 class DaemonTest : public ::testing::Test {
@@ -210,6 +269,192 @@ TEST_F(DaemonTest, SighupReReadsTheFolderConfiguration) {
   sys_.WriteFolders(folders);
   ASSERT_EQ(0, kill(indexd->pid(), SIGHUP));
   EXPECT_TRUE(WaitFor([] { return Running() == std::set<std::string>{"docs"}; }, 5000));
+}
+
+TEST_F(DaemonTest, ClientsHoldingTheSocketDoNotHoldOffOthers) {
+  OpenSocketFolder(sys_.root());
+  auto indexd = sys_.StartIndexd();
+  // Root's connections are never turned away: twenty idle ones and one stopped half-way through
+  // its frame hold the socket...
+  std::vector<UniqueFd> idle;
+  for (int i = 0; i < 20; ++i) idle.push_back(Connect());
+  idle.push_back(Connect(std::string("\x40\0\0\0{\"type\"", 11)));
+  for (const UniqueFd& fd : idle) ASSERT_TRUE(fd.valid());
+  // ... while another client's pause is applied before its reply, and the reply says so. (One
+  // client at a time, each given seconds to speak, would take most of a minute here.)
+  const auto start = std::chrono::steady_clock::now();
+  Json::Value pause(Json::objectValue);
+  pause["resume_time"] = 0;
+  const Json::Value reply = Command("pause", pause);
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(10));
+  EXPECT_TRUE(reply["success"].asBool()) << reply;
+  EXPECT_TRUE(Status()["paused"].asBool());
+  // Those that send no whole command within the daemon's short wait are let go.
+  for (const UniqueFd& fd : idle) EXPECT_TRUE(ClosedByDaemon(fd.get(), 10000));
+
+  // Any other user gets a few connections at a time; the next is refused at once, with a
+  // reason, and the user is served again once one is let go.
+  EXPECT_EQ(
+      kErrTooManyConnections, orvane::test::RunAsUser("nobody", [] {
+        std::vector<UniqueFd> held;
+        for (int i = 0; i < kMaxConnectionsPerUser; ++i) held.push_back(Connect());
+        const Json::Value refused = Command("status", Json::Value());
+        if (refused["error"]["msg"].asString().find("too many") == std::string::npos) return 1;
+        held.pop_back();
+        if (!WaitFor([] { return Command("status", Json::Value())["success"].asBool(); }, 5000)) {
+          return 2;
+        }
+        return refused["error"]["code"].asInt();
+      }));
+}
+
+TEST_F(DaemonTest, StatusShowsFileDetailsOnlyToAdministrators) {
+  OpenSocketFolder(sys_.root());
+  // An engine that refuses one document, which the real one cannot be made to do, stands in for
+  // it: after its retries the worker records the operation, path and all, as its last error.
+  engine_->Signal(SIGTERM);
+  const std::string secret = V("a/secret-plan.txt");
+  auto refuse_secret = [secret](int fd, const std::string& text) {
+    const Json::Value req = orvane::test::FakeDaemon::Parse(text);
+    Json::Value reply(Json::objectValue);
+    reply["success"] = req["data"]["doc_id"] != secret;
+    if (!reply["success"].asBool()) reply["error"]["code"] = 604;
+    if (req["command"] == "document_get_by_query") reply["data"] = Json::arrayValue;
+    orvane::test::FakeDaemon::WriteFrame(fd, JsonToString(reply));
+  };
+  orvane::test::FakeDaemon engine(RootedPathForWrite("/var/run/quixelasticd.sock"), refuse_secret);
+  auto indexd = sys_.StartIndexd();
+  Create("a/secret-plan.txt");
+  Json::Value report;
+  ASSERT_TRUE(
+      WaitFor([&] { return (report = Status()["shares"][0])["errors"].asUInt() > 0; }, 30000))
+      << report;
+  EXPECT_NE(std::string::npos, report["last_error"].asString().find(secret)) << report;
+
+  // 0: the counts without the path; 1: the path; 2: no counts.
+  const auto what_nobody_sees = [] {
+    const Json::Value status = Command("status", Json::Value());
+    if (status["data"]["shares"][0]["errors"].asUInt() == 0) return 2;
+    return JsonToString(status).find("secret-plan") != std::string::npos ? 1 : 0;
+  };
+  EXPECT_EQ(0, orvane::test::RunAsUser("nobody", what_nobody_sees));
+  // A member of the platform's administrators group sees what root sees.
+  const std::string shares = R"([{"name": "docs", "path": ")" + sys_.Vol("docs") +
+                             R"(", "recycle_bin": true}, {"name": "music", "path": ")" +
+                             sys_.Vol("music") + R"(", "recycle_bin": true}])";
+  orvane::test::WritePlatformConfig(sys_.root(),
+                                    R"({"admin_group": "nogroup", "shares": )" + shares + "}");
+  EXPECT_EQ(1, orvane::test::RunAsUser("nobody", what_nobody_sees));
+}
+
+TEST_F(DaemonTest, ADamagedIndexIsReportedWithTheCommandThatRebuildsIt) {
+  auto indexd = sys_.StartIndexd();
+  Create("a/one.txt");
+  ASSERT_TRUE(WaitFor([&] { return Indexed("a/one.txt"); }, 5000));
+  // The engine stopped, the index's database overwritten with garbage, the engine started again.
+  engine_->Signal(SIGTERM);
+  const std::string db = sdk::SDKShare("docs").GetDBPath() + "/index.db";
+  ASSERT_TRUE(IsFileExist(db)) << db;
+  unlink((db + "-wal").c_str());
+  unlink((db + "-shm").c_str());
+  test::WriteFile(db, std::string(64 << 10, 'x'));
+  engine_ = sys_.StartEngine();
+
+  // A search of the share names it and the command, and does not blame an engine out of reach.
+  auto [out, status] = Ctl("search one --share docs");
+  EXPECT_EQ(1, status) << out;
+  EXPECT_NE(std::string::npos, out.find("a share's search index is damaged (error 609): the index "
+                                        "of share docs cannot be read and was set aside; "
+                                        "\"fileindexctl share rebuild docs\" builds it again"))
+      << out;
+  EXPECT_EQ(std::string::npos, out.find("cannot be reached")) << out;
+
+  // Changes meanwhile are kept, not skipped, and the status says why and what to do.
+  Create("a/two.txt");
+  Json::Value report;
+  EXPECT_TRUE(WaitFor(
+      [&] {
+        report = Status()["shares"][0];
+        return report["last_error"].asString().find("\"fileindexctl share rebuild docs\"") !=
+               std::string::npos;
+      },
+      10000))
+      << report;
+  EXPECT_EQ(1u, report["queue_length"].asUInt()) << report;
+  std::tie(out, status) = Ctl("status");
+  EXPECT_NE(std::string::npos, out.find("notes:\n  docs: the search index cannot be read and was "
+                                        "set aside; \"fileindexctl share rebuild docs\" builds it "
+                                        "again\n"))
+      << out;
+
+  // The command given does it: both files are found again.
+  std::tie(out, status) = Ctl("share rebuild docs");
+  EXPECT_EQ(0, status) << out;
+  EXPECT_TRUE(WaitFor([&] { return Indexed("a/one.txt") && Indexed("a/two.txt"); }, 30000));
+}
+
+// Removes `name` in the folder `dir_fd` and everything below it, by descriptors all the way down,
+// since the deepest names are too long to be given whole.
+void RemoveTreeAt(int dir_fd, const std::string& name) {
+  UniqueFd fd(openat(dir_fd, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!fd.valid()) {
+    unlinkat(dir_fd, name.c_str(), 0);
+    return;
+  }
+  std::unique_ptr<DIR, int (*)(DIR*)> dir(fdopendir(dup(fd.get())), closedir);
+  std::vector<std::string> names;
+  while (struct dirent* entry = readdir(dir.get())) {
+    if (std::strcmp(entry->d_name, ".") != 0 && std::strcmp(entry->d_name, "..") != 0) {
+      names.emplace_back(entry->d_name);
+    }
+  }
+  for (const std::string& n : names) RemoveTreeAt(fd.get(), n);
+  unlinkat(dir_fd, name.c_str(), AT_REMOVEDIR);
+}
+
+TEST_F(DaemonTest, PathsTooLongToIndexAreCountedAndShown) {
+  // Folders nested by descriptor until the next name would reach PATH_MAX; inside the last one
+  // a file whose path is one byte short of it (indexed), one that reaches it, and a folder that
+  // does (each counted, the folder once for all below it).
+  const std::string top = V("a/deep");
+  ASSERT_EQ(0, mkdir(top.c_str(), 0755));
+  std::string path = top;
+  UniqueFd dir(open(top.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const std::string segment(200, 'd');
+  while (path.size() + 1 + segment.size() + 1 + 100 < PATH_MAX) {
+    ASSERT_EQ(0, mkdirat(dir.get(), segment.c_str(), 0755));
+    dir = UniqueFd(openat(dir.get(), segment.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    ASSERT_TRUE(dir.valid());
+    path += "/" + segment;
+  }
+  const size_t room = PATH_MAX - 1 - path.size() - 1;  // the longest name: the NUL and "/" left
+  const std::string fits = std::string(room, 'f');
+  const std::string too_long = std::string(room + 1, 'g');
+  for (const std::string& name : {fits, too_long}) {
+    UniqueFd file(openat(dir.get(), name.c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644));
+    ASSERT_TRUE(file.valid()) << name.size();
+  }
+  ASSERT_EQ(0, mkdirat(dir.get(), std::string(room + 1, 'h').c_str(), 0755));
+  ASSERT_EQ(PATH_MAX - 1, static_cast<int>((path + "/" + fits).size()));
+
+  auto indexd = sys_.StartIndexd();
+  ASSERT_TRUE(fileindex::QueueFileAppend(
+      sys_.Queue("docs"), R"({"event": 64, "is_dir": true, "path": ")" + top + "\"}\n"));
+  Json::Value report;
+  EXPECT_TRUE(
+      WaitFor([&] { return (report = Status()["shares"][0])["long_paths"].asUInt() == 2; }, 10000))
+      << report;
+  EXPECT_TRUE(WaitFor([&] { return sys_.Documents("docs").count(path + "/" + fits) > 0; }, 5000));
+  // Crawled again, the same paths are not counted twice.
+  ASSERT_TRUE(fileindex::QueueFileAppend(
+      sys_.Queue("docs"), R"({"event": 64, "is_dir": true, "path": ")" + top + "\"}\n"));
+  EXPECT_TRUE(WaitFor([&] { return Status()["shares"][0]["queue_length"].asUInt() == 0; }, 5000));
+  EXPECT_EQ(2u, Status()["shares"][0]["long_paths"].asUInt());
+  EXPECT_NE(std::string::npos,
+            Ctl("status").first.find("docs: 2 path(s) of 4096 bytes or more cannot be indexed"));
+
+  UniqueFd a(open(V("a").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  RemoveTreeAt(a.get(), "deep");
 }
 
 }  // namespace

@@ -41,9 +41,11 @@ std::string ShareOf(const Json::Value& data) {
 
 // The members of a worker's report that everyone may see: counts and states. The rest (the last
 // error's text) names files of the share, which only administrators may know of.
+// clang-format off
 const char* const kPublicReportMembers[] = {
-    "share",  "queue_length", "ops_pending", "ops_done",  "documents_written", "documents_deleted",
-    "last_pass", "errors",    "paused",      "out_of_space", "long_paths"};
+    "share", "queue_length", "ops_pending", "ops_done", "documents_written", "documents_deleted",
+    "last_pass", "errors", "paused", "out_of_space", "long_paths"};
+// clang-format on
 
 Json::Value PublicReport(const Json::Value& report) {
   Json::Value r(Json::objectValue);
@@ -60,8 +62,8 @@ bool IsPrivilegedCaller(uid_t uid) {
   LockMutex lock(sdk::SDKMutex());
   platform::PQUIXUSER user = nullptr;
   if (platform::QUIXUserGetByUID(uid, &user) != 0 || user == nullptr) return false;
-  std::unique_ptr<platform::QUIXUSER, void (*)(platform::PQUIXUSER)> owned(user,
-                                                                          platform::QUIXUserFree);
+  using UserPtr = std::unique_ptr<platform::QUIXUSER, void (*)(platform::PQUIXUSER)>;
+  const UserPtr owned(user, platform::QUIXUserFree);
   return platform::QLIBGroupIsAdminGroupMem(user->szName, 0) == 1;
 }
 

@@ -151,8 +151,8 @@ void CommandServer::Serve() {
     const bool privileged = cred.uid == 0 || cred.uid == geteuid();
     {
       std::lock_guard<std::mutex> lock(mu_);
-      if (!privileged && (capped_ >= kMaxConnections ||
-                          per_user_[cred.uid] >= kMaxConnectionsPerUser)) {
+      if (!privileged &&
+          (capped_ >= kMaxConnections || per_user_[cred.uid] >= kMaxConnectionsPerUser)) {
         Log(LOG_WARNING, "fileindexd: connection of user %u refused: too many connections",
             cred.uid);
         WriteReply(conn.get(),
@@ -194,7 +194,8 @@ void CommandServer::ServeOne(UniqueFd conn, uid_t uid, bool privileged) {
   setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &tv, sizeof(tv));
   [&] {
     uint32_t len = 0;
-    if (!ReadFull(fd, &len, sizeof(len), deadline)) return;  // a client that sent nothing gets nothing
+    // A client that sent nothing gets nothing.
+    if (!ReadFull(fd, &len, sizeof(len), deadline)) return;
     if (len == 0 || len > kMaxCommandFrame) {
       WriteReply(fd, ErrorReply(104, "frame length " + std::to_string(len) + " out of range"));
       return;

@@ -7,8 +7,8 @@
 #ifndef ORVANE_DAEMONS_FILEINDEXD_SERVER_HPP_
 #define ORVANE_DAEMONS_FILEINDEXD_SERVER_HPP_
 
-#include <sys/types.h>
 #include <json/json.h>
+#include <sys/types.h>
 
 #include <condition_variable>
 #include <cstdint>
@@ -71,10 +71,10 @@ class CommandServer {
 
   std::mutex mu_;  // guards the connection book-keeping below
   std::condition_variable idle_cv_;
-  int active_ = 0;                  // connection threads running
-  int capped_ = 0;                  // ... of them, of callers under the caps
-  std::map<uid_t, int> per_user_;   // capped connections by user
-  std::set<int> open_fds_;          // descriptors of running connections, shut down by Stop
+  int active_ = 0;                 // connection threads running
+  int capped_ = 0;                 // ... of them, of callers under the caps
+  std::map<uid_t, int> per_user_;  // capped connections by user
+  std::set<int> open_fds_;         // descriptors of running connections, shut down by Stop
 };
 
 }  // namespace fileindexd

@@ -94,6 +94,7 @@ void Worker::RequestStop() {
 }
 
 void Worker::Wake() {
+  woken_.store(true);
   if (!wake_write_.valid()) return;
   const char byte = 1;
   // A full pipe already holds a wake-up.
@@ -148,7 +149,10 @@ void Worker::Run() {
       // A pass that finished a batch left behind did not take the live queue yet.
       if (!IsFileExist(queue_path_)) Wait(kIdleWaitMillis);
     } else {
-      Backoff(backoff);
+      // A command (a rebuild's worker_create, a resume) ends the wait: what it changed may be
+      // what the pass was waiting for.
+      woken_.store(false);
+      Backoff(backoff, &woken_);
       backoff = std::min(backoff * 2, kPassRetryMaxMicros);
     }
   }
@@ -250,10 +254,10 @@ void Worker::Wait(int timeout_ms) {
   }
 }
 
-void Worker::Backoff(int64_t micros) {
+void Worker::Backoff(int64_t micros, const std::atomic<bool>* cut_short) {
   // In slices, so that a stop does not wait out a long back-off.
   constexpr int64_t kSlice = 200000;
-  while (micros > 0 && !stop_.load()) {
+  while (micros > 0 && !stop_.load() && !(cut_short != nullptr && cut_short->load())) {
     const int64_t step = std::min(micros, kSlice);
     Env::Current()->SleepMicros(step);
     micros -= step;

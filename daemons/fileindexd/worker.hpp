@@ -71,7 +71,8 @@ class Worker {
  private:
   void Run();
   void Wait(int timeout_ms);
-  void Backoff(int64_t micros);
+  // Sleeps, ending early on a stop or when `cut_short` is set.
+  void Backoff(int64_t micros, const std::atomic<bool>* cut_short = nullptr);
   void RecordError(const std::string& text);
   // Adds the over-long paths a pass met to the worker's count; logs the first new one.
   void TakeLongPaths(const Indexer& indexer);
@@ -83,6 +84,7 @@ class Worker {
   UniqueFd wake_write_;
   UniqueFd inotify_;
   std::atomic<bool> stop_{false};
+  std::atomic<bool> woken_{false};  // set by Wake; ends a pass's back-off
   std::thread thread_;
 
   mutable std::mutex mu_;  // guards the figures below
