@@ -206,6 +206,22 @@ TEST_F(CtlTest, StatusShowsEachShareFromBothDaemonsOrDashesWithoutThem) {
   EXPECT_THAT(Run({"status"}).out, HasSubstr("42    -          2"));
 }
 
+TEST_F(CtlTest, PauseSaysWhetherTheIndexingDaemonTookIt) {
+  // Not running: the status file holds the pause, which the daemon reads when it starts.
+  Result r = Run({"pause"});
+  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("(fileindexd is not running: it applies when fileindexd starts)"));
+  // Running (its pid file names a live process) and refusing: a failure, and the reason.
+  dir_.Write("var/run/fileindexd.pid", std::to_string(getpid()) + "\n");
+  test::FakeDaemon indexer(
+      dir_.Path("var/run/fileindexd.sock"),
+      test::FakeDaemon::Replies({R"({"success":false,"error":{"code":105,"msg":"too many"}})"}));
+  r = Run({"resume"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_THAT(r.err, HasSubstr("recorded, but the running fileindexd did not take it: fileindexd "
+                               "refused \"resume\": too many (code 105)"));
+}
+
 TEST(CliTest, ValuesPeopleType) {
   EXPECT_THROW(ParseSize("lots"), UsageError);
   EXPECT_EQ(ParseTime("1700000000"), 1700000000);
