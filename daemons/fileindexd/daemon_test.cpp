@@ -380,7 +380,7 @@ TEST_F(DaemonTest, ADamagedIndexIsReportedWithTheCommandThatRebuildsIt) {
       },
       10000))
       << report;
-  EXPECT_EQ(1u, report["queue_length"].asUInt()) << report;
+  EXPECT_GE(report["queue_length"].asUInt(), 1u) << report;
   std::tie(out, status) = Ctl("status");
   EXPECT_NE(std::string::npos, out.find("notes:\n  docs: the search index cannot be read and was "
                                         "set aside; \"fileindexctl share rebuild docs\" builds it "
