@@ -9,6 +9,7 @@
 #include <poppler-document.h>
 #include <poppler-global.h>
 #include <poppler-page.h>
+#include <sys/stat.h>
 #include <taglib/fileref.h>
 #include <taglib/tag.h>
 #include <taglib/tpropertymap.h>
@@ -38,13 +39,48 @@ constexpr size_t kMaxMemberBytes = 64 * 1024 * 1024;
 
 [[noreturn]] void Fail(const std::string& what) { throw std::runtime_error(what); }
 
-std::string ReadPrefix(const std::string& path, size_t max_bytes) {
-  UniqueFd fd(open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
-  if (!fd.valid()) Fail(std::string("cannot open: ") + std::strerror(errno));
+// The file being extracted, opened once. Every library reads this descriptor or its
+// /proc/self/fd name, which reaches the same inode, so a name swapped for something else after
+// the open changes nothing, and nothing here ever blocks on a FIFO or follows a link.
+class OpenedFile {
+ public:
+  explicit OpenedFile(const std::string& path) {
+    // Non-blocking: opening a FIFO with no writer returns at once instead of waiting for one.
+    fd_.Reset(open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOFOLLOW | O_CLOEXEC));
+    if (!fd_.valid()) {
+      Fail(errno == ELOOP ? std::string("a symbolic link, not read")
+                          : std::string("cannot open: ") + std::strerror(errno));
+    }
+    struct stat st;
+    if (fstat(fd_.get(), &st) != 0) Fail(std::string("cannot stat: ") + std::strerror(errno));
+    if (!S_ISREG(st.st_mode)) Fail(std::string("not a regular file (") + KindName(st.st_mode) + ")");
+    proc_path_ = "/proc/self/fd/" + std::to_string(fd_.get());
+  }
+
+  int fd() const { return fd_.get(); }
+  // A name the path-taking libraries open the same file by.
+  const std::string& proc_path() const { return proc_path_; }
+
+ private:
+  static const char* KindName(mode_t mode) {
+    if (S_ISDIR(mode)) return "a folder";
+    if (S_ISFIFO(mode)) return "a FIFO";
+    if (S_ISSOCK(mode)) return "a socket";
+    if (S_ISCHR(mode) || S_ISBLK(mode)) return "a device";
+    return "not a file";
+  }
+
+  UniqueFd fd_;
+  std::string proc_path_;
+};
+
+// Reads from the start whatever the descriptor's offset, which the type sniffing may move.
+std::string ReadPrefix(const OpenedFile& file, size_t max_bytes) {
   std::string data;
   char buf[65536];
   while (data.size() < max_bytes) {
-    const ssize_t n = read(fd.get(), buf, std::min(sizeof(buf), max_bytes - data.size()));
+    const ssize_t n = pread(file.fd(), buf, std::min(sizeof(buf), max_bytes - data.size()),
+                            static_cast<off_t>(data.size()));
     if (n < 0 && errno == EINTR) continue;
     if (n < 0) Fail(std::string("cannot read: ") + std::strerror(errno));
     if (n == 0) break;
@@ -163,9 +199,9 @@ void SetText(Json::Value& fields, const std::string& key, const std::string& val
 
 // ---- plain text
 
-void ExtractText(const std::string& path, Json::Value& fields) {
+void ExtractText(const OpenedFile& file, Json::Value& fields) {
   // Read a little more than the cap: a conversion can shrink the text.
-  const std::string raw = ReadPrefix(path, kMaxTextBytes + 4096);
+  const std::string raw = ReadPrefix(file, kMaxTextBytes + 4096);
   const std::string text = ToUtf8(raw, kMaxTextBytes);
   if (!text.empty()) fields["QUIXMDTextContent"] = text;
 }
@@ -179,9 +215,9 @@ std::string Utf8(const poppler::ustring& s) {
   return std::string(bytes.begin(), bytes.end());
 }
 
-void ExtractPdf(const std::string& path, Json::Value& fields) {
+void ExtractPdf(const OpenedFile& file, Json::Value& fields) {
   poppler::set_debug_error_function(QuietPoppler, nullptr);
-  std::unique_ptr<poppler::document> doc(poppler::document::load_from_file(path));
+  std::unique_ptr<poppler::document> doc(poppler::document::load_from_file(file.proc_path()));
   if (!doc) Fail("not a readable PDF");
   if (doc->is_encrypted()) fields["QUIXMDIsEncrypted"] = true;
   if (doc->is_locked()) return;
@@ -207,12 +243,13 @@ void ExtractPdf(const std::string& path, Json::Value& fields) {
 // ---- office documents
 
 // Reads the members of a zip file that `want` selects, in archive order.
-std::map<std::string, std::string> ReadZipMembers(const std::string& path,
+std::map<std::string, std::string> ReadZipMembers(const OpenedFile& file,
                                                   bool (*want)(const std::string&)) {
   std::unique_ptr<struct archive, int (*)(struct archive*)> zip(archive_read_new(),
                                                                 archive_read_free);
   archive_read_support_format_zip(zip.get());
-  if (archive_read_open_filename(zip.get(), path.c_str(), 65536) != ARCHIVE_OK) {
+  if (lseek(file.fd(), 0, SEEK_SET) != 0 ||
+      archive_read_open_fd(zip.get(), file.fd(), 65536) != ARCHIVE_OK) {
     Fail(std::string("not a readable zip: ") + archive_error_string(zip.get()));
   }
   std::map<std::string, std::string> members;
@@ -297,8 +334,8 @@ bool SlideOrder(const std::string& a, const std::string& b) {
   return a.size() != b.size() ? a.size() < b.size() : a < b;
 }
 
-void ExtractOffice(const std::string& path, bool odf, Json::Value& fields) {
-  const auto members = ReadZipMembers(path, odf ? IsOdfMember : IsOoxmlMember);
+void ExtractOffice(const OpenedFile& file, bool odf, Json::Value& fields) {
+  const auto members = ReadZipMembers(file, odf ? IsOdfMember : IsOoxmlMember);
   const std::map<std::string, std::string> props = {{"title", "QUIXMDTitle"},
                                                     {"creator", "QUIXMDAuthors"},
                                                     {"initial-creator", "QUIXMDAuthors"},
@@ -324,8 +361,9 @@ void ExtractOffice(const std::string& path, bool odf, Json::Value& fields) {
 
 std::string Utf8(const TagLib::String& s) { return s.to8Bit(true); }
 
-void ExtractAudio(const std::string& path, Json::Value& fields) {
-  TagLib::FileRef file(path.c_str(), true, TagLib::AudioProperties::Average);
+void ExtractAudio(const OpenedFile& opened, Json::Value& fields) {
+  // The descriptor's name has no extension: the library tells the format by its contents.
+  TagLib::FileRef file(opened.proc_path().c_str(), true, TagLib::AudioProperties::Average);
   if (file.isNull()) Fail("not a readable audio file");
   fields["QUIXMDMediaTypes"] = "Sound";
   if (const TagLib::Tag* tag = file.tag()) {
@@ -358,9 +396,9 @@ time_t ExifTime(const std::string& text) {
   return timegm(&tm);
 }
 
-void ExtractPhoto(const std::string& path, Json::Value& fields) {
+void ExtractPhoto(const OpenedFile& file, Json::Value& fields) {
   Exiv2::LogMsg::setLevel(Exiv2::LogMsg::mute);
-  auto image = Exiv2::ImageFactory::open(path);
+  auto image = Exiv2::ImageFactory::open(file.proc_path(), false);
   if (image.get() == nullptr) Fail("not a readable image");
   image->readMetadata();
   fields["QUIXMDMediaTypes"] = "Image";
@@ -438,10 +476,10 @@ std::string Narrow(const std::wstring& w) {
   return out;
 }
 
-void ExtractVideo(const std::string& path, Json::Value& fields) {
+void ExtractVideo(const OpenedFile& file, Json::Value& fields) {
   MediaInfoLib::MediaInfo info;
   info.Option(L"Internet", L"No");
-  if (info.Open(Widen(path)) == 0) Fail("not a readable media file");
+  if (info.Open(Widen(file.proc_path())) == 0) Fail("not a readable media file");
   auto get = [&info](MediaInfoLib::stream_t stream, const wchar_t* name) {
     return Narrow(info.Get(stream, 0, name));
   };
@@ -502,17 +540,34 @@ Kind KindOf(const std::string& path, const std::string& mime) {
 
 }  // namespace
 
-std::string MimeType(const std::string& path) {
-  // Loading the magic database costs more than looking most files up, and a long-lived helper
-  // looks up many: each thread keeps the cookie it loaded (a cookie is not thread-safe).
+namespace {
+
+// Loading the magic database costs more than looking most files up, and a long-lived helper
+// looks up many: each thread keeps the cookie it loaded (a cookie is not thread-safe).
+magic_t MagicCookie() {
   thread_local std::unique_ptr<struct magic_set, void (*)(magic_t)> cookie(nullptr, magic_close);
   if (!cookie) {
     cookie.reset(magic_open(MAGIC_MIME_TYPE | MAGIC_NO_CHECK_COMPRESS | MAGIC_ERROR));
     if (cookie && magic_load(cookie.get(), nullptr) != 0) cookie.reset();
-    if (!cookie) return "";
   }
-  const char* type = magic_file(cookie.get(), path.c_str());
+  return cookie.get();
+}
+
+std::string MimeTypeOf(const OpenedFile& file) {
+  magic_t cookie = MagicCookie();
+  if (cookie == nullptr || lseek(file.fd(), 0, SEEK_SET) != 0) return "";
+  const char* type = magic_descriptor(cookie, file.fd());
   return type == nullptr ? "" : type;
+}
+
+}  // namespace
+
+std::string MimeType(const std::string& path) {
+  try {
+    return MimeTypeOf(OpenedFile(path));
+  } catch (const std::exception&) {
+    return "";
+  }
 }
 
 std::string ToUtf8(const std::string& text, size_t max_bytes) {
@@ -526,30 +581,32 @@ std::string ToUtf8(const std::string& text, size_t max_bytes) {
 }
 
 Json::Value ExtractContent(const std::string& path) {
-  // Every kind, even one with nothing to extract, must at least be readable.
-  ReadPrefix(path, 1);
+  // Every kind, even one with nothing to extract, must at least be a readable regular file.
+  const OpenedFile file(path);
+  ReadPrefix(file, 1);
   Json::Value fields(Json::objectValue);
-  switch (KindOf(path, MimeType(path))) {
+  // The extension is the name's, not the descriptor's.
+  switch (KindOf(path, MimeTypeOf(file))) {
     case Kind::kText:
-      ExtractText(path, fields);
+      ExtractText(file, fields);
       break;
     case Kind::kPdf:
-      ExtractPdf(path, fields);
+      ExtractPdf(file, fields);
       break;
     case Kind::kOoxml:
-      ExtractOffice(path, false, fields);
+      ExtractOffice(file, false, fields);
       break;
     case Kind::kOdf:
-      ExtractOffice(path, true, fields);
+      ExtractOffice(file, true, fields);
       break;
     case Kind::kAudio:
-      ExtractAudio(path, fields);
+      ExtractAudio(file, fields);
       break;
     case Kind::kPhoto:
-      ExtractPhoto(path, fields);
+      ExtractPhoto(file, fields);
       break;
     case Kind::kVideo:
-      ExtractVideo(path, fields);
+      ExtractVideo(file, fields);
       break;
     case Kind::kNone:
       break;
