@@ -155,7 +155,9 @@ enum Action : uint8_t {
 
 // One row per handler, indexed by the pending operation's kind (kOPNone to kOPCrash).
 // A create after a pending delete revives it as an upsert while a modification after it is
-// dropped; a delete never overrides a pending re-index or folder-settings update.
+// dropped; a delete never overrides a pending re-index or folder-settings update. A re-index
+// after a pending delete takes the delete's place: the name came back as a folder (or a folder
+// went away where a file was), and the crawl both removes what is gone and indexes what is there.
 using Rules = std::array<Action, 8>;
 // clang-format off
 //                 pending:   none   delete     upsert        attr          update dir    rename reindex crash
@@ -164,7 +166,7 @@ constexpr Rules kModifyRules   = {kKeep, kDrop,     kDrop,        kToUpsert,    
 constexpr Rules kAttrRules     = {kKeep, kDrop,     kDrop,        kDrop,        kDrop,        kKeep, kDrop,  kKeep};
 constexpr Rules kDeleteRules   = {kKeep, kDrop,     kToDelete,    kToDelete,    kKeep,        kKeep, kKeep,  kKeep};
 constexpr Rules kUpdateDirRules= {kKeep, kDrop,     kToUpdateDir, kToUpdateDir, kMerge,       kKeep, kDrop,  kKeep};
-constexpr Rules kReindexRules  = {kKeep, kDrop,     kToReindex,   kToReindex,   kToReindex,   kKeep, kDrop,  kKeep};
+constexpr Rules kReindexRules  = {kKeep, kToReindex, kToReindex,  kToReindex,   kToReindex,   kKeep, kDrop,  kKeep};
 // clang-format on
 
 // Gives `op` its kind, then applies `rules` against every operation pending on the node,

@@ -63,7 +63,7 @@ TEST(OPTreeTest, CoalescingTableCellByCell) {
       {&OPTree::HandleAttr, kOPAttr, "0+ 1- 2- 3- 4- 5+ 6- 7+"},
       {&OPTree::HandleDelete, kOPDelete, "0+ 1- 1- 1- 4+ 5+ 6+ 7+"},
       {&OPTree::HandleUpdateDirectory, kOPUpdateDirectory, "0+ 1- 4- 4- 4- 5+ 6- 7+"},
-      {&OPTree::HandleReindex, kOPReindex, "0+ 1- 6- 6- 6- 5+ 6- 7+"},
+      {&OPTree::HandleReindex, kOPReindex, "0+ 6- 6- 6- 6- 5+ 6- 7+"},
   };
   for (const auto& row : rows) {
     for (int k = 0; k < 8; ++k) {
@@ -114,6 +114,28 @@ TEST(OPTreeTest, DirectoryReindexCancelsPendingWorkBelowButKeepsRenames) {
   // A deleted directory is re-indexed as well, once.
   EXPECT_THAT(Drain(Create("/v/s/d/a") + DeleteDir("/v/s/d") + DeleteDir("/v/s/d")),
               ElementsAre("[06] /v/s/d"));
+}
+
+// A name turned from file to folder and back, as fast as the watcher can report it: whatever
+// the name is at the end, the last word on it must be a crawl or an upsert, never a delete,
+// and there is one of it.
+TEST(OPTreeTest, NameToggledBetweenFileAndFolderEndsIndexed) {
+  std::string queue;
+  for (int toggles = 1; toggles <= 20; ++toggles) {
+    const bool now_dir = toggles % 2 == 1;
+    queue += now_dir ? Delete("/v/s/t") + Line(kEventCreate, "/v/s/t", ",\"is_dir\":true")
+                     : DeleteDir("/v/s/t") + Create("/v/s/t");
+    SCOPED_TRACE(std::to_string(toggles) + " toggles");
+    const std::vector<std::string> ops = Drain(queue);
+    ASSERT_FALSE(ops.empty());
+    EXPECT_THAT(ops.back(), ::testing::AnyOf("[06] /v/s/t", "[02] /v/s/t"));
+    EXPECT_THAT(ops, ::testing::Not(::testing::Contains("[01] /v/s/t")));
+  }
+  // From a folder that was being crawled: removed, made a file, removed, made a folder.
+  EXPECT_THAT(Drain(Line(kEventCreate, "/v/s/t", ",\"is_dir\":true") + DeleteDir("/v/s/t") +
+                    Create("/v/s/t") + Delete("/v/s/t") +
+                    Line(kEventCreate, "/v/s/t", ",\"is_dir\":true")),
+              ::testing::Each("[06] /v/s/t"));
 }
 
 TEST(OPTreeTest, RenameMovesPendingWorkAndFollowsUp) {
