@@ -189,6 +189,39 @@ TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
   ExpectSettled("media", sys_.Vol("media"));
 }
 
+// Names taken over for real, with the three daemons running: a link renamed over a root-only
+// file takes its document and its words away (the link's old name never had a document); a
+// FIFO made where a file was leaves no document; a name toggled between file and folder 21
+// times ends with the folder's document.
+TEST_F(EndToEndTest, NamesTakenByLinksFifosAndFoldersEndWithWhatIsThere) {
+  WriteFile(D("team/boss_plan.txt"), "confidential merger plans");
+  ASSERT_EQ(0, chmod(D("team/boss_plan.txt").c_str(), 0600));
+  WriteFile(D("team/swap.txt"), "swapped");
+  WriteFile(D("team/toggle"), "a file first");
+  WriteFile(D("pub/readable.txt"), "public words");
+  fileindex::FolderAdd(Folder("/docs/team", true), false);
+  ExpectSettled("docs", D("team"));
+  ASSERT_TRUE(WaitFor([] { return Search("merger") == 1; }, 20000));
+
+  ASSERT_EQ(0, symlink(D("pub/readable.txt").c_str(), D("team/.t").c_str()));
+  ASSERT_EQ(0, rename(D("team/.t").c_str(), D("team/boss_plan.txt").c_str()));
+  ASSERT_EQ(0, unlink(D("team/swap.txt").c_str()));
+  ASSERT_EQ(0, mkfifo(D("team/swap.txt").c_str(), 0644));
+  for (int i = 0; i < 21; ++i) {
+    const std::string t = D("team/toggle");
+    if (i % 2 == 0) {
+      ASSERT_EQ(0, unlink(t.c_str()));
+      ASSERT_EQ(0, mkdir(t.c_str(), 0755));
+    } else {
+      ASSERT_EQ(0, rmdir(t.c_str()));
+      WriteFile(t, "a file again");
+    }
+  }
+  ExpectSettled("docs", D("team"));
+  EXPECT_EQ(0, Search("merger"));
+  EXPECT_EQ(-1, std::get<2>(Index("docs")[D("team/toggle")]));
+}
+
 TEST_F(EndToEndTest, KilledDaemonsLoseNothingAndDoubleNothing) {
   WriteFile(D("proj/seed.txt"), "s");
   fileindex::FolderAdd(Folder("/docs/proj", false), false);

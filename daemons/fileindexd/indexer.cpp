@@ -15,6 +15,7 @@
 #include "common/json_util.hpp"
 #include "common/log.hpp"
 #include "common/util.hpp"
+#include "daemons/fileindexd/parse_pool.hpp"
 #include "extract/content_extract.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/util.hpp"
@@ -44,7 +45,9 @@ Json::Value Command(const char* name, Json::Value data) {
 }  // namespace
 
 // Collects document commands and sends them as compound requests, so a crawl of many files
-// costs one engine transaction per batch rather than one connection per file.
+// costs one engine transaction per batch rather than one connection per file. Contents are
+// extracted on a pool of threads, several files at once; a crawl names each path once, so the
+// documents may go out in the order their extraction ends.
 class Indexer::Batch {
  public:
   explicit Batch(Indexer* owner)
@@ -52,28 +55,28 @@ class Indexer::Batch {
   Batch(const Batch&) = delete;
   Batch& operator=(const Batch&) = delete;
 
-  // A file whose attributes cannot be read any more is simply not indexed: it went away while
-  // the crawl ran, and its delete event follows.
   void Upsert(const std::string& path, bool need_meta) {
-    Json::Value config(Json::objectValue);
-    config["need_meta"] = need_meta;
-    Json::Value doc;
-    try {
-      QUIX::CONTENT_EXTRACT::ParseFile(path, config, doc);
-    } catch (const std::exception& e) {
-      Log(LOG_WARNING, "fileindexd: %s not indexed: %s", path.c_str(), e.what());
+    if (need_meta) {
+      pool_.Submit(path, true);
+      // Bounded, so that memory stays bounded however large the folder: a slow file holds one
+      // thread while the others go on, and what they finish is taken here.
+      ParsePool::Result result;
+      while (pool_.Next(&result, pool_.outstanding() > kMaxInFlightPerThread * pool_.threads())) {
+        Add(std::move(result), true);
+      }
       return;
     }
-    // Name-only documents are small; with contents the file's size bounds the extracted text.
-    bytes_ += need_meta ? 512 + doc[QUIX::CONTENT_EXTRACT::QUIXMDFSSize].asUInt64() : 512;
-    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchFileName] = doc[QUIX::CONTENT_EXTRACT::QUIXMDFSName];
-    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchAncestor] = doc[QUIX::CONTENT_EXTRACT::QUIXMDParent];
-    Json::Value data(Json::objectValue);
-    data["id"] = id_;
-    data["doc_id"] = path;
-    data["data"] = std::move(doc);
-    Add(Command("document_upsert_by_id", std::move(data)));
-    ++owner_->documents_written_;
+    ParsePool::Result result;
+    result.path = path;
+    Json::Value config(Json::objectValue);
+    config["need_meta"] = false;
+    try {
+      QUIX::CONTENT_EXTRACT::ParseFile(path, config, result.doc);
+      result.ok = true;
+    } catch (const std::exception& e) {
+      result.error = e.what();
+    }
+    Add(std::move(result), false);
   }
   void Delete(const std::string& path) {
     Json::Value data(Json::objectValue);
@@ -82,7 +85,46 @@ class Indexer::Batch {
     Add(Command("document_del_by_id", std::move(data)));
     ++owner_->documents_deleted_;
   }
+  // Sends everything, waiting for the extractions still running; what is ready is sent before
+  // each wait, so the files done are searchable while a slow one is still being read.
   void Flush() {
+    ParsePool::Result result;
+    for (;;) {
+      while (pool_.Next(&result, false)) Add(std::move(result), true);
+      Send();
+      if (!pool_.Next(&result, true)) break;
+      Add(std::move(result), true);
+    }
+  }
+
+ private:
+  static constexpr size_t kMaxInFlightPerThread = 4;
+
+  // A file whose attributes cannot be read any more is simply not indexed: it went away while
+  // the crawl ran, and its delete event follows.
+  void Add(ParsePool::Result result, bool need_meta) {
+    if (!result.ok) {
+      Log(LOG_WARNING, "fileindexd: %s not indexed: %s", result.path.c_str(),
+          result.error.c_str());
+      return;
+    }
+    Json::Value& doc = result.doc;
+    // Name-only documents are small; with contents the file's size bounds the extracted text.
+    bytes_ += need_meta ? 512 + doc[QUIX::CONTENT_EXTRACT::QUIXMDFSSize].asUInt64() : 512;
+    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchFileName] = doc[QUIX::CONTENT_EXTRACT::QUIXMDFSName];
+    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchAncestor] = doc[QUIX::CONTENT_EXTRACT::QUIXMDParent];
+    Json::Value data(Json::objectValue);
+    data["id"] = id_;
+    data["doc_id"] = result.path;
+    data["data"] = std::move(doc);
+    Add(Command("document_upsert_by_id", std::move(data)));
+    ++owner_->documents_written_;
+  }
+  void Add(Json::Value req) {
+    reqs_.append(std::move(req));
+    if (reqs_.size() >= kCrawlBatchSize || bytes_ >= kCrawlBatchBytes) Send();
+  }
+  void Send() {
     if (reqs_.empty()) return;
     Json::Value req(Json::objectValue);
     req["compound"] = std::move(reqs_);
@@ -91,16 +133,12 @@ class Indexer::Batch {
     el::SendRequest(req);
   }
 
- private:
-  void Add(Json::Value req) {
-    reqs_.append(std::move(req));
-    if (reqs_.size() >= kCrawlBatchSize || bytes_ >= kCrawlBatchBytes) Flush();
-  }
-
   Indexer* owner_;
   std::string id_;
   Json::Value reqs_;
   uint64_t bytes_ = 0;
+  // Declared last: destroyed first, before the requests its results would have joined.
+  ParsePool pool_;
 };
 
 Indexer::Indexer(const std::string& share, const std::atomic<bool>* stop)
@@ -163,20 +201,37 @@ void Indexer::Upsert(const std::string& path) {
     if (errno == ENAMETOOLONG) NoteLongPath(path);
     return;  // gone again; its delete is queued
   }
+  // Before the rules: they look through a link at what it names.
+  if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) {
+    DeleteReplaced(path);
+    return;
+  }
   if (!folders_->GetMostSuitableCfg(path) || !fileindex::CanFullPathBeIndexed(path)) return;
   if (S_ISDIR(st.st_mode)) {
     Crawl(path, CrawlMode(), false);
     return;
   }
-  if (!S_ISREG(st.st_mode)) return;
   el::IndexUpsert(share_, path, folders_->IsFullPathNeedMeta(path));
   ++documents_written_;
+}
+
+void Indexer::DeleteReplaced(const std::string& path) {
+  // A link, FIFO, socket or device is never indexed, so nothing else would ever remove the
+  // document of the file or folder it replaced, and a link would lend that document the
+  // permissions of whatever it points to.
+  el::IndexDel(share_, path);
+  el::IndexDelDir(share_, path);
+  ++documents_deleted_;
 }
 
 void Indexer::Attr(const std::string& path) {
   struct stat st;
   if (lstat(path.c_str(), &st) != 0) {
     if (errno == ENAMETOOLONG) NoteLongPath(path);
+    return;
+  }
+  if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) {
+    DeleteReplaced(path);
     return;
   }
   if (!folders_->GetMostSuitableCfg(path) || !fileindex::CanFullPathBeIndexed(path)) return;
@@ -192,11 +247,17 @@ void Indexer::Attr(const std::string& path) {
 void Indexer::Rename(const std::string& path, const std::string& old_path) {
   // A move to a place no folder covers (or that the rules refuse) is a delete of the old name.
   struct stat st;
-  const bool indexable = lstat(path.c_str(), &st) == 0 && folders_->GetMostSuitableCfg(path) &&
+  const bool exists = lstat(path.c_str(), &st) == 0;
+  // Something never indexed (a link, a FIFO, ...) moved over the new name: the old name had no
+  // document, and the new name's document is of the file it replaced. Decided before the
+  // rules, which look through a link at what it names.
+  const bool replaced = exists && !S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode);
+  const bool indexable = exists && !replaced && folders_->GetMostSuitableCfg(path) &&
                          fileindex::CanFullPathBeIndexed(path);
   if (!indexable) {
     el::IndexDel(share_, old_path);
     el::IndexDelDir(share_, old_path);
+    if (replaced) DeleteReplaced(path);
     return;
   }
   try {

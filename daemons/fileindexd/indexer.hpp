@@ -63,6 +63,8 @@ class Indexer {
   void Upsert(const std::string& path);
   void Attr(const std::string& path);
   void Rename(const std::string& path, const std::string& old_path);
+  // Deletes the documents at and below `path`, whose name now holds something never indexed.
+  void DeleteReplaced(const std::string& path);
   // Indexes what exists below `root` (and `root` itself); with `reconcile`, also deletes the
   // documents at or below `root` that the walk did not meet.
   void Crawl(const std::string& root, const CrawlMode& mode, bool reconcile);

@@ -7,10 +7,14 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <thread>
+
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/fileindexd/test_system.hpp"
+#include "extract/extract_runner.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/queue_file.hpp"
 #include "fileindex/status_mgr.hpp"
@@ -133,6 +137,76 @@ TEST_F(WorkerTest, ReindexCrashAndFolderChangesSettleTheIndexWithTheDisk) {
   sys_.WriteFolders({System::Folder("/docs/b", false), System::Folder("/docs/a/sub", false)});
   EXPECT_EQ(Expect({"a/sub", "a/sub/new.txt", "b", "b/other.txt"}),
             Pass(Line(0x20000, "a/sub", true)));
+}
+
+// Whatever takes an indexed name without being indexable itself takes the name's document with
+// it: a link renamed over a file (the link's old name never had a document), a FIFO made where
+// a file was (its create is an upsert), a link where a file was whose change is an attribute one.
+TEST_F(WorkerTest, ANameTakenByWhatIsNotIndexedLosesItsDocument) {
+  for (const char* rel : {"a/boss_plan.txt", "a/fifo.txt", "a/attr.txt", "b/public.txt"}) {
+    Write(rel, rel);
+  }
+  EXPECT_EQ(Expect({"a", "a/boss_plan.txt", "a/fifo.txt", "a/attr.txt"}),
+            Pass(Line(0x10000, "a")));
+  ASSERT_EQ(0, symlink(V("b/public.txt").c_str(), V("a/.t").c_str()));
+  Move("a/.t", "a/boss_plan.txt");
+  ASSERT_EQ(0, unlink(V("a/fifo.txt").c_str()));
+  ASSERT_EQ(0, mkfifo(V("a/fifo.txt").c_str(), 0644));
+  ASSERT_EQ(0, unlink(V("a/attr.txt").c_str()));
+  ASSERT_EQ(0, symlink(V("b/public.txt").c_str(), V("a/attr.txt").c_str()));
+  EXPECT_EQ(Expect({"a"}), Pass(Line(0x100, "a/boss_plan.txt", false, "a/.t") +
+                                Line(0x40, "a/fifo.txt") + Line(0x4, "a/attr.txt")));
+  // A name that is a link again after being a folder loses the folder's documents too.
+  Write("a/d/inner.txt");
+  EXPECT_EQ(Expect({"a", "a/d", "a/d/inner.txt"}), Pass(Line(0x40, "a/d", true)));
+  ASSERT_EQ(0, system(("rm -r " + V("a/d")).c_str()));
+  ASSERT_EQ(0, symlink(V("b").c_str(), V("a/d").c_str()));
+  EXPECT_EQ(Expect({"a"}), Pass(Line(0x40, "a/d")));
+}
+
+// A file whose extraction takes long (the helper here answers for it only once the test says
+// so) holds one extraction thread; the rest of the crawl is extracted and sent meanwhile.
+TEST_F(WorkerTest, ASlowFileDoesNotHoldBackTheRestOfACrawl) {
+  sys_.WriteFolders({System::Folder("/docs/a", true)});
+  // Files of a folder are crawled before its sub-folders: the slow one comes first.
+  Write("a/slow.txt");
+  std::set<std::string> others;
+  for (int i = 0; i < 6; ++i) {
+    const std::string rel = "a/sub/f" + std::to_string(i) + ".txt";
+    Write(rel);
+    others.insert(V(rel));
+  }
+  const std::string release = sys_.root() + "/release";
+  const std::string helper = sys_.root() + "/slow-helper";
+  test::WriteFile(helper, "#!/bin/bash\n"
+                          "while IFS= read -r -d '' path; do\n"
+                          "  case \"$path\" in *slow*)\n"
+                          "    while [ ! -e " + release + " ]; do sleep 0.05; done ;;\n"
+                          "  esac\n"
+                          "  printf '{\"fields\":{}}\\n'\n"
+                          "done\n");
+  ASSERT_EQ(0, chmod(helper.c_str(), 0755));
+  setenv("FILEINDEX_EXTRACT_HELPER", helper.c_str(), 1);
+  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), Line(0x10000, "a")));
+
+  bool done = false;
+  std::thread pass([&] { done = worker_.RunPass(); });
+  const bool others_in = test::WaitFor(
+      [&] {
+        const std::set<std::string> docs = sys_.Documents("docs");
+        return std::includes(docs.begin(), docs.end(), others.begin(), others.end());
+      },
+      30000);
+  const bool slow_in = sys_.Documents("docs").count(V("a/slow.txt")) > 0;
+  test::WriteFile(release, "");
+  pass.join();
+  extract::CloseIdleExtractHelpers();
+  EXPECT_TRUE(others_in);
+  EXPECT_FALSE(slow_in);
+  EXPECT_TRUE(done);
+  EXPECT_EQ(Expect({"a", "a/slow.txt", "a/sub", "a/sub/f0.txt", "a/sub/f1.txt", "a/sub/f2.txt",
+                    "a/sub/f3.txt", "a/sub/f4.txt", "a/sub/f5.txt"}),
+            sys_.Documents("docs"));
 }
 
 // The engine replaced by a scripted one: every write succeeds except those `fail` picks, which
