@@ -8,6 +8,7 @@
 #include <climits>
 #include <cstring>
 #include <functional>
+#include <map>
 #include <utility>
 
 #include "common/comm.hpp"
@@ -141,8 +142,106 @@ class Indexer::Batch {
   ParsePool pool_;
 };
 
+// The upserts started ahead: their extraction pool and, by path, the operations waiting there.
+struct Indexer::Ahead {
+  // Upserts started ahead at once, per extraction thread: enough to keep every thread busy
+  // behind a slow file, few enough that their documents stay small in memory.
+  static constexpr size_t kPerThread = 4;
+
+  ParsePool pool;
+  std::map<std::string, std::shared_ptr<OP>> ops;
+};
+
 Indexer::Indexer(const std::string& share, const std::atomic<bool>* stop)
     : share_(share), stop_(stop) {}
+
+// Upserts still being extracted are dropped: their operations were not done, and the batch that
+// holds them is done again by the next pass.
+Indexer::~Indexer() = default;
+
+bool Indexer::UpsertAhead(const std::shared_ptr<OP>& op) {
+  if (op->op != fileindex::kOPUpsert) return false;
+  if (!folders_) BeginPass();
+  const auto node = op->node.lock();
+  if (!node) return false;
+  const std::string path = node->GetPath();
+  struct stat st;
+  if (lstat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) return false;
+  // Only contents are slow: a name and attributes are sent at once, the ordinary way.
+  if (!folders_->GetMostSuitableCfg(path) || !fileindex::CanFullPathBeIndexed(path) ||
+      !folders_->IsFullPathNeedMeta(path)) {
+    return false;
+  }
+  if (!ahead_) ahead_ = std::make_unique<Ahead>();
+  // One path is pending once: SettleAhead(op) sent the earlier one, as the same path conflicts.
+  if (ahead_->ops.count(path) != 0) return false;
+  ahead_->ops[path] = op;
+  ahead_->pool.Submit(path, true);
+  return true;
+}
+
+std::vector<std::shared_ptr<OP>> Indexer::SettleAhead(const OP* op) {
+  std::vector<std::shared_ptr<OP>> failed;
+  if (!ahead_) return failed;
+  std::vector<std::string> paths;
+  if (op != nullptr) {
+    if (const auto node = op->node.lock()) paths.push_back(node->GetPath());
+    if (op->op == fileindex::kOPRename) paths.push_back(op->path);
+  }
+  // Every pending path when there is no operation; else those at, above or below its paths
+  // (the root's path, "", is above everything).
+  const auto conflicts = [&](const std::string& pending) {
+    if (op == nullptr) return true;
+    for (const std::string& p : paths) {
+      if (pending == p || IsSubPath(pending, p) || IsSubPath(p, pending)) return true;
+    }
+    return false;
+  };
+  const auto blocked = [&] {
+    if (ahead_->ops.size() >= Ahead::kPerThread * ahead_->pool.threads()) return true;
+    for (const auto& [pending, unused] : ahead_->ops) {
+      if (conflicts(pending)) return true;
+    }
+    return false;
+  };
+  const std::string id = el::GetFileIndexID(share_);
+  const auto send = [&](ParsePool::Result result) {
+    auto it = ahead_->ops.find(result.path);
+    if (it == ahead_->ops.end()) return;
+    std::shared_ptr<OP> done = std::move(it->second);
+    ahead_->ops.erase(it);
+    if (!result.ok) {
+      // Gone or changed since: the ordinary way looks again and says what happened.
+      failed.push_back(std::move(done));
+      return;
+    }
+    Json::Value& doc = result.doc;
+    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchFileName] = doc[QUIX::CONTENT_EXTRACT::QUIXMDFSName];
+    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchAncestor] = doc[QUIX::CONTENT_EXTRACT::QUIXMDParent];
+    Json::Value data(Json::objectValue);
+    data["id"] = id;
+    data["doc_id"] = result.path;
+    data["data"] = std::move(doc);
+    try {
+      el::SendRequest(Command("document_upsert_by_id", std::move(data)));
+      ++documents_written_;
+    } catch (const Error& e) {
+      // The engine, the volume or the index failing is the pass's to handle; the rest is this
+      // file's, tried again the ordinary way.
+      if (e.code == kErrElastic || e.code == kErrSpaceNotEnough || e.code == kErrIndexDamaged) {
+        throw;
+      }
+      failed.push_back(std::move(done));
+    }
+  };
+  ParsePool::Result result;
+  for (;;) {
+    while (ahead_->pool.Next(&result, false)) send(std::move(result));
+    if (!blocked() || !ahead_->pool.Next(&result, true)) break;
+    send(std::move(result));
+  }
+  return failed;
+}
 
 void Indexer::BeginPass() { folders_ = std::make_unique<fileindex::FolderMgr>(); }
 

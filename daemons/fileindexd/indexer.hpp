@@ -39,6 +39,18 @@ class Indexer {
   // Sends the commands of one operation. Throws the Error of the failing command.
   void Apply(const fileindex::OP& op);
 
+  // Operations may be started ahead so that one slow file does not hold back the rest: the
+  // upsert of a file whose contents are extracted is taken by UpsertAhead (true) and its
+  // command is sent by a later SettleAhead, once its extraction ends. Before each operation the
+  // caller calls SettleAhead with it, which sends what has finished and waits for the upserts
+  // at, above or below a path of that operation, so no later command is overtaken by an
+  // earlier upsert; SettleAhead(nullptr) waits for all of them. SettleAhead returns the
+  // operations whose command failed on its own, to be applied again the ordinary way, and
+  // throws the engine's Error when it could not take one.
+  ~Indexer();
+  bool UpsertAhead(const std::shared_ptr<fileindex::OP>& op);
+  std::vector<std::shared_ptr<fileindex::OP>> SettleAhead(const fileindex::OP* op);
+
   // The document commands the indexer sent, for the status report.
   uint64_t documents_written() const { return documents_written_; }
   uint64_t documents_deleted() const { return documents_deleted_; }
@@ -59,6 +71,7 @@ class Indexer {
     Json::Value kinds;
   };
   class Batch;
+  struct Ahead;
 
   void Upsert(const std::string& path);
   void Attr(const std::string& path);
@@ -83,6 +96,7 @@ class Indexer {
   uint64_t documents_deleted_ = 0;
   std::unordered_set<size_t> long_paths_;
   std::string first_long_path_;
+  std::unique_ptr<Ahead> ahead_;  // created with the first upsert started ahead
 };
 
 }  // namespace fileindexd

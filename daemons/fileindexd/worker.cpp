@@ -179,29 +179,48 @@ bool Worker::RunPass() {
     documents_deleted_ += indexer.documents_deleted() - deleted_before;
   };
   size_t handed = 0;
+  // Applies one operation, retrying one that fails on its own and skipping it in the end.
+  const auto apply = [&](const std::shared_ptr<fileindex::OP>& op) {
+    int64_t delay = kOpRetryMicros;
+    for (int attempt = 1;; ++attempt) {
+      if (stop_.load()) throw PassAborted{false, ""};
+      try {
+        indexer.Apply(*op);
+        break;
+      } catch (const Error& e) {
+        if (IsPassFailure(e)) throw PassAborted{true, PassFailureText(share_, e)};
+        std::ostringstream what;
+        what << op;
+        if (attempt >= kOpAttempts) {
+          RecordError("skipped " + what.str() + ": " + e.what());
+          break;
+        }
+        Log(LOG_WARNING, "fileindexd: %s failed (attempt %d of %d): %s", what.str().c_str(),
+            attempt, kOpAttempts, e.what());
+        Backoff(delay);
+        delay *= 2;
+      }
+    }
+  };
+  // Sends the upserts started ahead that are done, and those `op` must not overtake.
+  const auto settle = [&](const fileindex::OP* op) {
+    std::vector<std::shared_ptr<fileindex::OP>> failed;
+    try {
+      failed = indexer.SettleAhead(op);
+    } catch (const Error& e) {
+      if (IsPassFailure(e)) throw PassAborted{true, PassFailureText(share_, e)};
+      throw;
+    }
+    for (const auto& again : failed) apply(again);
+  };
   try {
     handed = mgr.ProcessOP(
         [&](std::shared_ptr<fileindex::OP> op) {
-          int64_t delay = kOpRetryMicros;
-          for (int attempt = 1;; ++attempt) {
-            if (stop_.load()) throw PassAborted{false, ""};
-            try {
-              indexer.Apply(*op);
-              break;
-            } catch (const Error& e) {
-              if (IsPassFailure(e)) throw PassAborted{true, PassFailureText(share_, e)};
-              std::ostringstream what;
-              what << op;
-              if (attempt >= kOpAttempts) {
-                RecordError("skipped " + what.str() + ": " + e.what());
-                break;
-              }
-              Log(LOG_WARNING, "fileindexd: %s failed (attempt %d of %d): %s", what.str().c_str(),
-                  attempt, kOpAttempts, e.what());
-              Backoff(delay);
-              delay *= 2;
-            }
-          }
+          if (stop_.load()) throw PassAborted{false, ""};
+          settle(op.get());
+          // A file whose contents are extracted is started ahead, so that a slow one does not
+          // hold back the operations after it; it counts as done when handed over.
+          if (!indexer.UpsertAhead(op)) apply(op);
           // A crawl stopped half-way is not done: the batch is kept for the next start.
           if (stop_.load()) throw PassAborted{false, ""};
           std::lock_guard<std::mutex> lock(mu_);
@@ -209,6 +228,8 @@ bool Worker::RunPass() {
           if (ops_pending_ > 0) --ops_pending_;
         },
         true);
+    settle(nullptr);
+    if (stop_.load()) throw PassAborted{false, ""};
   } catch (const PassAborted& aborted) {
     account();
     if (aborted.retry) RecordError("batch kept for a later pass: " + aborted.why);

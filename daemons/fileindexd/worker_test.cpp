@@ -164,18 +164,11 @@ TEST_F(WorkerTest, ANameTakenByWhatIsNotIndexedLosesItsDocument) {
   EXPECT_EQ(Expect({"a"}), Pass(Line(0x40, "a/d")));
 }
 
-// A file whose extraction takes long (the helper here answers for it only once the test says
-// so) holds one extraction thread; the rest of the crawl is extracted and sent meanwhile.
-TEST_F(WorkerTest, ASlowFileDoesNotHoldBackTheRestOfACrawl) {
+// A file whose extraction takes long (the helper here answers for it only while a release file
+// exists) holds one extraction thread; the rest of a crawl, and the operations queued after it,
+// are extracted and sent meanwhile, but an operation on its path waits for it.
+TEST_F(WorkerTest, ASlowFileHoldsBackOnlyWhatConcernsIt) {
   sys_.WriteFolders({System::Folder("/docs/a", true)});
-  // Files of a folder are crawled before its sub-folders: the slow one comes first.
-  Write("a/slow.txt");
-  std::set<std::string> others;
-  for (int i = 0; i < 6; ++i) {
-    const std::string rel = "a/sub/f" + std::to_string(i) + ".txt";
-    Write(rel);
-    others.insert(V(rel));
-  }
   const std::string release = sys_.root() + "/release";
   const std::string helper = sys_.root() + "/slow-helper";
   test::WriteFile(helper, "#!/bin/bash\n"
@@ -187,25 +180,50 @@ TEST_F(WorkerTest, ASlowFileDoesNotHoldBackTheRestOfACrawl) {
                           "done\n");
   ASSERT_EQ(0, chmod(helper.c_str(), 0755));
   setenv("FILEINDEX_EXTRACT_HELPER", helper.c_str(), 1);
-  ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), Line(0x10000, "a")));
+  // Runs a pass on a thread; once `others` are in the index, records whether `held` are too,
+  // then lets the slow file go and waits for the pass.
+  const auto held_back = [&](const std::string& lines, const std::set<std::string>& others,
+                             const std::set<std::string>& held) {
+    EXPECT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), lines));
+    bool done = false;
+    std::thread pass([&] { done = worker_.RunPass(); });
+    const bool others_in = test::WaitFor(
+        [&] {
+          const std::set<std::string> docs = sys_.Documents("docs");
+          return std::includes(docs.begin(), docs.end(), others.begin(), others.end());
+        },
+        30000);
+    const std::set<std::string> docs = sys_.Documents("docs");
+    test::WriteFile(release, "");
+    pass.join();
+    EXPECT_TRUE(others_in);
+    EXPECT_TRUE(done);
+    EXPECT_EQ(0, unlink(release.c_str()));
+    return std::includes(docs.begin(), docs.end(), held.begin(), held.end());
+  };
 
-  bool done = false;
-  std::thread pass([&] { done = worker_.RunPass(); });
-  const bool others_in = test::WaitFor(
-      [&] {
-        const std::set<std::string> docs = sys_.Documents("docs");
-        return std::includes(docs.begin(), docs.end(), others.begin(), others.end());
-      },
-      30000);
-  const bool slow_in = sys_.Documents("docs").count(V("a/slow.txt")) > 0;
-  test::WriteFile(release, "");
-  pass.join();
+  // A crawl; files of a folder are crawled before its sub-folders, so the slow one comes first.
+  Write("a/d/slow.txt");
+  for (int i = 0; i < 6; ++i) Write("a/d/sub/f" + std::to_string(i) + ".txt");
+  EXPECT_FALSE(held_back(Line(0x10000, "a"), Expect({"a/d/sub/f0.txt", "a/d/sub/f5.txt"}),
+                         Expect({"a/d/slow.txt"})));
+  EXPECT_EQ(Expect({"a", "a/d", "a/d/slow.txt", "a/d/sub", "a/d/sub/f0.txt", "a/d/sub/f1.txt",
+                    "a/d/sub/f2.txt", "a/d/sub/f3.txt", "a/d/sub/f4.txt", "a/d/sub/f5.txt"}),
+            sys_.Documents("docs"));
+
+  // Queued operations: the slow file changed, then new files, then its folder renamed. The new
+  // files go in while the slow one is read; the rename waits for it, so the old names stay.
+  Write("a/d/slow.txt", "changed");
+  Write("a/g1.txt");
+  Write("a/g2.txt");
+  Move("a/d", "a/e");
+  EXPECT_TRUE(held_back(Line(0x2, "a/d/slow.txt") + Line(0x40, "a/g1.txt") +
+                            Line(0x40, "a/g2.txt") + Line(0x100, "a/e", true, "a/d"),
+                        Expect({"a/g1.txt", "a/g2.txt"}), Expect({"a/d", "a/d/slow.txt"})));
   extract::CloseIdleExtractHelpers();
-  EXPECT_TRUE(others_in);
-  EXPECT_FALSE(slow_in);
-  EXPECT_TRUE(done);
-  EXPECT_EQ(Expect({"a", "a/slow.txt", "a/sub", "a/sub/f0.txt", "a/sub/f1.txt", "a/sub/f2.txt",
-                    "a/sub/f3.txt", "a/sub/f4.txt", "a/sub/f5.txt"}),
+  EXPECT_EQ(Expect({"a", "a/e", "a/e/slow.txt", "a/e/sub", "a/e/sub/f0.txt", "a/e/sub/f1.txt",
+                    "a/e/sub/f2.txt", "a/e/sub/f3.txt", "a/e/sub/f4.txt", "a/e/sub/f5.txt",
+                    "a/g1.txt", "a/g2.txt"}),
             sys_.Documents("docs"));
 }
 
