@@ -53,7 +53,9 @@ class OpenedFile {
     }
     struct stat st;
     if (fstat(fd_.get(), &st) != 0) Fail(std::string("cannot stat: ") + std::strerror(errno));
-    if (!S_ISREG(st.st_mode)) Fail(std::string("not a regular file (") + KindName(st.st_mode) + ")");
+    if (!S_ISREG(st.st_mode)) {
+      Fail(std::string("not a regular file (") + KindName(st.st_mode) + ")");
+    }
     proc_path_ = "/proc/self/fd/" + std::to_string(fd_.get());
   }
 

@@ -22,8 +22,8 @@ class ParsePool {
  public:
   struct Result {
     std::string path;
-    bool ok = false;   // false: the file could not be described (it went away)
-    Json::Value doc;   // the document as ParseFile gives it
+    bool ok = false;  // false: the file could not be described (it went away)
+    Json::Value doc;  // the document as ParseFile gives it
     std::string error;
   };
 

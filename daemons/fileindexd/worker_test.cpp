@@ -146,8 +146,7 @@ TEST_F(WorkerTest, ANameTakenByWhatIsNotIndexedLosesItsDocument) {
   for (const char* rel : {"a/boss_plan.txt", "a/fifo.txt", "a/attr.txt", "b/public.txt"}) {
     Write(rel, rel);
   }
-  EXPECT_EQ(Expect({"a", "a/boss_plan.txt", "a/fifo.txt", "a/attr.txt"}),
-            Pass(Line(0x10000, "a")));
+  EXPECT_EQ(Expect({"a", "a/boss_plan.txt", "a/fifo.txt", "a/attr.txt"}), Pass(Line(0x10000, "a")));
   ASSERT_EQ(0, symlink(V("b/public.txt").c_str(), V("a/.t").c_str()));
   Move("a/.t", "a/boss_plan.txt");
   ASSERT_EQ(0, unlink(V("a/fifo.txt").c_str()));
@@ -164,20 +163,20 @@ TEST_F(WorkerTest, ANameTakenByWhatIsNotIndexedLosesItsDocument) {
   EXPECT_EQ(Expect({"a"}), Pass(Line(0x40, "a/d")));
 }
 
-// A file whose extraction takes long (the helper here answers for it only while a release file
-// exists) holds one extraction thread; the rest of a crawl, and the operations queued after it,
+// A file whose extraction takes long (the helper here answers for it only once a release file
+// exists, or after 30 s) holds one extraction thread; the rest of a crawl, and the operations queued after it,
 // are extracted and sent meanwhile, but an operation on its path waits for it.
 TEST_F(WorkerTest, ASlowFileHoldsBackOnlyWhatConcernsIt) {
   sys_.WriteFolders({System::Folder("/docs/a", true)});
   const std::string release = sys_.root() + "/release";
   const std::string helper = sys_.root() + "/slow-helper";
-  test::WriteFile(helper, "#!/bin/bash\n"
-                          "while IFS= read -r -d '' path; do\n"
-                          "  case \"$path\" in *slow*)\n"
-                          "    while [ ! -e " + release + " ]; do sleep 0.05; done ;;\n"
-                          "  esac\n"
-                          "  printf '{\"fields\":{}}\\n'\n"
-                          "done\n");
+  test::WriteFile(helper, "#!/bin/bash\nrelease=" + release + "\n" + R"(
+while IFS= read -r -d '' path; do
+  case "$path" in *slow*)
+    for i in $(seq 600); do [ -e "$release" ] && break; sleep 0.05; done ;;
+  esac
+  printf '{"fields":{}}\n'
+done)");
   ASSERT_EQ(0, chmod(helper.c_str(), 0755));
   setenv("FILEINDEX_EXTRACT_HELPER", helper.c_str(), 1);
   // Runs a pass on a thread; once `others` are in the index, records whether `held` are too,
