@@ -1,7 +1,8 @@
 // Fuzz entry point for the strict JSON reader: every input is read by it and by the general
-// library reader with the settings the system has always used. Aborts when they disagree on
-// whether the text is JSON, or on the value read (types included), or when the reader's compact
-// output of the value does not read back to the same value.
+// library reader with the settings the system has always used (its strings then turned back
+// into names). Aborts when they disagree on whether the text is JSON, or on the value read
+// (types included), or when the compact output of the value is not UTF-8 or does not read back
+// to the same value.
 #include <json/json.h>
 
 #include <cstdint>
@@ -10,6 +11,7 @@
 #include <string>
 
 #include "common/json_util.hpp"
+#include "common/name_codec.hpp"
 
 namespace {
 
@@ -27,6 +29,37 @@ bool LibraryParse(const char* begin, const char* end, Json::Value* out) {
   }
 }
 
+// Strings and member names as the system's reader hands them out.
+Json::Value Decoded(const Json::Value& v) {
+  if (v.isString()) {
+    const std::string s = orvane::DecodeName(v.asString());
+    return Json::Value(s.data(), s.data() + s.size());
+  }
+  if (v.isArray()) {
+    Json::Value out(Json::arrayValue);
+    for (const Json::Value& e : v) out.append(Decoded(e));
+    return out;
+  }
+  if (v.isObject()) {
+    Json::Value out(Json::objectValue);
+    for (auto it = v.begin(); it != v.end(); ++it) {
+      const std::string key = orvane::DecodeName(it.name());
+      *out.demand(key.data(), key.data() + key.size()) = Decoded(*it);
+    }
+    return out;
+  }
+  return v;
+}
+
+bool IsUtf8(const std::string& text) {
+  for (const char* p = text.data(); p != text.data() + text.size();) {
+    const size_t n = orvane::Utf8SequenceLength(p, text.data() + text.size());
+    if (n == 0) return false;
+    p += n;
+  }
+  return true;
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
@@ -36,7 +69,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   orvane::JsonValue got;
   if (got.fromString(begin, begin + size) != expected_ok) std::abort();
   if (!expected_ok) return 0;
+  expected = Decoded(expected);
   const std::string text = orvane::JsonToString(got);
+  if (!IsUtf8(text)) std::abort();
   if (!(got == expected) || text != orvane::JsonToString(expected)) std::abort();
   orvane::JsonValue back;
   if (!back.fromString(text) || !(back == got)) {

@@ -12,6 +12,7 @@
 #include <memory>
 
 #include "common/fd.hpp"
+#include "common/name_codec.hpp"
 #include "common/root.hpp"
 
 namespace orvane {
@@ -118,7 +119,8 @@ class FastReader {
     return -1;
   }
 
-  // Bytes other than the quote and the backslash pass unchanged, as with the general reader.
+  // Bytes other than the quote and the backslash pass unchanged, as with the general reader;
+  // names written as code points are turned back into their bytes.
   bool ReadString(std::string* s) {
     ++p_;
     s->clear();
@@ -127,7 +129,10 @@ class FastReader {
       while (p_ != end_ && *p_ != '"' && *p_ != '\\') ++p_;
       s->append(run, p_);
       if (p_ == end_) return false;
-      if (*p_++ == '"') return true;
+      if (*p_++ == '"') {
+        DecodeNameInPlace(s);
+        return true;
+      }
       if (p_ == end_) return false;
       const char c = *p_++;
       switch (c) {
@@ -226,11 +231,23 @@ class FastReader {
 void AppendQuoted(const char* begin, const char* end, std::string* out) {
   static const char kHex[] = "0123456789abcdef";
   out->push_back('"');
-  // Runs of bytes that need no escape are copied at once; text goes out as UTF-8 unchanged.
+  // Runs of bytes that need no escape are copied at once; well-formed UTF-8 goes out unchanged
+  // and any other byte as its own code point, so the text is always UTF-8.
   const char* run = begin;
   for (const char* p = begin; p != end; ++p) {
     const unsigned char c = static_cast<unsigned char>(*p);
-    if (c >= 0x20 && c != '"' && c != '\\') continue;
+    if (c >= 0x20 && c < 0x80 && c != '"' && c != '\\') continue;
+    if (c >= 0x80) {
+      const size_t n = PlainSequenceLength(p, end);
+      if (n != 0) {
+        p += n - 1;
+        continue;
+      }
+      out->append(run, p);
+      run = p + 1;
+      AppendByteCodePoint(c, out);
+      continue;
+    }
     out->append(run, p);
     run = p + 1;
     switch (c) {
@@ -251,10 +268,103 @@ void AppendQuoted(const char* begin, const char* end, std::string* out) {
   out->push_back('"');
 }
 
-std::string StyledText(const Json::Value& value) {
-  Json::StreamWriterBuilder builder;
-  builder["emitUTF8"] = true;
-  return Json::writeString(builder, value) + "\n";
+// True when some string or member name below `v` is not text as it stands.
+bool NeedsEncoding(const Json::Value& v) {
+  const char* begin = nullptr;
+  const char* end = nullptr;
+  switch (v.type()) {
+    case Json::stringValue:
+      return v.getString(&begin, &end) && NameNeedsEncoding(std::string_view(begin, end - begin));
+    case Json::arrayValue:
+      for (const Json::Value& e : v) {
+        if (NeedsEncoding(e)) return true;
+      }
+      return false;
+    case Json::objectValue:
+      for (auto it = v.begin(); it != v.end(); ++it) {
+        begin = it.memberName(&end);
+        if (NameNeedsEncoding(std::string_view(begin, end - begin)) || NeedsEncoding(*it)) {
+          return true;
+        }
+      }
+      return false;
+    default:
+      return false;
+  }
+}
+
+// A copy of `v` with every string and member name in its written form, for the library's
+// writer, which would otherwise copy the bytes as they are.
+Json::Value EncodedCopy(const Json::Value& v) {
+  const char* begin = nullptr;
+  const char* end = nullptr;
+  switch (v.type()) {
+    case Json::stringValue: {
+      if (!v.getString(&begin, &end)) return v;
+      const std::string text = EncodeName(std::string_view(begin, end - begin));
+      return Json::Value(text.data(), text.data() + text.size());
+    }
+    case Json::arrayValue: {
+      Json::Value out(Json::arrayValue);
+      for (const Json::Value& e : v) out.append(EncodedCopy(e));
+      return out;
+    }
+    case Json::objectValue: {
+      Json::Value out(Json::objectValue);
+      for (auto it = v.begin(); it != v.end(); ++it) {
+        begin = it.memberName(&end);
+        const std::string key = EncodeName(std::string_view(begin, end - begin));
+        *out.demand(key.data(), key.data() + key.size()) = EncodedCopy(*it);
+      }
+      return out;
+    }
+    default:
+      return v;
+  }
+}
+
+// The general reader keeps strings as bytes; names written as code points become bytes again.
+void DecodeStrings(Json::Value* v) {
+  const char* begin = nullptr;
+  const char* end = nullptr;
+  const auto has_lead = [](const char* b, const char* e) {
+    return std::memchr(b, '\xF4', static_cast<size_t>(e - b)) != nullptr;
+  };
+  switch (v->type()) {
+    case Json::stringValue:
+      if (v->getString(&begin, &end) && has_lead(begin, end)) {
+        std::string s(begin, end);
+        DecodeNameInPlace(&s);
+        *v = Json::Value(s.data(), s.data() + s.size());
+      }
+      break;
+    case Json::arrayValue:
+      for (Json::Value& e : *v) DecodeStrings(&e);
+      break;
+    case Json::objectValue: {
+      bool keys = false;
+      for (auto it = v->begin(); it != v->end() && !keys; ++it) {
+        begin = it.memberName(&end);
+        keys = has_lead(begin, end);
+      }
+      if (!keys) {
+        for (Json::Value& e : *v) DecodeStrings(&e);
+        break;
+      }
+      Json::Value out(Json::objectValue);
+      for (auto it = v->begin(); it != v->end(); ++it) {
+        begin = it.memberName(&end);
+        const std::string key = DecodeName(std::string_view(begin, end - begin));
+        Json::Value& member = *out.demand(key.data(), key.data() + key.size());
+        member = *it;
+        DecodeStrings(&member);
+      }
+      v->swap(out);
+      break;
+    }
+    default:
+      break;
+  }
 }
 
 bool WriteAll(int fd, const std::string& text) {
@@ -332,6 +442,13 @@ std::string JsonToString(const Json::Value& value) {
   return out;
 }
 
+std::string JsonToStyledString(const Json::Value& value, const std::string& indentation) {
+  Json::StreamWriterBuilder builder;
+  builder["emitUTF8"] = true;
+  builder["indentation"] = indentation;
+  return Json::writeString(builder, NeedsEncoding(value) ? EncodedCopy(value) : value);
+}
+
 bool JsonValue::fromString(const std::string& text) {
   return fromString(text.data(), text.data() + text.size());
 }
@@ -346,6 +463,7 @@ bool JsonValue::fromString(const char* begin, const char* end) {
     } catch (const std::exception&) {
       // Nesting past the reader's stack limit is thrown rather than reported.
     }
+    if (ok) DecodeStrings(&parsed);
   }
   if (!ok) {
     Json::Value::operator=(Json::Value());
@@ -376,7 +494,7 @@ bool JsonValue::toFile(const std::string& path) const {
   std::string tmp = path + ".XXXXXX";
   UniqueFd fd(mkostemp(tmp.data(), O_CLOEXEC));
   if (!fd.valid()) return false;
-  const bool ok = WriteAll(fd.get(), StyledText(*this)) && fchmod(fd.get(), 0644) == 0 &&
+  const bool ok = WriteAll(fd.get(), JsonToStyledString(*this, "\t") + "\n") && fchmod(fd.get(), 0644) == 0 &&
                   fsync(fd.get()) == 0 && fd.Close() && rename(tmp.c_str(), path.c_str()) == 0;
   if (!ok) {
     const int failure = errno;

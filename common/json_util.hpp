@@ -13,11 +13,18 @@
 
 namespace orvane {
 
+// Every text written here is UTF-8 and every text read gives back the bytes it was written
+// from: strings hold names as the disk has them, and a name that is not UTF-8 is written in
+// the form common/name_codec.hpp describes. Use these helpers for every JSON text, never the
+// library's own readers and writers.
+
 // The compact one-line text of a value (on the wire, in stored documents and in failure texts),
-// byte for byte what the library's compact writer produces. UTF-8 passes as is.
+// byte for byte what the library's compact writer produces for UTF-8 strings.
 std::string JsonToString(const Json::Value& value);
 // The same text, appended to `*out`.
 void AppendJson(const Json::Value& value, std::string* out);
+// The indented text of a value (files, output for scripts), without a final newline.
+std::string JsonToStyledString(const Json::Value& value, const std::string& indentation);
 
 // A Json::Value with the three conveniences. It adds no data, so it converts both ways freely.
 class JsonValue : public Json::Value {
