@@ -51,15 +51,6 @@ Json::Value Decoded(const Json::Value& v) {
   return v;
 }
 
-bool IsUtf8(const std::string& text) {
-  for (const char* p = text.data(); p != text.data() + text.size();) {
-    const size_t n = orvane::Utf8SequenceLength(p, text.data() + text.size());
-    if (n == 0) return false;
-    p += n;
-  }
-  return true;
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
@@ -71,7 +62,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (!expected_ok) return 0;
   expected = Decoded(expected);
   const std::string text = orvane::JsonToString(got);
-  if (!IsUtf8(text)) std::abort();
+  if (!orvane::IsValidUtf8(text)) std::abort();
   if (!(got == expected) || text != orvane::JsonToString(expected)) std::abort();
   orvane::JsonValue back;
   if (!back.fromString(text) || !(back == got)) {

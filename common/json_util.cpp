@@ -449,6 +449,18 @@ std::string JsonToStyledString(const Json::Value& value, const std::string& inde
   return Json::writeString(builder, NeedsEncoding(value) ? EncodedCopy(value) : value);
 }
 
+bool JsonParseChecked(const std::string& text, Json::Value* out, std::string* errors) {
+  Json::CharReaderBuilder builder;
+  builder["collectComments"] = false;
+  builder["rejectDupKeys"] = true;
+  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  Json::Value parsed;
+  if (!reader->parse(text.data(), text.data() + text.size(), &parsed, errors)) return false;
+  DecodeStrings(&parsed);
+  out->swap(parsed);
+  return true;
+}
+
 bool JsonValue::fromString(const std::string& text) {
   return fromString(text.data(), text.data() + text.size());
 }

@@ -25,6 +25,9 @@ std::string JsonToString(const Json::Value& value);
 void AppendJson(const Json::Value& value, std::string* out);
 // The indented text of a value (files, output for scripts), without a final newline.
 std::string JsonToStyledString(const Json::Value& value, const std::string& indentation);
+// Parses a file people write: comments allowed, a repeated member name refused, and on
+// failure false with the reader's description of where and why in `*errors`.
+bool JsonParseChecked(const std::string& text, Json::Value* out, std::string* errors);
 
 // A Json::Value with the three conveniences. It adds no data, so it converts both ways freely.
 class JsonValue : public Json::Value {

@@ -24,6 +24,16 @@ const char kReplacement[] = "\xEF\xBF\xBD";  // U+FFFD
 
 }  // namespace
 
+bool IsValidUtf8(std::string_view text) {
+  const char* const end = text.data() + text.size();
+  for (const char* p = FirstHighByte(text.data(), end); p != end;) {
+    const size_t n = Utf8SequenceLength(p, end);
+    if (n == 0) return false;
+    p += n;
+  }
+  return true;
+}
+
 void AppendEncodedName(const char* begin, const char* end, std::string* out) {
   const char* run = begin;
   for (const char* p = FirstHighByte(begin, end); p != end;) {

@@ -51,6 +51,9 @@ inline size_t PlainSequenceLength(const char* p, const char* end) {
   return n;
 }
 
+// True when `text` is well-formed UTF-8 throughout.
+bool IsValidUtf8(std::string_view text);
+
 // Appends U+10FF00 + `byte` (`byte` >= 0x80) in UTF-8.
 inline void AppendByteCodePoint(unsigned char byte, std::string* out) {
   const char seq[4] = {'\xF4', '\x8F', byte < 0xC0 ? '\xBE' : '\xBF',

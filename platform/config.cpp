@@ -12,6 +12,7 @@
 #include <sstream>
 
 #include "common/error.hpp"
+#include "common/json_util.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
 #include "platform/platform_error.hpp"
@@ -165,13 +166,9 @@ std::string PlatformConfigPath() { return RootedPath("/etc/orvane/platform.json"
 
 std::shared_ptr<const PlatformConfig> ParsePlatformConfig(const std::string& text,
                                                           const std::string& file) {
-  Json::CharReaderBuilder builder;
-  builder["collectComments"] = false;
-  builder["rejectDupKeys"] = true;
-  std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
   Json::Value root;
   std::string errs;
-  if (!reader->parse(text.data(), text.data() + text.size(), &root, &errs)) {
+  if (!JsonParseChecked(text, &root, &errs)) {
     Fail(file, "malformed JSON: " + errs.substr(0, errs.find_last_not_of("\n") + 1));
   }
   if (!root.isObject()) Fail(file, "the top level is not a JSON object");

@@ -10,6 +10,7 @@
 
 #include "common/fd.hpp"
 #include "common/json_util.hpp"
+#include "common/name_codec.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
@@ -82,11 +83,13 @@ Where WhereOf(const Schema& schema, const DocQuery& q) {
       }
       if (id_field) {
         w.sql = "path = ?";
+        w.args.push_back(q.value);
       } else {
+        // Values inside the stored JSON are in their written form.
         w.sql = "json_extract(body, ?) = ?";
         w.args.push_back(FieldPath(q.field));
+        w.args.push_back(EncodeName(q.value));
       }
-      w.args.push_back(q.value);
       break;
     case DocQuery::Kind::kPrefix: {
       const std::optional<std::string> upper = PrefixUpperBound(q.value);
@@ -100,10 +103,12 @@ Where WhereOf(const Schema& schema, const DocQuery& q) {
           w.args.push_back(*upper);
         }
       } else {
+        // substr counts characters of the written form, not bytes.
+        const std::string text = EncodeName(q.value);
         w.sql = "substr(json_extract(body, ?), 1, ?) = ?";
         w.args.push_back(FieldPath(q.field));
-        w.args.push_back(std::to_string(q.value.size()));
-        w.args.push_back(q.value);
+        w.args.push_back(std::to_string(DisplayLength(text)));
+        w.args.push_back(text);
       }
       break;
     }
@@ -328,14 +333,15 @@ void IndexStore::WriteRow(int64_t rowid, const DerivedDoc& d, const std::string&
   st.Run();
   if (insert && rowid == 0) rowid = writer_.LastInsertRowid();
   // Full-text rows are only rewritten when their text changed: re-pathing a directory's
-  // descendants leaves names and words alone and stays cheap.
+  // descendants leaves names and words alone and stays cheap. The tokenizers read UTF-8, so
+  // the texts go in in their written form: a name's valid parts are found as any other.
   if (old == nullptr || old->all_text != d.all_text) {
     if (old != nullptr && !old->all_text.empty()) {
       Cached("DELETE FROM fts_all WHERE rowid = ?").Bind(1, rowid).Run();
     }
     if (!d.all_text.empty()) {
-      Cached("INSERT INTO fts_all(rowid, text) VALUES(?, ?)").Bind(1, rowid).Bind(2, d.all_text)
-          .Run();
+      Cached("INSERT INTO fts_all(rowid, text) VALUES(?, ?)").Bind(1, rowid)
+          .Bind(2, EncodeName(d.all_text)).Run();
     }
   }
   if (old == nullptr || old->name_text != d.name_text) {
@@ -344,7 +350,7 @@ void IndexStore::WriteRow(int64_t rowid, const DerivedDoc& d, const std::string&
     }
     if (!d.name_text.empty()) {
       Cached("INSERT INTO fts_name(rowid, name) VALUES(?, ?)").Bind(1, rowid)
-          .Bind(2, d.name_text).Run();
+          .Bind(2, EncodeName(d.name_text)).Run();
     }
   }
 }
@@ -546,9 +552,10 @@ Json::Value HitOf(Stmt& st, bool has_keywords) {
 }  // namespace
 
 SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard) {
-  const std::string match = MatchExpression(p.keywords);
+  // The full-text tables hold written forms; the other columns hold the names' bytes.
+  const std::string match = MatchExpression(EncodeName(p.keywords));
   const bool has_keywords = !match.empty();
-  const std::string name = AsciiLower(p.name);
+  const std::string name = EncodeName(AsciiLower(p.name));
   std::vector<Arg> args;
   auto text = [&](const std::string& v) { args.push_back({true, v, 0}); };
   auto number = [&](int64_t v) { args.push_back({false, std::string(), v}); };
@@ -569,7 +576,7 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, Q
     sql += " JOIN fts_name ON fts_name.rowid = d.rowid";
     // The trigram index answers substrings of three characters or more as a phrase of
     // trigrams, from positions alone; shorter ones scan the names.
-    if (name.size() >= 3) {
+    if (DisplayLength(name) >= 3) {
       std::string phrase = "\"";
       for (char c : name) {
         if (c == '"') phrase += '"';
@@ -694,7 +701,7 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, Q
          ++i) {
       snip.Reset();
       snip.Bind(1, match).Bind(2, rowids[i]);
-      page.hits[i]["snippet"] = snip.Step() ? snip.Text(0) : std::string();
+      page.hits[i]["snippet"] = snip.Step() ? DecodeName(snip.Text(0)) : std::string();
     }
   }
   GiveBackReader(std::move(db));
@@ -704,7 +711,7 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, Q
 std::vector<std::string> IndexStore::Suggest(const std::string& prefix, size_t limit,
                                              const VisibleFn& visible, QueryGuard* guard) {
   std::vector<std::string> out;
-  const std::string low = AsciiLower(prefix);
+  const std::string low = EncodeName(AsciiLower(prefix));
   const std::optional<std::string> upper = PrefixUpperBound(low);
   if (!upper) return out;
   std::unique_ptr<Db> db = TakeReader();
@@ -730,7 +737,7 @@ std::vector<std::string> IndexStore::Suggest(const std::string& prefix, size_t l
         docs.Bind(1, "\"" + term + "\"");
         while (!shown && docs.Step()) shown = visible(docs.Text(0));
       }
-      if (shown) out.push_back(term);
+      if (shown) out.push_back(DecodeName(term));
     }
   }
   GiveBackReader(std::move(db));

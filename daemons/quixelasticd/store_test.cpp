@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include "common/json_util.hpp"
+#include "common/name_codec.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
 #include "daemons/quixelasticd/test_client.hpp"
 #include "test/test_util.hpp"
@@ -148,6 +149,68 @@ TEST_F(StoreTest, SuggestsTermsMostUsedFirst) {
   EXPECT_TRUE(store_->Suggest("2", 10, nullptr).empty());
   EXPECT_THAT(store_->Suggest("Be", 10, nullptr), ElementsAre("beach", "bear"));
   EXPECT_THAT(store_->Suggest("be", 1, nullptr), ElementsAre("beach"));
+}
+
+// Names on disk may be any bytes. The full-text tables and the stored documents hold valid
+// UTF-8, so the tokenizers see every valid part of a name; what comes back is the real bytes.
+TEST_F(StoreTest, NamesThatAreNotUtf8AreFoundByTheirValidParts) {
+  const std::string latin1 = "/v/s/caf\xE9 menu.txt";
+  const std::string lone = "/v/s/\xFF\xFEreport.pdf";
+  const std::string inner = "/v/s/dir\xFF/inner.txt";
+  const std::string cjk = "/v/s/\xE6\x97\xA5\xE6\x9C\xAC.txt";
+  for (const std::string& p : {latin1, lone, inner, cjk}) Put(FileDoc(p));
+  for (const char* sql : {"SELECT name FROM fts_name", "SELECT text FROM fts_all",
+                          "SELECT body FROM docs"}) {
+    Stmt st(store_->writer(), sql);
+    while (st.Step()) EXPECT_TRUE(IsValidUtf8(st.Text(0))) << sql << ": " << st.Text(0);
+  }
+
+  SearchParams p;
+  p.name = "menu";
+  EXPECT_THAT(Names(p), ElementsAre("caf\xE9 menu.txt"));
+  p.name = "REPORT";
+  EXPECT_THAT(Names(p), ElementsAre("\xFF\xFEreport.pdf"));
+  // A name typed with the same bytes finds it too, long or short.
+  p.name = "f\xE9 m";
+  EXPECT_THAT(Names(p), ElementsAre("caf\xE9 menu.txt"));
+  p.name = "\xFF";
+  EXPECT_THAT(Names(p), ElementsAre("\xFF\xFEreport.pdf"));
+  // Two characters are too few for the trigram index whatever their length in bytes.
+  p.name = "\xE6\x97\xA5\xE6\x9C\xAC";
+  EXPECT_THAT(Names(p), ElementsAre("\xE6\x97\xA5\xE6\x9C\xAC.txt"));
+  p = SearchParams();
+  p.folder = "/v/s/dir\xFF";
+  EXPECT_THAT(Names(p), ElementsAre("inner.txt"));
+  p = SearchParams();
+  p.keywords = "menu";
+  const SearchPage page = store_->Search(p, nullptr);
+  ASSERT_EQ(page.hits.size(), 1u);
+  EXPECT_EQ(page.hits[0]["path"], latin1);
+  EXPECT_THAT(page.hits[0]["snippet"].asString(), ::testing::HasSubstr("caf\xE9 <b>menu</b>"));
+  for (const std::string& term : store_->Suggest("caf", 10, nullptr)) {
+    EXPECT_EQ(term.rfind("caf", 0), 0u) << term;
+    EXPECT_FALSE(NameNeedsEncoding(term) && IsValidUtf8(term)) << "not decoded: " << term;
+  }
+
+  // Queries on the identifier and on other fields, and a rename away from such a name.
+  using K = DocQuery::Kind;
+  EXPECT_THAT(Paths({K::kPrefix, "QUIXMDPath", "/v/s/dir\xFF/"}), ElementsAre(inner));
+  EXPECT_THAT(Paths({K::kTerm, "QUIXMDParent", "/v/s/dir\xFF"}), ElementsAre(inner));
+  EXPECT_THAT(Paths({K::kPrefix, "QUIXMDFSName", "caf\xE9"}), ElementsAre(latin1));
+  EXPECT_THAT(Paths({K::kPrefix, "QUIXMDFSName", "\xE6\x97\xA5"}), ElementsAre(cjk));
+  WriteTxn txn(*store_);
+  Json::Value fields;
+  fields["QUIXMDPath"] = "/v/s/cafe menu.txt";
+  fields["QUIXMDFSName"] = fields["QUIXMDSearchFileName"] = "cafe menu.txt";
+  store_->SetFields(latin1, fields);
+  EXPECT_TRUE(store_->Delete(lone));
+  txn.Commit();
+  p = SearchParams();
+  p.name = "menu";
+  EXPECT_THAT(Names(p), ElementsAre("cafe menu.txt"));
+  EXPECT_THAT(Paths(DocQuery()), ElementsAre("/v/s/cafe menu.txt", inner, cjk));
+  p.name = "report";
+  EXPECT_TRUE(Names(p).empty());
 }
 
 TEST_F(StoreTest, AFullDiskFailsTheWriteAndKeepsWhatWasThere) {
