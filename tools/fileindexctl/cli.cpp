@@ -5,6 +5,8 @@
 #include <cstdlib>
 #include <ctime>
 
+#include "common/name_codec.hpp"
+
 namespace orvane {
 namespace ctl {
 
@@ -71,16 +73,17 @@ void Args::Check(const std::set<std::string>& known, size_t max_positional) cons
 }
 
 void Table::Print(std::ostream& out) const {
+  // Columns line up by characters as shown, an undecodable byte counting as one.
   std::vector<size_t> widths;
   for (const auto& row : rows_) {
     widths.resize(std::max(widths.size(), row.size()));
-    for (size_t c = 0; c < row.size(); ++c) widths[c] = std::max(widths[c], row[c].size());
+    for (size_t c = 0; c < row.size(); ++c) widths[c] = std::max(widths[c], DisplayLength(row[c]));
   }
   for (const auto& row : rows_) {
     std::string line;
     for (size_t c = 0; c < row.size(); ++c) {
       line += row[c];
-      if (c + 1 < row.size()) line += std::string(widths[c] - row[c].size() + 2, ' ');
+      if (c + 1 < row.size()) line += std::string(widths[c] - DisplayLength(row[c]) + 2, ' ');
     }
     out << line << '\n';
   }

@@ -10,10 +10,12 @@
 #include <cstring>
 #include <fstream>
 #include <iostream>
+#include <sstream>
 
 #include "common/env.hpp"
 #include "common/error.hpp"
 #include "common/json_util.hpp"
+#include "common/name_codec.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "fileindex/elastic_control.hpp"
@@ -28,12 +30,12 @@ namespace ctl {
 
 void Output::Emit(const Json::Value& value, const std::function<void(std::ostream&)>& human) {
   if (json_) {
-    Json::StreamWriterBuilder builder;
-    builder["emitUTF8"] = true;
-    builder["indentation"] = "  ";
-    out_ << Json::writeString(builder, value) << '\n';
+    out_ << JsonToStyledString(value, "  ") << '\n';
   } else {
-    human(out_);
+    // Names are bytes; a terminal gets valid text, with U+FFFD for what is not UTF-8.
+    std::ostringstream text;
+    human(text);
+    out_ << DisplayName(text.str());
   }
 }
 

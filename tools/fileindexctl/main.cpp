@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "common/error.hpp"
+#include "common/name_codec.hpp"
 #include "tools/fileindexctl/cli.hpp"
 #include "tools/fileindexctl/commands.hpp"
 
@@ -109,16 +110,18 @@ int main(int argc, char** argv) {
     command->run(parsed, out);
     return 0;
   } catch (const orvane::ctl::UsageError& e) {
-    std::cerr << "fileindexctl: " << e.what() << '\n';
+    // Messages may quote names, which are bytes; the terminal gets U+FFFD for what is not text.
+    std::cerr << "fileindexctl: " << orvane::DisplayName(e.what()) << '\n';
     PrintUsage(std::cerr, *command);
     return 2;
   } catch (const orvane::Error& e) {
     const orvane::ctl::ErrorAdvice advice = orvane::ctl::AdviceFor(e.code);
     std::cerr << "fileindexctl: " << advice.meaning << " (error " << e.code
-              << "): " << orvane::ctl::ReasonOf(e.message) << "; " << advice.hint << '\n';
+              << "): " << orvane::DisplayName(orvane::ctl::ReasonOf(e.message)) << "; "
+              << advice.hint << '\n';
     return 1;
   } catch (const std::exception& e) {
-    std::cerr << "fileindexctl: " << e.what() << '\n';
+    std::cerr << "fileindexctl: " << orvane::DisplayName(e.what()) << '\n';
     return 1;
   }
 }
