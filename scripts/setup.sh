@@ -10,7 +10,7 @@ packages=(
   libmagic-dev libpoppler-cpp-dev libtag1-dev libexiv2-dev libarchive-dev
   libxml2-dev libuchardet-dev libmediainfo-dev
   e2fsprogs mount util-linux acl passwd
-  python3-minimal
+  python3
 )
 
 missing=()
