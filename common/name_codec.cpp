@@ -74,7 +74,7 @@ bool NameNeedsEncoding(std::string_view raw) {
   return false;
 }
 
-bool DecodeNameInPlace(std::string* text) {
+bool DecodeByteCodePoints(std::string* text) {
   char* const begin = text->data();
   char* const end = begin + text->size();
   // F4 only ever leads a sequence, so a text without it has nothing to decode.

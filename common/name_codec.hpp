@@ -7,6 +7,7 @@
 #define ORVANE_COMMON_NAME_CODEC_HPP_
 
 #include <cstddef>
+#include <cstring>
 #include <string>
 #include <string_view>
 
@@ -70,8 +71,12 @@ bool NameNeedsEncoding(std::string_view raw);
 // The name a text stands for: each U+10FF80..U+10FFFF back to its byte. Anything else passes
 // unchanged, bytes that are not UTF-8 included (texts written before names were encoded).
 std::string DecodeName(std::string_view text);
-// The same, in place; false (and nothing touched) when the text holds no such code point.
-bool DecodeNameInPlace(std::string* text);
+// The same, in place; false when the text holds no such code point. Every string the JSON
+// reader reads comes here, so the common case, no F4 lead byte at all, costs one memchr.
+bool DecodeByteCodePoints(std::string* text);
+inline bool DecodeNameInPlace(std::string* text) {
+  return std::memchr(text->data(), '\xF4', text->size()) != nullptr && DecodeByteCodePoints(text);
+}
 
 // The name for people: each byte that is not part of a well-formed sequence becomes U+FFFD.
 // Not reversible; never for anything but display.
