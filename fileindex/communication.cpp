@@ -155,19 +155,6 @@ void SendCommandToDaemon(const std::string& cmd, const Json::Value& data) {
   std::vector<unsigned char> reply(length);
   BufferRead(fd_socket, length, reply.data());
   errno = saved_errno;  // failed connect attempts that came to nothing leave no trace
-  // The daemon answers only once the command took effect, and a refusal means it did not: that
-  // must reach the caller. Any other answer only keeps the exchange in step.
-  size_t text_len = reply.size();
-  while (text_len > 0 && reply[text_len - 1] == '\0') --text_len;
-  JsonValue parsed;
-  if (parsed.fromString(std::string(reply.begin(), reply.begin() + static_cast<long>(text_len))) &&
-      parsed.isObject() && parsed["success"].isBool() && !parsed["success"].asBool()) {
-    const Json::Value& error = parsed["error"];
-    const std::string msg = error.isObject() ? error["msg"].asString() : JsonToString(parsed);
-    const int code = error.isObject() ? error["code"].asInt() : 0;
-    throw Error(kErrSystem, "fileindexd refused \"" + cmd + "\": " + msg + " (code " +
-                                std::to_string(code) + ")");
-  }
 }
 
 }  // namespace fileindex

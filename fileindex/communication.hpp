@@ -1,6 +1,5 @@
 // The command channel to the indexing daemon: one length-framed JSON command per connection over
-// its Unix-domain socket. The daemon replies once the command took effect; a refusal is thrown,
-// any other reply only keeps the exchange in step. Each call uses its own
+// its Unix-domain socket, whose reply only keeps the exchange in step. Each call uses its own
 // socket; nothing is shared except the process-wide SIGPIPE setting (ignored from the first
 // call on) and the test seam below.
 #ifndef ORVANE_FILEINDEX_COMMUNICATION_HPP_
@@ -21,9 +20,7 @@ constexpr unsigned int kMaxDaemonReplyBytes = 16u << 20;
 // How long the daemon may take to answer (and to send each further part of its answer).
 constexpr int kDaemonReplyTimeoutSec = 30;
 
-// Sends {"type": cmd, "data": data} and reads the reply. Throws Error 502 on failure, and when
-// the daemon refused the command ({"success": false, "error": {"code", "msg"}}: "fileindexd
-// refused "cmd": msg (code N)").
+// Sends {"type": cmd, "data": data} and reads the reply. Throws Error 502 on failure.
 void SendCommandToDaemon(const std::string& cmd, const Json::Value& data);
 
 // Writes exactly `size` bytes in chunks of at most 1024, retrying up to 10 interrupted calls.

@@ -211,15 +211,19 @@ TEST_F(CtlTest, PauseSaysWhetherTheIndexingDaemonTookIt) {
   Result r = Run({"pause"});
   EXPECT_EQ(r.status, 0) << r.err;
   EXPECT_THAT(r.out, HasSubstr("(fileindexd is not running: it applies when fileindexd starts)"));
-  // Running (its pid file names a live process) and refusing: a failure, and the reason.
+  // Running (its pid file names a live process): what it holds afterwards decides.
   dir_.Write("var/run/fileindexd.pid", std::to_string(getpid()) + "\n");
-  test::FakeDaemon indexer(
-      dir_.Path("var/run/fileindexd.sock"),
-      test::FakeDaemon::Replies({R"({"success":false,"error":{"code":105,"msg":"too many"}})"}));
+  const std::string refusal = R"({"success":false,"error":{"code":105,"msg":"too many"}})";
+  test::FakeDaemon indexer(dir_.Path("var/run/fileindexd.sock"),
+                           test::FakeDaemon::Replies({refusal, R"({"data":{"resume_time":0}})",
+                                                      "{}", R"({"data":{"resume_time":-1}})"}));
   r = Run({"resume"});
   EXPECT_EQ(r.status, 1);
-  EXPECT_THAT(r.err, HasSubstr("recorded, but the running fileindexd did not take it: fileindexd "
-                               "refused \"resume\": too many (code 105)"));
+  EXPECT_THAT(r.err, HasSubstr("recorded, but the running fileindexd did not take it: it holds "
+                               "resume time 0 instead of -1"));
+  r = Run({"resume"});
+  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("indexing resumed"));
 }
 
 TEST(CliTest, ValuesPeopleType) {

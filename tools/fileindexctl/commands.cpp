@@ -409,20 +409,42 @@ void SuggestCmd(const Args& args, Output& out) {
 
 Json::Value DaemonState(const std::string& name);
 
+// The indexing daemon's answer to "status"; false with the reason when it cannot be asked.
+bool AskIndexerStatus(Json::Value& reply, std::string& error) {
+  Json::Value cmd(Json::objectValue);
+  cmd["type"] = "status";
+  cmd["data"] = Json::Value();
+  return Exchange(RootedPath(kIndexerSocket), JsonToString(cmd) + std::string(1, '\0'), reply,
+                  error);
+}
+
 // Runs a pause or resume, which records the choice in the status file and then tells the
-// indexing daemon. A daemon that is not running reads the file when it starts, so the choice
-// holds; one that is running and did not take it is a failure, though the file has it.
+// indexing daemon. The command channel ignores what the daemon answers, so the daemon is asked
+// afterwards which pause it holds. One that is not running reads the file when it starts, so the
+// choice holds; one that is running and holds another pause is a failure, though the file has it.
 void TellIndexer(const std::function<void()>& change, const std::string& done, Output& out) {
+  std::string refused;
   try {
     change();
   } catch (const Error& e) {
     if (e.code != kErrSystem) throw;
-    if (DaemonState("fileindexd")["running"].asBool()) {
-      throw Error(kErrSystem, "recorded, but the running fileindexd did not take it: " +
-                                  ReasonOf(e.message) + "; it applies at fileindexd's next start");
-    }
+    refused = ReasonOf(e.message);
+  }
+  if (!DaemonState("fileindexd")["running"].asBool()) {
     out.Done(done + " (fileindexd is not running: it applies when fileindexd starts)");
     return;
+  }
+  if (refused.empty()) {
+    Json::Value reply;
+    const long long wanted = StatusMgr().GetPauseInfo();
+    if (AskIndexerStatus(reply, refused) && reply["data"]["resume_time"].asInt64() != wanted) {
+      refused = "it holds resume time " + std::to_string(reply["data"]["resume_time"].asInt64()) +
+                " instead of " + std::to_string(wanted);
+    }
+  }
+  if (!refused.empty()) {
+    throw Error(kErrSystem, "recorded, but the running fileindexd did not take it: " + refused +
+                                "; it applies at fileindexd's next start");
   }
   out.Done(done);
 }
@@ -488,13 +510,7 @@ Json::Value CollectStatus() {
   // The indexing daemon's own counters, when it is up.
   Json::Value reply;
   std::string error;
-  Json::Value cmd(Json::objectValue);
-  cmd["type"] = "status";
-  cmd["data"] = Json::Value();
-  if (Exchange(RootedPath(kIndexerSocket), JsonToString(cmd) + std::string(1, '\0'), reply,
-               error)) {
-    status["indexer"] = reply;
-  }
+  if (AskIndexerStatus(reply, error)) status["indexer"] = reply;
   status["indexes"] = EngineIndexes();
   return status;
 }
