@@ -29,6 +29,12 @@ Event::Event(const std::string& event_raw) {
   GetJsonValue<Json::Value>(this->data, data, "data", false);
 }
 
+bool IsReconcile(const Json::Value& data) {
+  if (!data.isObject()) return false;
+  const Json::Value* flag = data.find(kReconcileKey, kReconcileKey + strlen(kReconcileKey));
+  return flag != nullptr && flag->isBool() && flag->asBool();
+}
+
 OP::OP(std::shared_ptr<OPNode> node, FileIndexOP op, const std::string& path,
        const Json::Value& data)
     : node(node), op(op), path(path), data(data) {}
@@ -54,6 +60,7 @@ std::ostream& operator<<(std::ostream& out, std::shared_ptr<OP> op) {
   if (op->op == kOPRename) out << op->path << " -> ";
   if (auto node = op->node.lock()) out << node->GetPath();
   if (op->op == kOPUpdateDirectory) out << ", data=" << JsonToString(op->data);
+  if (op->op == kOPReindex && IsReconcile(op->data)) out << ", reconcile";
   return out;
 }
 
@@ -305,7 +312,11 @@ void OPTree::InsertEvent(std::shared_ptr<Event> event) {
     op->path = event->path_old;
     HandleRename(node, op);
   }
-  if (bits & kEventReindex) HandleReindex(node, op);
+  if (bits & kEventReindex) {
+    // Only a line that is nothing but a re-index may ask for the cheap form of it.
+    if (bits == kEventReindex && IsReconcile(event->data)) op->data = event->data;
+    HandleReindex(node, op);
+  }
   if (bits & kEventFolderSettings) {
     op->data = event->data;
     HandleUpdateDirectory(node, op);
@@ -344,13 +355,26 @@ void OPTree::HandleUpdateDirectory(std::shared_ptr<OPNode> node, std::shared_ptr
 }
 
 void OPTree::HandleReindex(std::shared_ptr<OPNode> node, std::shared_ptr<OP> op) {
+  const bool reconcile = IsReconcile(op->data);
+  if (!reconcile) {
+    // A full re-index absorbs a reconciliation pending on the same folder: what is kept must
+    // read everything again.
+    for (const auto& pending : node->ops) {
+      if (pending->op == kOPReindex) pending->data = Json::Value();
+    }
+  }
   Coalesce(*node, *op, kOPReindex, kReindexRules);
-  // The re-index covers everything below, whether or not it was itself kept.
+  // A full re-index covers everything below, whether or not it was itself kept. A
+  // reconciliation only covers the reconciliations below: the work queued there may be a full
+  // re-index or a change its comparison of sizes and times would not see.
   TraverseNodeDescendant(
       node,
-      [](std::shared_ptr<OPNode> descendant) {
+      [reconcile](std::shared_ptr<OPNode> descendant) {
         for (const auto& pending : descendant->ops) {
-          if (pending->op != kOPRename) pending->op = kOPNone;
+          if (pending->op == kOPRename) continue;
+          if (!reconcile || (pending->op == kOPReindex && IsReconcile(pending->data))) {
+            pending->op = kOPNone;
+          }
         }
       },
       true);

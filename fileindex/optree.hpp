@@ -28,6 +28,12 @@ constexpr uint32_t kEventCrash = 0x200;
 constexpr uint32_t kEventReindex = 0x10000;
 constexpr uint32_t kEventFolderSettings = 0x20000;
 
+// The data member of a re-index line that asks only for the differences between the disk and
+// the index to be applied: unchanged files are neither read nor written again.
+constexpr char kReconcileKey[] = "reconcile";
+// Whether a re-index line's (or operation's) data asks only for those differences.
+bool IsReconcile(const Json::Value& data);
+
 // Lines longer than this are not parsed: no real event comes near it (paths are bounded by
 // PATH_MAX), and it keeps one corrupt line from costing unbounded memory.
 constexpr size_t kMaxEventLineLength = 128 * 1024;
@@ -59,7 +65,8 @@ enum FileIndexOP : int32_t {
 class OPNode;
 
 // A pending index operation on a node. `path` is the former path of a rename; `data` the folder
-// settings of a folder-settings update.
+// settings of a folder-settings update, or {"reconcile": true} on a re-index that only settles
+// the differences.
 class OP {
  public:
   OP(std::shared_ptr<OPNode> node, FileIndexOP op, const std::string& path,

@@ -73,7 +73,7 @@ bool QueueMgr::IsFullPathProcessing(const std::string& full_path) {
 bool QueueMgr::IsFullPathHasReindex(const std::string& full_path) {
   const std::string path = full_path + "/";
   auto reindexes = [&path](const Event& e) {
-    return e.event == kEventReindex && StringStartWith(path, e.path + "/");
+    return e.event == kEventReindex && !IsReconcile(e.data) && StringStartWith(path, e.path + "/");
   };
   return FindQueue(queue_path_, reindexes) || FindQueue(queue_path_tmp_, reindexes);
 }
