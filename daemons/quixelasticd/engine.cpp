@@ -79,7 +79,7 @@ std::string DocumentIndexOf(const Json::Value& sub) {
     key = "db_name";
   } else if (name == "document_upsert_by_id" || name == "document_set_by_id" ||
              name == "document_del_by_id" || name == "document_del_by_query" ||
-             name == "document_get_by_query") {
+             name == "document_get_by_query" || name == "document_list") {
     key = "id";
   } else {
     return std::string();
@@ -632,7 +632,8 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
                              const Caller& caller, Session& session) {
   const bool batched = command == "update_term_suggestion" || command == "document_upsert_by_id" ||
                        command == "document_set_by_id" || command == "document_del_by_id" ||
-                       command == "document_del_by_query" || command == "document_get_by_query";
+                       command == "document_del_by_query" || command == "document_get_by_query" ||
+                       command == "document_list";
   // Every other command works outside the batch's transaction: it needs the index locks the
   // batch may hold, or (searches) it reads committed data, which then includes the batch's.
   if (!batched && command != "commit") session.FinishQuietly();
@@ -682,6 +683,23 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
     result["deleted"] = store.Delete(RequireString(data, "doc_id")) ? 1 : 0;
   } else if (command == "document_del_by_query") {
     result["deleted"] = static_cast<Json::Int64>(store.DeleteByQuery(DocQuery::Parse(data["query"])));
+  } else if (command == "document_list") {
+    const std::string dir = RequirePath(data, "path");
+    const Json::Value& after = data["after"];
+    if (!after.isNull() && !after.isString()) {
+      throw EngineError(kCodeInvalidParam, "\"after\" must be a string");
+    }
+    std::vector<std::string> extra;
+    if (!data["load_field"].isNull() && !data["load_field"].isArray()) {
+      throw EngineError(kCodeInvalidParam, "\"load_field\" must be an array");
+    }
+    for (const Json::Value& f : data["load_field"]) {
+      if (!f.isString()) throw EngineError(kCodeInvalidParam, "\"load_field\" holds a non-string");
+      extra.push_back(f.asString());
+    }
+    const int64_t size = std::min(OptionalInt(data, "size", options_.default_page_size),
+                                  options_.max_page_size);
+    result = store.List(dir, after.isString() ? after.asString() : std::string(), extra, size);
   } else {
     const Json::Value& query = data["query"];
     const DocQuery q = DocQuery::Parse(query);

@@ -72,6 +72,7 @@ class Stmt {
   void Reset();
 
   bool IsNull(int col) const { return sqlite3_column_type(stmt_, col) == SQLITE_NULL; }
+  bool IsInt(int col) const { return sqlite3_column_type(stmt_, col) == SQLITE_INTEGER; }
   int64_t Int(int col) const { return sqlite3_column_int64(stmt_, col); }
   double Double(int col) const { return sqlite3_column_double(stmt_, col); }
   std::string Text(int col) const;

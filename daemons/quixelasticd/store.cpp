@@ -456,6 +456,50 @@ Json::Value IndexStore::GetByQuery(const DocQuery& q, const std::vector<std::str
   return hits;
 }
 
+Json::Value IndexStore::List(const std::string& dir, const std::string& after,
+                             const std::vector<std::string>& extra, int64_t size) {
+  // One range scan of the identifier index: from the folder itself (or just after the last
+  // identifier of the previous page) up to the first identifier past its subtree; names that
+  // only begin like the folder ("dir.txt" sorts between "dir" and "dir/") are filtered out.
+  const std::string under = dir + "/";
+  const std::optional<std::string> upper = PrefixUpperBound(under);
+  const bool resume = !after.empty() && after >= dir;
+  std::string sql = "SELECT path, size, mtime, is_dir";
+  for (size_t i = 0; i < extra.size(); ++i) {
+    sql += ", json_extract(body, ?" + std::to_string(6 + i) + ")";
+  }
+  sql += std::string(" FROM docs WHERE path ") + (resume ? ">" : ">=") + " ?1";
+  if (upper) sql += " AND path < ?2";
+  sql += " AND (path = ?3 OR path >= ?4) ORDER BY path LIMIT ?5";
+  Stmt st(writer_, sql);
+  st.Bind(1, resume ? after : dir);
+  if (upper) st.Bind(2, *upper);
+  st.Bind(3, dir);
+  st.Bind(4, under);
+  st.Bind(5, size);
+  for (size_t i = 0; i < extra.size(); ++i) st.Bind(static_cast<int>(6 + i), FieldPath(extra[i]));
+  Json::Value hits(Json::arrayValue);
+  while (st.Step()) {
+    Json::Value hit(Json::arrayValue);
+    hit.append(st.Text(0));
+    hit.append(st.IsNull(1) ? Json::Value() : Json::Value(Json::Int64(st.Int(1))));
+    hit.append(st.IsNull(2) ? Json::Value() : Json::Value(Json::Int64(st.Int(2))));
+    hit.append(!st.IsNull(3) && st.Int(3) != 0);
+    for (size_t i = 0; i < extra.size(); ++i) {
+      const int col = static_cast<int>(4 + i);
+      if (st.IsNull(col)) {
+        hit.append(Json::Value());
+      } else if (st.IsInt(col)) {
+        hit.append(Json::Int64(st.Int(col)));
+      } else {
+        hit.append(st.Text(col));
+      }
+    }
+    hits.append(std::move(hit));
+  }
+  return hits;
+}
+
 bool IndexStore::UpdateTermSuggestion(const std::string& doc_id) {
   Stmt& find = Cached("SELECT 1 FROM docs WHERE path = ?");
   find.Bind(1, doc_id);

@@ -103,6 +103,12 @@ class IndexStore {
   // Hits in identifier order, each the loaded stored fields.
   Json::Value GetByQuery(const DocQuery& q, const std::vector<std::string>& load, int64_t from,
                          int64_t size);
+  // The documents whose identifier is `dir` or lies below `dir` + "/", after `after` (all
+  // when empty), in identifier order, at most `size`: each [identifier, size, modification
+  // time, is a directory, then the stored fields `extra` in order], null where a document has
+  // no value. Reads only the derived columns unless `extra` asks for more.
+  Json::Value List(const std::string& dir, const std::string& after,
+                   const std::vector<std::string>& extra, int64_t size);
   // (Re)computes the suggestion terms of one document; false when it does not exist.
   bool UpdateTermSuggestion(const std::string& doc_id);
   int64_t DocCount();

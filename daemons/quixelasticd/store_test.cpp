@@ -113,6 +113,35 @@ TEST_F(StoreTest, PrefixQueriesStopAtTheFolderBoundary) {
   EXPECT_TRUE(store_->Suggest("x", 10, nullptr).empty());
 }
 
+TEST_F(StoreTest, ListingPagesThroughOneFolderInIdentifierOrder) {
+  for (const char* p : {"/v/s/a", "/v/s/a.txt", "/v/s/a/x.txt", "/v/s/a/y", "/v/s/a/y/z.txt",
+                        "/v/s/a0", "/v/s/ab"}) {
+    Json::Value doc = FileDoc(p, 7, 1000);
+    if (std::string(p) == "/v/s/a/y") {
+      doc["QUIXMDIsDir"] = true;
+      doc["QUIXMDAttributeChangeDate"] = 2000;
+    }
+    Put(doc);
+  }
+  std::vector<std::string> paths;
+  std::string after;
+  for (int page = 0; page < 4; ++page) {
+    const Json::Value hits = store_->List("/v/s/a", after, {"QUIXMDAttributeChangeDate"}, 2);
+    for (const Json::Value& hit : hits) {
+      paths.push_back(hit[0].asString());
+      if (hit[0] == "/v/s/a/y") {
+        EXPECT_EQ(JsonToString(hit), R"(["/v/s/a/y",7,1000,true,2000])");
+      } else {
+        EXPECT_TRUE(hit[3] == false && hit[4].isNull()) << hit;
+      }
+    }
+    if (hits.size() < 2) break;
+    after = paths.back();
+  }
+  // Names that only begin like the folder are not below it, wherever they sort.
+  EXPECT_THAT(paths, ElementsAre("/v/s/a", "/v/s/a/x.txt", "/v/s/a/y", "/v/s/a/y/z.txt"));
+}
+
 TEST_F(StoreTest, SetFieldsRekeysAndReplacesTheDocumentAtTheNewPath) {
   Json::Value old_doc = FileDoc("/v/s/old.txt", 10);
   old_doc["QUIXMDSecret"] = "not stored";
