@@ -79,12 +79,38 @@ class Indexer::Batch {
     }
     Add(std::move(result), false);
   }
+  // Only the file-system fields: the contents kept in the document stay as they are.
+  void SetAttributes(const std::string& path) {
+    Json::Value config(Json::objectValue);
+    config["need_meta"] = false;
+    Json::Value doc;
+    try {
+      QUIX::CONTENT_EXTRACT::ParseFile(path, config, doc);
+    } catch (const std::exception& e) {
+      Log(LOG_WARNING, "fileindexd: %s not refreshed: %s", path.c_str(), e.what());
+      return;
+    }
+    bytes_ += 512;
+    Json::Value data(Json::objectValue);
+    data["id"] = id_;
+    data["doc_id"] = path;
+    data["data"] = std::move(doc);
+    Add(Command("document_set_by_id", std::move(data)));
+    ++owner_->documents_written_;
+  }
   void Delete(const std::string& path) {
     Json::Value data(Json::objectValue);
     data["id"] = id_;
     data["doc_id"] = path;
     Add(Command("document_del_by_id", std::move(data)));
     ++owner_->documents_deleted_;
+  }
+  // Every document below `dir`, in one command.
+  void DeleteBelow(const std::string& dir) {
+    Json::Value data(Json::objectValue);
+    data["id"] = id_;
+    data["query"]["qsl"]["prefix"][QUIX::CONTENT_EXTRACT::QUIXMDPath] = dir + "/";
+    Add(Command("document_del_by_query", std::move(data)));
   }
   // Sends everything, waiting for the extractions still running; what is ready is sent before
   // each wait, so the files done are searchable while a slow one is still being read.
@@ -150,6 +176,31 @@ struct Indexer::Ahead {
 
   ParsePool pool;
   std::map<std::string, std::shared_ptr<OP>> ops;
+};
+
+// Turns the differences a reconciliation finds into the commands of a batch.
+class Indexer::ReconcileBatch : public ReconcileSink {
+ public:
+  ReconcileBatch(Indexer* owner, Batch* batch) : owner_(owner), batch_(batch) {}
+
+  void Add(const std::string& path, bool is_dir) override {
+    batch_->Upsert(path, !is_dir && owner_->folders_->IsFullPathNeedMeta(path));
+  }
+  void Refresh(const std::string& path, bool is_dir, bool contents) override {
+    if (contents || is_dir) {
+      Add(path, is_dir);
+    } else {
+      batch_->SetAttributes(path);
+    }
+  }
+  void Remove(const std::string& path, bool subtree) override {
+    batch_->Delete(path);
+    if (subtree) batch_->DeleteBelow(path);
+  }
+
+ private:
+  Indexer* owner_;
+  Batch* batch_;
 };
 
 Indexer::Indexer(const std::string& share, const std::atomic<bool>* stop)
@@ -275,7 +326,11 @@ void Indexer::Apply(const OP& op) {
       Rename(path, op.path);
       break;
     case fileindex::kOPReindex:
-      Crawl(path, CrawlMode(), true);
+      if (fileindex::IsReconcile(op.data)) {
+        Reconcile(path);
+      } else {
+        Crawl(path, CrawlMode(), true);
+      }
       break;
     case fileindex::kOPCrash:
       // Whatever the lost events said, the indexed folders themselves are the truth.
@@ -435,6 +490,28 @@ void Indexer::Crawl(const std::string& root, const CrawlMode& mode, bool reconci
     for (const auto& path : stale) batch.Delete(path);
   }
   batch.Flush();
+}
+
+void Indexer::Reconcile(const std::string& root) {
+  if (observer_) observer_(root, ReconcileCounts(), false);
+  Batch batch(this);
+  ReconcileBatch sink(this, &batch);
+  EngineEntries index(share_, root);
+  std::function<void(const ReconcileCounts&)> progress;
+  if (observer_) progress = [&](const ReconcileCounts& counts) { observer_(root, counts, false); };
+  Reconciler reconciler(*folders_, stop_, progress);
+  // A stopped reconciliation sends nothing more: its operation stays queued and runs again.
+  if (!reconciler.Run(root, index, sink)) return;
+  batch.Flush();
+  const ReconcileCounts& counts = reconciler.counts();
+  Log(LOG_INFO,
+      "fileindexd: reconciled %s: %llu entries compared, %llu added, %llu removed, %llu "
+      "refreshed",
+      root.c_str(), static_cast<unsigned long long>(counts.compared),
+      static_cast<unsigned long long>(counts.added),
+      static_cast<unsigned long long>(counts.removed),
+      static_cast<unsigned long long>(counts.refreshed));
+  if (observer_) observer_(root, counts, true);
 }
 
 void Indexer::CrawlDir(const std::string& dir, dev_t dev, const CrawlMode& mode, Batch& batch,

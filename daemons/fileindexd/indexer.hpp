@@ -9,12 +9,14 @@
 
 #include <atomic>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <string>
 #include <unordered_set>
 #include <vector>
 
 #include "fileindex/folder_mgr.hpp"
+#include "daemons/fileindexd/reconciler.hpp"
 #include "fileindex/optree.hpp"
 
 namespace orvane {
@@ -51,6 +53,12 @@ class Indexer {
   bool UpsertAhead(const std::shared_ptr<fileindex::OP>& op);
   std::vector<std::shared_ptr<fileindex::OP>> SettleAhead(const fileindex::OP* op);
 
+  // Called when a reconciliation of `folder` starts (zero counts), as it goes and, with
+  // `finished`, once its differences are sent; a stopped or failed one never finishes.
+  using ReconcileObserver = std::function<void(const std::string& folder,
+                                               const ReconcileCounts& counts, bool finished)>;
+  void SetReconcileObserver(ReconcileObserver observer) { observer_ = std::move(observer); }
+
   // The document commands the indexer sent, for the status report.
   uint64_t documents_written() const { return documents_written_; }
   uint64_t documents_deleted() const { return documents_deleted_; }
@@ -72,6 +80,7 @@ class Indexer {
   };
   class Batch;
   struct Ahead;
+  class ReconcileBatch;
 
   void Upsert(const std::string& path);
   void Attr(const std::string& path);
@@ -81,6 +90,8 @@ class Indexer {
   // Indexes what exists below `root` (and `root` itself); with `reconcile`, also deletes the
   // documents at or below `root` that the walk did not meet.
   void Crawl(const std::string& root, const CrawlMode& mode, bool reconcile);
+  // Sends only the differences between the disk and the documents at or below `root`.
+  void Reconcile(const std::string& root);
   void CrawlDir(const std::string& dir, dev_t dev, const CrawlMode& mode, Batch& batch,
                 std::unordered_set<std::string>* stale);
   // Whether some configured folder lies strictly below `dir`.
@@ -92,6 +103,7 @@ class Indexer {
   std::string share_;
   const std::atomic<bool>* stop_;
   std::unique_ptr<fileindex::FolderMgr> folders_;
+  ReconcileObserver observer_;
   uint64_t documents_written_ = 0;
   uint64_t documents_deleted_ = 0;
   std::unordered_set<size_t> long_paths_;

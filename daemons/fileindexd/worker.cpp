@@ -106,6 +106,7 @@ Json::Value Worker::Report() const {
   r["share"] = share_;
   r["queue_length"] = Json::UInt64(CountLines(queue_path_) + CountLines(queue_path_ + ".tmp"));
   std::lock_guard<std::mutex> lock(mu_);
+  r["state"] = reconciling_ ? "reconciling" : (ops_pending_ > 0 ? "indexing" : "idle");
   r["ops_pending"] = Json::UInt64(ops_pending_);
   r["ops_done"] = Json::UInt64(ops_done_);
   r["documents_written"] = Json::UInt64(documents_written_);
@@ -116,7 +117,49 @@ Json::Value Worker::Report() const {
   r["paused"] = gate_.paused ? gate_.paused() : false;
   r["out_of_space"] = out_of_space_;
   r["long_paths"] = Json::UInt64(long_paths_.size());
+  r["passes"] = Json::UInt64(passes_);
+  r["reconciling"] = reconciling_ ? ToJson(current_, false) : Json::Value();
+  const auto last = reconciled_.find(last_reconciled_);
+  r["last_reconcile"] = last != reconciled_.end() ? ToJson(last->second, true) : Json::Value();
+  r["reconciliations"] = Json::Value(Json::arrayValue);
+  for (const auto& entry : reconciled_) r["reconciliations"].append(ToJson(entry.second, true));
   return r;
+}
+
+Json::Value Worker::ToJson(const Reconciliation& rec, bool done) {
+  Json::Value r(Json::objectValue);
+  r["folder"] = rec.folder;
+  r["started"] = Json::Int64(rec.started);
+  r["compared"] = Json::UInt64(rec.counts.compared);
+  if (!done) return r;
+  r["finished"] = Json::Int64(rec.finished);
+  r["duration_ms"] = Json::Int64(rec.duration_ms);
+  r["added"] = Json::UInt64(rec.counts.added);
+  r["removed"] = Json::UInt64(rec.counts.removed);
+  r["refreshed"] = Json::UInt64(rec.counts.refreshed);
+  r["pass"] = Json::UInt64(rec.pass);
+  return r;
+}
+
+void Worker::OnReconcile(uint64_t pass, const std::string& folder, const ReconcileCounts& counts,
+                         bool finished) {
+  Env* env = Env::Current();
+  std::lock_guard<std::mutex> lock(mu_);
+  if (!reconciling_ || current_.folder != folder) {
+    current_ = Reconciliation();
+    current_.folder = folder;
+    current_.pass = pass;
+    current_.started = env->Now();
+    current_.started_us = env->NowMicros();
+    reconciling_ = true;
+  }
+  current_.counts = counts;
+  if (!finished) return;
+  current_.finished = env->Now();
+  current_.duration_ms = (env->NowMicros() - current_.started_us) / 1000;
+  reconciled_[folder] = current_;
+  last_reconciled_ = folder;
+  reconciling_ = false;
 }
 
 void Worker::Run() {
@@ -165,16 +208,23 @@ bool Worker::RunPass() {
   fileindex::QueueMgr mgr(queue_path_);
   mgr.PrepareTmpQueue();
   if (!IsFileExist(queue_path_ + ".tmp")) return true;
+  uint64_t pass = 0;
   {
     const auto tree = mgr.GetOPTreeTmp();
     std::lock_guard<std::mutex> lock(mu_);
     ops_pending_ = tree->crashed ? 1 : tree->ops.size();
+    pass = ++passes_;
   }
+  indexer.SetReconcileObserver(
+      [this, pass](const std::string& folder, const ReconcileCounts& counts, bool finished) {
+        OnReconcile(pass, folder, counts, finished);
+      });
   const uint64_t written_before = indexer.documents_written();
   const uint64_t deleted_before = indexer.documents_deleted();
   auto account = [&] {
     TakeLongPaths(indexer);
     std::lock_guard<std::mutex> lock(mu_);
+    reconciling_ = false;
     documents_written_ += indexer.documents_written() - written_before;
     documents_deleted_ += indexer.documents_deleted() - deleted_before;
   };
@@ -221,9 +271,13 @@ bool Worker::RunPass() {
           // A file whose contents are extracted is started ahead, so that a slow one does not
           // hold back the operations after it; it counts as done when handed over.
           if (!indexer.UpsertAhead(op)) apply(op);
+          std::unique_lock<std::mutex> lock(mu_);
+          // One that failed or stopped half-way is not running any more.
+          reconciling_ = false;
+          lock.unlock();
           // A crawl stopped half-way is not done: the batch is kept for the next start.
           if (stop_.load()) throw PassAborted{false, ""};
-          std::lock_guard<std::mutex> lock(mu_);
+          lock.lock();
           ++ops_done_;
           if (ops_pending_ > 0) --ops_pending_;
         },

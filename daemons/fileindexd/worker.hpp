@@ -12,12 +12,14 @@
 #include <cstdint>
 #include <ctime>
 #include <functional>
+#include <map>
 #include <mutex>
 #include <string>
 #include <thread>
 #include <unordered_set>
 
 #include "common/fd.hpp"
+#include "daemons/fileindexd/reconciler.hpp"
 
 namespace orvane {
 namespace fileindexd {
@@ -56,10 +58,13 @@ class Worker {
   void RequestStop();
   // Makes the worker look at its queue (and the pause) now.
   void Wake();
-  // {"share", "queue_length", "ops_pending", "ops_done", "documents_written",
-  //  "documents_deleted", "last_pass", "errors", "last_error", "paused", "out_of_space",
-  //  "long_paths"}; "long_paths" counts the paths of PATH_MAX bytes and more met since the start,
-  //  which cannot be indexed.
+  // {"share", "state" ("idle", "indexing", "reconciling"), "queue_length", "ops_pending",
+  //  "ops_done", "documents_written", "documents_deleted", "last_pass", "passes", "errors",
+  //  "last_error", "paused", "out_of_space", "long_paths", "reconciling" (the one running, or
+  //  null), "last_reconcile" (or null), "reconciliations" (the last of each folder)};
+  //  "long_paths" counts the paths of PATH_MAX bytes and more met since the start, which cannot
+  //  be indexed. A reconciliation is {"folder", "started", "compared", and once done
+  //  "finished", "duration_ms", "added", "removed", "refreshed", "pass"}.
   Json::Value Report() const;
   const std::string& share() const { return share_; }
 
@@ -76,6 +81,21 @@ class Worker {
   void RecordError(const std::string& text);
   // Adds the over-long paths a pass met to the worker's count; logs the first new one.
   void TakeLongPaths(const Indexer& indexer);
+
+  // The indexer's reconciliation observer for the pass numbered `pass`.
+  void OnReconcile(uint64_t pass, const std::string& folder, const ReconcileCounts& counts,
+                   bool finished);
+
+  struct Reconciliation {
+    std::string folder;
+    uint64_t pass = 0;
+    time_t started = 0;
+    time_t finished = 0;
+    int64_t started_us = 0;
+    int64_t duration_ms = 0;
+    ReconcileCounts counts;
+  };
+  static Json::Value ToJson(const Reconciliation& r, bool done);
 
   const std::string share_;
   const std::string queue_path_;
@@ -95,8 +115,13 @@ class Worker {
   uint64_t errors_ = 0;
   std::string last_error_;
   time_t last_pass_ = 0;
+  uint64_t passes_ = 0;  // passes that took a batch
   bool out_of_space_ = false;
   std::unordered_set<size_t> long_paths_;
+  bool reconciling_ = false;
+  Reconciliation current_;                              // while reconciling_
+  std::map<std::string, Reconciliation> reconciled_;  // the last of each folder
+  std::string last_reconciled_;
 };
 
 }  // namespace fileindexd
