@@ -52,7 +52,7 @@ void EngineEntries::Fetch() {
   Json::Value& data = req["data"];
   data["id"] = id_;
   data["path"] = dir_;
-  if (!page_.empty()) data["after"] = page_.back().path;
+  if (!after_.empty()) data["after"] = after_;
   data["size"] = kListPageSize;
   data["load_field"].append(ce::QUIXMDAttributeChangeDate);
   Json::Value res;
@@ -77,6 +77,7 @@ void EngineEntries::Fetch() {
     e.ctime = IntOr(hit[4], -1);
     page_.push_back(std::move(e));
   }
+  if (!page_.empty()) after_ = page_.back().path;
 }
 
 Reconciler::Reconciler(const fileindex::FolderMgr& folders, const std::atomic<bool>* stop,

@@ -46,6 +46,7 @@ class EngineEntries : public IndexedEntries {
 
   std::string id_;
   std::string dir_;
+  std::string after_;  // the last path listed so far
   std::vector<IndexedEntry> page_;
   size_t next_ = 0;
   bool last_page_ = false;

@@ -226,6 +226,49 @@ done)");
             sys_.Documents("docs"));
 }
 
+TEST_F(WorkerTest, AReconciliationWritesOnlyWhatChangedAndReportsIt) {
+  for (const char* rel : {"a/same.txt", "a/grows.txt", "a/old.txt", "a/sub/x.txt", "a/gone/1.txt",
+                          "a/gone/2/3.txt", "b/other.txt"}) {
+    Write(rel);
+  }
+  const std::string reconcile =
+      R"({"event": 65536, "is_dir": true, "path": ")" + V("a") + R"(", "data": {"reconcile": true}})" "\n";
+  Pass(Line(0x10000, "a"));
+  // The index keeps whole seconds: the changes below must fall in a later one to be seen.
+  const time_t indexed = time(nullptr);
+  while (time(nullptr) == indexed) usleep(20000);
+
+  ASSERT_EQ(0, unlink(V("a/old.txt").c_str()));
+  ASSERT_EQ(0, system(("rm -r " + V("a/gone")).c_str()));
+  Write("a/grows.txt", "longer");
+  Write("a/sub/new.txt");
+  ASSERT_EQ(0, chmod(V("a/sub/x.txt").c_str(), 0600));
+  const uint64_t written = worker_.Report()["documents_written"].asUInt64();
+  EXPECT_EQ(Expect({"a", "a/same.txt", "a/grows.txt", "a/sub", "a/sub/x.txt", "a/sub/new.txt"}),
+            Pass(reconcile));
+  Json::Value report = worker_.Report();
+  Json::Value last = report["last_reconcile"];
+  EXPECT_EQ(last["folder"], V("a"));
+  EXPECT_EQ(report["state"], "idle");
+  EXPECT_TRUE(report["reconciling"].isNull());
+  // Added the new file; removed the file and the folder of four documents; refreshed the file
+  // that grew, the one whose mode changed and the two folders whose entries changed. Nothing
+  // else was read or written.
+  EXPECT_EQ(last["added"].asUInt(), 1u);
+  EXPECT_EQ(last["removed"].asUInt(), 5u);
+  EXPECT_EQ(last["refreshed"].asUInt(), 4u);
+  EXPECT_EQ(last["compared"].asUInt(), 6u);
+  EXPECT_EQ(report["documents_written"].asUInt64() - written, 5u);
+  EXPECT_EQ(report["reconciliations"].size(), 1u);
+
+  // Again, with nothing changed: nothing is written at all.
+  EXPECT_EQ(6u, Pass(reconcile).size());
+  last = worker_.Report()["last_reconcile"];
+  EXPECT_EQ(last["added"].asUInt() + last["removed"].asUInt() + last["refreshed"].asUInt(), 0u);
+  EXPECT_EQ(worker_.Report()["documents_written"].asUInt64() - written, 5u);
+  EXPECT_GT(last["pass"].asUInt(), report["last_reconcile"]["pass"].asUInt());
+}
+
 // The engine replaced by a scripted one: every write succeeds except those `fail` picks, which
 // are answered with `code`; queries find nothing.
 class ScriptedEngineTest : public ShareTest {
