@@ -5,7 +5,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cstring>
+#include <fstream>
 
 #include "common/json_util.hpp"
 #include "common/root.hpp"
@@ -224,6 +226,70 @@ TEST_F(CtlTest, PauseSaysWhetherTheIndexingDaemonTookIt) {
   r = Run({"resume"});
   EXPECT_EQ(r.status, 0) << r.err;
   EXPECT_THAT(r.out, HasSubstr("indexing resumed"));
+}
+
+TEST_F(CtlTest, FolderCheckQueuesAReconciliationAndReportsWhatItFixed) {
+  Result r = Run({"folder", "check", "/docs/reports"});
+  EXPECT_EQ(r.status, 1);
+  EXPECT_THAT(r.err, HasSubstr("the folder is not indexed (error 902): /docs/reports"));
+  {
+    const std::string ok = R"({"success":true,"data":{}})";
+    test::FakeDaemon engine(dir_.Path("var/run/quixelasticd.sock"),
+                            test::FakeDaemon::Replies({ok}));
+    test::FakeDaemon indexer(dir_.Path("var/run/fileindexd.sock"), test::FakeDaemon::Replies({ok}));
+    ASSERT_EQ(Run({"folder", "add", "/docs/reports"}).status, 0);
+  }
+  const std::string queue = docs_ + "/@eaDir/@fileindex/queue";
+  const std::string folder = docs_ + "/reports";
+
+  // Without the indexing daemon the check is queued for later, and said so.
+  r = Run({"folder", "check", folder});
+  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("queued a check of /docs/reports; fileindexd is not indexing "
+                               "share docs now (stopped or paused)"));
+  const std::string line = R"({"data":{"reconcile":true},"event":65536,"path":")" + folder +
+                           R"(","path_old":""})";
+  EXPECT_THAT(test::ReadFile(queue), HasSubstr(line + "\n"));
+
+  // The daemon's worker: the pass after the ones it had begun brings the folder's result, and
+  // while it runs the status shows how far it got.
+  std::atomic<int> asked{0};
+  test::FakeDaemon indexer(
+      dir_.Path("var/run/fileindexd.sock"), [&asked, &folder](int fd, const std::string&) {
+        const bool done = ++asked > 2;
+        const std::string old_result = R"({"folder":")" + folder + R"(","pass":3,"added":9})";
+        const std::string result = R"({"folder":")" + folder + R"(","pass":4,"finished":0,)"
+                                   R"("compared":10,"added":1,"removed":2,"refreshed":3,)"
+                                   R"("duration_ms":250})";
+        test::FakeDaemon::WriteFrame(
+            fd, R"({"success":true,"data":{"shares":[{"share":"docs","queue_length":1,)" +
+                    std::string(done ? R"("passes":4,"reconciliations":[)" + result + "]"
+                                     : R"("passes":3,"reconciling":{"folder":")" + folder +
+                                           R"(","compared":1500},"reconciliations":[)" +
+                                           old_result + "]") +
+                    "}]}}");
+      });
+  r = Run({"folder", "check", "/docs/reports"});
+  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_EQ(r.out, "checked /docs/reports in 0.25 s: 10 entries compared, 1 added, 2 removed, "
+                   "3 refreshed\n");
+  asked = 0;
+  EXPECT_THAT(Run({"status"}).out, HasSubstr("reconciling /docs/reports, 1500 entries compared"));
+  asked = 10;
+  EXPECT_THAT(Run({"status"}).out,
+              HasSubstr("RECONCILED FOLDER  FINISHED  COMPARED  ADDED  REMOVED  REFRESHED\n"
+                        "/docs/reports      -         10        1      2        3\n"));
+  asked = 0;
+  JsonValue json;
+  ASSERT_TRUE(json.fromString(Run({"--json", "folder", "check", "/docs/reports"}).out));
+  EXPECT_EQ(json["refreshed"].asUInt(), 3u);
+  EXPECT_TRUE(json["finished"].asBool());
+
+  // A full re-index queued already covers the check.
+  std::ofstream(queue, std::ios::app) << R"({"event":65536,"path":")" << folder << "\"}\n";
+  r = Run({"folder", "check", "/docs/reports"});
+  EXPECT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, HasSubstr("a full re-index of /docs/reports is already queued"));
 }
 
 TEST(CliTest, ValuesPeopleType) {

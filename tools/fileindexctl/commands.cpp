@@ -20,7 +20,10 @@
 #include "common/util.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/index_mgr.hpp"
+#include "common/sdk/share.hpp"
 #include "fileindex/notifyd_cfg.hpp"
+#include "fileindex/optree.hpp"
+#include "fileindex/queue_mgr.hpp"
 #include "fileindex/status_mgr.hpp"
 #include "fileindex/util.hpp"
 #include "platform/daemon_sock.hpp"
@@ -216,6 +219,100 @@ void FolderReindexCmd(const Args& args, Output& out) {
   const Json::Value paths = SharePaths(args, "PATH");
   FolderReindex(paths);
   out.Done("queued " + std::to_string(paths.size()) + " folder(s) for re-indexing");
+}
+
+// The indexing daemon's status and the worker of `share` in it (null when there is none).
+Json::Value IndexerStatus();
+const Json::Value& EntryWith(const Json::Value& list, const char* key, const std::string& value);
+
+void FolderCheckCmd(const Args& args, Output& out) {
+  const std::string path = SharePathOf(args.At(0, "PATH"));
+  const long long timeout = args.GetInt("timeout", 0);
+  std::string full;
+  std::string share;
+  std::string queue;
+  {
+    FolderMgr folders;
+    std::shared_ptr<Folder> folder;
+    folders.Get(folder, path);
+    full = folder->GetFullPath();
+    share = folder->GetShare();
+    queue = sdk::SDKShare(share).GetQueuePath();
+  }
+  Json::Value result(Json::objectValue);
+  result["path"] = path;
+  result["folder"] = full;
+  // A full re-index already queued reads the folder again anyway, and no check is added.
+  if (QueueMgr(queue).IsFullPathHasReindex(full)) {
+    result["finished"] = false;
+    result["covered_by_reindex"] = true;
+    out.Emit(result, [&path](std::ostream& os) {
+      os << "a full re-index of " << path << " is already queued; it covers the check\n";
+    });
+    return;
+  }
+  // Passes that take a batch are numbered: the check's result is the first reconciliation of
+  // the folder by a pass after the ones already under way.
+  const Json::Value before = IndexerStatus();
+  const Json::Value& worker = EntryWith(before["data"]["shares"], "share", share);
+  const uint64_t passes = worker["passes"].asUInt64();
+  Json::Value data(Json::objectValue);
+  data[kReconcileKey] = true;
+  AddCustomEvent(kEventReindex, full, "", data);
+  if (!worker.isObject()) {
+    result["finished"] = false;
+    result["queued"] = true;
+    out.Emit(result, [&](std::ostream& os) {
+      os << "queued a check of " << path << "; fileindexd is not indexing share " << share
+         << " now (stopped or paused): it runs when indexing resumes\n";
+    });
+    return;
+  }
+  const bool terminal = &out.stream() == &std::cout && isatty(STDOUT_FILENO) == 1;
+  const int64_t start = Env::Current()->NowMicros();
+  for (;;) {
+    const Json::Value status = IndexerStatus();
+    ORVANE_THROW_IF(status.isNull(), kErrSystem,
+                    "fileindexd stopped while checking " + path +
+                        "; the check stays queued and runs when it starts again");
+    const Json::Value& w = EntryWith(status["data"]["shares"], "share", share);
+    for (const Json::Value& r : w["reconciliations"]) {
+      if (r["folder"].asString() != full || r["pass"].asUInt64() <= passes) continue;
+      if (terminal) out.stream() << '\n';
+      for (const auto& name : r.getMemberNames()) result[name] = r[name];
+      result["finished"] = true;
+      out.Emit(result, [&](std::ostream& os) {
+        os << "checked " << path << " in " << r["duration_ms"].asInt64() / 1000.0 << " s: "
+           << r["compared"].asUInt64() << " entries compared, " << r["added"].asUInt64()
+           << " added, " << r["removed"].asUInt64() << " removed, " << r["refreshed"].asUInt64()
+           << " refreshed\n";
+      });
+      return;
+    }
+    // The check's line is gone from the queue without a result of its own: a full re-index of
+    // the folder queued meanwhile took its place.
+    if (w["passes"].asUInt64() > passes && w["queue_length"].asUInt64() == 0 &&
+        !w["reconciling"].isObject()) {
+      result["finished"] = false;
+      result["covered_by_reindex"] = true;
+      out.Emit(result, [&path](std::ostream& os) {
+        os << "a full re-index of " << path << " took the place of the check\n";
+      });
+      return;
+    }
+    if (terminal && w["reconciling"]["folder"].asString() == full) {
+      out.stream() << "\rchecking " << path << ": " << w["reconciling"]["compared"].asUInt64()
+                   << " entries compared" << std::flush;
+    }
+    const int64_t now = Env::Current()->NowMicros();
+    if (timeout > 0 && now - start > timeout * 1000000) {
+      if (terminal) out.stream() << '\n';
+      throw Error(kErrSystem, "the check of " + path + " did not finish within " +
+                                  std::to_string(timeout) +
+                                  " s; it stays queued (\"fileindexctl status\" shows it)");
+    }
+    Env::Current()->SleepMicros(200000);
+  }
 }
 
 void FolderListCmd(const Args& args, Output& out) {
@@ -498,6 +595,13 @@ Json::Value EngineIndexes() {
   return reply["data"];
 }
 
+// The indexing daemon's reply to "status"; null when it cannot be asked.
+Json::Value IndexerStatus() {
+  Json::Value reply;
+  std::string error;
+  return AskIndexerStatus(reply, error) ? reply : Json::Value();
+}
+
 Json::Value CollectStatus() {
   Json::Value status(Json::objectValue);
   for (const char* daemon : {"quixelasticd", "fileindexd", "quixnotifyd"}) {
@@ -549,6 +653,11 @@ std::string ShareState(const Json::Value& summary, const Json::Value& worker,
   if (worker["out_of_space"].asBool()) notes.push_back("out of space");
   if (summary["queue_no_space"].asBool()) notes.push_back("queue volume full");
   if (summary["watch_limit"].asBool()) notes.push_back("watch limit reached");
+  if (worker["reconciling"].isObject()) {
+    notes.push_back("reconciling " + SharePathOf(worker["reconciling"]["folder"].asString()) + ", " +
+                    std::to_string(worker["reconciling"]["compared"].asUInt64()) +
+                    " entries compared");
+  }
   const std::string engine = index["state"].asString();
   if (!engine.empty() && engine != "ready") notes.push_back("index " + engine);
   std::string text;
@@ -609,6 +718,20 @@ void PrintStatus(const Json::Value& status, std::ostream& os) {
   }
   if (!shares.empty()) {
     shares.Print(os);
+    os << '\n';
+  }
+  Table reconciled({"RECONCILED FOLDER", "FINISHED", "COMPARED", "ADDED", "REMOVED", "REFRESHED"});
+  for (const Json::Value& worker : status["indexer"]["data"]["shares"]) {
+    for (const Json::Value& r : worker["reconciliations"]) {
+      reconciled.Add({SharePathOf(r["folder"].asString()), HumanTime(r["finished"].asInt64()),
+                      std::to_string(r["compared"].asUInt64()),
+                      std::to_string(r["added"].asUInt64()),
+                      std::to_string(r["removed"].asUInt64()),
+                      std::to_string(r["refreshed"].asUInt64())});
+    }
+  }
+  if (!reconciled.empty()) {
+    reconciled.Print(os);
     os << '\n';
   }
   Table folders({"FOLDER", "STATUS"});
@@ -730,6 +853,14 @@ const std::vector<Command>& Commands() {
        {},
        1000,
        FolderReindexCmd},
+      {"folder",
+       "check",
+       "PATH [--timeout SECONDS]",
+       "compare a folder with the index, fix the differences and report them",
+       {"timeout"},
+       {},
+       1,
+       FolderCheckCmd},
       {"folder", "groups", "", "list the groups folders are shown to", {}, {}, 0, FolderGroupsCmd},
       {"share",
        "rename",
