@@ -1,0 +1,121 @@
+// Reconciliation of an indexed folder against the real engine, in a scratch root:
+//   1. a full re-index of a folder of N files (default 100,000) that the index already holds,
+//      for comparison;
+//   2. the engine's listing of the folder alone (what the comparison reads from the index);
+//   3. a reconciliation of the unchanged folder, warm (target: under 2 s for 100,000 files);
+//   4. a reconciliation after 1% of the files changed size.
+// The worker runs in this process (its pass, as the daemon runs it); the engine is a child.
+// Built with the benchmarks, run by hand (a non-sanitized release build gives the real figures):
+//   reconcile_bench [files]
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "common/json_util.hpp"
+#include "daemons/fileindexd/reconciler.hpp"
+#include "daemons/fileindexd/test_system.hpp"
+#include "daemons/fileindexd/worker.hpp"
+#include "fileindex/elastic_control.hpp"
+#include "fileindex/queue_file.hpp"
+
+namespace {
+
+using orvane::fileindexd::EngineEntries;
+using orvane::fileindexd::IndexedEntry;
+using orvane::fileindexd::Worker;
+using orvane::fileindexd::test::System;
+using Clock = std::chrono::steady_clock;
+
+double Seconds(Clock::time_point a, Clock::time_point b) {
+  return std::chrono::duration<double>(b - a).count();
+}
+
+// Queues one line and runs the worker's pass; the wall time of the pass.
+double Pass(const System& sys, Worker& worker, const std::string& line) {
+  if (!orvane::fileindex::QueueFileAppend(sys.Queue("docs"), line + "\n")) {
+    std::fprintf(stderr, "cannot append to the queue\n");
+    std::exit(1);
+  }
+  const auto start = Clock::now();
+  if (!worker.RunPass()) {
+    std::fprintf(stderr, "the pass failed: %s\n", orvane::JsonToString(worker.Report()).c_str());
+    std::exit(1);
+  }
+  return Seconds(start, Clock::now());
+}
+
+void PrintReconcile(const char* what, double s, const Json::Value& report) {
+  const Json::Value& r = report["last_reconcile"];
+  std::printf("%-44s %7.3f s  (%llu compared, %llu added, %llu removed, %llu refreshed)\n", what,
+              s, static_cast<unsigned long long>(r["compared"].asUInt64()),
+              static_cast<unsigned long long>(r["added"].asUInt64()),
+              static_cast<unsigned long long>(r["removed"].asUInt64()),
+              static_cast<unsigned long long>(r["refreshed"].asUInt64()));
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  const int files = argc > 1 ? std::atoi(argv[1]) : 100000;
+  constexpr int kPerDir = 1000;
+  System sys({"docs"});
+  sys.WriteFolders({System::Folder("/docs/a", false)});
+  auto engine = sys.StartEngine();
+  orvane::fileindex::elastic::ShareIndexCreate("docs");
+  for (int i = 0; i < files; ++i) {
+    orvane::fileindexd::test::WriteFile(
+        sys.Vol("docs/a/d" + std::to_string(i / kPerDir) + "/f" + std::to_string(i) + ".txt"),
+        "x");
+  }
+  const std::string folder = sys.Vol("docs/a");
+  const std::string reindex = R"({"event": 65536, "is_dir": true, "path": ")" + folder + "\"}";
+  const std::string reconcile = R"({"event": 65536, "is_dir": true, "path": ")" + folder +
+                                R"(", "data": {"reconcile": true}})";
+  Worker worker("docs", sys.Queue("docs"), Worker::PauseGate());
+
+  std::printf("folder of %d files in %d directories\n", files, (files + kPerDir - 1) / kPerDir);
+  std::printf("%-44s %7.3f s\n", "first indexing", Pass(sys, worker, reindex));
+  std::printf("%-44s %7.3f s\n", "full re-index of the indexed folder", Pass(sys, worker, reindex));
+
+  std::vector<double> listing;
+  for (int run = 0; run < 3; ++run) {
+    const auto start = Clock::now();
+    EngineEntries index("docs", folder);
+    IndexedEntry entry;
+    size_t n = 0;
+    while (index.Next(&entry)) ++n;
+    listing.push_back(Seconds(start, Clock::now()));
+    if (run == 0) std::printf("listing holds %zu documents\n", n);
+  }
+  std::sort(listing.begin(), listing.end());
+  std::printf("%-44s %7.3f s  (median of 3)\n", "engine listing of the folder", listing[1]);
+
+  // The index keeps whole seconds: the reconciliations start in a second after the last write.
+  const time_t written = time(nullptr);
+  while (time(nullptr) == written) usleep(20000);
+  std::vector<double> runs;
+  Json::Value report;
+  for (int run = 0; run < 3; ++run) {
+    runs.push_back(Pass(sys, worker, reconcile));
+    report = worker.Report();
+  }
+  std::sort(runs.begin(), runs.end());
+  PrintReconcile("reconciliation, unchanged (median of 3)", runs[1], report);
+  std::printf("%-44s %7.3f s / %7.3f s\n", "  fastest / slowest", runs.front(), runs.back());
+
+  for (int i = 0; i < files; i += 100) {
+    orvane::fileindexd::test::WriteFile(
+        sys.Vol("docs/a/d" + std::to_string(i / kPerDir) + "/f" + std::to_string(i) + ".txt"),
+        "changed");
+  }
+  const double changed = Pass(sys, worker, reconcile);
+  PrintReconcile("reconciliation, 1% of the files changed", changed, worker.Report());
+  engine.reset();
+  return 0;
+}
