@@ -228,6 +228,34 @@ TEST_F(DaemonTest, AStartAfterAnUncleanStopReconcilesEveryFolder) {
   EXPECT_EQ((std::set<std::string>{V("a"), sys_.Vol("music")}), reconciled());
 }
 
+// Whether a file's document was written again is told by the daemon's count of documents it
+// wrote: every upsert extracts, every attribute refresh stats, and both are counted.
+TEST_F(DaemonTest, AReconciliationOfAnUnchangedFolderReadsAndWritesNothing) {
+  for (int i = 0; i < 50; ++i) std::ofstream(V("a/f" + std::to_string(i) + ".txt")) << i;
+  auto indexd = sys_.StartIndexd();
+  fileindex::AddCustomEvent(fileindex::kEventReindex, V("a"), "", Json::Value());
+  Json::Value report;
+  ASSERT_TRUE(WaitFor([&] { return (report = Status()["shares"][0])["ops_done"].asUInt() == 1; },
+                      10000))
+      << report;
+  ASSERT_EQ(51u, sys_.Documents("docs").size());
+  const uint64_t written = report["documents_written"].asUInt64();
+
+  Json::Value data(Json::objectValue);
+  data[fileindex::kReconcileKey] = true;
+  fileindex::AddCustomEvent(fileindex::kEventReindex, V("a"), "", data);
+  ASSERT_TRUE(WaitFor([&] { return (report = Status()["shares"][0])["ops_done"].asUInt() == 2; },
+                      10000))
+      << report;
+  const Json::Value& last = report["last_reconcile"];
+  EXPECT_EQ(V("a"), last["folder"].asString());
+  EXPECT_EQ(51u, last["compared"].asUInt());
+  EXPECT_EQ(0u, last["added"].asUInt() + last["removed"].asUInt() + last["refreshed"].asUInt());
+  EXPECT_EQ(written, report["documents_written"].asUInt64());
+  EXPECT_EQ("idle", report["state"].asString());
+  EXPECT_EQ(51u, sys_.Documents("docs").size());
+}
+
 TEST_F(DaemonTest, SighupReReadsTheFolderConfiguration) {
   auto indexd = sys_.StartIndexd();
   ASSERT_EQ(std::set<std::string>{"docs"}, Running());
