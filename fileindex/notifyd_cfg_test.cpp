@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include "fileindex/admin_test_env.hpp"
+#include "fileindex/optree.hpp"
 #include "fileindex/status_mgr.hpp"
 #include "platform/fault.hpp"
 #include "platform/monitor_queue.hpp"
@@ -62,6 +63,16 @@ TEST_F(NotifydCfgTest, EventsAreWrittenPerShareUnlessAQueuedReindexCoversThem) {
       Strings(photo.begin() + 1, photo.end()),
       (Strings{"65536 /photo/trips/2024", "65536 /photo/trips", "256 /photo/family <- /photo/f"}));
   EXPECT_FALSE(IsFileExist(Queue("ro")));
+
+  // A queued reconciliation covers nothing: a full re-index of its folder is still written.
+  Json::Value reconcile(Json::objectValue);
+  reconcile[kReconcileKey] = true;
+  AddCustomEvents({{0x10000, vol_ + "/photo/family", "", reconcile},
+                   {0x10000, vol_ + "/photo/family", "", Json::Value()},
+                   {0x10000, trips + "/z", "", reconcile}});  // below a full one
+  const Strings later = Events("photo");
+  EXPECT_EQ(Strings(later.begin() + 4, later.end()),
+            (Strings{"65536 /photo/family {\"reconcile\":true}", "65536 /photo/family"}));
 
   // A path in no share ends the batch: what came before it is written, the rest is not.
   EXPECT_EQ(ErrorOf([&] {
