@@ -247,7 +247,7 @@ TEST_F(CtlTest, FolderCheckQueuesAReconciliationAndReportsWhatItFixed) {
   EXPECT_EQ(r.status, 0) << r.err;
   EXPECT_THAT(r.out, HasSubstr("queued a check of /docs/reports; fileindexd is not indexing "
                                "share docs now (stopped or paused)"));
-  const std::string line = R"({"data":{"reconcile":true},"event":65536,"path":")" + folder +
+  const std::string line = R"({"data":{"reconcile":true},"event":65536,"is_dir":true,"path":")" + folder +
                            R"(","path_old":""})";
   EXPECT_THAT(test::ReadFile(queue), HasSubstr(line + "\n"));
 
