@@ -144,8 +144,8 @@ TEST(OPTreeTest, ReconciliationsFoldIntoEachOtherAndGiveWayToFullReindexes) {
   auto reindex = [](const std::string& p) { return Line(kEventReindex, p, ",\"is_dir\":true"); };
   // Two reconciliations of one folder are one; one below another is covered by it, but the
   // work queued below stays, whether a change or a full re-index.
-  EXPECT_THAT(Drain(Create("/v/s/d/a") + check("/v/s/d/e") + reindex("/v/s/d/f") +
-                    check("/v/s/d") + check("/v/s/d")),
+  EXPECT_THAT(Drain(Create("/v/s/d/a") + check("/v/s/d/e") + reindex("/v/s/d/f") + check("/v/s/d") +
+                    check("/v/s/d")),
               ElementsAre("[02] /v/s/d/a", "[06] /v/s/d/f", "[06] /v/s/d, reconcile"));
   // A full re-index of the same folder wins in either order, and cancels what lies below.
   EXPECT_THAT(Drain(check("/v/s/d") + Create("/v/s/d/a") + reindex("/v/s/d")),

@@ -235,8 +235,8 @@ TEST_F(DaemonTest, AReconciliationOfAnUnchangedFolderReadsAndWritesNothing) {
   auto indexd = sys_.StartIndexd();
   fileindex::AddCustomEvent(fileindex::kEventReindex, V("a"), "", Json::Value());
   Json::Value report;
-  ASSERT_TRUE(WaitFor([&] { return (report = Status()["shares"][0])["ops_done"].asUInt() == 1; },
-                      10000))
+  ASSERT_TRUE(
+      WaitFor([&] { return (report = Status()["shares"][0])["ops_done"].asUInt() == 1; }, 10000))
       << report;
   ASSERT_EQ(51u, sys_.Documents("docs").size());
   const uint64_t written = report["documents_written"].asUInt64();
@@ -244,8 +244,8 @@ TEST_F(DaemonTest, AReconciliationOfAnUnchangedFolderReadsAndWritesNothing) {
   Json::Value data(Json::objectValue);
   data[fileindex::kReconcileKey] = true;
   fileindex::AddCustomEvent(fileindex::kEventReindex, V("a"), "", data);
-  ASSERT_TRUE(WaitFor([&] { return (report = Status()["shares"][0])["ops_done"].asUInt() == 2; },
-                      10000))
+  ASSERT_TRUE(
+      WaitFor([&] { return (report = Status()["shares"][0])["ops_done"].asUInt() == 2; }, 10000))
       << report;
   const Json::Value& last = report["last_reconcile"];
   EXPECT_EQ(V("a"), last["folder"].asString());

@@ -15,8 +15,8 @@
 #include <unordered_set>
 #include <vector>
 
-#include "fileindex/folder_mgr.hpp"
 #include "daemons/fileindexd/reconciler.hpp"
+#include "fileindex/folder_mgr.hpp"
 #include "fileindex/optree.hpp"
 
 namespace orvane {
@@ -55,8 +55,8 @@ class Indexer {
 
   // Called when a reconciliation of `folder` starts (zero counts), as it goes and, with
   // `finished`, once its differences are sent; a stopped or failed one never finishes.
-  using ReconcileObserver = std::function<void(const std::string& folder,
-                                               const ReconcileCounts& counts, bool finished)>;
+  using ReconcileObserver =
+      std::function<void(const std::string& folder, const ReconcileCounts& counts, bool finished)>;
   void SetReconcileObserver(ReconcileObserver observer) { observer_ = std::move(observer); }
 
   // The document commands the indexer sent, for the status report.

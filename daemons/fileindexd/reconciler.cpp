@@ -156,8 +156,7 @@ void Reconciler::Walk(const std::string& dir, dev_t dev, bool indexable) {
     items.push_back({name, disk, kVisit});
   }
   closer.reset();
-  std::sort(items.begin(), items.end(),
-            [](const Item& a, const Item& b) { return a.key < b.key; });
+  std::sort(items.begin(), items.end(), [](const Item& a, const Item& b) { return a.key < b.key; });
   for (const Item& item : items) {
     if (Stopping()) return;
     switch (item.kind) {
@@ -169,7 +168,8 @@ void Reconciler::Walk(const std::string& dir, dev_t dev, bool indexable) {
         break;
       case kBelow:
       case kBelowIndexable:
-        Walk(dir + "/" + item.key.substr(0, item.key.size() - 1), dev, item.kind == kBelowIndexable);
+        Walk(dir + "/" + item.key.substr(0, item.key.size() - 1), dev,
+             item.kind == kBelowIndexable);
         break;
     }
   }

@@ -107,10 +107,10 @@ class ReconcilerTest : public ::testing::Test {
 TEST_F(ReconcilerTest, SendsExactlyTheDifferencesInPathOrder) {
   // Names on both sides of "/" in byte order ("d-x", "d.txt" < "d/in.txt" < "d0.txt") and a
   // nested tree, all unchanged, with every kind of difference between them.
-  for (const char* rel : {"a/same.txt", "a/grown.txt", "a/touched.txt", "a/chowned.txt",
-                          "a/old-doc.txt", "a/d-x", "a/d.txt", "a/d/in.txt", "a/d0.txt",
-                          "a/sub/deep/x.txt", "a/was-dir", "a/@eaDir/thumb.txt", "a/new.txt",
-                          "a/was-file/n.txt"}) {
+  for (const char* rel :
+       {"a/same.txt", "a/grown.txt", "a/touched.txt", "a/chowned.txt", "a/old-doc.txt", "a/d-x",
+        "a/d.txt", "a/d/in.txt", "a/d0.txt", "a/sub/deep/x.txt", "a/was-dir", "a/@eaDir/thumb.txt",
+        "a/new.txt", "a/was-file/n.txt"}) {
     test::WriteFile(V(rel), rel);
   }
   ASSERT_EQ(0, symlink(V("a/same.txt").c_str(), V("a/link.txt").c_str()));
@@ -127,21 +127,21 @@ TEST_F(ReconcilerTest, SendsExactlyTheDifferencesInPathOrder) {
   docs.back().ctime -= 10;
   docs.push_back(Doc("a/old-doc.txt"));
   docs.back().ctime = -1;
-  for (const IndexedEntry& gone : {Gone("a/gone.txt"), Gone("a/gone-dir", true),
-                                   Gone("a/gone-dir/f"), Gone("a/gone-dir/g", true),
-                                   Gone("a/gone-dir/g/h"), Gone("a/was-dir", true),
-                                   Gone("a/was-dir/1"), Gone("a/was-dir/2"), Gone("a/was-file"),
-                                   Gone("a/@eaDir/thumb.txt"), Gone("a/link.txt")}) {
+  for (const IndexedEntry& gone :
+       {Gone("a/gone.txt"), Gone("a/gone-dir", true), Gone("a/gone-dir/f"),
+        Gone("a/gone-dir/g", true), Gone("a/gone-dir/g/h"), Gone("a/was-dir", true),
+        Gone("a/was-dir/1"), Gone("a/was-dir/2"), Gone("a/was-file"), Gone("a/@eaDir/thumb.txt"),
+        Gone("a/link.txt")}) {
     docs.push_back(gone);
   }
   ASSERT_TRUE(Run(docs));
-  EXPECT_THAT(recorder_.calls,
-              ElementsAre("remove /a/@eaDir/thumb.txt", "refresh /a/chowned.txt attributes",
-                          "remove /a/gone-dir and below", "remove /a/gone.txt",
-                          "refresh /a/grown.txt", "remove /a/link.txt", "add /a/new.txt",
-                          "refresh /a/old-doc.txt attributes", "refresh /a/touched.txt",
-                          "remove /a/was-dir and below", "refresh /a/was-dir",
-                          "refresh /a/was-file/", "add /a/was-file/n.txt"));
+  EXPECT_THAT(
+      recorder_.calls,
+      ElementsAre("remove /a/@eaDir/thumb.txt", "refresh /a/chowned.txt attributes",
+                  "remove /a/gone-dir and below", "remove /a/gone.txt", "refresh /a/grown.txt",
+                  "remove /a/link.txt", "add /a/new.txt", "refresh /a/old-doc.txt attributes",
+                  "refresh /a/touched.txt", "remove /a/was-dir and below", "refresh /a/was-dir",
+                  "refresh /a/was-file/", "add /a/was-file/n.txt"));
   EXPECT_EQ(counts_.compared, 18u);
   EXPECT_EQ(counts_.added, 2u);
   EXPECT_EQ(counts_.removed, 9u);

@@ -119,7 +119,7 @@ class Worker {
   bool out_of_space_ = false;
   std::unordered_set<size_t> long_paths_;
   bool reconciling_ = false;
-  Reconciliation current_;                              // while reconciling_
+  Reconciliation current_;                            // while reconciling_
   std::map<std::string, Reconciliation> reconciled_;  // the last of each folder
   std::string last_reconciled_;
 };

@@ -231,8 +231,9 @@ TEST_F(WorkerTest, AReconciliationWritesOnlyWhatChangedAndReportsIt) {
                           "a/gone/2/3.txt", "b/other.txt"}) {
     Write(rel);
   }
-  const std::string reconcile =
-      R"({"event": 65536, "is_dir": true, "path": ")" + V("a") + R"(", "data": {"reconcile": true}})" "\n";
+  const std::string reconcile = R"({"event": 65536, "is_dir": true, "path": ")" + V("a") +
+                                R"(", "data": {"reconcile": true}})"
+                                "\n";
   Pass(Line(0x10000, "a"));
   // The index keeps whole seconds: the changes below must fall in a later one to be seen.
   const time_t indexed = time(nullptr);

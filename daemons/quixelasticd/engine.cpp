@@ -697,8 +697,8 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
       if (!f.isString()) throw EngineError(kCodeInvalidParam, "\"load_field\" holds a non-string");
       extra.push_back(f.asString());
     }
-    const int64_t size = std::min(OptionalInt(data, "size", options_.default_page_size),
-                                  options_.max_page_size);
+    const int64_t size =
+        std::min(OptionalInt(data, "size", options_.default_page_size), options_.max_page_size);
     result = store.List(dir, after.isString() ? after.asString() : std::string(), extra, size);
   } else {
     const Json::Value& query = data["query"];

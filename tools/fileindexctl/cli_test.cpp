@@ -247,8 +247,8 @@ TEST_F(CtlTest, FolderCheckQueuesAReconciliationAndReportsWhatItFixed) {
   EXPECT_EQ(r.status, 0) << r.err;
   EXPECT_THAT(r.out, HasSubstr("queued a check of /docs/reports; fileindexd is not indexing "
                                "share docs now (stopped or paused)"));
-  const std::string line = R"({"data":{"reconcile":true},"event":65536,"is_dir":true,"path":")" + folder +
-                           R"(","path_old":""})";
+  const std::string line = R"({"data":{"reconcile":true},"event":65536,"is_dir":true,"path":")" +
+                           folder + R"(","path_old":""})";
   EXPECT_THAT(test::ReadFile(queue), HasSubstr(line + "\n"));
 
   // The daemon's worker: the pass after the ones it had begun brings the folder's result, and
@@ -258,7 +258,8 @@ TEST_F(CtlTest, FolderCheckQueuesAReconciliationAndReportsWhatItFixed) {
       dir_.Path("var/run/fileindexd.sock"), [&asked, &folder](int fd, const std::string&) {
         const bool done = ++asked > 2;
         const std::string old_result = R"({"folder":")" + folder + R"(","pass":3,"added":9})";
-        const std::string result = R"({"folder":")" + folder + R"(","pass":4,"finished":0,)"
+        const std::string result = R"({"folder":")" + folder +
+                                   R"(","pass":4,"finished":0,)"
                                    R"("compared":10,"added":1,"removed":2,"refreshed":3,)"
                                    R"("duration_ms":250})";
         test::FakeDaemon::WriteFrame(
@@ -271,8 +272,9 @@ TEST_F(CtlTest, FolderCheckQueuesAReconciliationAndReportsWhatItFixed) {
       });
   r = Run({"folder", "check", "/docs/reports"});
   EXPECT_EQ(r.status, 0) << r.err;
-  EXPECT_EQ(r.out, "checked /docs/reports in 0.25 s: 10 entries compared, 1 added, 2 removed, "
-                   "3 refreshed\n");
+  EXPECT_EQ(r.out,
+            "checked /docs/reports in 0.25 s: 10 entries compared, 1 added, 2 removed, "
+            "3 refreshed\n");
   asked = 0;
   EXPECT_THAT(Run({"status"}).out, HasSubstr("reconciling /docs/reports, 1500 entries compared"));
   asked = 10;

@@ -17,10 +17,10 @@
 #include "common/json_util.hpp"
 #include "common/name_codec.hpp"
 #include "common/root.hpp"
+#include "common/sdk/share.hpp"
 #include "common/util.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/index_mgr.hpp"
-#include "common/sdk/share.hpp"
 #include "fileindex/notifyd_cfg.hpp"
 #include "fileindex/optree.hpp"
 #include "fileindex/queue_mgr.hpp"
@@ -282,8 +282,8 @@ void FolderCheckCmd(const Args& args, Output& out) {
       for (const auto& name : r.getMemberNames()) result[name] = r[name];
       result["finished"] = true;
       out.Emit(result, [&](std::ostream& os) {
-        os << "checked " << path << " in " << r["duration_ms"].asInt64() / 1000.0 << " s: "
-           << r["compared"].asUInt64() << " entries compared, " << r["added"].asUInt64()
+        os << "checked " << path << " in " << r["duration_ms"].asInt64() / 1000.0
+           << " s: " << r["compared"].asUInt64() << " entries compared, " << r["added"].asUInt64()
            << " added, " << r["removed"].asUInt64() << " removed, " << r["refreshed"].asUInt64()
            << " refreshed\n";
       });
@@ -654,8 +654,8 @@ std::string ShareState(const Json::Value& summary, const Json::Value& worker,
   if (summary["queue_no_space"].asBool()) notes.push_back("queue volume full");
   if (summary["watch_limit"].asBool()) notes.push_back("watch limit reached");
   if (worker["reconciling"].isObject()) {
-    notes.push_back("reconciling " + SharePathOf(worker["reconciling"]["folder"].asString()) + ", " +
-                    std::to_string(worker["reconciling"]["compared"].asUInt64()) +
+    notes.push_back("reconciling " + SharePathOf(worker["reconciling"]["folder"].asString()) +
+                    ", " + std::to_string(worker["reconciling"]["compared"].asUInt64()) +
                     " entries compared");
   }
   const std::string engine = index["state"].asString();
@@ -723,11 +723,10 @@ void PrintStatus(const Json::Value& status, std::ostream& os) {
   Table reconciled({"RECONCILED FOLDER", "FINISHED", "COMPARED", "ADDED", "REMOVED", "REFRESHED"});
   for (const Json::Value& worker : status["indexer"]["data"]["shares"]) {
     for (const Json::Value& r : worker["reconciliations"]) {
-      reconciled.Add({SharePathOf(r["folder"].asString()), HumanTime(r["finished"].asInt64()),
-                      std::to_string(r["compared"].asUInt64()),
-                      std::to_string(r["added"].asUInt64()),
-                      std::to_string(r["removed"].asUInt64()),
-                      std::to_string(r["refreshed"].asUInt64())});
+      reconciled.Add(
+          {SharePathOf(r["folder"].asString()), HumanTime(r["finished"].asInt64()),
+           std::to_string(r["compared"].asUInt64()), std::to_string(r["added"].asUInt64()),
+           std::to_string(r["removed"].asUInt64()), std::to_string(r["refreshed"].asUInt64())});
     }
   }
   if (!reconciled.empty()) {
