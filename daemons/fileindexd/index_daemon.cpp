@@ -40,11 +40,12 @@ std::string ShareOf(const Json::Value& data) {
 }
 
 // The members of a worker's report that everyone may see: counts and states. The rest (the last
-// error's text) names files of the share, which only administrators may know of.
+// error's text, the folders reconciled) names files of the share, which only administrators may
+// know of.
 // clang-format off
 const char* const kPublicReportMembers[] = {
     "share", "queue_length", "ops_pending", "ops_done", "documents_written", "documents_deleted",
-    "last_pass", "errors", "paused", "out_of_space", "long_paths"};
+    "last_pass", "errors", "paused", "out_of_space", "long_paths", "state", "passes"};
 // clang-format on
 
 Json::Value PublicReport(const Json::Value& report) {
