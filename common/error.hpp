@@ -18,6 +18,7 @@ enum ErrorCode : int32_t {
   kErrLoadConfig = 504,
   kErrSaveConfig = 505,
   kErrLockFile = 506,
+  kErrUnsafePath = 507,
   // The search engine's answer for an index it found damaged and set aside; passed through.
   kErrIndexDamaged = 609,
   kErrShareGet = 800,

@@ -27,9 +27,33 @@ LockFile::LockFile(const std::string& path, bool exclusive) : fd_(-1), path_(pat
     }
     close(fd_);
     fd_ = -1;
-    Env::Current()->SleepMicros(static_cast<int64_t>(Env::Current()->Rand() % 10) * 100000);
-    if (--attempts_left == 0) throw Error(kErrLockFile, "Exceed max retry, path=" + path_);
+    NextAttempt(&attempts_left);
   }
+}
+
+LockFile::LockFile(UniqueFd fd, const std::string& path, bool exclusive)
+    : fd_(fd.Release()), path_(path) {
+  for (int attempts_left = kMaxAttempts;;) {
+    if (flock(fd_, (exclusive ? LOCK_EX : LOCK_SH) | LOCK_NB) == 0) return;
+    if (errno != EINTR && errno != EWOULDBLOCK) {
+      const int failure = errno;
+      close(fd_);
+      fd_ = -1;
+      throw Error(kErrLockFile, std::strerror(failure));
+    }
+    try {
+      NextAttempt(&attempts_left);
+    } catch (...) {
+      close(fd_);
+      fd_ = -1;
+      throw;
+    }
+  }
+}
+
+void LockFile::NextAttempt(int* attempts_left) {
+  Env::Current()->SleepMicros(static_cast<int64_t>(Env::Current()->Rand() % 10) * 100000);
+  if (--*attempts_left == 0) throw Error(kErrLockFile, "Exceed max retry, path=" + path_);
 }
 
 LockFile::~LockFile() {

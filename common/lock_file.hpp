@@ -6,6 +6,8 @@
 
 #include <string>
 
+#include "common/fd.hpp"
+
 namespace orvane {
 
 class LockFile {
@@ -13,6 +15,9 @@ class LockFile {
   // Acquires the lock (exclusive or shared) or throws Error 506. The file is created with mode
   // 0644 if missing and never removed.
   LockFile(const std::string& path, bool exclusive);
+  // Locks the file already open as `fd` (the caller opened it safely); `path` names it in
+  // errors. The descriptor is owned from here on.
+  LockFile(UniqueFd fd, const std::string& path, bool exclusive);
   ~LockFile();
   LockFile(const LockFile&) = delete;
   LockFile& operator=(const LockFile&) = delete;
@@ -20,6 +25,9 @@ class LockFile {
   static constexpr int kMaxAttempts = 64;
 
  private:
+  // Sleeps before the next attempt; throws Error 506 when none is left.
+  void NextAttempt(int* attempts_left);
+
   int fd_;
   std::string path_;
 };

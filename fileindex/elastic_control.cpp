@@ -1,5 +1,6 @@
 #include "fileindex/elastic_control.hpp"
 
+#include <fcntl.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -17,6 +18,7 @@
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/status_mgr.hpp"
 #include "fileindex/util.hpp"
+#include "platform/safe_dir.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -375,17 +377,18 @@ void UpdateTermSuggestion() {
     const std::string db = sdk_share.GetDBName();
     if (std::find(dbs.begin(), dbs.end(), db) == dbs.end()) continue;
     Log(LOG_ERR, "%s:%d Start building term sugg [%s]", SourceName(__FILE__), __LINE__, db.c_str());
-    const std::string term_sugg_running = sdk_share.GetDBPath() + kTermSuggRunningMarker;
-    {
-      std::ofstream ofs(term_sugg_running, std::ios::trunc);
-      ORVANE_LOG_IF(!ofs);
-    }
+    // The marker lies among the engine's own files, so it is written like them: through the
+    // folder's descriptor, root-only, never through a link.
+    const platform::SafeDir db_dir = platform::SafeDir::Open(sdk_share.GetDBPath(), false);
+    const std::string marker = kTermSuggRunningMarker + 1;  // without its leading "/"
+    ORVANE_LOG_IF(!db_dir.valid() ||
+                  !db_dir.OpenFile(marker, O_WRONLY | O_CREAT | O_TRUNC).valid());
     paths.clear();
     elastic::IndexGetByPrefixPath(db, sdk_share.GetPath(), paths);
     elastic::UpdateTermSuggestion(db, paths);
     elastic::IndexCommit(share);
     Log(LOG_ERR, "%s:%d Done building term sugg [%s]", SourceName(__FILE__), __LINE__, db.c_str());
-    ORVANE_LOG_IF(0 != unlink(term_sugg_running.c_str()));
+    ORVANE_LOG_IF(!db_dir.valid() || 0 != db_dir.Unlink(marker));
   }
 }
 

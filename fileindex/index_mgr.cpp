@@ -1,6 +1,5 @@
 #include "fileindex/index_mgr.hpp"
 
-#include <ftw.h>
 #include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -34,6 +33,7 @@
 #include "fileindex/util.hpp"
 #include "platform/fileidx.hpp"
 #include "platform/monitor_queue.hpp"
+#include "platform/safe_dir.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -183,32 +183,6 @@ std::string ComposeIndexPath(int (*compose)(const char*, char*, size_t),
   ORVANE_THROW_IF(0 > compose(share_path.c_str(), buf, sizeof(buf)), kErrSystem,
                   "Cannot compose index location of " + share_path);
   return buf;
-}
-
-int RemoveEntry(const char* path, const struct stat*, int type, struct FTW*) {
-  const int rc = (type == FTW_DP || type == FTW_D) ? rmdir(path) : unlink(path);
-  return (rc == 0 || errno == ENOENT) ? 0 : -1;
-}
-
-// Removes `path` and, for a folder, everything in it, staying on its file system and never
-// following a link.
-void RemoveTree(const std::string& path) {
-  struct stat st;
-  if (lstat(path.c_str(), &st) != 0) {
-    ORVANE_THROW_IF(errno != ENOENT, kErrSystem, "Cannot remove: " + path);
-    errno = 0;
-    return;
-  }
-  if (!S_ISDIR(st.st_mode)) {
-    ORVANE_THROW_IF(0 != unlink(path.c_str()) && errno != ENOENT, kErrSystem,
-                    "Cannot remove: " + path);
-    errno = 0;
-    return;
-  }
-  ORVANE_THROW_IF(0 != nftw(path.c_str(), RemoveEntry, 16, FTW_DEPTH | FTW_PHYS | FTW_MOUNT),
-                  kErrSystem, "Cannot remove: " + path);
-  // A mount point below is left in place, and so is the folder holding it.
-  ORVANE_THROW_IF(IsDirExist(path, false), kErrSystem, "Cannot remove: " + path);
 }
 
 // The indexed shares whose folder lies on the volume mounted at `volume`.
@@ -562,9 +536,17 @@ void CleanShareIndexData(const std::string& share, const std::string& share_path
   ORVANE_THROW_IF(share_path.empty() || share_path[0] != '/', kErrInvalidParam,
                   "Bad share path of " + share + ": " + share_path);
   const std::string queue = ComposeIndexPath(platform::FILEIDXQueuePathCompose, share_path);
-  RemoveTree(queue);
-  RemoveTree(queue + ".tmp");
-  RemoveTree(ComposeIndexPath(platform::FILEIDXDBPathCompose, share_path));
+  const std::string db = ComposeIndexPath(platform::FILEIDXDBPathCompose, share_path);
+  // Through the folders' own descriptors, never a link: a planted "@eaDir" link must not make
+  // root remove files somewhere else.
+  auto remove = [](const std::string& path) {
+    const platform::SafeDir dir = platform::SafeDir::Open(Dirname(path), false);
+    if (!dir.valid()) return;
+    ORVANE_THROW_IF(0 != dir.RemoveTree(Basename(path)), kErrSystem, "Cannot remove: " + path);
+  };
+  remove(queue);
+  remove(queue + ".tmp");
+  remove(db);
 }
 
 void VolumePause(const std::string& volume) {

@@ -9,7 +9,9 @@
 #include <cerrno>
 #include <cstring>
 
-#include "common/root.hpp"
+#include "common/error.hpp"
+#include "common/util.hpp"
+#include "platform/safe_dir.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -19,8 +21,10 @@ constexpr size_t kBufferSize = 256 * 1024;
 
 }  // namespace
 
-QueueFileReader::QueueFileReader(const std::string& path)
-    : fd_(open(path.c_str(), O_RDONLY | O_CLOEXEC)) {
+QueueFileReader::QueueFileReader(const std::string& path) {
+  const platform::SafeDir dir = platform::SafeDir::Open(Dirname(path), false);
+  if (!dir.valid()) return;
+  fd_ = dir.OpenFile(Basename(path), O_RDONLY);
   if (fd_.valid()) buf_.reset(new char[kBufferSize]);
 }
 
@@ -66,9 +70,19 @@ bool QueueFileReader::ReadLine(std::string* line, size_t max_length) {
 }
 
 bool QueueFileAppend(const std::string& queue_path, const std::string& lines) {
-  MakeParentDirs(queue_path);
+  platform::SafeDir dir;
+  try {
+    dir = platform::SafeDir::Open(Dirname(queue_path), true);
+  } catch (const Error& e) {
+    // A folder that cannot be made is a failed append like a full volume; a planted entry is
+    // the caller's to report.
+    if (e.code == kErrUnsafePath) throw;
+    if (errno == 0) errno = EIO;
+    return false;
+  }
+  const std::string name = Basename(queue_path);
   for (;;) {
-    UniqueFd fd(open(queue_path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644));
+    UniqueFd fd = dir.OpenFile(name, O_WRONLY | O_APPEND | O_CREAT);
     if (!fd.valid()) return false;
     int rc;
     while ((rc = flock(fd.get(), LOCK_EX)) != 0 && errno == EINTR) {
@@ -77,7 +91,7 @@ bool QueueFileAppend(const std::string& queue_path, const std::string& lines) {
     struct stat locked;
     struct stat current;
     if (fstat(fd.get(), &locked) != 0) return false;
-    if (stat(queue_path.c_str(), &current) != 0 || locked.st_ino != current.st_ino ||
+    if (!dir.Stat(name, &current) || locked.st_ino != current.st_ino ||
         locked.st_dev != current.st_dev) {
       continue;  // renamed away under us: the next open creates the fresh live queue
     }

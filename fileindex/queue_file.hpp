@@ -14,7 +14,9 @@ namespace fileindex {
 
 class QueueFileReader {
  public:
-  // Opens `path` for reading; test the object for success (errno tells why not).
+  // Opens `path` for reading without following links (a queue under a share's "@eaDir" is
+  // reached component by component, see platform::SafeDir); test the object for success (errno
+  // tells why not). Throws Error(kErrUnsafePath) when a planted entry stands in the way.
   explicit QueueFileReader(const std::string& path);
   QueueFileReader(const QueueFileReader&) = delete;
   QueueFileReader& operator=(const QueueFileReader&) = delete;
@@ -37,7 +39,8 @@ class QueueFileReader {
 };
 
 // Appends `lines` (whole lines, each ending in "\n") to the queue at `queue_path` in one write,
-// creating the file and its folder if missing. It holds the queue's lock while writing, and
+// creating the file (0600) and its folders (0700) if missing, never through a link; a planted
+// entry is refused with Error(kErrUnsafePath). It holds the queue's lock while writing, and
 // checks that the file it locked is still the live queue: the reader may have just renamed it to
 // the side file, and a line written there would miss the batch already being read. False (errno
 // set) when the queue cannot be opened, locked or written.

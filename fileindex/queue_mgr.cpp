@@ -1,5 +1,7 @@
 #include "fileindex/queue_mgr.hpp"
 
+#include <fcntl.h>
+
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -9,6 +11,7 @@
 #include "common/util.hpp"
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/queue_file.hpp"
+#include "platform/safe_dir.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -17,12 +20,24 @@ QueueMgr::QueueMgr(const std::string& queue_path)
     : queue_path_(queue_path), queue_path_tmp_(queue_path + ".tmp") {}
 
 void QueueMgr::PrepareTmpQueue() {
-  if (!IsFileExist(queue_path_)) return;
-  LockFile lock(queue_path_, true);
+  // The queue's folder is reached without following links and everything below happens
+  // through its descriptor, so a folder swapped in meanwhile is never the one renamed in.
+  const platform::SafeDir dir = platform::SafeDir::Open(Dirname(queue_path_), false);
+  if (!dir.valid()) return;
+  const std::string live = Basename(queue_path_);
+  const std::string side = Basename(queue_path_tmp_);
+  UniqueFd queue = dir.OpenFile(live, O_RDONLY);
+  if (!queue.valid()) {
+    ORVANE_THROW_IF(errno != ENOENT, kErrLockFile,
+                    "cannot open " + queue_path_ + ": " + std::strerror(errno));
+    return;
+  }
+  LockFile lock(std::move(queue), queue_path_, true);
   // A waiting side file is an interrupted batch: it goes first and new events wait their turn.
-  if (IsFileExist(queue_path_tmp_)) return;
-  ORVANE_THROW_IF(0 > rename(queue_path_.c_str(), queue_path_tmp_.c_str()), kErrSystem,
-                  std::string("rename failed, reason=") + std::strerror(errno));
+  if (dir.CheckEntry(side, false)) return;
+  ORVANE_THROW_IF(0 > dir.Rename(live, side), kErrSystem,
+                  "cannot rename " + queue_path_ + " to " + queue_path_tmp_ + ": " +
+                      std::strerror(errno));
 }
 
 std::shared_ptr<OPTree> QueueMgr::GetOPTree() const {
@@ -41,7 +56,10 @@ size_t QueueMgr::ProcessOP(std::function<void(std::shared_ptr<OP>)> callback, bo
   return IsFileExist(queue_path_tmp_) ? GetOPTreeTmp()->ProcessOP(callback) : 0;
 }
 
-void QueueMgr::DeleteTmp() { unlink(queue_path_tmp_.c_str()); }
+void QueueMgr::DeleteTmp() {
+  const platform::SafeDir dir = platform::SafeDir::Open(Dirname(queue_path_tmp_), false);
+  if (dir.valid()) dir.Unlink(Basename(queue_path_tmp_));
+}
 
 bool QueueMgr::FindQueue(const std::string& path,
                          const std::function<bool(const Event&)>& pred) const {

@@ -22,7 +22,9 @@
 #include "daemons/fileindexd/indexer.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/notify.hpp"
+#include "fileindex/queue_file.hpp"
 #include "fileindex/queue_mgr.hpp"
+#include "platform/safe_dir.hpp"
 
 namespace orvane {
 namespace fileindexd {
@@ -51,10 +53,15 @@ std::string PassFailureText(const std::string& share, const Error& e) {
 }
 
 uint64_t CountLines(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  if (!in) return 0;
-  return static_cast<uint64_t>(std::count(std::istreambuf_iterator<char>(in),
-                                          std::istreambuf_iterator<char>(), '\n'));
+  try {
+    fileindex::QueueFileReader reader(path);
+    uint64_t count = 0;
+    std::string line;
+    while (reader.ReadLine(&line, 0)) ++count;
+    return count;
+  } catch (const Error&) {
+    return 0;  // a refused queue is reported through the worker's state
+  }
 }
 
 }  // namespace
@@ -72,10 +79,18 @@ void Worker::Start() {
   inotify_.Reset(inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
   ORVANE_THROW_IF(!inotify_.valid(), kErrSystem, "inotify_init1 failed");
   // The queue's folder is watched rather than the file: the file is renamed away on every pass
-  // and created again by the next append.
-  MakeParentDirs(queue_path_);
-  if (inotify_add_watch(inotify_.get(), Dirname(queue_path_).c_str(),
-                        IN_MODIFY | IN_CLOSE_WRITE | IN_CREATE | IN_MOVED_TO) < 0) {
+  // and created again by the next append. Making sure of the folder first also narrows the
+  // modes an older installation left; a refusal is reported by every pass until it is resolved.
+  bool safe = true;
+  try {
+    CheckSystemFiles();
+  } catch (const Error& e) {
+    safe = false;
+    RecordFailure(e);
+  }
+  if (!safe || inotify_add_watch(inotify_.get(), Dirname(queue_path_).c_str(),
+                                 IN_MODIFY | IN_CLOSE_WRITE | IN_CREATE | IN_MOVED_TO |
+                                     IN_ONLYDIR | IN_DONT_FOLLOW) < 0) {
     Log(LOG_WARNING, "fileindexd: cannot watch the queue folder of %s: %m; polling it",
         share_.c_str());
   }
@@ -123,6 +138,7 @@ Json::Value Worker::Report() const {
   r["last_reconcile"] = last != reconciled_.end() ? ToJson(last->second, true) : Json::Value();
   r["reconciliations"] = Json::Value(Json::arrayValue);
   for (const auto& entry : reconciled_) r["reconciliations"].append(ToJson(entry.second, true));
+  r["unsafe"] = unsafe_;
   return r;
 }
 
@@ -182,7 +198,7 @@ void Worker::Run() {
     try {
       done = RunPass();
     } catch (const Error& e) {
-      RecordError(e.what());
+      RecordFailure(e);
     } catch (const std::exception& e) {
       RecordError(e.what());
     }
@@ -201,7 +217,18 @@ void Worker::Run() {
   }
 }
 
+void Worker::CheckSystemFiles() {
+  const platform::SafeDir dir = platform::SafeDir::Open(Dirname(queue_path_), true);
+  dir.CheckEntry(Basename(queue_path_), false);
+  dir.CheckEntry(Basename(queue_path_) + ".tmp", false);
+  std::lock_guard<std::mutex> lock(mu_);
+  unsafe_.clear();
+}
+
 bool Worker::RunPass() {
+  // Every pass makes sure of the queue's folder, so a folder planted or swapped in after the
+  // start is reported instead of leaving the share quietly idle.
+  CheckSystemFiles();
   if (!IsFileExist(queue_path_) && !IsFileExist(queue_path_ + ".tmp")) return true;
   Indexer indexer(share_, &stop_);
   indexer.BeginPass();
@@ -352,6 +379,18 @@ void Worker::TakeLongPaths(const Indexer& indexer) {
       "fileindexd: share %s: %zu more path(s) of %d bytes or more cannot be indexed; the first "
       "(%zu bytes) begins %.512s",
       share_.c_str(), added, PATH_MAX, first.size(), first.c_str());
+}
+
+void Worker::RecordFailure(const Error& e) {
+  if (e.code != kErrUnsafePath) {
+    RecordError(e.what());
+    return;
+  }
+  // Logged once where it was found; the pass after the entry is removed clears it.
+  std::lock_guard<std::mutex> lock(mu_);
+  ++errors_;
+  last_error_ = e.what();
+  unsafe_ = e.what();
 }
 
 void Worker::RecordError(const std::string& text) {

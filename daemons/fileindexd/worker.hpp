@@ -18,6 +18,7 @@
 #include <thread>
 #include <unordered_set>
 
+#include "common/error.hpp"
 #include "common/fd.hpp"
 #include "daemons/fileindexd/reconciler.hpp"
 
@@ -60,8 +61,10 @@ class Worker {
   void Wake();
   // {"share", "state" ("idle", "indexing", "reconciling"), "queue_length", "ops_pending",
   //  "ops_done", "documents_written", "documents_deleted", "last_pass", "passes", "errors",
-  //  "last_error", "paused", "out_of_space", "long_paths", "reconciling" (the one running, or
-  //  null), "last_reconcile" (or null), "reconciliations" (the last of each folder)};
+  //  "last_error", "paused", "out_of_space", "long_paths", "unsafe", "reconciling" (the one
+  //  running, or null), "last_reconcile" (or null), "reconciliations" (the last of each
+  //  folder)}; "unsafe" is the refusal of a planted entry among the share's own files (the path
+  //  and what to do), empty while they are sound.
   //  "long_paths" counts the paths of PATH_MAX bytes and more met since the start, which cannot
   //  be indexed. A reconciliation is {"folder", "started", "compared", and once done
   //  "finished", "duration_ms", "added", "removed", "refreshed", "pass"}.
@@ -78,6 +81,10 @@ class Worker {
   void Wait(int timeout_ms);
   // Sleeps, ending early on a stop or when `cut_short` is set.
   void Backoff(int64_t micros, const std::atomic<bool>* cut_short = nullptr);
+  // Opens the queue's folder (made when missing, modes narrowed) and checks its files; throws
+  // Error(kErrUnsafePath) on a planted entry.
+  void CheckSystemFiles();
+  void RecordFailure(const Error& e);
   void RecordError(const std::string& text);
   // Adds the over-long paths a pass met to the worker's count; logs the first new one.
   void TakeLongPaths(const Indexer& indexer);
@@ -122,6 +129,7 @@ class Worker {
   Reconciliation current_;                            // while reconciling_
   std::map<std::string, Reconciliation> reconciled_;  // the last of each folder
   std::string last_reconciled_;
+  std::string unsafe_;
 };
 
 }  // namespace fileindexd

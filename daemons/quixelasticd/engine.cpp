@@ -11,6 +11,8 @@
 #include <functional>
 #include <optional>
 
+#include <fcntl.h>
+
 #include "common/env.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
@@ -138,38 +140,59 @@ const char* StateText(int code) {
 
 const std::vector<std::string> kStoreFiles = {"", "-wal", "-shm"};
 
+// Removes the index folder `dir` once it is empty, through its parent's verified descriptor.
+void RemoveStoreDir(const std::string& dir) {
+  const platform::SafeDir parent = OpenStoreDir(Dirname(dir), false);
+  if (parent.valid()) parent.RemoveDir(Basename(dir));
+}
+
 // Moves the store files of one folder to another: a rename when both are on one file system,
-// else a synced copy followed by removal of the originals.
+// else a synced copy followed by removal of the originals. Both folders are reached without
+// following links, and the files are moved through their descriptors.
 void MoveStoreFiles(const std::string& from_dir, const std::string& to_dir) {
-  if (!MakeParentDirs(to_dir + "/" + IndexStore::kDbFile)) {
-    throw EngineError(kCodeStorage, "cannot create folder " + to_dir);
-  }
+  const platform::SafeDir from = OpenStoreDir(from_dir, false);
+  const platform::SafeDir to = OpenStoreDir(to_dir, true);
+  if (!from.valid()) throw EngineError(kCodeStorage, "no store in " + from_dir);
   for (const std::string& suffix : kStoreFiles) {
-    const std::string from = from_dir + "/" + IndexStore::kDbFile + suffix;
-    const std::string to = to_dir + "/" + IndexStore::kDbFile + suffix;
-    if (!IsFileExist(from)) continue;
-    if (::rename(from.c_str(), to.c_str()) == 0) continue;
+    const std::string name = IndexStore::kDbFile + suffix;
+    const std::string from_file = from_dir + "/" + name;
+    const std::string to_file = to_dir + "/" + name;
+    if (!from.Exists(name)) continue;
+    if (from.RenameTo(name, to, name) == 0) continue;
     if (errno != EXDEV) {
       Log(LOG_ERR, "%s:%d rename %s to %s failed [err: %m]", SourceName(__FILE__), __LINE__,
-          from.c_str(), to.c_str());
-      throw EngineError(kCodeStorage, "cannot move " + from);
+          from_file.c_str(), to_file.c_str());
+      throw EngineError(kCodeStorage, "cannot move " + from_file);
     }
-    {
-      std::ifstream in(from, std::ios::binary);
-      std::ofstream out(to, std::ios::binary | std::ios::trunc);
-      out << in.rdbuf();
-      out.flush();
-      if (!in || !out) throw EngineError(kCodeStorage, "cannot copy " + from + " to " + to);
+    UniqueFd in;
+    UniqueFd out;
+    try {
+      in = from.OpenFile(name, O_RDONLY);
+      out = to.OpenFile(name, O_WRONLY | O_CREAT | O_TRUNC);
+    } catch (const Error& e) {
+      throw EngineError(kCodeStorage, e.message);
     }
-    FILE* f = std::fopen(to.c_str(), "rb");
-    if (f == nullptr || ::fsync(fileno(f)) != 0) {
-      if (f != nullptr) std::fclose(f);
-      throw EngineError(kCodeStorage, "cannot sync " + to);
+    if (!in.valid() || !out.valid()) {
+      throw EngineError(kCodeStorage, "cannot copy " + from_file + " to " + to_file);
     }
-    std::fclose(f);
-    ::unlink(from.c_str());
+    char buf[64 * 1024];
+    for (;;) {
+      const ssize_t n = ::read(in.get(), buf, sizeof(buf));
+      if (n < 0 && errno == EINTR) continue;
+      if (n < 0) throw EngineError(kCodeStorage, "cannot read " + from_file);
+      if (n == 0) break;
+      for (ssize_t done = 0; done < n;) {
+        const ssize_t w = ::write(out.get(), buf + done, static_cast<size_t>(n - done));
+        if (w < 0 && errno == EINTR) continue;
+        if (w <= 0) throw EngineError(kCodeStorage, "cannot copy " + from_file + " to " + to_file);
+        done += w;
+      }
+    }
+    if (::fsync(out.get()) != 0) throw EngineError(kCodeStorage, "cannot sync " + to_file);
+    from.Unlink(name);
   }
-  ::rmdir(from_dir.c_str());
+  to.Sync();
+  RemoveStoreDir(from_dir);
 }
 
 }  // namespace
@@ -355,6 +378,7 @@ void Engine::OpenAll(bool after_crash) {
     std::shared_ptr<IndexStore> store;
     std::string failure;
     bool damaged = false;
+    bool refused = false;
     try {
       if (!IndexStore::ExistsIn(path)) {
         failure = "no store in " + path;
@@ -362,6 +386,9 @@ void Engine::OpenAll(bool after_crash) {
         store = IndexStore::Open(path);
         if (after_crash && !store->QuickCheck(&failure)) damaged = true;
       }
+    } catch (const UnsafeStoreError& err) {
+      failure = err.what();
+      refused = true;
     } catch (const StoreError& err) {
       failure = err.what();
       damaged = err.IsCorruption();
@@ -377,6 +404,8 @@ void Engine::OpenAll(bool after_crash) {
     } else if (damaged) {
       store.reset();
       SetAside(*e, failure);
+    } else if (refused) {
+      Refuse(*e, failure);
     } else {
       e->state = State::kDamaged;
       Log(LOG_ERR, "%s:%d index %s cannot be opened (%s); it needs a rebuild",
@@ -431,17 +460,30 @@ void Engine::RequireReady(const Entry& e) {
     case State::kPaused: code = kCodeIndexPaused; break;
     case State::kMoving: code = kCodeIndexMoving; break;
     case State::kDamaged: code = kCodeIndexDamaged; break;
+    case State::kRefused: throw EngineError(kCodeStorage, "index " + e.id + ": " + e.refusal);
   }
   throw EngineError(code, "index " + e.id + " " + StateText(code));
+}
+
+void Engine::Refuse(Entry& e, const std::string& why) {
+  e.store.reset();
+  e.state = State::kRefused;
+  e.refusal = why;
+  Publish(e);
 }
 
 void Engine::SetAside(Entry& e, const std::string& why) {
   e.store.reset();
   e.state = State::kDamaged;
   const std::string stamp = ".damaged-" + std::to_string(Env::Current()->Now());
-  for (const std::string& suffix : kStoreFiles) {
-    const std::string file = e.path + "/" + IndexStore::kDbFile + suffix;
-    if (IsFileExist(file)) ::rename(file.c_str(), (file + stamp).c_str());
+  try {
+    const platform::SafeDir folder = OpenStoreDir(e.path, false);
+    for (const std::string& suffix : kStoreFiles) {
+      const std::string name = IndexStore::kDbFile + suffix;
+      if (folder.valid() && folder.Exists(name)) folder.Rename(name, name + stamp);
+    }
+  } catch (const StoreError& err) {
+    Log(LOG_ERR, "%s:%d %s", SourceName(__FILE__), __LINE__, err.what());
   }
   Log(LOG_ERR, "%s:%d index %s in %s is damaged (%s); its files are set aside and it needs a "
       "rebuild", SourceName(__FILE__), __LINE__, e.id.c_str(), e.path.c_str(), why.c_str());
@@ -746,8 +788,26 @@ Json::Value Engine::IndexCreate(const Json::Value& data) {
   std::lock_guard<std::mutex> lock(registry_mu_);
   auto it = indexes_.find(id);
   if (it != indexes_.end()) {
-    // Re-creating an index where it already is keeps it and its documents.
-    if (it->second->path == path) return Json::Value(Json::objectValue);
+    // Re-creating an index where it already is keeps it and its documents; one refused for a
+    // planted entry is tried again, as the entry may be gone by now.
+    if (it->second->path == path) {
+      Entry& old = *it->second;
+      EntryGuard entry_lock(old);
+      if (old.state == State::kRefused) {
+        try {
+          old.store = IndexStore::ExistsIn(path)
+                          ? IndexStore::Open(path)
+                          : IndexStore::Create(path, id, mappings, data["settings"],
+                                               data["event_handler"]);
+        } catch (const UnsafeStoreError& err) {
+          old.refusal = err.what();
+          throw;
+        }
+        old.state = State::kReady;
+        old.refusal.clear();
+      }
+      return Json::Value(Json::objectValue);
+    }
     throw EngineError(kCodeIndexExists, "index " + id + " exists in " + it->second->path);
   }
   for (auto& [other_id, e] : indexes_) {
@@ -756,19 +816,28 @@ Json::Value Engine::IndexCreate(const Json::Value& data) {
   auto e = std::make_shared<Entry>();
   e->id = id;
   e->path = path;
-  if (IndexStore::ExistsIn(path)) {
-    // A store left in the folder (an index re-keyed or a registry lost) is adopted, not
-    // overwritten: its documents are the index's.
-    e->store = IndexStore::Open(path);
-    WriteTxn txn(*e->store);
-    e->store->SetMeta("id", id);
-    txn.Commit();
-    Log(LOG_INFO, "%s:%d index %s adopts the store in %s", SourceName(__FILE__), __LINE__,
-        id.c_str(), path.c_str());
-  } else {
-    e->store = IndexStore::Create(path, id, mappings, data["settings"], data["event_handler"]);
+  try {
+    if (IndexStore::ExistsIn(path)) {
+      // A store left in the folder (an index re-keyed or a registry lost) is adopted, not
+      // overwritten: its documents are the index's.
+      e->store = IndexStore::Open(path);
+      WriteTxn txn(*e->store);
+      e->store->SetMeta("id", id);
+      txn.Commit();
+      Log(LOG_INFO, "%s:%d index %s adopts the store in %s", SourceName(__FILE__), __LINE__,
+          id.c_str(), path.c_str());
+    } else {
+      e->store = IndexStore::Create(path, id, mappings, data["settings"], data["event_handler"]);
+    }
+    e->state = State::kReady;
+  } catch (const UnsafeStoreError& err) {
+    // Kept as refused, so that the index's state tells why; creating it again once the entry
+    // is gone finishes the job.
+    Refuse(*e, err.what());
+    indexes_[id] = e;
+    SaveRegistry();
+    throw;
   }
-  e->state = State::kReady;
   Publish(*e);
   indexes_[id] = e;
   try {
@@ -799,10 +868,16 @@ Json::Value Engine::IndexDelete(const Json::Value& data) {
   EntryGuard lock(*e);
   e->removed = true;
   e->store.reset();
-  for (const std::string& suffix : kStoreFiles) {
-    ::unlink((e->path + "/" + IndexStore::kDbFile + suffix).c_str());
+  try {
+    const platform::SafeDir folder = OpenStoreDir(e->path, false);
+    if (folder.valid()) {
+      for (const std::string& suffix : kStoreFiles) folder.Unlink(IndexStore::kDbFile + suffix);
+    }
+    RemoveStoreDir(e->path);
+  } catch (const UnsafeStoreError& err) {
+    // The index is forgotten either way; what stands in its folder's place is not touched.
+    Log(LOG_ERR, "%s:%d %s", SourceName(__FILE__), __LINE__, err.what());
   }
-  ::rmdir(e->path.c_str());
   Json::Value result;
   result["deleted"] = true;
   return result;
@@ -824,6 +899,9 @@ Json::Value Engine::IndexPause(const Json::Value& data, bool pause) {
       try {
         e->store = IndexStore::Open(e->path);
         e->state = State::kReady;
+      } catch (const UnsafeStoreError& err) {
+        Refuse(*e, err.what());
+        throw;
       } catch (const StoreError& err) {
         if (err.IsCorruption()) {
           SetAside(*e, err.what());
@@ -900,6 +978,8 @@ Json::Value Engine::IndexConfigSet(const Json::Value& data) {
     MoveStoreFiles(old_path, new_path);
   } catch (const EngineError& err) {
     failure = err.what();
+  } catch (const StoreError& err) {
+    failure = err.what();
   }
   {
     EntryGuard lock(*e);
@@ -908,6 +988,9 @@ Json::Value Engine::IndexConfigSet(const Json::Value& data) {
     if (before == State::kReady) {
       try {
         e->store = IndexStore::Open(e->path);
+      } catch (const UnsafeStoreError& err) {
+        Refuse(*e, err.what());
+        failure = err.what();
       } catch (const StoreError& err) {
         HandleStoreFailure(*e, err);
         if (!err.IsCorruption()) e->state = State::kDamaged;
@@ -962,7 +1045,8 @@ Json::Value Engine::ListTermSuggDb() {
 }
 
 Json::Value Engine::IndexList() {
-  static const char* kNames[] = {"opening", "recovering", "ready", "paused", "moving", "damaged"};
+  static const char* kNames[] = {"opening", "recovering", "ready",  "paused",
+                                 "moving",  "damaged",    "refused"};
   Json::Value result(Json::arrayValue);
   std::lock_guard<std::mutex> lock(registry_mu_);
   for (auto& [id, e] : indexes_) {
@@ -971,6 +1055,7 @@ Json::Value Engine::IndexList() {
     item["id"] = id;
     item["path"] = e->path;
     item["state"] = kNames[static_cast<int>(e->state)];
+    if (e->state == State::kRefused) item["error"] = e->refusal;
     if (e->store) item["documents"] = static_cast<Json::Int64>(e->store->DocCount());
     result.append(item);
   }

@@ -81,12 +81,14 @@ class Engine {
   static Json::Value ErrorReply(int code, const std::string& msg);
 
  private:
-  enum class State { kOpening, kRecovering, kReady, kPaused, kMoving, kDamaged };
+  // kRefused: a planted entry stands where the index's folder or files belong (see `refusal`).
+  enum class State { kOpening, kRecovering, kReady, kPaused, kMoving, kDamaged, kRefused };
   struct Entry {
     std::string id;
     std::string path;
     State state = State::kOpening;
     bool removed = false;
+    std::string refusal;  // why the index is refused: the entry's path and what to do
     std::shared_ptr<IndexStore> store;
     std::mutex mu;  // guards everything above; held by a writer for its whole run
     // A copy of state and store for searches, which must not wait for a writer's run.
@@ -137,6 +139,8 @@ class Engine {
   static void RequireReady(const Entry& e);
   // Marks an index damaged after its store reported corruption, and sets its files aside.
   void SetAside(Entry& e, const std::string& why);
+  // Marks the index refused for a planted entry among its files; `why` names it.
+  void Refuse(Entry& e, const std::string& why);
   void HandleStoreFailure(Entry& e, const StoreError& err);
   void SaveRegistry();  // with registry_mu_ held
   void OpenAll(bool after_crash);

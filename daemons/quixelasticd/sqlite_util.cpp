@@ -1,18 +1,62 @@
 #include "daemons/quixelasticd/sqlite_util.hpp"
 
+#include <sys/stat.h>
+#include <syslog.h>
+
+#include <cstring>
+#include <mutex>
+
 #include "common/log.hpp"
 
 namespace orvane {
 namespace elasticd {
 
+namespace {
+
+constexpr const char* kFolderFdVfsName = "orvane-folder-fd";
+
+// The default VFS resolves every link of a name textually, "/proc/self/fd/N" included, which
+// would turn the name back into the folder's path and undo the descriptor's protection. Names
+// here are absolute and clean, so they are kept as they are; a database file that is itself a
+// link is reported so that SQLITE_OPEN_NOFOLLOW refuses it.
+int FullPathnameAsGiven(sqlite3_vfs*, const char* name, int out_size, char* out) {
+  const size_t n = std::strlen(name);
+  if (name[0] != '/' || n + 1 > static_cast<size_t>(out_size)) return SQLITE_CANTOPEN;
+  std::memcpy(out, name, n + 1);
+  struct stat st;
+  if (lstat(name, &st) == 0 && S_ISLNK(st.st_mode)) return SQLITE_OK_SYMLINK;
+  return SQLITE_OK;
+}
+
+}  // namespace
+
+const char* FolderFdVfs() {
+  static std::once_flag once;
+  static sqlite3_vfs vfs;
+  std::call_once(once, [] {
+    sqlite3_vfs* unix_vfs = sqlite3_vfs_find("unix");
+    if (unix_vfs == nullptr) unix_vfs = sqlite3_vfs_find(nullptr);
+    // A copy keeps the default's methods and its private data (which its open and lock code
+    // read through the VFS pointer); only the name and the path resolution differ.
+    vfs = *unix_vfs;
+    vfs.pNext = nullptr;
+    vfs.zName = kFolderFdVfsName;
+    vfs.xFullPathname = FullPathnameAsGiven;
+    const int rc = sqlite3_vfs_register(&vfs, 0);
+    if (rc != SQLITE_OK) Log(LOG_ERR, "cannot register the SQLite VFS: %s", sqlite3_errstr(rc));
+  });
+  return kFolderFdVfsName;
+}
+
 Db::~Db() { Close(); }
 
-void Db::Open(const std::string& file, bool create, bool read_only) {
+void Db::Open(const std::string& file, bool create, bool read_only, const char* vfs) {
   Close();
   int flags = SQLITE_OPEN_NOMUTEX;
+  if (vfs != nullptr) flags |= SQLITE_OPEN_NOFOLLOW;
   flags |= read_only ? SQLITE_OPEN_READONLY : SQLITE_OPEN_READWRITE;
   if (create && !read_only) flags |= SQLITE_OPEN_CREATE;
-  const int rc = sqlite3_open_v2(file.c_str(), &db_, flags, nullptr);
+  const int rc = sqlite3_open_v2(file.c_str(), &db_, flags, vfs);
   if (rc != SQLITE_OK) {
     const std::string msg = db_ != nullptr ? sqlite3_errmsg(db_) : sqlite3_errstr(rc);
     Close();

@@ -29,6 +29,13 @@ class StoreError : public std::runtime_error {
 
 class Stmt;
 
+// The name of a VFS that behaves as the default "unix" one except that it takes a database's
+// name as given instead of resolving its symbolic links. Stores opened as
+// "/proc/self/fd/<folder descriptor>/index.db" then reach their files (the database, its log
+// and shared-memory index) through the folder they verified, whatever the folder's path names
+// by now. Registered on first use; safe from any thread.
+const char* FolderFdVfs();
+
 class Db {
  public:
   Db() = default;
@@ -36,8 +43,9 @@ class Db {
   Db(const Db&) = delete;
   Db& operator=(const Db&) = delete;
 
-  // Opens (creating when `create`) the database file; throws StoreError.
-  void Open(const std::string& file, bool create, bool read_only);
+  // Opens (creating when `create`) the database file; throws StoreError. `vfs` names the
+  // SQLite VFS (nullptr: the default one).
+  void Open(const std::string& file, bool create, bool read_only, const char* vfs = nullptr);
   void Close();
   bool IsOpen() const { return db_ != nullptr; }
   sqlite3* get() const { return db_; }

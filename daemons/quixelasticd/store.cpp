@@ -6,8 +6,10 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstring>
 #include <set>
 
+#include "common/error.hpp"
 #include "common/fd.hpp"
 #include "common/json_util.hpp"
 #include "common/name_codec.hpp"
@@ -128,13 +130,25 @@ Json::Value ParseBody(const std::string& body) {
   return v;
 }
 
-void SyncFile(const std::string& path) {
-  UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+void SyncFile(const platform::SafeDir& folder, const std::string& name) {
+  const std::string path = folder.path() + "/" + name;
+  UniqueFd fd(::openat(folder.fd(), name.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
   if (!fd.valid()) {
     if (errno == ENOENT) return;
     throw StoreError(SQLITE_IOERR, "open " + path + " for sync failed");
   }
   if (::fsync(fd.get()) != 0) throw StoreError(SQLITE_IOERR_FSYNC, "fsync " + path + " failed");
+}
+
+// Runs a check of the system's own files, turning its refusals into the store's.
+template <typename F>
+auto Guarded(F&& f) -> decltype(f()) {
+  try {
+    return f();
+  } catch (const Error& e) {
+    if (e.code == kErrUnsafePath) throw UnsafeStoreError(e.message);
+    throw StoreError(SQLITE_CANTOPEN, e.message);
+  }
 }
 
 // A user's keywords as an FTS query: every word quoted (so that no word is read as an
@@ -227,7 +241,15 @@ bool IsSuggestible(const std::string& term) {
   return term.size() >= 2 && !digits && term.find('"') == std::string::npos;
 }
 
-IndexStore::IndexStore(std::string dir) : dir_(std::move(dir)), file_(dir_ + "/" + kDbFile) {}
+platform::SafeDir OpenStoreDir(const std::string& dir, bool create) {
+  return Guarded([&] { return platform::SafeDir::Open(dir, create); });
+}
+
+IndexStore::IndexStore(std::string dir, platform::SafeDir folder)
+    : dir_(std::move(dir)),
+      file_(dir_ + "/" + kDbFile),
+      folder_(std::move(folder)),
+      open_name_("/proc/self/fd/" + std::to_string(folder_.fd()) + "/" + kDbFile) {}
 
 IndexStore::~IndexStore() {
   cached_.clear();
@@ -235,7 +257,10 @@ IndexStore::~IndexStore() {
   writer_.Close();
 }
 
-bool IndexStore::ExistsIn(const std::string& dir) { return IsFileExist(dir + "/" + kDbFile); }
+bool IndexStore::ExistsIn(const std::string& dir) {
+  const platform::SafeDir folder = OpenStoreDir(dir, false);
+  return folder.valid() && folder.Exists(kDbFile);
+}
 
 Stmt& IndexStore::Cached(const char* sql) {
   std::unique_ptr<Stmt>& st = cached_[sql];
@@ -248,7 +273,7 @@ Stmt& IndexStore::Cached(const char* sql) {
 }
 
 void IndexStore::OpenWriter(bool create) {
-  writer_.Open(file_, create, false);
+  writer_.Open(open_name_, create, false, FolderFdVfs());
   ConfigureWriter(writer_);
 }
 
@@ -257,11 +282,17 @@ std::shared_ptr<IndexStore> IndexStore::Create(const std::string& dir, const std
                                                const Json::Value& settings,
                                                const Json::Value& event_handler) {
   Schema::Parse(mappings);  // refuse a bad schema before anything is written
-  if (!MakeParentDirs(dir + "/" + kDbFile)) {
-    throw StoreError(SQLITE_CANTOPEN, "cannot create folder " + dir);
+  platform::SafeDir folder = OpenStoreDir(dir, true);
+  if (folder.Exists(kDbFile)) {
+    throw EngineError(kCodeIndexExists, "a store already exists in " + dir);
   }
-  if (ExistsIn(dir)) throw EngineError(kCodeIndexExists, "a store already exists in " + dir);
-  std::shared_ptr<IndexStore> s(new IndexStore(dir));
+  // Made here, root-only, so that SQLite's log and shared-memory files, which take the
+  // database's mode, are root-only too.
+  if (!Guarded([&] { return folder.OpenFile(kDbFile, O_RDWR | O_CREAT | O_EXCL); }).valid()) {
+    throw StoreError(SQLITE_CANTOPEN, "cannot create " + dir + "/" + kDbFile + ": " +
+                                          std::strerror(errno));
+  }
+  std::shared_ptr<IndexStore> s(new IndexStore(dir, std::move(folder)));
   s->OpenWriter(true);
   {
     Transaction txn(s->writer_);
@@ -281,13 +312,20 @@ std::shared_ptr<IndexStore> IndexStore::Create(const std::string& dir, const std
   s->LoadSchema();
   s->Sync();
   // The folder entry of the new file must reach the disk too.
-  SyncFile(dir);
+  if (!s->folder_.Sync()) throw StoreError(SQLITE_IOERR_FSYNC, "fsync " + dir + " failed");
   return s;
 }
 
 std::shared_ptr<IndexStore> IndexStore::Open(const std::string& dir) {
-  if (!ExistsIn(dir)) throw EngineError(kCodeIndexNotFound, "no store in " + dir);
-  std::shared_ptr<IndexStore> s(new IndexStore(dir));
+  platform::SafeDir folder = OpenStoreDir(dir, false);
+  if (!folder.valid() || !folder.Exists(kDbFile)) {
+    throw EngineError(kCodeIndexNotFound, "no store in " + dir);
+  }
+  // Files an older installation left readable by everyone are narrowed here, every open.
+  for (const char* suffix : {"", "-wal", "-shm"}) {
+    Guarded([&] { return folder.CheckEntry(std::string(kDbFile) + suffix, false); });
+  }
+  std::shared_ptr<IndexStore> s(new IndexStore(dir, std::move(folder)));
   s->OpenWriter(false);
   s->LoadSchema();
   return s;
@@ -524,8 +562,8 @@ void IndexStore::Sync() {
   // A passive checkpoint never waits for readers; whatever it could not copy stays in the log,
   // which is synced below, so every committed transaction is on disk either way.
   sqlite3_wal_checkpoint_v2(writer_.get(), nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
-  SyncFile(file_ + "-wal");
-  SyncFile(file_);
+  SyncFile(folder_, std::string(kDbFile) + "-wal");
+  SyncFile(folder_, kDbFile);
 }
 
 bool IndexStore::QuickCheck(std::string* detail) {
@@ -559,7 +597,7 @@ std::unique_ptr<Db> IndexStore::TakeReader() {
     }
   }
   auto db = std::make_unique<Db>();
-  db->Open(file_, false, false);
+  db->Open(open_name_, false, false, FolderFdVfs());
   db->Exec("PRAGMA query_only=1");
   db->Exec("PRAGMA cache_size=-16384");
   db->Exec(kMmapPragma);

@@ -22,6 +22,7 @@
 #include "daemons/quixelasticd/query_guard.hpp"
 #include "daemons/quixelasticd/schema.hpp"
 #include "daemons/quixelasticd/sqlite_util.hpp"
+#include "platform/safe_dir.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -59,6 +60,17 @@ struct SearchPage {
   std::vector<Json::Value> hits;
 };
 
+// An index folder or file that is not the system's own (a planted link, a foreign owner): the
+// store is refused rather than damaged. The text names the path and what to do.
+class UnsafeStoreError : public StoreError {
+ public:
+  explicit UnsafeStoreError(const std::string& what) : StoreError(SQLITE_CANTOPEN, what) {}
+};
+
+// Opens the index folder `dir` without following links (see platform::SafeDir), made with mode
+// 0700 when `create`; invalid when missing. Throws UnsafeStoreError or StoreError.
+platform::SafeDir OpenStoreDir(const std::string& dir, bool create);
+
 // Decides whether the asking user may see the file at a full path.
 using VisibleFn = std::function<bool(const std::string& path)>;
 
@@ -77,8 +89,10 @@ class IndexStore {
                                             const Json::Value& mappings,
                                             const Json::Value& settings,
                                             const Json::Value& event_handler);
-  // Opens the existing store in `dir`. Throws StoreError (damaged, unreadable) or EngineError.
+  // Opens the existing store in `dir`, narrowing the modes of its files (0600). Throws
+  // StoreError (damaged, unreadable, UnsafeStoreError when refused) or EngineError.
   static std::shared_ptr<IndexStore> Open(const std::string& dir);
+  // Throws UnsafeStoreError when a planted entry stands in the way.
   static bool ExistsIn(const std::string& dir);
 
   ~IndexStore();
@@ -126,7 +140,7 @@ class IndexStore {
                                    const VisibleFn& visible, QueryGuard* guard = nullptr);
 
  private:
-  explicit IndexStore(std::string dir);
+  IndexStore(std::string dir, platform::SafeDir folder);
   void OpenWriter(bool create);
   void LoadSchema();
   std::unique_ptr<Db> TakeReader();
@@ -141,6 +155,10 @@ class IndexStore {
 
   std::string dir_;
   std::string file_;
+  // The verified folder, open for the store's whole life: SQLite reaches the files through it
+  // by `open_name_` ("/proc/self/fd/<fd>/index.db").
+  platform::SafeDir folder_;
+  std::string open_name_;
   Schema schema_;
   Db writer_;
   std::map<const char*, std::unique_ptr<Stmt>> cached_;

@@ -460,7 +460,17 @@ void Watcher::FinishMoves() {
 void Watcher::Flush() {
   for (auto it = pending_.begin(); it != pending_.end();) {
     const std::string& queue = it->first;
-    if (it->second.empty() || fileindex::QueueFileAppend(queue, it->second)) {
+    bool appended = false;
+    bool refused = false;
+    try {
+      appended = it->second.empty() || fileindex::QueueFileAppend(queue, it->second);
+    } catch (const Error& e) {
+      // A planted entry where the queue belongs: the refusal is logged where it is found, once.
+      refused = e.code == kErrUnsafePath;
+      if (!refused) Log(LOG_ERR, "%s:%d %s", SourceName(__FILE__), __LINE__, e.what());
+      errno = 0;
+    }
+    if (appended) {
       if (no_space_.erase(queue) != 0) {
         Log(LOG_INFO, "%s:%d queue %s can be written again: its folders are reconciled",
             SourceName(__FILE__), __LINE__, queue.c_str());
@@ -481,7 +491,7 @@ void Watcher::Flush() {
         fileindex::SendZRMNotify();
       }
       it->second = ReconcileLines(queue);
-    } else {
+    } else if (!refused) {
       // Kept and tried again on the next pass; Emit() bounds what is kept.
       Log(LOG_ERR, "%s:%d cannot append to queue %s [err: %m]", SourceName(__FILE__), __LINE__,
           queue.c_str());

@@ -658,6 +658,7 @@ std::string ShareState(const Json::Value& summary, const Json::Value& worker,
                     ", " + std::to_string(worker["reconciling"]["compared"].asUInt64()) +
                     " entries compared");
   }
+  if (!worker["unsafe"].asString().empty()) notes.push_back("refused: unsafe index files");
   const std::string engine = index["state"].asString();
   if (!engine.empty() && engine != "ready") notes.push_back("index " + engine);
   std::string text;
