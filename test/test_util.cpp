@@ -1,11 +1,14 @@
 #include "test/test_util.hpp"
 
+#include <fcntl.h>
 #include <ftw.h>
 #include <grp.h>
 #include <pwd.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
@@ -150,6 +153,18 @@ int RunAsUser(const std::string& user, const std::function<int()>& fn) {
     return -1;
   }
   return WEXITSTATUS(status);
+}
+
+std::string MakeOpenShare(const TempDir& dir, const std::string& rel) {
+  const std::string path = dir.Path(rel);
+  if (mkdir(path.c_str(), 0777) != 0 && errno != EEXIST) return path;
+  chmod(path.c_str(), 0777);
+  chmod(dir.path().c_str(), 0711);
+  return path;
+}
+
+int RenameExchange(const std::string& a, const std::string& b) {
+  return renameat2(AT_FDCWD, a.c_str(), AT_FDCWD, b.c_str(), RENAME_EXCHANGE);
 }
 
 ScopedRoot::ScopedRoot(const std::string& root) {

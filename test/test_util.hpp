@@ -97,6 +97,13 @@ class FakeEnv : public Env {
 // cannot switch: `fn` then runs in a child as the caller, who is unprivileged already.
 int RunAsUser(const std::string& user, const std::function<int()>& fn);
 
+// Makes `dir`/`rel` a share root every user may write (0777), with `dir` searchable by all
+// (0711), as a hostile local user meets a share open to everyone. Returns its path.
+std::string MakeOpenShare(const TempDir& dir, const std::string& rel);
+
+// renameat2(RENAME_EXCHANGE) of two paths: 0 or -1 with errno set.
+int RenameExchange(const std::string& a, const std::string& b);
+
 // Sets ORVANE_ROOT for its lifetime and restores the former value.
 class ScopedRoot {
  public:

@@ -1,0 +1,149 @@
+#include "platform/safe_dir.hpp"
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "common/util.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace platform {
+namespace {
+
+mode_t Mode(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
+}
+
+// `fn` run as nobody; true when it returned 0.
+bool AsNobody(const std::function<int()>& fn) { return test::RunAsUser("nobody", fn) == 0; }
+
+TEST(SafeDirTest, MakesRootOnlyFoldersAndFilesAndNarrowsOlderOnes) {
+  test::TempDir dir;
+  const std::string share = test::MakeOpenShare(dir, "share");
+  const std::string fi = share + "/@eaDir/@fileindex";
+  {
+    const SafeDir folder = SafeDir::Open(fi, true);
+    ASSERT_TRUE(folder.valid());
+    EXPECT_EQ(folder.path(), fi);
+    EXPECT_TRUE(folder.OpenFile("queue", O_WRONLY | O_CREAT).valid());
+  }
+  EXPECT_EQ(Mode(share), 0777u);  // the share itself is the administrator's
+  EXPECT_EQ(Mode(share + "/@eaDir"), 0700u);
+  EXPECT_EQ(Mode(fi), 0700u);
+  EXPECT_EQ(Mode(fi + "/queue"), 0600u);
+
+  // What an older installation left: folders 0755, files 0644 or writable by everyone.
+  ASSERT_EQ(mkdir((fi + "/db").c_str(), 0755), 0);
+  dir.Write("share/@eaDir/@fileindex/db/index.db", "x");
+  ASSERT_EQ(chmod((fi + "/db/index.db").c_str(), 0666), 0);
+  ASSERT_EQ(chmod((share + "/@eaDir").c_str(), 0755), 0);
+  ASSERT_EQ(chmod(fi.c_str(), 0755), 0);
+  ASSERT_EQ(chmod((fi + "/queue").c_str(), 0644), 0);
+  const SafeDir db = SafeDir::Open(fi + "/db", false);
+  ASSERT_TRUE(db.valid());
+  EXPECT_TRUE(db.CheckEntry("index.db", false));
+  EXPECT_FALSE(db.CheckEntry("index.db-wal", false));
+  EXPECT_TRUE(SafeDir::Open(fi, false).CheckEntry("queue", false));
+  for (const char* rel : {"/@eaDir", "/@eaDir/@fileindex", "/@eaDir/@fileindex/db"}) {
+    EXPECT_EQ(Mode(share + rel), 0700u) << rel;
+  }
+  EXPECT_EQ(Mode(fi + "/db/index.db"), 0600u);
+  EXPECT_EQ(Mode(fi + "/queue"), 0600u);
+
+  // Without `create` nothing missing is made.
+  EXPECT_FALSE(SafeDir::Open(share + "/@eaDir/other/db", false).valid());
+  EXPECT_FALSE(IsFileExist(share + "/@eaDir/other"));
+}
+
+// A user who may write the share plants each entry the system owns in turn; every one is
+// refused with its path, logged once, and nothing is written where it points.
+TEST(SafeDirTest, PlantedEntriesAreRefusedWithTheirPath) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act as nobody";
+  test::TempDir dir;
+  test::LogCapture log;
+  const std::string share = test::MakeOpenShare(dir, "share");
+  const std::string secret = dir.Write("secret/file", "root only\n");
+  const std::string fi = share + "/@eaDir/@fileindex";
+  auto refusal = [](const std::function<void()>& fn) { return test::ErrorOf(fn); };
+
+  ASSERT_TRUE(AsNobody([&] { return symlink(Dirname(secret).c_str(), (share + "/@eaDir").c_str()); }));
+  for (int i = 0; i < 2; ++i) {
+    const Error e = refusal([&] { SafeDir::Open(fi, true); });
+    EXPECT_EQ(e.code, kErrUnsafePath);
+    EXPECT_NE(e.message.find(share + "/@eaDir: it is a symbolic link"), std::string::npos)
+        << e.message;
+    EXPECT_NE(e.message.find("move it aside or remove it"), std::string::npos);
+  }
+  EXPECT_EQ(log.Count("unsafe index file " + share + "/@eaDir"), 1);
+  EXPECT_FALSE(IsFileExist(Dirname(secret) + "/@fileindex"));
+
+  // A real folder, but the planter's.
+  ASSERT_EQ(unlink((share + "/@eaDir").c_str()), 0);
+  ASSERT_TRUE(AsNobody([&] { return mkdir((share + "/@eaDir").c_str(), 0777); }));
+  EXPECT_NE(refusal([&] { SafeDir::Open(fi, true); }).message.find("owned by uid 65534"),
+            std::string::npos);
+  ASSERT_EQ(rmdir((share + "/@eaDir").c_str()), 0);
+
+  // Links and a FIFO planted in a folder an older installation left open to everyone: the
+  // folder is narrowed, the entries refused, and the FIFO does not block the open.
+  ASSERT_TRUE(SafeDir::Open(fi, true).valid());
+  ASSERT_EQ(chmod((share + "/@eaDir").c_str(), 0755), 0);
+  ASSERT_EQ(chmod(fi.c_str(), 0777), 0);
+  ASSERT_TRUE(AsNobody([&] {
+    return symlink(secret.c_str(), (fi + "/queue").c_str()) |
+           mkfifo((fi + "/queue.tmp").c_str(), 0666) |
+           symlink(Dirname(secret).c_str(), (fi + "/db").c_str());
+  }));
+  const SafeDir folder = SafeDir::Open(fi, false);
+  EXPECT_EQ(Mode(share + "/@eaDir"), 0700u);
+  EXPECT_EQ(Mode(fi), 0700u);
+  EXPECT_NE(refusal([&] { folder.OpenFile("queue", O_WRONLY | O_APPEND | O_CREAT); })
+                .message.find(fi + "/queue: it is a symbolic link"),
+            std::string::npos);
+  EXPECT_NE(refusal([&] { folder.CheckEntry("queue.tmp", false); })
+                .message.find(fi + "/queue.tmp: it is a special file"),
+            std::string::npos);
+  EXPECT_THROW(folder.Sub("db", true), Error);
+  EXPECT_EQ(test::ReadFile(secret), "root only\n");
+  EXPECT_EQ(Mode(secret), 0644u);
+}
+
+// A folder swapped away after it was opened: the holder keeps writing to the real one, and the
+// next open meets the swapped-in folder and refuses it.
+TEST(SafeDirTest, AnExchangedFolderIsNeverWrittenThrough) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act as nobody";
+  test::TempDir dir;
+  const std::string share = test::MakeOpenShare(dir, "share");
+  const SafeDir held = SafeDir::Open(share + "/@eaDir/@fileindex", true);
+  ASSERT_TRUE(AsNobody([&] {
+    return mkdir((share + "/bait").c_str(), 0777) |
+           mkdir((share + "/bait/@fileindex").c_str(), 0777) |
+           test::RenameExchange(share + "/@eaDir", share + "/bait");
+  }));
+  EXPECT_TRUE(held.OpenFile("queue", O_WRONLY | O_CREAT).valid());
+  EXPECT_TRUE(IsFileExist(share + "/bait/@fileindex/queue"));  // the real folder, moved
+  EXPECT_FALSE(IsFileExist(share + "/@eaDir/@fileindex/queue"));
+  const Error e = test::ErrorOf([&] { SafeDir::Open(share + "/@eaDir/@fileindex", true); });
+  EXPECT_EQ(e.code, kErrUnsafePath);
+}
+
+TEST(SafeDirTest, RemoveTreeNeverFollowsALink) {
+  test::TempDir dir;
+  const std::string keep = dir.Write("outside/keep", "k");
+  dir.Write("share/@eaDir/@fileindex/db/index.db", "x");
+  const std::string db = dir.Path("share/@eaDir/@fileindex/db");
+  ASSERT_EQ(symlink(Dirname(keep).c_str(), (db + "/escape").c_str()), 0);
+  const SafeDir folder = SafeDir::Open(Dirname(db), false);
+  ASSERT_TRUE(folder.valid());
+  EXPECT_EQ(folder.RemoveTree("db"), 0);
+  EXPECT_EQ(folder.RemoveTree("db"), 0);  // gone already
+  EXPECT_FALSE(IsFileExist(db));
+  EXPECT_EQ(test::ReadFile(keep), "k");
+}
+
+}  // namespace
+}  // namespace platform
+}  // namespace orvane
