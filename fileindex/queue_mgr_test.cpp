@@ -5,6 +5,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdlib>
 #include <set>
 
 #include "common/error.hpp"
@@ -81,7 +82,8 @@ TEST_F(QueueMgrTest, RenameAndOpenFailuresAre502AndLeaveTheFiles) {
     QueueMgr other(dir_.Path("other"));
     // A bit per failed check.
     return fails([&] { mgr.PrepareTmpQueue(); },
-                 "Orvane error, code=502, reason=[rename failed, reason=Permission denied]") +
+                 "Orvane error, code=502, reason=[cannot rename " + queue_ + " to " + queue_ +
+                     ".tmp: Permission denied]") +
            2 * fails([&] { other.ProcessOP([](std::shared_ptr<OP>) {}, true); }, open_failed) +
            4 * fails([&] { other.IsFullPathProcessing("/v/s/a"); }, open_failed);
   });
@@ -89,6 +91,37 @@ TEST_F(QueueMgrTest, RenameAndOpenFailuresAre502AndLeaveTheFiles) {
   EXPECT_EQ(result, 0);
   EXPECT_TRUE(IsFileExist(queue_));
   EXPECT_FALSE(IsFileExist(queue_ + ".tmp"));
+}
+
+// A user who may write the share root plants the queue's folders with the queue a link to a
+// root-only file: neither the watcher's append nor the indexer's batch goes through it. Once
+// the planted folder is gone, the system makes its own, root-only.
+TEST_F(QueueMgrTest, APlantedQueueIsNeitherWrittenNorRead) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act as nobody";
+  const std::string share = test::MakeOpenShare(dir_, "share");
+  const std::string secret = dir_.Write("secret", "root only\n");
+  ASSERT_EQ(chmod(secret.c_str(), 0600), 0);
+  ASSERT_EQ(0, test::RunAsUser("nobody", [&] {
+    return mkdir((share + "/@eaDir").c_str(), 0777) |
+           mkdir((share + "/@eaDir/@fileindex").c_str(), 0777) |
+           symlink(secret.c_str(), queue_.c_str());
+  }));
+  EXPECT_THAT([&] { QueueFileAppend(queue_, Line(2, "/v/s/a")); }, ThrowsCode(kErrUnsafePath));
+  QueueMgr mgr(queue_);
+  EXPECT_THAT([&] { mgr.PrepareTmpQueue(); }, ThrowsCode(kErrUnsafePath));
+  EXPECT_THAT([&] { QueueFileReader reader(queue_); }, ThrowsCode(kErrUnsafePath));
+  EXPECT_EQ(test::ReadFile(secret), "root only\n");
+
+  ASSERT_EQ(std::system(("rm -rf '" + share + "/@eaDir'").c_str()), 0);
+  ASSERT_TRUE(QueueFileAppend(queue_, Line(2, "/v/s/a")));
+  mgr.PrepareTmpQueue();
+  struct stat st;
+  for (const std::string& path : {share + "/@eaDir", Dirname(queue_), queue_ + ".tmp"}) {
+    ASSERT_EQ(lstat(path.c_str(), &st), 0) << path;
+    EXPECT_EQ(st.st_uid, 0u) << path;
+    EXPECT_EQ(st.st_mode & 07777, S_ISDIR(st.st_mode) ? 0700u : 0600u) << path;
+  }
+  EXPECT_EQ(Paths(mgr, true), std::vector<std::string>{"/v/s/a"});
 }
 
 TEST_F(QueueMgrTest, RenameWaitsForTheWritersLock) {

@@ -81,18 +81,10 @@ void Worker::Start() {
   // The queue's folder is watched rather than the file: the file is renamed away on every pass
   // and created again by the next append. Making sure of the folder first also narrows the
   // modes an older installation left; a refusal is reported by every pass until it is resolved.
-  bool safe = true;
   try {
     CheckSystemFiles();
   } catch (const Error& e) {
-    safe = false;
     RecordFailure(e);
-  }
-  if (!safe || inotify_add_watch(inotify_.get(), Dirname(queue_path_).c_str(),
-                                 IN_MODIFY | IN_CLOSE_WRITE | IN_CREATE | IN_MOVED_TO |
-                                     IN_ONLYDIR | IN_DONT_FOLLOW) < 0) {
-    Log(LOG_WARNING, "fileindexd: cannot watch the queue folder of %s: %m; polling it",
-        share_.c_str());
   }
   stop_.store(false);
   thread_ = std::thread([this] { Run(); });
@@ -221,6 +213,17 @@ void Worker::CheckSystemFiles() {
   const platform::SafeDir dir = platform::SafeDir::Open(Dirname(queue_path_), true);
   dir.CheckEntry(Basename(queue_path_), false);
   dir.CheckEntry(Basename(queue_path_) + ".tmp", false);
+  // The watch is set once the folder is known to be the system's own (a refused one is not
+  // watched, and is polled until it is resolved).
+  if (!watch_tried_ && inotify_.valid()) {
+    watch_tried_ = true;
+    if (inotify_add_watch(inotify_.get(), dir.path().c_str(),
+                          IN_MODIFY | IN_CLOSE_WRITE | IN_CREATE | IN_MOVED_TO | IN_ONLYDIR |
+                              IN_DONT_FOLLOW) < 0) {
+      Log(LOG_WARNING, "fileindexd: cannot watch the queue folder of %s: %m; polling it",
+          share_.c_str());
+    }
+  }
   std::lock_guard<std::mutex> lock(mu_);
   unsafe_.clear();
 }

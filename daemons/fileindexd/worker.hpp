@@ -110,6 +110,9 @@ class Worker {
   UniqueFd wake_read_;
   UniqueFd wake_write_;
   UniqueFd inotify_;
+  // The queue folder's watch was set up (or failed for good); touched by Start() before the
+  // thread runs and by passes after.
+  bool watch_tried_ = false;
   std::atomic<bool> stop_{false};
   std::atomic<bool> woken_{false};  // set by Wake; ends a pass's back-off
   std::thread thread_;

@@ -3,6 +3,7 @@
 // connection, a full volume) come from a scripted engine.
 #include "daemons/fileindexd/worker.hpp"
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -355,6 +356,35 @@ TEST_F(ScriptedEngineTest, AFullVolumeFlagsTheShareAndNotifiesOnce) {
   EXPECT_TRUE(worker_.Report()["out_of_space"].asBool()) << worker_.Report();
   EXPECT_EQ(1, platform::CallCount("QLIBCExecl"));
   // The share's flag in the status file is the library's commit's to set, and checked there.
+}
+
+// "@eaDir" planted in a share open to everyone as a link to a root-only folder: the worker's
+// report says why the share is not indexed, naming the entry, until the link is removed; then
+// the worker makes the queue's folders itself, root-only.
+TEST_F(ShareTest, APlantedQueueFolderIsReportedUntilItIsGone) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act as nobody";
+  const std::string share = sys_.Vol("docs");
+  ASSERT_EQ(chmod(Dirname(share).c_str(), 0711), 0);
+  ASSERT_EQ(chmod(share.c_str(), 0777), 0);
+  orvane::test::TempDir secret;
+  ASSERT_EQ(0, orvane::test::RunAsUser("nobody", [&] {
+    return symlink(secret.path().c_str(), (share + "/@eaDir").c_str());
+  }));
+  worker_.Start();
+  const Json::Value report = worker_.Report();
+  EXPECT_THAT(report["unsafe"].asString(),
+              ::testing::HasSubstr(share + "/@eaDir: it is a symbolic link"));
+  EXPECT_EQ(report["last_error"], report["unsafe"]);
+  EXPECT_GE(report["errors"].asUInt64(), 1u);
+  EXPECT_FALSE(IsFileExist(secret.Path("@fileindex")));
+
+  ASSERT_EQ(unlink((share + "/@eaDir").c_str()), 0);
+  EXPECT_TRUE(test::WaitFor([&] { return worker_.Report()["unsafe"].asString().empty(); },
+                            20000));
+  struct stat st;
+  ASSERT_EQ(lstat(Dirname(sys_.Queue("docs")).c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0700u);
+  EXPECT_TRUE(IsFileExist(share + "/@eaDir") && !IsFileExist(secret.Path("@fileindex")));
 }
 
 }  // namespace

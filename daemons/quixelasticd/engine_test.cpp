@@ -1,9 +1,11 @@
 #include "daemons/quixelasticd/engine.hpp"
 
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdlib>
 #include <fstream>
 
 #include <gmock/gmock.h>
@@ -320,6 +322,92 @@ TEST_F(EngineTest, SearchStopsAtItsBudgetOrWhenItsClientHangsUp) {
   EXPECT_EQ(CodeOf(r), kCodeSearchTooLong);
   EXPECT_EQ(r["error"]["msg"].asString().rfind("the search took longer than 1 s", 0), 0u)
       << JsonToString(r);
+}
+
+mode_t Mode(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
+}
+
+const char kShareDb[] = "share/@eaDir/@fileindex/db";
+
+// A user who may write the share root plants the index folder as a link to a root-only folder
+// before the share is indexed: the index is refused with the path, nothing is made where the
+// link points, and the index is made root-only once the planted folders are gone. Modes an
+// older installation left are narrowed when the index opens.
+TEST_F(EngineTest, APlantedIndexFolderIsRefusedUntilItIsGone) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act as nobody";
+  const std::string share = orvane::test::MakeOpenShare(dir_, "share");
+  const std::string secret = dir_.Path("secret");
+  ASSERT_EQ(mkdir(secret.c_str(), 0700), 0);
+  ASSERT_EQ(0, orvane::test::RunAsUser("nobody", [&] {
+    return mkdir((share + "/@eaDir").c_str(), 0777) |
+           mkdir((share + "/@eaDir/@fileindex").c_str(), 0777) |
+           symlink(secret.c_str(), dir_.Path(kShareDb).c_str());
+  }));
+  const Json::Value refused = Create(kId, kShareDb);
+  EXPECT_EQ(CodeOf(refused), kCodeStorage);
+  EXPECT_THAT(refused["error"]["msg"].asString(),
+              HasSubstr("unsafe index file " + share + "/@eaDir: it is owned by uid 65534"));
+  Json::Value list = Send(Cmd("index_list", Json::Value(Json::objectValue)));
+  ASSERT_EQ(list["data"].size(), 1u);
+  EXPECT_EQ(list["data"][0]["state"], "refused");
+  EXPECT_THAT(list["data"][0]["error"].asString(), HasSubstr(share + "/@eaDir"));
+  EXPECT_EQ(CodeOf(Send(Upsert("/v/share/a.txt"))), kCodeStorage);
+  EXPECT_EQ(std::system(("ls -A '" + secret + "' | grep -q .").c_str()) == 0, false);
+
+  ASSERT_EQ(std::system(("rm -rf '" + share + "/@eaDir'").c_str()), 0);
+  ASSERT_EQ(CodeOf(Create(kId, kShareDb)), 0);
+  ASSERT_EQ(CodeOf(Send(Upsert("/v/share/a.txt"))), 0);
+  ASSERT_EQ(CodeOf(Send(OnIndex("commit"))), 0);
+  const std::string db = dir_.Path(kShareDb);
+  for (const std::string& rel : {"/@eaDir", "/@eaDir/@fileindex", "/@eaDir/@fileindex/db"}) {
+    EXPECT_EQ(Mode(share + rel), 0700u) << rel;
+  }
+  for (const char* file : {"/index.db", "/index.db-wal", "/index.db-shm"}) {
+    EXPECT_EQ(Mode(db + file), 0600u) << file;
+  }
+
+  engine_.reset();
+  ASSERT_EQ(chmod((share + "/@eaDir").c_str(), 0755), 0);
+  ASSERT_EQ(chmod(db.c_str(), 0755), 0);
+  ASSERT_EQ(chmod((db + "/index.db").c_str(), 0644), 0);
+  StartEngine();
+  EXPECT_EQ(HitPaths(Send(Query("term", "/v/share/a.txt"))),
+            std::vector<std::string>{"/v/share/a.txt"});
+  EXPECT_EQ(Mode(share + "/@eaDir"), 0700u);
+  EXPECT_EQ(Mode(db), 0700u);
+  EXPECT_EQ(Mode(db + "/index.db"), 0600u);
+}
+
+// The index folder's path swapped under a running engine (renameat2 RENAME_EXCHANGE of
+// "@eaDir" by a user who may write the share root): the engine keeps working in its own
+// folder, readers opened after the swap included, and writes nothing into the swapped-in one.
+// At the next start the swapped-in folder is refused.
+TEST_F(EngineTest, TheIndexFollowsItsFolderNotItsPath) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act as nobody";
+  const std::string share = orvane::test::MakeOpenShare(dir_, "share");
+  ASSERT_EQ(CodeOf(Create(kId, kShareDb)), 0);
+  ASSERT_EQ(CodeOf(Send(Upsert("/v/share/before.txt"))), 0);
+  ASSERT_EQ(CodeOf(Send(OnIndex("commit"))), 0);
+  ASSERT_EQ(0, orvane::test::RunAsUser("nobody", [&] {
+    return mkdir((share + "/bait").c_str(), 0777) |
+           mkdir((share + "/bait/@fileindex").c_str(), 0777) |
+           mkdir((share + "/bait/@fileindex/db").c_str(), 0777) |
+           orvane::test::RenameExchange(share + "/@eaDir", share + "/bait");
+  }));
+  EXPECT_THAT(Found(R"({"name": "before"})"), ElementsAre("before.txt"));
+  ASSERT_EQ(CodeOf(Send(Upsert("/v/share/after.txt"))), 0);
+  ASSERT_EQ(CodeOf(Send(OnIndex("commit"))), 0);
+  EXPECT_THAT(Found(R"({"name": "after"})"), ElementsAre("after.txt"));
+  EXPECT_EQ(std::system(("ls -A '" + dir_.Path(kShareDb) + "' | grep -q .").c_str()) == 0, false);
+  EXPECT_TRUE(IsFileExist(share + "/bait/@fileindex/db/index.db"));
+
+  engine_.reset();
+  StartEngine();
+  const Json::Value list = Send(Cmd("index_list", Json::Value(Json::objectValue)));
+  EXPECT_EQ(list["data"][0]["state"], "refused");
+  EXPECT_THAT(list["data"][0]["error"].asString(), HasSubstr(share + "/@eaDir"));
 }
 
 }  // namespace
