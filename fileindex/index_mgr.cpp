@@ -169,12 +169,16 @@ void GetOptional(unsigned int& out, const Json::Value& request, const std::strin
 
 // The number of lines in a queue file; 0 when there is none.
 size_t CountQueueLines(const std::string& path) {
-  QueueFileReader reader(path);
-  if (!reader) return 0;
-  size_t count = 0;
-  std::string line;
-  while (reader.ReadLine(&line, kMaxEventLineLength)) ++count;
-  return count;
+  try {
+    QueueFileReader reader(path);
+    if (!reader) return 0;
+    size_t count = 0;
+    std::string line;
+    while (reader.ReadLine(&line, kMaxEventLineLength)) ++count;
+    return count;
+  } catch (const Error&) {
+    return 0;  // a refused queue is the worker's to report; the summary still answers
+  }
 }
 
 std::string ComposeIndexPath(int (*compose)(const char*, char*, size_t),

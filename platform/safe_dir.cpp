@@ -145,7 +145,7 @@ SystemPathSplit SplitSystemPath(const std::string& path) {
     if (end > pos) parts.push_back(path.substr(pos, end - pos));
     pos = end + 1;
   }
-  size_t first_owned = parts.empty() ? 0 : parts.size() - 1;
+  size_t first_owned = parts.size();
   for (size_t i = 0; i < parts.size(); ++i) {
     if (parts[i] == kSystemDir) {
       first_owned = i;
@@ -163,8 +163,11 @@ SafeDir SafeDir::Open(const std::string& path, bool create) {
     throw Error(kErrInvalidParam, "not an absolute path: " + path);
   }
   const SystemPathSplit split = SplitSystemPath(path);
-  // The trusted part is the share's own path: made like any other folder when missing.
-  if (create && !split.owned.empty()) MakeParentDirs(Join(split.trusted, split.owned[0]));
+  // The trusted part is the administrator's (the share's own path): made like any other folder
+  // when missing, and never narrowed.
+  if (create) {
+    MakeParentDirs(Join(split.trusted, split.owned.empty() ? "" : split.owned[0]));
+  }
   UniqueFd fd(open(split.trusted.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (!fd.valid()) {
     if (errno == ENOENT && !create) return SafeDir();
@@ -180,7 +183,7 @@ SafeDir SafeDir::Open(const std::string& path, bool create) {
     }
     fd = std::move(next);
   }
-  return SafeDir(std::move(fd), at);
+  return SafeDir(std::move(fd), at, !split.owned.empty());
 }
 
 UniqueFd SafeDir::OpenFile(const std::string& name, int flags) const {
@@ -188,10 +191,12 @@ UniqueFd SafeDir::OpenFile(const std::string& name, int flags) const {
   UniqueFd fd(openat(fd_.get(), name.c_str(), flags | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK,
                      kFileMode));
   if (!fd.valid()) {
-    if (errno == ELOOP || errno == ENXIO || errno == EISDIR) OpenFailed(fd_.get(), name, path, false);
+    if (owned_ && (errno == ELOOP || errno == ENXIO || errno == EISDIR)) {
+      OpenFailed(fd_.get(), name, path, false);
+    }
     return fd;
   }
-  CheckOpened(fd.get(), path, false);
+  if (owned_) CheckOpened(fd.get(), path, false);
   // Regular files only from here on: the flag was there to keep a planted FIFO from blocking.
   const int fl = fcntl(fd.get(), F_GETFL);
   if (fl >= 0) (void)fcntl(fd.get(), F_SETFL, fl & ~O_NONBLOCK);
@@ -211,7 +216,7 @@ SafeDir SafeDir::Sub(const std::string& name, bool create) const {
   const std::string path = Join(path_, name);
   UniqueFd fd = OpenOwnedDir(fd_.get(), name, path, create);
   if (!fd.valid()) return SafeDir();
-  return SafeDir(std::move(fd), path);
+  return SafeDir(std::move(fd), path, true);
 }
 
 bool SafeDir::Exists(const std::string& name) const {

@@ -19,7 +19,8 @@ namespace platform {
 
 // Where a path of the system's own splits: `trusted` is followed as the administrator wrote it,
 // `owned` are the components below it that the system owns. The owned part begins at the first
-// "@eaDir" component; a path without one owns only its last component.
+// "@eaDir" component; a path without one (a scratch or administrator-chosen folder) is trusted
+// whole.
 struct SystemPathSplit {
   std::string trusted;
   std::vector<std::string> owned;
@@ -33,7 +34,8 @@ class SafeDir {
   SafeDir& operator=(SafeDir&&) = default;
 
   // Opens the folder `path` (absolute). With `create`, missing owned folders are made with mode
-  // 0700; without, a missing one gives an invalid SafeDir (errno ENOENT). A symbolic link, a
+  // 0700 (a missing trusted part 0755); without, a missing one gives an invalid SafeDir (errno
+  // ENOENT). A symbolic link, a
   // non-folder, a wrong owner or a mode that cannot be tightened is refused with
   // Error(kErrUnsafePath) naming the entry and what to do (logged once per entry); other
   // failures are Error(kErrSystem).
@@ -44,8 +46,9 @@ class SafeDir {
   const std::string& path() const { return path_; }
 
   // Opens the regular file `name` in this folder with `flags` (O_NOFOLLOW and O_CLOEXEC are
-  // added; a created file gets mode 0600). The file is checked and tightened like the folders;
-  // it must have no other name (hard link). An invalid descriptor with errno set (ENOENT when
+  // added; a created file gets mode 0600). In an owned folder the file is checked and narrowed
+  // like the folders, and must have no other name (hard link); in a trusted one it is taken as
+  // it is. An invalid descriptor with errno set (ENOENT when
   // missing) on a plain failure; throws Error(kErrUnsafePath) on a refusal.
   UniqueFd OpenFile(const std::string& name, int flags) const;
   // Checks and tightens the entry `name` when it exists (a file, or with `dir` a folder); false
@@ -70,10 +73,12 @@ class SafeDir {
   bool Sync() const;
 
  private:
-  SafeDir(UniqueFd fd, std::string path) : fd_(std::move(fd)), path_(std::move(path)) {}
+  SafeDir(UniqueFd fd, std::string path, bool owned)
+      : fd_(std::move(fd)), path_(std::move(path)), owned_(owned) {}
 
   UniqueFd fd_;
   std::string path_;
+  bool owned_ = false;
 };
 
 }  // namespace platform

@@ -53,6 +53,14 @@ TEST(SafeDirTest, MakesRootOnlyFoldersAndFilesAndNarrowsOlderOnes) {
   EXPECT_EQ(Mode(fi + "/db/index.db"), 0600u);
   EXPECT_EQ(Mode(fi + "/queue"), 0600u);
 
+  // A folder outside "@eaDir" is the administrator's: used as it is, never narrowed.
+  const std::string plain = dir.Write("plain/file", "x");
+  ASSERT_EQ(chmod(Dirname(plain).c_str(), 0755), 0);
+  const SafeDir trusted = SafeDir::Open(Dirname(plain), true);
+  EXPECT_TRUE(trusted.OpenFile("file", O_RDONLY).valid());
+  EXPECT_EQ(Mode(Dirname(plain)), 0755u);
+  EXPECT_EQ(Mode(plain), 0644u);
+
   // Without `create` nothing missing is made.
   EXPECT_FALSE(SafeDir::Open(share + "/@eaDir/other/db", false).valid());
   EXPECT_FALSE(IsFileExist(share + "/@eaDir/other"));
