@@ -63,7 +63,7 @@ TEST(SafeDirTest, MakesRootOnlyFoldersAndFilesAndNarrowsOlderOnes) {
 
   // Without `create` nothing missing is made.
   EXPECT_FALSE(SafeDir::Open(share + "/@eaDir/other/db", false).valid());
-  EXPECT_FALSE(IsFileExist(share + "/@eaDir/other"));
+  EXPECT_FALSE(IsDirExist(share + "/@eaDir/other", false));
 }
 
 // A user who may write the share plants each entry the system owns in turn; every one is
@@ -86,7 +86,7 @@ TEST(SafeDirTest, PlantedEntriesAreRefusedWithTheirPath) {
     EXPECT_NE(e.message.find("move it aside or remove it"), std::string::npos);
   }
   EXPECT_EQ(log.Count("unsafe index file " + share + "/@eaDir"), 1);
-  EXPECT_FALSE(IsFileExist(Dirname(secret) + "/@fileindex"));
+  EXPECT_FALSE(IsDirExist(Dirname(secret) + "/@fileindex", false));
 
   // A real folder, but the planter's.
   ASSERT_EQ(unlink((share + "/@eaDir").c_str()), 0);
@@ -148,7 +148,7 @@ TEST(SafeDirTest, RemoveTreeNeverFollowsALink) {
   ASSERT_TRUE(folder.valid());
   EXPECT_EQ(folder.RemoveTree("db"), 0);
   EXPECT_EQ(folder.RemoveTree("db"), 0);  // gone already
-  EXPECT_FALSE(IsFileExist(db));
+  EXPECT_FALSE(IsDirExist(db, false));
   EXPECT_EQ(test::ReadFile(keep), "k");
 }
 

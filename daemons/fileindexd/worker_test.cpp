@@ -376,7 +376,7 @@ TEST_F(ShareTest, APlantedQueueFolderIsReportedUntilItIsGone) {
               ::testing::HasSubstr(share + "/@eaDir: it is a symbolic link"));
   EXPECT_EQ(report["last_error"], report["unsafe"]);
   EXPECT_GE(report["errors"].asUInt64(), 1u);
-  EXPECT_FALSE(IsFileExist(secret.Path("@fileindex")));
+  EXPECT_FALSE(IsDirExist(secret.Path("@fileindex"), false));
 
   ASSERT_EQ(unlink((share + "/@eaDir").c_str()), 0);
   EXPECT_TRUE(test::WaitFor([&] { return worker_.Report()["unsafe"].asString().empty(); },
@@ -384,7 +384,7 @@ TEST_F(ShareTest, APlantedQueueFolderIsReportedUntilItIsGone) {
   struct stat st;
   ASSERT_EQ(lstat(Dirname(sys_.Queue("docs")).c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0700u);
-  EXPECT_TRUE(IsFileExist(share + "/@eaDir") && !IsFileExist(secret.Path("@fileindex")));
+  EXPECT_FALSE(IsDirExist(secret.Path("@fileindex"), false));
 }
 
 }  // namespace
