@@ -22,7 +22,16 @@ constexpr size_t kBufferSize = 256 * 1024;
 }  // namespace
 
 QueueFileReader::QueueFileReader(const std::string& path) {
-  const platform::SafeDir dir = platform::SafeDir::Open(Dirname(path), false);
+  platform::SafeDir dir;
+  try {
+    dir = platform::SafeDir::Open(Dirname(path), false);
+  } catch (const Error& e) {
+    // An unreadable folder is an unreadable queue (errno tells why); a planted entry is the
+    // caller's to report.
+    if (e.code == kErrUnsafePath) throw;
+    if (errno == 0) errno = EIO;
+    return;
+  }
   if (!dir.valid()) return;
   fd_ = dir.OpenFile(Basename(path), O_RDONLY);
   if (fd_.valid()) buf_.reset(new char[kBufferSize]);

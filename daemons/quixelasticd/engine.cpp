@@ -874,7 +874,7 @@ Json::Value Engine::IndexDelete(const Json::Value& data) {
       for (const std::string& suffix : kStoreFiles) folder.Unlink(IndexStore::kDbFile + suffix);
     }
     RemoveStoreDir(e->path);
-  } catch (const UnsafeStoreError& err) {
+  } catch (const StoreError& err) {
     // The index is forgotten either way; what stands in its folder's place is not touched.
     Log(LOG_ERR, "%s:%d %s", SourceName(__FILE__), __LINE__, err.what());
   }
