@@ -160,9 +160,9 @@ TEST_F(IndexMgrTest, FailuresAfterTheChecksAreNotRolledBack) {
   EXPECT_EQ(NewEngine(), (Strings{"index_create fileindex_music"}));
   EXPECT_FALSE(IsFileExist(FoldersPath()));
 
-  // The queue cannot be written: the configuration is saved and the error out.
+  // A folder in the queue's place is refused: the configuration is saved and the error out.
   ASSERT_TRUE(MakeParentDirs(Queue("music") + "/x"));
-  EXPECT_EQ(ErrorOf([&] { FolderAdd(music, false); }).code, kErrSystem);
+  EXPECT_EQ(ErrorOf([&] { FolderAdd(music, false); }).code, kErrUnsafePath);
   EXPECT_EQ(FolderPaths(), (Strings{"/music"}));
 
   // With the indexing daemon gone the change is saved and the failure reaches the caller.

@@ -1,5 +1,6 @@
 #include "fileindex/notifyd_cfg.hpp"
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include "fileindex/admin_test_env.hpp"
@@ -101,13 +102,14 @@ TEST_F(NotifydCfgTest, AQueuedReconciliationStandsInForNoReindex) {
 
 TEST_F(NotifydCfgTest, FailedEventFlagsTheShareAndIsThrownOn) {
   StatusMgr::CreateIfMissing();
-  // A folder in the queue's place cannot be opened for appending.
+  // A folder in the queue's place is refused: nothing is appended and the share is flagged.
   ASSERT_TRUE(MakeParentDirs(Queue("music") + "/x"));
   test::LogCapture log;
   Error e = ErrorOf([&] { AddCustomEvent(0x10000, vol_ + "/music/live", "", Json::Value()); });
-  EXPECT_EQ(e.message,
-            "Orvane error, code=502, reason=[Cannot append to queue: " + Queue("music") + "]");
-  EXPECT_EQ(log.Count("(AddCustomEvent) AddCustomEvent failed, code=502, reason=" + e.message +
+  EXPECT_EQ(e.code, kErrUnsafePath);
+  EXPECT_THAT(e.message, ::testing::HasSubstr("unsafe index file " + Queue("music") +
+                                              ": it is a folder, not a regular file"));
+  EXPECT_EQ(log.Count("(AddCustomEvent) AddCustomEvent failed, code=507, reason=" + e.message +
                       ". Set [music] need reindex"),
             1);
 

@@ -327,13 +327,16 @@ TEST_F(WatcherTest, FollowsRegistrationChangesAndWritesOneLinePerQueue) {
 
 TEST_F(WatcherTest, UnwritableQueueKeepsLinesUntilItCanBeWritten) {
   Watcher w;
-  // A file where the queue's folder should be makes every append fail.
+  // A file where the queue's folder should be is refused, once, with what to do about it.
   Mkdir("/@eaDir");
   Touch("/@eaDir/@fileindex", "in the way");
   test::LogCapture log;
   Touch("/docs/kept.txt");
   w.RunOnce(200);
-  EXPECT_TRUE(log.Contains("cannot append to queue " + queue_));
+  w.RunOnce(200);
+  EXPECT_EQ(log.Count("unsafe index file " + share_ + "/@eaDir/@fileindex: it is a file, not a "
+                      "folder; move it aside or remove it"),
+            1);
   ASSERT_EQ(unlink((share_ + "/@eaDir/@fileindex").c_str()), 0);
   EXPECT_THAT(Drain(w, 2), ElementsAre("40 /docs/kept.txt", "8 /docs/kept.txt"));
 }
