@@ -36,34 +36,49 @@ int64_t IntOr(const Json::Value& v, int64_t fallback) {
 EngineEntries::EngineEntries(const std::string& share, const std::string& dir)
     : id_(fileindex::elastic::GetFileIndexID(share)), dir_(dir) {}
 
+EngineEntries::~EngineEntries() {
+  if (!ahead_.valid()) return;
+  try {
+    ahead_.get();
+  } catch (const std::exception&) {
+    // The page was not wanted any more: its failure, if it is lasting, comes back next time.
+  }
+}
+
 bool EngineEntries::Next(IndexedEntry* entry) {
   if (next_ >= page_.size()) {
     if (last_page_) return false;
-    Fetch();
-    if (page_.empty()) return false;
+    page_ = started_ ? ahead_.get() : Fetch(std::string());
+    started_ = true;
+    next_ = 0;
+    // Only an empty page ends the listing: the engine may give fewer than asked on any page.
+    if (page_.empty()) {
+      last_page_ = true;
+      return false;
+    }
+    // Keyed by the last path rather than an offset, the next page is right even though the
+    // differences of this one reach the engine meanwhile: what they add sorts before it.
+    ahead_ = std::async(std::launch::async, &EngineEntries::Fetch, this, page_.back().path);
   }
   *entry = std::move(page_[next_++]);
   return true;
 }
 
-void EngineEntries::Fetch() {
+std::vector<IndexedEntry> EngineEntries::Fetch(const std::string& after) const {
   Json::Value req(Json::objectValue);
   req["command"] = "document_list";
   Json::Value& data = req["data"];
   data["id"] = id_;
   data["path"] = dir_;
-  if (!after_.empty()) data["after"] = after_;
+  if (!after.empty()) data["after"] = after;
   data["size"] = kListPageSize;
   data["load_field"].append(ce::QUIXMDAttributeChangeDate);
   Json::Value res;
   fileindex::elastic::SendRequest(res, req);
   const Json::Value& hits = res["data"];
   ORVANE_THROW_IF(!hits.isArray(), kErrNoQueryData, JsonToString(res));
-  // Only an empty page ends the listing: the engine may give fewer than asked on any page.
-  page_.clear();
-  next_ = 0;
-  last_page_ = hits.empty();
-  page_.reserve(hits.size());
+  std::vector<IndexedEntry> page;
+  page.reserve(hits.size());
   for (const Json::Value& hit : hits) {
     // A document left out would be judged gone and deleted: a reply not understood ends the
     // reconciliation instead.
@@ -75,9 +90,9 @@ void EngineEntries::Fetch() {
     e.mtime = IntOr(hit[2], -1);
     e.is_dir = hit[3].isBool() && hit[3].asBool();
     e.ctime = IntOr(hit[4], -1);
-    page_.push_back(std::move(e));
+    page.push_back(std::move(e));
   }
-  if (!page_.empty()) after_ = page_.back().path;
+  return page;
 }
 
 Reconciler::Reconciler(const fileindex::FolderMgr& folders, const std::atomic<bool>* stop,

@@ -10,6 +10,7 @@
 #include <atomic>
 #include <cstdint>
 #include <functional>
+#include <future>
 #include <string>
 #include <vector>
 
@@ -35,21 +36,28 @@ class IndexedEntries {
   virtual bool Next(IndexedEntry* entry) = 0;
 };
 
-// Pages through the engine's listing of one share's index below a folder.
+// Pages through the engine's listing of one share's index below a folder. The next page is
+// asked for on a thread of its own while the caller works through the current one; the
+// destructor waits for it.
 class EngineEntries : public IndexedEntries {
  public:
   EngineEntries(const std::string& share, const std::string& dir);
+  ~EngineEntries() override;
+  EngineEntries(const EngineEntries&) = delete;
+  EngineEntries& operator=(const EngineEntries&) = delete;
   bool Next(IndexedEntry* entry) override;
 
  private:
-  void Fetch();
+  // The page of documents after `after` (from the start when empty); empty after the last.
+  std::vector<IndexedEntry> Fetch(const std::string& after) const;
 
   std::string id_;
   std::string dir_;
-  std::string after_;  // the last path listed so far
   std::vector<IndexedEntry> page_;
   size_t next_ = 0;
+  bool started_ = false;
   bool last_page_ = false;
+  std::future<std::vector<IndexedEntry>> ahead_;
 };
 
 // What a reconciliation does about each difference.
