@@ -52,7 +52,7 @@ ctl search license --size 5
 if [ -n "$sub" ]; then
   echo
   echo "== everything in $sub"
-  ctl search --folder "$sub" --type document --size 5 || true
+  ctl search --folder "$sub" --size 5 || true
 fi
 
 cat <<EOT

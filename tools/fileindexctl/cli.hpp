@@ -14,6 +14,8 @@
 #include <string>
 #include <vector>
 
+#include "common/error.hpp"
+
 namespace orvane {
 namespace ctl {
 
@@ -70,6 +72,16 @@ int64_t ParseTime(const std::string& text);
 uint64_t ParseSize(const std::string& text);
 
 // What an error code means to an administrator, and what to do about it.
+// An error the search engine answered with: it was reached, and its message says what to do
+// (a busy engine, a search over its time budget). Thrown as the engine's error, 913.
+class EngineRefusal : public Error {
+ public:
+  EngineRefusal(int engine_code, const std::string& msg)
+      : Error(kErrElastic, msg), engine_code(engine_code) {}
+
+  int engine_code;
+};
+
 struct ErrorAdvice {
   std::string meaning;
   std::string hint;

@@ -170,9 +170,8 @@ Json::Value AskEngine(const std::string& command, const Json::Value& data) {
     if (err.isObject() && err["code"].asInt() == kErrIndexDamaged) {
       throw Error(kErrIndexDamaged, DamagedIndexText(err["msg"].asString()));
     }
-    throw Error(kErrElastic, err.isObject() ? err["msg"].asString() + " (engine code " +
-                                                  std::to_string(err["code"].asInt()) + ")"
-                                            : JsonToString(reply));
+    if (!err.isObject()) throw Error(kErrElastic, JsonToString(reply));
+    throw EngineRefusal(err["code"].asInt(), err["msg"].asString());
   }
   return reply["data"];
 }

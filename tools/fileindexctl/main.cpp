@@ -114,6 +114,11 @@ int main(int argc, char** argv) {
     std::cerr << "fileindexctl: " << orvane::DisplayName(e.what()) << '\n';
     PrintUsage(std::cerr, *command);
     return 2;
+  } catch (const orvane::ctl::EngineRefusal& e) {
+    std::cerr << "fileindexctl: the search engine turned the request down (engine code "
+              << e.engine_code << "): " << orvane::DisplayName(orvane::ctl::ReasonOf(e.message))
+              << '\n';
+    return 1;
   } catch (const orvane::Error& e) {
     const orvane::ctl::ErrorAdvice advice = orvane::ctl::AdviceFor(e.code);
     std::cerr << "fileindexctl: " << advice.meaning << " (error " << e.code
