@@ -18,27 +18,17 @@
 #include <string>
 #include <vector>
 
+#include "bench/bench_util.hpp"
 #include "common/json_util.hpp"
-#include "common/log.hpp"
 #include "daemons/quixelasticd/access.hpp"
-#include "daemons/quixelasticd/engine.hpp"
-#include "fileindex/elastic_control.hpp"
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
+using orvane::bench::Clock;
+using orvane::bench::Cmd;
 using orvane::elasticd::Caller;
 
-double Millis(Clock::time_point since) {
-  return std::chrono::duration<double, std::milli>(Clock::now() - since).count();
-}
-
-Json::Value Cmd(const std::string& command, const Json::Value& data) {
-  Json::Value r;
-  r["command"] = command;
-  r["data"] = data;
-  return r;
-}
+double Millis(Clock::time_point since) { return orvane::bench::Seconds(since) * 1e3; }
 
 struct Figures {
   double p50, p95, max;
@@ -77,32 +67,17 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "run as root, on a system with a user nobody\n");
     return 2;
   }
-  std::setvbuf(stdout, nullptr, _IOLBF, 0);
-  orvane::SetLogSink([](int priority, const std::string& line) {
-    if (priority <= 3) std::fprintf(stderr, "%s\n", line.c_str());
-  });
-  char tmpl[] = "/tmp/access-bench-XXXXXX";
-  if (mkdtemp(tmpl) == nullptr) return 1;
-  const std::string dir = tmpl;
-  ::chmod(dir.c_str(), 0755);
-  ::setenv("ORVANE_ROOT", dir.c_str(), 1);
+  const std::string dir = orvane::bench::ScratchRoot("access-bench", true);
+  if (dir.empty()) return 1;
   const std::string share = dir + "/share";
   ::mkdir(share.c_str(), 0755);
 
-  orvane::elasticd::EngineOptions options;
-  options.registry_file = dir + "/state/indexes.json";
-  options.running_marker = dir + "/state/running";
-  orvane::elasticd::Engine engine(options);
-  engine.Start();
-  engine.WaitOpened();
+  orvane::bench::InProcessEngine in_process(dir);
+  orvane::elasticd::Engine& engine = in_process.engine();
   const Caller root{0, 0, true};
   const Caller user{nobody->pw_uid, nobody->pw_gid, false};
-  Json::Value create;
-  create["id"] = "fileindex_share";
-  create["path"] = share + "/@eaDir/@fileindex/db";
-  create["settings"] = orvane::fileindex::elastic::GetFileIndexSettings();
-  create["mappings"] = orvane::fileindex::elastic::GetFileIndexMappings();
-  engine.HandleValue(Cmd("index_create", create), root);
+  engine.HandleValue(
+      orvane::bench::FileIndexCreate("fileindex_share", share + "/@eaDir/@fileindex/db"), root);
 
   const auto start = Clock::now();
   std::vector<std::string> paths;
@@ -178,7 +153,7 @@ int main(int argc, char** argv) {
         " of %zu shown\n",
         ms, ms * 1000 / paths.size(), shown, paths.size());
   }
-  engine.Shutdown();
+  in_process.Stop();
   std::system(("rm -rf '" + dir + "'").c_str());
   return 0;
 }

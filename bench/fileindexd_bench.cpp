@@ -25,6 +25,7 @@
 #include <string>
 #include <vector>
 
+#include "bench/bench_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/fileindexd/test_system.hpp"
@@ -36,11 +37,9 @@ namespace {
 using orvane::fileindexd::test::ChildProcess;
 using orvane::fileindexd::test::System;
 using orvane::fileindexd::test::WaitFor;
-using Clock = std::chrono::steady_clock;
-
-double Seconds(Clock::time_point a, Clock::time_point b) {
-  return std::chrono::duration<double>(b - a).count();
-}
+using orvane::bench::Clock;
+using orvane::bench::ProcessCpuSeconds;
+using orvane::bench::Seconds;
 
 int64_t Documents(const std::string& id) {
   try {
@@ -60,22 +59,6 @@ long PeakKb(pid_t pid) {
     if (line.rfind("VmHWM:", 0) == 0) return std::strtol(line.c_str() + 6, nullptr, 10);
   }
   return -1;
-}
-
-// User plus system CPU seconds the process has used so far.
-double CpuSeconds(pid_t pid) {
-  std::ifstream in("/proc/" + std::to_string(pid) + "/stat");
-  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  const size_t close = text.rfind(')');
-  if (close == std::string::npos) return -1;
-  std::istringstream rest(text.substr(close + 2));
-  std::string field;
-  unsigned long long utime = 0, stime = 0;
-  for (int i = 3; i <= 15 && rest >> field; ++i) {
-    if (i == 14) utime = std::stoull(field);
-    if (i == 15) stime = std::stoull(field);
-  }
-  return double(utime + stime) / sysconf(_SC_CLK_TCK);
 }
 
 // CPU seconds of the children of `pid` (its extraction helpers), the running and the reaped.
@@ -101,7 +84,7 @@ double ChildrenCpuSeconds(pid_t pid) {
     if (task->d_name[0] == '.') continue;
     std::ifstream children(proc + "/task/" + task->d_name + "/children");
     pid_t child;
-    while (children >> child) total += CpuSeconds(child);
+    while (children >> child) total += ProcessCpuSeconds(child);
   }
   return total;
 }
@@ -109,7 +92,8 @@ double ChildrenCpuSeconds(pid_t pid) {
 // Prints the CPU seconds the engine, the indexer and its helpers used since `before`, which it
 // then updates.
 void PrintCpu(pid_t engine, pid_t indexd, double before[3]) {
-  const double now[3] = {CpuSeconds(engine), CpuSeconds(indexd), ChildrenCpuSeconds(indexd)};
+  const double now[3] = {ProcessCpuSeconds(engine), ProcessCpuSeconds(indexd),
+                         ChildrenCpuSeconds(indexd)};
   std::printf("  CPU seconds: quixelasticd %.2f, fileindexd %.2f, extraction helpers %.2f\n",
               now[0] - before[0], now[1] - before[1], now[2] - before[2]);
   for (int i = 0; i < 3; ++i) before[i] = now[i];
@@ -242,7 +226,8 @@ int main(int argc, char** argv) {
   std::printf("first indexing: %d files (+%d folders) in %.2f s = %.0f files/s\n", files, dirs,
               first, files / first);
   std::printf("  CPU seconds so far: quixelasticd %.2f, quixnotifyd %.2f, fileindexd %.2f\n",
-              CpuSeconds(engine->pid()), CpuSeconds(notifyd->pid()), CpuSeconds(indexd->pid()));
+              ProcessCpuSeconds(engine->pid()), ProcessCpuSeconds(notifyd->pid()),
+              ProcessCpuSeconds(indexd->pid()));
 
   // 2. Close-write to searchable.
   std::vector<double> delays;
@@ -285,7 +270,7 @@ int main(int argc, char** argv) {
               burst_files * 10, Seconds(b0, b1), Seconds(b1, b2) - 0.3, Seconds(b0, b2) - 0.3);
 
   // 4. Contents.
-  double cpu[3] = {CpuSeconds(engine->pid()), CpuSeconds(indexd->pid()),
+  double cpu[3] = {ProcessCpuSeconds(engine->pid()), ProcessCpuSeconds(indexd->pid()),
                    ChildrenCpuSeconds(indexd->pid())};
   Json::Value content(Json::arrayValue);
   content.append(System::Folder("/content", true));

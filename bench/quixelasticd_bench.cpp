@@ -9,77 +9,31 @@
 // ORVANE_ROOT; the bulk load and the searches are framed requests on that socket, the delete
 // and the rename are the library's own IndexDelDir and IndexRename.
 #include <sqlite3.h>
-#include <sys/resource.h>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
 #include <random>
 #include <string>
 #include <thread>
 #include <atomic>
 #include <vector>
 
-#include "common/fd.hpp"
-#include "common/json_util.hpp"
-#include "common/log.hpp"
-#include "daemons/quixelasticd/engine.hpp"
-#include "daemons/quixelasticd/server.hpp"
+#include "bench/bench_util.hpp"
 #include "fileindex/elastic_control.hpp"
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
+using orvane::bench::Clock;
+using orvane::bench::Cmd;
+using orvane::bench::CpuSeconds;
+using orvane::bench::Seconds;
 
 std::string g_socket;
 
-Json::Value Request(const Json::Value& req) {
-  orvane::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  struct sockaddr_un addr;
-  std::memset(&addr, 0, sizeof(addr));
-  addr.sun_family = AF_UNIX;
-  std::strncpy(addr.sun_path, g_socket.c_str(), sizeof(addr.sun_path) - 1);
-  if (::connect(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0) {
-    std::perror("connect");
-    std::exit(1);
-  }
-  const std::string text = orvane::JsonToString(req) + std::string(1, '\0');
-  const uint32_t n = static_cast<uint32_t>(text.size());
-  std::string frame(reinterpret_cast<const char*>(&n), 4);
-  frame += text;
-  for (size_t off = 0; off < frame.size();) {
-    const ssize_t put = ::send(fd.get(), frame.data() + off, frame.size() - off, MSG_NOSIGNAL);
-    if (put <= 0) std::exit(1);
-    off += static_cast<size_t>(put);
-  }
-  std::string reply;
-  char buf[1 << 16];
-  for (;;) {
-    const ssize_t got = ::recv(fd.get(), buf, sizeof(buf), 0);
-    if (got <= 0) break;
-    reply.append(buf, static_cast<size_t>(got));
-  }
-  orvane::JsonValue v;
-  if (reply.size() < 5 || !v.fromString(reply.substr(4, reply.size() - 5)) ||
-      !v["success"].asBool()) {
-    std::fprintf(stderr, "request failed: %s\n", reply.size() > 4 ? reply.c_str() + 4 : "");
-    std::exit(1);
-  }
-  return v;
-}
-
-Json::Value Cmd(const std::string& command, const Json::Value& data) {
-  Json::Value r;
-  r["command"] = command;
-  r["data"] = data;
-  return r;
-}
+Json::Value Request(const Json::Value& req) { return orvane::bench::Request(g_socket, req); }
 
 const char kShare[] = "bench";
 const char kId[] = "fileindex_bench";
@@ -120,19 +74,6 @@ Json::Value FileDoc(const std::string& parent, const std::string& name, uint64_t
   d["QUIXMDOwnerUserID"] = "1026";
   d["QUIXMDOwnerGroupID"] = "100";
   return d;
-}
-
-// CPU seconds this process has used (client and daemon threads together): a figure that other
-// load on the machine does not distort the way wall time is.
-double CpuSeconds() {
-  struct rusage ru;
-  getrusage(RUSAGE_SELF, &ru);
-  return ru.ru_utime.tv_sec + ru.ru_stime.tv_sec +
-         (ru.ru_utime.tv_usec + ru.ru_stime.tv_usec) / 1e6;
-}
-
-double Seconds(Clock::time_point since) {
-  return std::chrono::duration<double>(Clock::now() - since).count();
 }
 
 // Upserts `count` documents under `parent` in compound batches of `batch`, from `g_senders`
@@ -185,33 +126,14 @@ int main(int argc, char** argv) {
     std::fprintf(stderr, "at least 130000 documents are needed\n");
     return 2;
   }
-  std::setvbuf(stdout, nullptr, _IOLBF, 0);
-  orvane::SetLogSink([](int priority, const std::string& line) {
-    if (priority <= 3) std::fprintf(stderr, "%s\n", line.c_str());
-  });
-  char tmpl[] = "/tmp/quixelasticd-bench-XXXXXX";
-  if (mkdtemp(tmpl) == nullptr) return 1;
-  const std::string dir = tmpl;
-  ::setenv("ORVANE_ROOT", dir.c_str(), 1);
-  g_socket = dir + "/var/run/quixelasticd.sock";
-  orvane::elasticd::EngineOptions options;
-  options.registry_file = dir + "/state/indexes.json";
-  options.running_marker = dir + "/state/running";
-  orvane::elasticd::Engine engine(options);
-  engine.Start();
-  engine.WaitOpened();
-  orvane::elasticd::ServerOptions server_options;
-  server_options.socket_path = g_socket;
-  orvane::elasticd::Server server(engine, server_options);
-  server.Start();
+  const std::string dir = orvane::bench::ScratchRoot("quixelasticd-bench", false);
+  if (dir.empty()) return 1;
+  orvane::bench::InProcessEngine engine(dir);
+  engine.Serve(false);
+  g_socket = engine.socket();
 
-  Json::Value create;
-  create["id"] = kId;
-  create["path"] = dir + "/db";
   // The library's own schema and settings, as ShareIndexCreate sends them.
-  create["settings"] = orvane::fileindex::elastic::GetFileIndexSettings();
-  create["mappings"] = orvane::fileindex::elastic::GetFileIndexMappings();
-  Request(Cmd("index_create", create));
+  Request(orvane::bench::FileIndexCreate(kId, dir + "/db"));
 
   std::printf("SQLite %s; WAL, synchronous=NORMAL (commit syncs the log), cache_size=64 MiB,"
               " temp_store=MEMORY, mmap_size=2 GiB, page size 4096; FTS5 unicode61 (catch-all)"
@@ -303,8 +225,7 @@ int main(int argc, char** argv) {
   std::printf("IndexDelDir of 100000 documents (then IndexCommit): %.2f s, %.2f CPU s\n",
               Seconds(start), CpuSeconds() - cpu);
 
-  server.Stop();
-  engine.Shutdown();
+  engine.Stop();
   std::string cleanup = "rm -rf '" + dir + "'";
   return std::system(cleanup.c_str()) == 0 ? 0 : 1;
 }

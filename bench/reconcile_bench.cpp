@@ -14,13 +14,11 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
-#include <fstream>
-#include <iterator>
 #include <memory>
-#include <sstream>
 #include <string>
 #include <vector>
 
+#include "bench/bench_util.hpp"
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
@@ -36,11 +34,9 @@ using orvane::fileindexd::EngineEntries;
 using orvane::fileindexd::IndexedEntry;
 using orvane::fileindexd::Worker;
 using orvane::fileindexd::test::System;
-using Clock = std::chrono::steady_clock;
-
-double Seconds(Clock::time_point a, Clock::time_point b) {
-  return std::chrono::duration<double>(b - a).count();
-}
+using orvane::bench::Clock;
+using orvane::bench::ProcessCpuSeconds;
+using orvane::bench::Seconds;
 
 // Queues one line and runs the worker's pass; the wall time of the pass.
 double Pass(const System& sys, Worker& worker, const std::string& line) {
@@ -56,27 +52,10 @@ double Pass(const System& sys, Worker& worker, const std::string& line) {
   return Seconds(start, Clock::now());
 }
 
-// User plus system CPU seconds of `pid` (0: this process) so far.
-double CpuSeconds(pid_t pid) {
-  std::ifstream in(pid == 0 ? std::string("/proc/self/stat")
-                            : "/proc/" + std::to_string(pid) + "/stat");
-  std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-  const size_t close = text.rfind(')');
-  if (close == std::string::npos) return -1;
-  std::istringstream rest(text.substr(close + 2));
-  std::string field;
-  unsigned long long utime = 0, stime = 0;
-  for (int i = 3; i <= 15 && rest >> field; ++i) {
-    if (i == 14) utime = std::stoull(field);
-    if (i == 15) stime = std::stoull(field);
-  }
-  return double(utime + stime) / sysconf(_SC_CLK_TCK);
-}
-
 // The CPU seconds this process and the engine spent since the last call.
 std::string CpuSince(pid_t engine) {
   static double self_before = 0, engine_before = 0;
-  const double self = CpuSeconds(0), eng = CpuSeconds(engine);
+  const double self = ProcessCpuSeconds(0), eng = ProcessCpuSeconds(engine);
   char text[96];
   std::snprintf(text, sizeof(text), "CPU: worker %.2f s, engine %.2f s", self - self_before,
                 eng - engine_before);

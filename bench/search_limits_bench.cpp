@@ -11,10 +11,6 @@
 #include <poll.h>
 #include <pwd.h>
 #include <sqlite3.h>
-#include <sys/resource.h>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -22,70 +18,21 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
-#include <cstring>
+#include <memory>
 #include <string>
 #include <vector>
 
-#include "common/fd.hpp"
-#include "common/json_util.hpp"
-#include "common/log.hpp"
-#include "daemons/quixelasticd/engine.hpp"
-#include "daemons/quixelasticd/server.hpp"
-#include "fileindex/elastic_control.hpp"
+#include "bench/bench_util.hpp"
+#include "platform/daemon_sock.hpp"
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
-orvane::UniqueFd Connect(const std::string& socket) {
-  orvane::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  struct sockaddr_un addr;
-  std::memset(&addr, 0, sizeof(addr));
-  addr.sun_family = AF_UNIX;
-  std::strncpy(addr.sun_path, socket.c_str(), sizeof(addr.sun_path) - 1);
-  if (::connect(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0) {
-    fd.Close();
-  }
-  return fd;
-}
-
-Json::Value Request(const std::string& socket, const Json::Value& req) {
-  orvane::UniqueFd fd = Connect(socket);
-  if (!fd.valid()) {
-    std::perror("connect");
-    std::exit(1);
-  }
-  const std::string text = orvane::JsonToString(req) + std::string(1, '\0');
-  const uint32_t n = static_cast<uint32_t>(text.size());
-  std::string frame(reinterpret_cast<const char*>(&n), 4);
-  frame += text;
-  for (size_t off = 0; off < frame.size();) {
-    const ssize_t put = ::send(fd.get(), frame.data() + off, frame.size() - off, MSG_NOSIGNAL);
-    if (put <= 0) std::exit(1);
-    off += static_cast<size_t>(put);
-  }
-  std::string reply;
-  char buf[1 << 16];
-  for (;;) {
-    const ssize_t got = ::recv(fd.get(), buf, sizeof(buf), 0);
-    if (got <= 0) break;
-    reply.append(buf, static_cast<size_t>(got));
-  }
-  orvane::JsonValue v;
-  if (reply.size() < 5 || !v.fromString(reply.substr(4, reply.size() - 5)) ||
-      !v["success"].asBool()) {
-    std::fprintf(stderr, "request failed: %s\n", reply.size() > 4 ? reply.c_str() + 4 : "");
-    std::exit(1);
-  }
-  return v;
-}
-
-Json::Value Cmd(const std::string& command, const Json::Value& data) {
-  Json::Value r;
-  r["command"] = command;
-  r["data"] = data;
-  return r;
-}
+using orvane::bench::Clock;
+using orvane::bench::Cmd;
+using orvane::bench::CpuSeconds;
+using orvane::bench::Median;
+using orvane::bench::Request;
+using orvane::bench::Seconds;
 
 const char kId[] = "fileindex_bench";
 
@@ -108,22 +55,6 @@ Json::Value Upsert(const std::string& path, const std::string& content) {
   data["doc_id"] = path;
   data["data"] = d;
   return Cmd("document_upsert_by_id", data);
-}
-
-double CpuSeconds() {
-  struct rusage ru;
-  getrusage(RUSAGE_SELF, &ru);
-  return ru.ru_utime.tv_sec + ru.ru_stime.tv_sec +
-         (ru.ru_utime.tv_usec + ru.ru_stime.tv_usec) / 1e6;
-}
-
-double Seconds(Clock::time_point since) {
-  return std::chrono::duration<double>(Clock::now() - since).count();
-}
-
-double Median(std::vector<double> v) {
-  std::sort(v.begin(), v.end());
-  return v[v.size() / 2];
 }
 
 // Wall and CPU seconds of five searches for `keyword`, medians.
@@ -182,8 +113,11 @@ pid_t StartFlood(const std::string& socket, int count, uid_t uid, gid_t gid, int
     ::close(ready[0]);
     ::close(stop[1]);
     if (::setgid(gid) != 0 || ::setuid(uid) != 0) _exit(3);
-    std::vector<orvane::UniqueFd> conns;
-    for (int i = 0; i < count; ++i) conns.push_back(Connect(socket));
+    std::vector<std::unique_ptr<quixdaemon::DomainSockConnection>> conns;
+    for (int i = 0; i < count; ++i) {
+      conns.emplace_back(new quixdaemon::DomainSockConnection(socket));
+      conns.back()->Connect(0);
+    }
     if (::write(ready[1], "x", 1) != 1) _exit(4);
     struct pollfd p = {stop[0], POLLIN, 0};
     ::poll(&p, 1, 60000);
@@ -203,36 +137,15 @@ pid_t StartFlood(const std::string& socket, int count, uid_t uid, gid_t gid, int
 int main(int argc, char** argv) {
   const int repeats = argc > 1 ? std::atoi(argv[1]) : 200000;
   const int documents = argc > 2 ? std::atoi(argv[2]) : 1000;
-  std::setvbuf(stdout, nullptr, _IOLBF, 0);
-  orvane::SetLogSink([](int priority, const std::string& line) {
-    if (priority <= 3) std::fprintf(stderr, "%s\n", line.c_str());
-  });
-  char tmpl[] = "/tmp/search-limits-bench-XXXXXX";
-  if (mkdtemp(tmpl) == nullptr) return 1;
-  const std::string dir = tmpl;
-  // The flood runs as nobody, who must reach the public socket below it.
-  ::chmod(dir.c_str(), 0755);
-  ::setenv("ORVANE_ROOT", dir.c_str(), 1);
-  orvane::elasticd::EngineOptions options;
-  options.registry_file = dir + "/state/indexes.json";
-  options.running_marker = dir + "/state/running";
-  orvane::elasticd::Engine engine(options);
-  engine.Start();
-  engine.WaitOpened();
-  orvane::elasticd::ServerOptions server_options;
-  server_options.socket_path = dir + "/var/run/quixelasticd.sock";
-  server_options.public_socket_path = dir + "/var/run/quixelasticd.search.sock";
-  orvane::elasticd::Server server(engine, server_options);
-  server.Start();
-  const std::string& main_socket = server_options.socket_path;
-  const std::string& public_socket = server_options.public_socket_path;
+  // The flood runs as nobody, who must reach the public socket below the scratch root.
+  const std::string dir = orvane::bench::ScratchRoot("search-limits-bench", true);
+  if (dir.empty()) return 1;
+  orvane::bench::InProcessEngine engine(dir);
+  engine.Serve(true);
+  const std::string main_socket = engine.socket();
+  const std::string public_socket = engine.public_socket();
 
-  Json::Value create;
-  create["id"] = kId;
-  create["path"] = dir + "/db";
-  create["settings"] = orvane::fileindex::elastic::GetFileIndexSettings();
-  create["mappings"] = orvane::fileindex::elastic::GetFileIndexMappings();
-  Request(main_socket, Cmd("index_create", create));
+  Request(main_socket, orvane::bench::FileIndexCreate(kId, dir + "/db"));
   std::string text;
   for (int i = 0; i < repeats; ++i) text += "hello ";
   text += "the quarterly figures";
@@ -290,7 +203,6 @@ int main(int argc, char** argv) {
   ::close(release);
   int status = 0;
   ::waitpid(flood, &status, 0);
-  server.Stop();
-  engine.Shutdown();
+  engine.Stop();
   return 0;
 }

@@ -1,0 +1,74 @@
+// What the benchmarks share: clocks and CPU figures, a client of the search engine's framed
+// socket that gives up the whole run on any failure, and the engine (optionally with its
+// server) run in this process below a scratch ORVANE_ROOT. Single-threaded use except
+// Request(), which opens its own connection per call.
+#ifndef ORVANE_BENCH_BENCH_UTIL_HPP_
+#define ORVANE_BENCH_BENCH_UTIL_HPP_
+
+#include <sys/types.h>
+
+#include <json/json.h>
+
+#include <chrono>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "daemons/quixelasticd/engine.hpp"
+#include "daemons/quixelasticd/server.hpp"
+
+namespace orvane {
+namespace bench {
+
+using Clock = std::chrono::steady_clock;
+
+double Seconds(Clock::time_point since);
+double Seconds(Clock::time_point a, Clock::time_point b);
+double Median(std::vector<double> v);
+// User plus system CPU seconds of this process (client and in-process engine threads
+// together): a figure that other load on the machine does not distort the way wall time is.
+double CpuSeconds();
+// The same for any process, read from /proc (`pid` 0: this process); -1 when it is gone.
+double ProcessCpuSeconds(pid_t pid);
+
+// A request {"command": command, "data": data}.
+Json::Value Cmd(const std::string& command, const Json::Value& data);
+// index_create of the library's own file-index schema and settings.
+Json::Value FileIndexCreate(const std::string& id, const std::string& path);
+// One framed request on `socket` and its reply; a failed connection or a reply without
+// success ends the process with the reason on stderr.
+Json::Value Request(const std::string& socket, const Json::Value& request);
+
+// Line-buffered stdout, engine errors to stderr, and a fresh scratch folder made the process's
+// ORVANE_ROOT (0755 when `open_to_others`, so that another user reaches sockets below it).
+// "" when the folder cannot be made.
+std::string ScratchRoot(const std::string& prefix, bool open_to_others);
+
+// The engine started on `root` (opening done), and once Serve() is called its server on the
+// daemon's sockets there. Stop() (or the destructor) stops both.
+class InProcessEngine {
+ public:
+  explicit InProcessEngine(const std::string& root);
+  ~InProcessEngine();
+  InProcessEngine(const InProcessEngine&) = delete;
+  InProcessEngine& operator=(const InProcessEngine&) = delete;
+
+  // Serves the main socket and, when `with_public`, the public search socket.
+  void Serve(bool with_public);
+  void Stop();
+
+  elasticd::Engine& engine() { return *engine_; }
+  std::string socket() const { return root_ + "/var/run/quixelasticd.sock"; }
+  std::string public_socket() const { return root_ + "/var/run/quixelasticd.search.sock"; }
+
+ private:
+  std::string root_;
+  std::unique_ptr<elasticd::Engine> engine_;
+  std::unique_ptr<elasticd::Server> server_;
+  bool stopped_ = false;
+};
+
+}  // namespace bench
+}  // namespace orvane
+
+#endif  // ORVANE_BENCH_BENCH_UTIL_HPP_
