@@ -11,6 +11,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <sstream>
 #include <stdexcept>
@@ -165,6 +166,38 @@ std::string MakeOpenShare(const TempDir& dir, const std::string& rel) {
 
 int RenameExchange(const std::string& a, const std::string& b) {
   return renameat2(AT_FDCWD, a.c_str(), AT_FDCWD, b.c_str(), RENAME_EXCHANGE);
+}
+
+ProgramResult RunProgram(const std::string& path, const std::vector<std::string>& args,
+                         const std::string& root) {
+  TempDir io;
+  const std::string out_path = io.Path("out");
+  const std::string err_path = io.Path("err");
+  std::vector<std::string> argv_text = {path.substr(path.rfind('/') + 1)};
+  argv_text.insert(argv_text.end(), args.begin(), args.end());
+  std::vector<char*> argv;
+  for (std::string& a : argv_text) argv.push_back(a.data());
+  argv.push_back(nullptr);
+  std::vector<std::string> env_text;
+  if (!root.empty()) env_text.push_back("ORVANE_ROOT=" + root);
+  for (char** e = environ; *e != nullptr; ++e) {
+    if (root.empty() || std::strncmp(*e, "ORVANE_ROOT=", 12) != 0) env_text.emplace_back(*e);
+  }
+  std::vector<char*> envp;
+  for (std::string& e : env_text) envp.push_back(e.data());
+  envp.push_back(nullptr);
+  // Everything is prepared before the fork: the child of a process with running daemon threads
+  // may only make calls that take no lock (open, dup2, exec) until it execs.
+  const pid_t pid = fork();
+  if (pid == 0) {
+    dup2(open(out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
+    dup2(open(err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
+    execve(path.c_str(), argv.data(), envp.data());
+    _exit(127);
+  }
+  int status = 0;
+  waitpid(pid, &status, 0);
+  return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, ReadFile(out_path), ReadFile(err_path)};
 }
 
 ScopedRoot::ScopedRoot(const std::string& root) {

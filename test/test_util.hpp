@@ -104,6 +104,19 @@ std::string MakeOpenShare(const TempDir& dir, const std::string& rel);
 // renameat2(RENAME_EXCHANGE) of two paths: 0 or -1 with errno set.
 int RenameExchange(const std::string& a, const std::string& b);
 
+// What a program run to its end left: its exit status (-1 when it did not exit) and what it
+// wrote to standard output and error.
+struct ProgramResult {
+  int status;
+  std::string out;
+  std::string err;
+};
+
+// Runs the program at `path` (argv[0] its file name) with `args` and this process's
+// environment, ORVANE_ROOT replaced by `root` unless that is empty, and waits for it.
+ProgramResult RunProgram(const std::string& path, const std::vector<std::string>& args,
+                         const std::string& root = std::string());
+
 // Sets ORVANE_ROOT for its lifetime and restores the former value.
 class ScopedRoot {
  public:

@@ -19,6 +19,7 @@
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
+#include "daemons/fileindexd/e2e_fixture.hpp"
 #include "daemons/fileindexd/indexer.hpp"
 #include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/index_mgr.hpp"
@@ -106,17 +107,9 @@ int Search(const std::string& word) {
   return System::Engine("search", q)["data"]["total"].asInt();
 }
 
-class EndToEndTest : public ::testing::Test {
+class EndToEndTest : public test::RunningSystemTest {
  protected:
-  EndToEndTest() : sys_({"docs", "media"}) {}
-
-  void SetUp() override {
-    setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BIN, 1);
-    sys_.WriteFolders(Json::Value(Json::arrayValue));
-    engine_ = sys_.StartEngine();
-    notifyd_ = sys_.StartNotifyd();
-    indexd_ = sys_.StartIndexd();
-  }
+  EndToEndTest() : RunningSystemTest({"docs", "media"}) {}
 
   std::string D(const std::string& rel) const { return sys_.Vol("docs/" + rel); }
   std::string M(const std::string& rel) const { return sys_.Vol("media/" + rel); }
@@ -128,11 +121,6 @@ class EndToEndTest : public ::testing::Test {
     EXPECT_EQ(Walk(root), got);
     EXPECT_EQ(int64_t(got.size()), EngineCount(share)) << "a document is doubled";
   }
-
-  System sys_;
-  std::unique_ptr<test::ChildProcess> engine_;
-  std::unique_ptr<test::ChildProcess> notifyd_;
-  std::unique_ptr<test::ChildProcess> indexd_;
 };
 
 TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {

@@ -2,9 +2,7 @@
 // system with the real daemons: the crawl, the watcher, renames and deletes reach the index
 // with the real bytes, the valid parts of a name find it, and every JSON text that fileindexctl
 // prints or the administration files hold is strict UTF-8.
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -14,45 +12,23 @@
 #include "common/json_util.hpp"
 #include "common/name_codec.hpp"
 #include "common/root.hpp"
+#include "daemons/fileindexd/e2e_fixture.hpp"
 #include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/index_mgr.hpp"
+#include "test/test_util.hpp"
 
 namespace orvane {
 namespace fileindexd {
 namespace {
 
-using test::System;
-using test::WaitFor;
 using test::WriteFile;
 
-struct CtlResult {
-  int status;
-  std::string out;
-  std::string err;
-};
+using CtlResult = orvane::test::ProgramResult;
 
 // Runs fileindexctl with these arguments, bytes as given, under the test's ORVANE_ROOT.
 CtlResult Ctl(const std::vector<std::string>& args) {
-  orvane::test::TempDir io;
-  const std::string out_path = io.Path("out");
-  const std::string err_path = io.Path("err");
-  std::vector<std::string> argv_text = {"fileindexctl"};
-  argv_text.insert(argv_text.end(), args.begin(), args.end());
-  std::vector<char*> argv;
-  for (std::string& a : argv_text) argv.push_back(a.data());
-  argv.push_back(nullptr);
-  const pid_t pid = fork();
-  if (pid == 0) {
-    dup2(open(out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
-    dup2(open(err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
-    execv(FILEINDEXCTL_BIN, argv.data());
-    _exit(127);
-  }
-  int st = 0;
-  waitpid(pid, &st, 0);
-  return {WIFEXITED(st) ? WEXITSTATUS(st) : -1, orvane::test::ReadFile(out_path),
-          orvane::test::ReadFile(err_path)};
+  return orvane::test::RunProgram(FILEINDEXCTL_BIN, args);
 }
 
 // Whether a strict outside parser takes `text` as JSON: the bytes decoded as UTF-8 with no
@@ -75,20 +51,12 @@ std::set<std::string> Disk(const std::string& root) {
   return out;
 }
 
-class NamesEndToEndTest : public ::testing::Test {
+class NamesEndToEndTest : public test::RunningSystemTest {
  protected:
-  NamesEndToEndTest() : sys_({"docs"}) {}
-
-  void SetUp() override {
-    setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BIN, 1);
-    sys_.WriteFolders(Json::Value(Json::arrayValue));
-    engine_ = sys_.StartEngine();
-    notifyd_ = sys_.StartNotifyd();
-    indexd_ = sys_.StartIndexd();
-  }
+  NamesEndToEndTest() : RunningSystemTest({"docs"}) {}
 
   void ExpectSettled(const std::string& root) {
-    WaitFor([&] { return sys_.Documents("docs") == Disk(root); }, 30000);
+    test::WaitFor([&] { return sys_.Documents("docs") == Disk(root); }, 30000);
     EXPECT_EQ(sys_.Documents("docs"), Disk(root));
   }
 
@@ -103,11 +71,6 @@ class NamesEndToEndTest : public ::testing::Test {
     EXPECT_TRUE(value.fromString(text)) << text;
     return std::move(value);
   }
-
-  System sys_;
-  std::unique_ptr<test::ChildProcess> engine_;
-  std::unique_ptr<test::ChildProcess> notifyd_;
-  std::unique_ptr<test::ChildProcess> indexd_;
 };
 
 TEST_F(NamesEndToEndTest, NamesThatAreNotUtf8AreIndexedFoundRenamedAndDeleted) {
@@ -118,7 +81,7 @@ TEST_F(NamesEndToEndTest, NamesThatAreNotUtf8AreIndexedFoundRenamedAndDeleted) {
   WriteFile(folder + "/dir\xFF/inner.txt", "i");
   WriteFile(folder + "/plain.txt", "p");
   Json::Value add(Json::arrayValue);
-  add.append(System::Folder("/docs/l\xE9gacy", true));
+  add.append(test::System::Folder("/docs/l\xE9gacy", true));
   fileindex::FolderAdd(add, false);
   ExpectSettled(folder);
 

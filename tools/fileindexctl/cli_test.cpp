@@ -1,12 +1,9 @@
-#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
-#include <cstring>
 #include <fstream>
 
 #include "common/json_util.hpp"
@@ -23,41 +20,7 @@ using ::testing::AllOf;
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
 
-struct Result {
-  int status;
-  std::string out;
-  std::string err;
-};
-
-// Runs the real program with ORVANE_ROOT set, collecting both streams. Everything is prepared
-// before the fork: the child of a process with running daemon threads may only make calls that
-// take no lock (open, dup2, exec) until it execs.
-Result RunCtl(const std::string& root, std::vector<std::string> args) {
-  test::TempDir io;
-  const std::string out_path = io.Path("out");
-  const std::string err_path = io.Path("err");
-  std::vector<char*> argv = {const_cast<char*>("fileindexctl")};
-  for (std::string& a : args) argv.push_back(a.data());
-  argv.push_back(nullptr);
-  std::vector<std::string> env_text = {"ORVANE_ROOT=" + root};
-  for (char** e = environ; *e != nullptr; ++e) {
-    if (std::strncmp(*e, "ORVANE_ROOT=", 12) != 0) env_text.emplace_back(*e);
-  }
-  std::vector<char*> envp;
-  for (std::string& e : env_text) envp.push_back(e.data());
-  envp.push_back(nullptr);
-  const pid_t pid = fork();
-  if (pid == 0) {
-    dup2(open(out_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
-    dup2(open(err_path.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
-    execve(FILEINDEXCTL_BIN, argv.data(), envp.data());
-    _exit(127);
-  }
-  int status = 0;
-  waitpid(pid, &status, 0);
-  return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, test::ReadFile(out_path),
-          test::ReadFile(err_path)};
-}
+using Result = test::ProgramResult;
 
 class CtlTest : public ::testing::Test {
  protected:
@@ -69,7 +32,9 @@ class CtlTest : public ::testing::Test {
                                                R"("}], "admin_group": "root"})");
     MakeParentDirs(dir_.Path("var/run/x"));
   }
-  Result Run(std::vector<std::string> args) { return RunCtl(dir_.path(), std::move(args)); }
+  Result Run(std::vector<std::string> args) {
+    return test::RunProgram(FILEINDEXCTL_BIN, args, dir_.path());
+  }
 
   test::TempDir dir_;
   std::string docs_ = dir_.Path("vol/docs");
