@@ -12,24 +12,29 @@
 
 namespace orvane {
 
-// The file is never removed, so the descriptor opened once stays on the file that others lock.
 LockFile::LockFile(const std::string& path, bool exclusive) : fd_(-1), path_(path) {
-  ORVANE_THROW_IF(0 > (fd_ = open(path_.c_str(), O_RDONLY | O_CREAT, 0644)), kErrLockFile,
-                  "open failed, path=" + path_ + ", reason=" + std::strerror(errno));
-  Acquire(exclusive);
+  for (int attempts_left = kMaxAttempts;;) {
+    ORVANE_THROW_IF(0 > (fd_ = open(path_.c_str(), O_RDONLY | O_CREAT, 0644)), kErrLockFile,
+                    "open failed, path=" + path_ + ", reason=" + std::strerror(errno));
+    if (flock(fd_, (exclusive ? LOCK_EX : LOCK_SH) | LOCK_NB) == 0) return;
+    // A hard failure is not retried. The object never comes to exist, so its destructor will
+    // not run: the descriptor is closed here or it would leak for the life of the process.
+    if (errno != EINTR && errno != EWOULDBLOCK) {
+      const int failure = errno;
+      close(fd_);
+      fd_ = -1;
+      throw Error(kErrLockFile, std::strerror(failure));
+    }
+    close(fd_);
+    fd_ = -1;
+    NextAttempt(&attempts_left);
+  }
 }
 
 LockFile::LockFile(UniqueFd fd, const std::string& path, bool exclusive)
     : fd_(fd.Release()), path_(path) {
-  Acquire(exclusive);
-}
-
-void LockFile::Acquire(bool exclusive) {
   for (int attempts_left = kMaxAttempts;;) {
     if (flock(fd_, (exclusive ? LOCK_EX : LOCK_SH) | LOCK_NB) == 0) return;
-    // A hard failure is not retried. The object never comes to exist when this throws, so its
-    // destructor will not run: the descriptor is closed here or it would leak for the life of
-    // the process.
     if (errno != EINTR && errno != EWOULDBLOCK) {
       const int failure = errno;
       close(fd_);

@@ -25,8 +25,6 @@ class LockFile {
   static constexpr int kMaxAttempts = 64;
 
  private:
-  // Takes the lock on fd_, retrying a busy one; on failure closes fd_ and throws Error 506.
-  void Acquire(bool exclusive);
   // Sleeps before the next attempt; throws Error 506 when none is left.
   void NextAttempt(int* attempts_left);
 
