@@ -17,14 +17,7 @@ LockFile::LockFile(const std::string& path, bool exclusive) : fd_(-1), path_(pat
     ORVANE_THROW_IF(0 > (fd_ = open(path_.c_str(), O_RDONLY | O_CREAT, 0644)), kErrLockFile,
                     "open failed, path=" + path_ + ", reason=" + std::strerror(errno));
     if (flock(fd_, (exclusive ? LOCK_EX : LOCK_SH) | LOCK_NB) == 0) return;
-    // A hard failure is not retried. The object never comes to exist, so its destructor will
-    // not run: the descriptor is closed here or it would leak for the life of the process.
-    if (errno != EINTR && errno != EWOULDBLOCK) {
-      const int failure = errno;
-      close(fd_);
-      fd_ = -1;
-      throw Error(kErrLockFile, std::strerror(failure));
-    }
+    if (errno != EINTR && errno != EWOULDBLOCK) FailHard();
     close(fd_);
     fd_ = -1;
     NextAttempt(&attempts_left);
@@ -35,12 +28,7 @@ LockFile::LockFile(UniqueFd fd, const std::string& path, bool exclusive)
     : fd_(fd.Release()), path_(path) {
   for (int attempts_left = kMaxAttempts;;) {
     if (flock(fd_, (exclusive ? LOCK_EX : LOCK_SH) | LOCK_NB) == 0) return;
-    if (errno != EINTR && errno != EWOULDBLOCK) {
-      const int failure = errno;
-      close(fd_);
-      fd_ = -1;
-      throw Error(kErrLockFile, std::strerror(failure));
-    }
+    if (errno != EINTR && errno != EWOULDBLOCK) FailHard();
     try {
       NextAttempt(&attempts_left);
     } catch (...) {
@@ -49,6 +37,15 @@ LockFile::LockFile(UniqueFd fd, const std::string& path, bool exclusive)
       throw;
     }
   }
+}
+
+// A hard failure is not retried. The object never comes to exist, so its destructor will not
+// run: the descriptor is closed here or it would leak for the life of the process.
+void LockFile::FailHard() {
+  const int failure = errno;
+  close(fd_);
+  fd_ = -1;
+  throw Error(kErrLockFile, std::strerror(failure));
 }
 
 void LockFile::NextAttempt(int* attempts_left) {

@@ -26,6 +26,7 @@ class LockFile {
 
  private:
   // Sleeps before the next attempt; throws Error 506 when none is left.
+  [[noreturn]] void FailHard();
   void NextAttempt(int* attempts_left);
 
   int fd_;
