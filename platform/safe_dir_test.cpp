@@ -1,6 +1,7 @@
 #include "platform/safe_dir.hpp"
 
 #include <fcntl.h>
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -11,6 +12,8 @@
 namespace orvane {
 namespace platform {
 namespace {
+
+using ::testing::HasSubstr;
 
 mode_t Mode(const std::string& path) {
   struct stat st;
@@ -24,12 +27,7 @@ TEST(SafeDirTest, MakesRootOnlyFoldersAndFilesAndNarrowsOlderOnes) {
   test::TempDir dir;
   const std::string share = test::MakeOpenShare(dir, "share");
   const std::string fi = share + "/@eaDir/@fileindex";
-  {
-    const SafeDir folder = SafeDir::Open(fi, true);
-    ASSERT_TRUE(folder.valid());
-    EXPECT_EQ(folder.path(), fi);
-    EXPECT_TRUE(folder.OpenFile("queue", O_WRONLY | O_CREAT).valid());
-  }
+  ASSERT_TRUE(SafeDir::Open(fi, true).OpenFile("queue", O_WRONLY | O_CREAT).valid());
   EXPECT_EQ(Mode(share), 0777u);  // the share itself is the administrator's
   EXPECT_EQ(Mode(share + "/@eaDir"), 0700u);
   EXPECT_EQ(Mode(fi), 0700u);
@@ -38,26 +36,26 @@ TEST(SafeDirTest, MakesRootOnlyFoldersAndFilesAndNarrowsOlderOnes) {
   // What an older installation left: folders 0755, files 0644 or writable by everyone.
   ASSERT_EQ(mkdir((fi + "/db").c_str(), 0755), 0);
   dir.Write("share/@eaDir/@fileindex/db/index.db", "x");
-  ASSERT_EQ(chmod((fi + "/db/index.db").c_str(), 0666), 0);
-  ASSERT_EQ(chmod((share + "/@eaDir").c_str(), 0755), 0);
-  ASSERT_EQ(chmod(fi.c_str(), 0755), 0);
-  ASSERT_EQ(chmod((fi + "/queue").c_str(), 0644), 0);
+  struct Older {
+    std::string path;
+    mode_t mode;
+    mode_t narrowed;
+  };
+  const Older older[] = {{share + "/@eaDir", 0755, 0700},     {fi, 0755, 0700},
+                         {fi + "/db", 0755, 0700},             {fi + "/queue", 0644, 0600},
+                         {fi + "/db/index.db", 0666, 0600}};
+  for (const Older& entry : older) ASSERT_EQ(chmod(entry.path.c_str(), entry.mode), 0);
   const SafeDir db = SafeDir::Open(fi + "/db", false);
   ASSERT_TRUE(db.valid());
   EXPECT_TRUE(db.CheckEntry("index.db", false));
   EXPECT_FALSE(db.CheckEntry("index.db-wal", false));
   EXPECT_TRUE(SafeDir::Open(fi, false).CheckEntry("queue", false));
-  for (const char* rel : {"/@eaDir", "/@eaDir/@fileindex", "/@eaDir/@fileindex/db"}) {
-    EXPECT_EQ(Mode(share + rel), 0700u) << rel;
-  }
-  EXPECT_EQ(Mode(fi + "/db/index.db"), 0600u);
-  EXPECT_EQ(Mode(fi + "/queue"), 0600u);
+  for (const Older& entry : older) EXPECT_EQ(Mode(entry.path), entry.narrowed) << entry.path;
 
   // A folder outside "@eaDir" is the administrator's: used as it is, never narrowed.
   const std::string plain = dir.Write("plain/file", "x");
   ASSERT_EQ(chmod(Dirname(plain).c_str(), 0755), 0);
-  const SafeDir trusted = SafeDir::Open(Dirname(plain), true);
-  EXPECT_TRUE(trusted.OpenFile("file", O_RDONLY).valid());
+  EXPECT_TRUE(SafeDir::Open(Dirname(plain), true).OpenFile("file", O_RDONLY).valid());
   EXPECT_EQ(Mode(Dirname(plain)), 0755u);
   EXPECT_EQ(Mode(plain), 0644u);
 
@@ -75,15 +73,14 @@ TEST(SafeDirTest, PlantedEntriesAreRefusedWithTheirPath) {
   const std::string share = test::MakeOpenShare(dir, "share");
   const std::string secret = dir.Write("secret/file", "root only\n");
   const std::string fi = share + "/@eaDir/@fileindex";
-  auto refusal = [](const std::function<void()>& fn) { return test::ErrorOf(fn); };
+  const auto open_fi = [&] { SafeDir::Open(fi, true); };
 
   ASSERT_TRUE(AsNobody([&] { return symlink(Dirname(secret).c_str(), (share + "/@eaDir").c_str()); }));
   for (int i = 0; i < 2; ++i) {
-    const Error e = refusal([&] { SafeDir::Open(fi, true); });
+    const Error e = test::ErrorOf(open_fi);
     EXPECT_EQ(e.code, kErrUnsafePath);
-    EXPECT_NE(e.message.find(share + "/@eaDir: it is a symbolic link"), std::string::npos)
-        << e.message;
-    EXPECT_NE(e.message.find("move it aside or remove it"), std::string::npos);
+    EXPECT_THAT(e.message, HasSubstr(share + "/@eaDir: it is a symbolic link"));
+    EXPECT_THAT(e.message, HasSubstr("move it aside or remove it"));
   }
   EXPECT_EQ(log.Count("unsafe index file " + share + "/@eaDir"), 1);
   EXPECT_FALSE(IsDirExist(Dirname(secret) + "/@fileindex", false));
@@ -91,8 +88,7 @@ TEST(SafeDirTest, PlantedEntriesAreRefusedWithTheirPath) {
   // A real folder, but the planter's.
   ASSERT_EQ(unlink((share + "/@eaDir").c_str()), 0);
   ASSERT_TRUE(AsNobody([&] { return mkdir((share + "/@eaDir").c_str(), 0777); }));
-  EXPECT_NE(refusal([&] { SafeDir::Open(fi, true); }).message.find("owned by uid 65534"),
-            std::string::npos);
+  EXPECT_THAT(test::ErrorOf(open_fi).message, HasSubstr("owned by uid 65534"));
   ASSERT_EQ(rmdir((share + "/@eaDir").c_str()), 0);
 
   // Links and a FIFO planted in a folder an older installation left open to everyone: the
@@ -108,12 +104,11 @@ TEST(SafeDirTest, PlantedEntriesAreRefusedWithTheirPath) {
   const SafeDir folder = SafeDir::Open(fi, false);
   EXPECT_EQ(Mode(share + "/@eaDir"), 0700u);
   EXPECT_EQ(Mode(fi), 0700u);
-  EXPECT_NE(refusal([&] { folder.OpenFile("queue", O_WRONLY | O_APPEND | O_CREAT); })
-                .message.find(fi + "/queue: it is a symbolic link"),
-            std::string::npos);
-  EXPECT_NE(refusal([&] { folder.CheckEntry("queue.tmp", false); })
-                .message.find(fi + "/queue.tmp: it is a special file"),
-            std::string::npos);
+  EXPECT_THAT(test::ErrorOf([&] { folder.OpenFile("queue", O_WRONLY | O_APPEND | O_CREAT); })
+                  .message,
+              HasSubstr(fi + "/queue: it is a symbolic link"));
+  EXPECT_THAT(test::ErrorOf([&] { folder.CheckEntry("queue.tmp", false); }).message,
+              HasSubstr(fi + "/queue.tmp: it is a special file"));
   EXPECT_THROW(folder.Sub("db", true), Error);
   EXPECT_EQ(test::ReadFile(secret), "root only\n");
   EXPECT_EQ(Mode(secret), 0644u);
@@ -134,15 +129,14 @@ TEST(SafeDirTest, AnExchangedFolderIsNeverWrittenThrough) {
   EXPECT_TRUE(held.OpenFile("queue", O_WRONLY | O_CREAT).valid());
   EXPECT_TRUE(IsFileExist(share + "/bait/@fileindex/queue"));  // the real folder, moved
   EXPECT_FALSE(IsFileExist(share + "/@eaDir/@fileindex/queue"));
-  const Error e = test::ErrorOf([&] { SafeDir::Open(share + "/@eaDir/@fileindex", true); });
-  EXPECT_EQ(e.code, kErrUnsafePath);
+  EXPECT_EQ(test::ErrorOf([&] { SafeDir::Open(share + "/@eaDir/@fileindex", true); }).code,
+            kErrUnsafePath);
 }
 
 TEST(SafeDirTest, RemoveTreeNeverFollowsALink) {
   test::TempDir dir;
   const std::string keep = dir.Write("outside/keep", "k");
-  dir.Write("share/@eaDir/@fileindex/db/index.db", "x");
-  const std::string db = dir.Path("share/@eaDir/@fileindex/db");
+  const std::string db = Dirname(dir.Write("share/@eaDir/@fileindex/db/index.db", "x"));
   ASSERT_EQ(symlink(Dirname(keep).c_str(), (db + "/escape").c_str()), 0);
   const SafeDir folder = SafeDir::Open(Dirname(db), false);
   ASSERT_TRUE(folder.valid());

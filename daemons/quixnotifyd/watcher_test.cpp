@@ -81,6 +81,20 @@ class WatcherTest : public ::testing::Test {
     chmod(notifier.c_str(), 0755);
   }
   std::string Notified() const { return test::ReadFile(dir_.Path("usr/quix/bin/notified")); }
+  // How many queue lines read `line`.
+  long LinesOf(const std::string& line) const {
+    const std::vector<std::string> lines = QueueLines(queue_, share_);
+    return std::count(lines.begin(), lines.end(), line);
+  }
+  long NotifiedCount() const {
+    const std::string notified = Notified();
+    return std::count(notified.begin(), notified.end(), '\n');
+  }
+  // A file where the queue's folder should be, so that no queue can be written.
+  void BlockQueueFolder() {
+    Mkdir("/@eaDir");
+    Touch("/@eaDir/@fileindex", "in the way");
+  }
   int ShareFlags() const { return fileindex::StatusMgr().GetShareStatus("share"); }
 
   // Runs the watcher until the queue holds at least `n` lines (or a generous bound passes).
@@ -158,8 +172,7 @@ TEST_F(WatcherTest, LostChangesBecomeOneReconciliation) {
   ASSERT_GT(kernel_queue, 0);
   for (int i = 0; i < kernel_queue / 2 + 100; ++i) Touch("/docs/f" + std::to_string(i), "");
   for (int i = 0; i < 20; ++i) w.RunOnce(50);
-  const std::vector<std::string> lines = QueueLines(queue_, share_);
-  EXPECT_EQ(std::count(lines.begin(), lines.end(), "10000 dir /docs reconcile"), 1);
+  EXPECT_EQ(LinesOf("10000 dir /docs reconcile"), 1);
 }
 
 TEST_F(WatcherTest, FolderShortOfWatchesIsMarkedAndReconciledUntilTheyFit) {
@@ -213,8 +226,7 @@ TEST_F(WatcherTest, FolderShortOfWatchesIsMarkedAndReconciledUntilTheyFit) {
   Touch("/docs/a/b/deep.txt");
   env.Advance(61 * 1000000LL);
   EXPECT_THAT(Drain(w, 2), ElementsAre("40 /docs/a/b/deep.txt", "8 /docs/a/b/deep.txt"));
-  const std::string notified = Notified();
-  EXPECT_EQ(std::count(notified.begin(), notified.end(), '\n'), 1);
+  EXPECT_EQ(NotifiedCount(), 1);
 }
 
 // A small ext4 image mounted on `dir` for its lifetime, unmounted and removed in all cases.
@@ -284,9 +296,8 @@ TEST_F(WatcherTest, FullVolumeFlagsTheShareOnceAndReconcilesWhenThereIsRoom) {
   EXPECT_EQ(ShareFlags(), fileindex::kShareStatusQueueNoSpace);
   EXPECT_EQ(log.Count("cannot append to queue " + queue_), 1);
   EXPECT_TRUE(log.Contains("free space on its volume"));
-  EXPECT_NE(Notified().find("error:index_no_space"), std::string::npos);
-  const std::string notified = Notified();
-  EXPECT_EQ(std::count(notified.begin(), notified.end(), '\n'), 1);
+  EXPECT_THAT(Notified(), ::testing::HasSubstr("error:index_no_space"));
+  EXPECT_EQ(NotifiedCount(), 1);
 
   // Room again: the reconciliation, written first, stands for everything not queued (what
   // changes before it is written is on the disk it reads); then lines as before.
@@ -328,8 +339,7 @@ TEST_F(WatcherTest, FollowsRegistrationChangesAndWritesOneLinePerQueue) {
 TEST_F(WatcherTest, UnwritableQueueKeepsLinesUntilItCanBeWritten) {
   Watcher w;
   // A file where the queue's folder should be is refused, once, with what to do about it.
-  Mkdir("/@eaDir");
-  Touch("/@eaDir/@fileindex", "in the way");
+  BlockQueueFolder();
   test::LogCapture log;
   Touch("/docs/kept.txt");
   w.RunOnce(200);
@@ -347,8 +357,7 @@ TEST_F(WatcherTest, TooManyLinesHeldGiveWayToAReconciliation) {
   WatcherOptions options;
   options.max_pending_bytes = 1024;
   Watcher w(options);
-  Mkdir("/@eaDir");
-  Touch("/@eaDir/@fileindex", "in the way");
+  BlockQueueFolder();
   test::LogCapture log;
   for (int i = 0; i < 20; ++i) Touch("/docs/f" + std::to_string(i) + ".txt");
   w.RunOnce(200);
@@ -474,22 +483,15 @@ TEST_F(WatcherTest, DaemonUnderARealWatchLimitMarksTheShareUntilTheLimitIsRaised
   const std::string told = "error:watch_limit " + share_ + "/docs user.max_inotify_watches 8\n";
   EXPECT_TRUE(wait_for([&] { return Notified().find(told) != std::string::npos; })) << Notified();
   // Reconciled at start and again every second while the limit holds.
-  EXPECT_TRUE(wait_for([&] {
-    const std::vector<std::string> lines = QueueLines(queue_, share_);
-    return std::count(lines.begin(), lines.end(), "10000 dir /docs reconcile") >= 3;
-  }));
+  EXPECT_TRUE(wait_for([&] { return LinesOf("10000 dir /docs reconcile") >= 3; }));
 
   ASSERT_EQ(0, std::system(("nsenter -U -t " + std::to_string(pid) +
                             " sh -c 'echo 100 > /proc/sys/user/max_inotify_watches'")
                                .c_str()));
   EXPECT_TRUE(wait_for([&] { return flags() == 0; }));
   Touch("/docs/d5/late.txt");
-  EXPECT_TRUE(wait_for([&] {
-    const std::vector<std::string> lines = QueueLines(queue_, share_);
-    return std::count(lines.begin(), lines.end(), "40 /docs/d5/late.txt") == 1;
-  }));
-  const std::string notified = Notified();
-  EXPECT_EQ(std::count(notified.begin(), notified.end(), '\n'), 1);
+  EXPECT_TRUE(wait_for([&] { return LinesOf("40 /docs/d5/late.txt") == 1; }));
+  EXPECT_EQ(NotifiedCount(), 1);
   kill(pid, SIGTERM);
   EXPECT_TRUE(wait_for([&] { return daemon.Exited(); }));
   EXPECT_TRUE(WIFEXITED(daemon.status) && WEXITSTATUS(daemon.status) == 0) << daemon.status;
