@@ -164,9 +164,9 @@ TEST_F(WorkerTest, ANameTakenByWhatIsNotIndexedLosesItsDocument) {
   EXPECT_EQ(Expect({"a"}), Pass(Line(0x40, "a/d")));
 }
 
-// A file whose extraction takes long (the helper here answers for it only once a release file
-// exists, or after 30 s) holds one extraction thread; the rest of a crawl, and the operations queued after it,
-// are extracted and sent meanwhile, but an operation on its path waits for it.
+// A file whose extraction takes long (the helper answers for it only once a release file exists,
+// or after 30 s) holds one extraction thread; the rest of a crawl and the operations queued after
+// it are sent meanwhile, but an operation on its path waits for it.
 TEST_F(WorkerTest, ASlowFileHoldsBackOnlyWhatConcernsIt) {
   sys_.WriteFolders({System::Folder("/docs/a", true)});
   const std::string release = sys_.root() + "/release";
@@ -204,11 +204,11 @@ done)");
 
   // A crawl; files of a folder are crawled before its sub-folders, so the slow one comes first.
   Write("a/d/slow.txt");
-  for (int i = 0; i < 6; ++i) Write("a/d/sub/f" + std::to_string(i) + ".txt");
-  EXPECT_FALSE(held_back(Line(0x10000, "a"), Expect({"a/d/sub/f0.txt", "a/d/sub/f5.txt"}),
+  Write("a/d/sub/f0.txt");
+  Write("a/d/sub/f1.txt");
+  EXPECT_FALSE(held_back(Line(0x10000, "a"), Expect({"a/d/sub/f0.txt", "a/d/sub/f1.txt"}),
                          Expect({"a/d/slow.txt"})));
-  EXPECT_EQ(Expect({"a", "a/d", "a/d/slow.txt", "a/d/sub", "a/d/sub/f0.txt", "a/d/sub/f1.txt",
-                    "a/d/sub/f2.txt", "a/d/sub/f3.txt", "a/d/sub/f4.txt", "a/d/sub/f5.txt"}),
+  EXPECT_EQ(Expect({"a", "a/d", "a/d/slow.txt", "a/d/sub", "a/d/sub/f0.txt", "a/d/sub/f1.txt"}),
             sys_.Documents("docs"));
 
   // Queued operations: the slow file changed, then new files, then its folder renamed. The new
@@ -222,7 +222,6 @@ done)");
                         Expect({"a/g1.txt", "a/g2.txt"}), Expect({"a/d", "a/d/slow.txt"})));
   extract::CloseIdleExtractHelpers();
   EXPECT_EQ(Expect({"a", "a/e", "a/e/slow.txt", "a/e/sub", "a/e/sub/f0.txt", "a/e/sub/f1.txt",
-                    "a/e/sub/f2.txt", "a/e/sub/f3.txt", "a/e/sub/f4.txt", "a/e/sub/f5.txt",
                     "a/g1.txt", "a/g2.txt"}),
             sys_.Documents("docs"));
 }
