@@ -28,40 +28,32 @@ int Shell(const std::string& command) {
 
 // A group and a user who belongs to it besides its own primary group "nogroup", created with
 // groupadd/useradd for the test and always removed.
-class ScopedUser {
- public:
-  ScopedUser() : name_("fiacc" + std::to_string(::getpid())) {
-    ok_ = Shell("groupadd " + name_ + "g") == 0 &&
-          Shell("useradd -M -N -g nogroup -G " + name_ + "g -s /usr/sbin/nologin " + name_) == 0;
-    const struct passwd* pw = ::getpwnam(name_.c_str());
-    const struct group* gr = ::getgrnam((name_ + "g").c_str());
-    ok_ = ok_ && pw != nullptr && gr != nullptr;
-    if (ok_) {
-      uid_ = pw->pw_uid;
-      gid_ = pw->pw_gid;
-      group_ = gr->gr_gid;
+struct ScopedUser {
+  ScopedUser() {
+    ok = Shell("groupadd " + group_name) == 0 &&
+         Shell("useradd -M -N -g nogroup -G " + group_name + " -s /usr/sbin/nologin " + name) == 0;
+    const struct passwd* pw = ::getpwnam(name.c_str());
+    const struct group* gr = ::getgrnam(group_name.c_str());
+    ok = ok && pw != nullptr && gr != nullptr;
+    if (ok) {
+      uid = pw->pw_uid;
+      gid = pw->pw_gid;
+      group = gr->gr_gid;
     }
   }
   ~ScopedUser() {
-    Shell("userdel " + name_ + " 2>/dev/null");
-    Shell("groupdel " + name_ + "g 2>/dev/null");
+    Shell("userdel " + name + " 2>/dev/null");
+    Shell("groupdel " + group_name + " 2>/dev/null");
   }
   ScopedUser(const ScopedUser&) = delete;
   ScopedUser& operator=(const ScopedUser&) = delete;
 
-  bool ok() const { return ok_; }
-  const std::string& name() const { return name_; }
-  std::string group_name() const { return name_ + "g"; }
-  uid_t uid() const { return uid_; }
-  gid_t gid() const { return gid_; }
-  gid_t group() const { return group_; }
-
- private:
-  std::string name_;
-  bool ok_ = false;
-  uid_t uid_ = 0;
-  gid_t gid_ = 0;
-  gid_t group_ = 0;
+  const std::string name = "fiacc" + std::to_string(::getpid());
+  const std::string group_name = name + "g";
+  bool ok = false;
+  uid_t uid = 0;
+  gid_t gid = 0;
+  gid_t group = 0;
 };
 
 // Runs `fn` in a child with the full identity of `user` (its groups from the user database,
@@ -107,7 +99,7 @@ class AccessTest : public ::testing::Test {
  protected:
   void SetUp() override {
     if (::geteuid() != 0) GTEST_SKIP() << "needs root to create users and switch to them";
-    ASSERT_TRUE(user_.ok()) << "groupadd/useradd failed";
+    ASSERT_TRUE(user_.ok) << "groupadd/useradd failed";
     ::chmod(dir_.path().c_str(), 0755);
   }
   // A file (or folder, for a name ending in '/') owned by root and `gid`, with `mode`, then
@@ -122,14 +114,14 @@ class AccessTest : public ::testing::Test {
     }
     EXPECT_EQ(::chown(path.c_str(), 0, gid), 0);
     EXPECT_EQ(::chmod(path.c_str(), mode), 0);
-    for (const auto& [from, to] : {std::pair<std::string, std::string>{"USER", user_.name()},
-                                   {"GROUP", user_.group_name()}}) {
+    for (const auto& [from, to] : {std::pair<std::string, std::string>{"USER", user_.name},
+                                   {"GROUP", user_.group_name}}) {
       for (size_t at; (at = acl.find(from)) != std::string::npos;) acl.replace(at, from.size(), to);
     }
     if (!acl.empty()) EXPECT_EQ(Shell("setfacl -m " + acl + " '" + path + "'"), 0) << acl;
     return path;
   }
-  AccessChecker Checker() { return AccessChecker(user_.uid(), user_.gid()); }
+  AccessChecker Checker() { return AccessChecker(user_.uid, user_.gid); }
 
   ScopedUser user_;
   orvane::test::TempDir dir_;
@@ -177,22 +169,22 @@ TEST_F(AccessTest, ModesAndAclsDecideAsTheKernelDoes) {
   Make("list/acl list/", 0700, "u:USER:r-x");
   Make("list/acl no list/", 0750, "u:USER:--x,g:GROUP:r-x");
   Make("enter/acl no search/", 0755, "u:USER:r--");
-  for (const Case& c : cases) Make(c.rel, c.mode, c.acl, c.group_owned ? user_.group() : 0);
+  for (const Case& c : cases) Make(c.rel, c.mode, c.acl, c.group_owned ? user_.group : 0);
   Make("enter/acl no search/sub/", 0755);
   Make("list/x only/sub/", 0755);
   AccessChecker checker = Checker();
   for (const Case& c : cases) {
     const std::string path = dir_.Path(c.rel);
-    EXPECT_EQ(KernelLets(user_.name(), path), c.visible) << c.rel;
+    EXPECT_EQ(KernelLets(user_.name, path), c.visible) << c.rel;
     EXPECT_EQ(checker.CanOpen(path), c.visible) << c.rel;
   }
 
   // The owner is judged by the owner bits alone, whatever the others may do; the owner of a
   // folder others may not list lists it.
   const std::string own = Make("plain/own.txt", 0044);
-  ASSERT_EQ(::chown(own.c_str(), user_.uid(), 0), 0);
-  ASSERT_EQ(::chown(dir_.Path("list/wx only").c_str(), user_.uid(), 0), 0);
-  EXPECT_FALSE(KernelLets(user_.name(), own));
+  ASSERT_EQ(::chown(own.c_str(), user_.uid, 0), 0);
+  ASSERT_EQ(::chown(dir_.Path("list/wx only").c_str(), user_.uid, 0), 0);
+  EXPECT_FALSE(KernelLets(user_.name, own));
   EXPECT_FALSE(Checker().CanOpen(own));
   EXPECT_TRUE(Checker().CanOpen(dir_.Path("list/wx only/file.txt")));
 }
@@ -208,8 +200,8 @@ TEST_F(AccessTest, SymlinksBelowTheShareAreNeverFollowed) {
     return ::symlink("readable.txt", (team + "/.t").c_str()) == 0 &&
            ::rename((team + "/.t").c_str(), secret.c_str()) == 0;
   };
-  ASSERT_EQ(AsUser(user_.name(), swap), 1);
-  ASSERT_TRUE(KernelLets(user_.name(), secret));
+  ASSERT_EQ(AsUser(user_.name, swap), 1);
+  ASSERT_TRUE(KernelLets(user_.name, secret));
   const std::string share = dir_.Path("vol/share");
   EXPECT_FALSE(Checker().CanOpen(secret, share));
   EXPECT_TRUE(Checker().CanOpen(readable, share));
@@ -260,7 +252,7 @@ TEST_F(AccessTest, AFolderSwappedDuringARequestHidesWhatIsBelowIt) {
   // Between two hits of one request the user puts their folder in the place of root's: the
   // folder answer the checker keeps is for root's folder, not for what the path now leads to.
   const std::string team = dir_.Path("team");
-  ASSERT_EQ(AsUser(user_.name(),
+  ASSERT_EQ(AsUser(user_.name,
                    [&] {
                      return ::rename((team + "/root").c_str(), (team + "/old").c_str()) == 0 &&
                             ::rename((team + "/mine").c_str(), (team + "/root").c_str()) == 0;
@@ -270,7 +262,7 @@ TEST_F(AccessTest, AFolderSwappedDuringARequestHidesWhatIsBelowIt) {
   // Also once the checker has looked elsewhere and must find the folder again by its path.
   EXPECT_TRUE(checker.CanOpen(note));
   EXPECT_FALSE(checker.CanOpen(secret));
-  EXPECT_TRUE(KernelLets(user_.name(), secret));
+  EXPECT_TRUE(KernelLets(user_.name, secret));
 }
 
 TEST_F(AccessTest, AclsAreReadOnOlderKernelsAndAFailedReadHidesTheFile) {

@@ -1,6 +1,6 @@
 // The daemon binary itself, through its real sockets: framing, signals, crashes and the
 // identity of callers (root and nobody).
-#include <grp.h>
+#include <fcntl.h>
 #include <poll.h>
 #include <pwd.h>
 #include <signal.h>
@@ -11,7 +11,6 @@
 
 #include <chrono>
 #include <cstring>
-#include <sstream>
 #include <thread>
 
 #include <gmock/gmock.h>
@@ -58,76 +57,66 @@ UniqueFd Connect(const std::string& socket, int timeout_s) {
   return fd;
 }
 
-// Another process, running as `uid`, that opens `count` connections to `socket`, sends nothing
-// on them and holds them until Release() or 30 s. Counts() says how many the daemon answered
-// at once with 1401 and how many it left open.
+// Another process, running as `user`, that opens `count` connections to `socket`, sends nothing
+// on them and holds them until Release() or 30 s. Counts() says how many it opened, how many
+// the daemon answered at once with 1401 and how many it closed without an answer.
 class Flood {
  public:
-  Flood(const std::string& socket, int count, uid_t uid, gid_t gid) {
+  Flood(const std::string& socket, int count, const std::string& user) {
     int report[2], release[2];
-    if (::pipe(report) != 0 || ::pipe(release) != 0) return;
-    pid_ = ::fork();
-    if (pid_ == 0) {
-      ::close(report[0]);
-      ::close(release[1]);
-      if (::setgroups(0, nullptr) != 0 || ::setgid(gid) != 0 || ::setuid(uid) != 0) _exit(3);
-      std::vector<UniqueFd> conns;
-      std::vector<struct pollfd> fds;
-      for (int i = 0; i < count; ++i) {
-        conns.push_back(Connect(socket, 5));
-        if (conns.back().valid()) fds.push_back({conns.back().get(), POLLIN, 0});
-      }
-      // The daemon answers the connections it refuses as it accepts them; the others stay
-      // silent. Ten seconds bound the wait for the last answers.
-      int refused = 0, closed = 0;
-      const auto until = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-      while (std::chrono::steady_clock::now() < until && refused + closed < count - 16) {
-        if (::poll(fds.data(), fds.size(), 100) <= 0) continue;
-        for (struct pollfd& p : fds) {
-          if (p.fd < 0 || p.revents == 0) continue;
-          char buf[4096];
-          const ssize_t n = ::recv(p.fd, buf, sizeof(buf), 0);
-          const std::string got(buf, n > 0 ? static_cast<size_t>(n) : 0);
-          (got.find("\"code\":1401") != std::string::npos ? refused : closed) += 1;
-          p.fd = -1;
-        }
-      }
-      const std::string counts = std::to_string(fds.size()) + " " + std::to_string(refused) + " " +
-                                 std::to_string(closed) + "\n";
-      if (::write(report[1], counts.data(), counts.size()) < 0) _exit(4);
-      struct pollfd wait = {release[0], POLLIN, 0};
-      ::poll(&wait, 1, 30000);
-      _exit(0);
-    }
-    ::close(report[1]);
-    ::close(release[0]);
+    if (::pipe2(report, O_CLOEXEC) != 0 || ::pipe2(release, O_CLOEXEC) != 0) return;
     report_.Reset(report[0]);
     release_.Reset(release[1]);
+    holder_ = std::thread([=] {
+      orvane::test::RunAsUser(user, [&] {
+        ::close(release[1]);  // or the wait below never sees Release()
+        std::vector<UniqueFd> conns;
+        std::vector<struct pollfd> fds;
+        for (int i = 0; i < count; ++i) {
+          conns.push_back(Connect(socket, 5));
+          if (conns.back().valid()) fds.push_back({conns.back().get(), POLLIN, 0});
+        }
+        // The daemon answers the connections it refuses as it accepts them; the others stay
+        // silent. Ten seconds bound the wait for the last answers.
+        int counts[3] = {static_cast<int>(fds.size()), 0, 0};
+        const auto until = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+        while (std::chrono::steady_clock::now() < until && counts[1] + counts[2] < count - 16) {
+          if (::poll(fds.data(), fds.size(), 100) <= 0) continue;
+          for (struct pollfd& p : fds) {
+            if (p.fd < 0 || p.revents == 0) continue;
+            char buf[4096];
+            const ssize_t n = ::recv(p.fd, buf, sizeof(buf), 0);
+            const std::string got(buf, n > 0 ? static_cast<size_t>(n) : 0);
+            counts[got.find("\"code\":1401") != std::string::npos ? 1 : 2] += 1;
+            p.fd = -1;
+          }
+        }
+        if (::write(report[1], counts, sizeof(counts)) != sizeof(counts)) return 4;
+        struct pollfd wait = {release[0], POLLIN, 0};
+        ::poll(&wait, 1, 30000);
+        return 0;
+      });
+      ::close(report[1]);
+      ::close(release[0]);
+    });
   }
   ~Flood() { Release(); }
 
-  // Waits for the flood to be in place: connected, refused at once, closed without an answer.
+  // Waits for the flood to be in place.
   std::vector<int> Counts() {
-    std::string text;
-    char c;
-    while (::read(report_.get(), &c, 1) == 1 && c != '\n') text += c;
-    std::istringstream in(text);
-    std::vector<int> out;
-    for (int n; in >> n;) out.push_back(n);
-    return out;
+    int counts[3] = {-1, -1, -1};
+    if (::read(report_.get(), counts, sizeof(counts)) != sizeof(counts)) return {};
+    return {counts[0], counts[1], counts[2]};
   }
   void Release() {
-    if (pid_ <= 0) return;
     release_.Close();
-    int status = 0;
-    ::waitpid(pid_, &status, 0);
-    pid_ = -1;
+    if (holder_.joinable()) holder_.join();
   }
 
  private:
-  pid_t pid_ = -1;
   UniqueFd report_;
   UniqueFd release_;
+  std::thread holder_;
 };
 
 class DaemonTest : public ::testing::Test {
@@ -332,7 +321,7 @@ TEST_F(DaemonTest, PublicFloodLeavesRoomForTheMainSocketAndOtherUsers) {
   ASSERT_EQ(CreateIndex()["success"], true);
   const Json::Value search = tc::Parse(R"({"command": "search", "data": {"name": "flood"}})");
 
-  Flood flood(daemon_->public_socket(), 400, nobody->pw_uid, nobody->pw_gid);
+  Flood flood(daemon_->public_socket(), 400, "nobody");
   EXPECT_THAT(flood.Counts(), ::testing::ElementsAre(400, 384, 0));
   const auto start = std::chrono::steady_clock::now();
   ASSERT_EQ(Send(tc::Upsert(dir_.Write("share/flood.txt", "x")))["success"], true);
