@@ -402,7 +402,6 @@ TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLink
       {"pub/memo denied.txt", 0644, "u:nobody:---"},
       {"team/memo open.txt", 0644, ""},
       {"team/memo swapped.txt", 0600, ""},
-      {"x711/memo listless.txt", 0644, ""},
   };
   std::vector<Json::Value> upserts;
   for (const File& f : files) {
@@ -418,8 +417,7 @@ TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLink
     upserts.push_back(upsert);
   }
   for (const auto& [rel, mode] : std::vector<std::pair<std::string, mode_t>>{
-           {"disk/share", 0755}, {"disk/share/pub", 0755}, {"disk/share/team", 0777},
-           {"disk/share/x711", 0711}}) {
+           {"disk/share", 0755}, {"disk/share/pub", 0755}, {"disk/share/team", 0777}}) {
     ASSERT_EQ(::chmod(dir_.Path(rel).c_str(), mode), 0);
   }
   Launch();
@@ -450,13 +448,13 @@ TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLink
   std::vector<std::string> names;
   for (const Json::Value& hit : by_name["hits"]) names.push_back(hit["name"].asString());
   EXPECT_THAT(names, ::testing::ElementsAre("memo granted.txt", "memo open.txt"));
-  EXPECT_EQ(search(R"({"name": "memo"})", true)["total"], 5);
+  EXPECT_EQ(search(R"({"name": "memo"})", true)["total"], 4);
   const Json::Value by_word = search(R"({"keyword": "memo", "sort": "name", "from": 1})", false);
   EXPECT_EQ(by_word["total"], 2);
   ASSERT_EQ(by_word["hits"].size(), 1u) << JsonToString(by_word);
   EXPECT_EQ(by_word["hits"][0]["path"], dir_.Path("vol/share/team/memo open.txt"));
   EXPECT_THAT(by_word["hits"][0]["snippet"].asString(), ::testing::HasSubstr("about openstuff"));
-  for (const char* hidden : {"deniedstuff", "swappedstuff", "listlessstuff"}) {
+  for (const char* hidden : {"deniedstuff", "swappedstuff"}) {
     const std::string query = std::string(R"({"keyword": ")") + hidden + "\"}";
     EXPECT_EQ(search(query, false)["total"], 0) << hidden;
     EXPECT_EQ(search(query, true)["total"], 1) << hidden;
@@ -465,7 +463,7 @@ TEST_F(DaemonTest, OrdinaryUsersSeeWhatTheKernelLetsThemOpenThroughAclsButNoLink
   // Suggestions offer no word found only in files nobody may not open.
   Json::Value suggest = tc::Parse(R"({"command": "suggest", "data": {"prefix": "", "size": 100}})");
   std::vector<std::string> offered;
-  for (const char* prefix : {"gran", "deni", "swap", "listl", "open"}) {
+  for (const char* prefix : {"gran", "deni", "swap", "open"}) {
     suggest["data"]["prefix"] = prefix;
     const Json::Value reply = tc::RequestAs(daemon_->public_socket(), suggest, uid, gid);
     for (const Json::Value& word : reply["data"]["suggestions"]) offered.push_back(word.asString());

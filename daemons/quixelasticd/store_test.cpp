@@ -221,21 +221,10 @@ TEST_F(StoreTest, NamesThatAreNotUtf8AreFoundByTheirValidParts) {
     EXPECT_FALSE(NameNeedsEncoding(term) && IsValidUtf8(term)) << "not decoded: " << term;
   }
 
-  // Queries on the identifier and on other fields, and a rename away from such a name.
+  // Queries on the identifier and on other fields.
   using K = DocQuery::Kind;
   EXPECT_THAT(Paths({K::kPrefix, "QUIXMDPath", "/v/s/dir\xFF/"}), ElementsAre(inner));
   EXPECT_THAT(Paths({K::kPrefix, "QUIXMDFSName", "caf\xE9"}), ElementsAre(latin1));
-  WriteTxn txn(*store_);
-  Json::Value fields;
-  fields["QUIXMDPath"] = "/v/s/cafe menu.txt";
-  fields["QUIXMDFSName"] = fields["QUIXMDSearchFileName"] = "cafe menu.txt";
-  store_->SetFields(latin1, fields);
-  EXPECT_TRUE(store_->Delete(lone));
-  txn.Commit();
-  p = SearchParams();
-  p.name = "menu";
-  EXPECT_THAT(Names(p), ElementsAre("cafe menu.txt"));
-  EXPECT_THAT(Paths(DocQuery()), ElementsAre("/v/s/cafe menu.txt", inner, cjk));
 }
 
 TEST_F(StoreTest, AFullDiskFailsTheWriteAndKeepsWhatWasThere) {
