@@ -65,10 +65,9 @@ class NamesEndToEndTest : public test::RunningSystemTest {
     args.insert(args.begin(), "--json");
     const CtlResult run = Ctl(args);
     EXPECT_EQ(run.status, 0) << testing::PrintToString(args) << run.err;
-    const std::string& text = run.out;
-    EXPECT_TRUE(StrictJson(text)) << testing::PrintToString(args) << "\n" << text;
+    EXPECT_TRUE(StrictJson(run.out)) << testing::PrintToString(args) << "\n" << run.out;
     JsonValue value;
-    EXPECT_TRUE(value.fromString(text)) << text;
+    EXPECT_TRUE(value.fromString(run.out)) << run.out;
     return std::move(value);
   }
 };
