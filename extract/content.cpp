@@ -515,29 +515,32 @@ void ExtractVideo(const OpenedFile& file, Json::Value& fields) {
   info.Close();
 }
 
-enum class Kind { kNone, kText, kPdf, kOoxml, kOdf, kAudio, kPhoto, kVideo };
+// Which parser reads a file follows its contents, so that a misnamed file is still read right.
+// Whether a file is read at all is the folder's switch for the kind its name gives
+// (fileindex::GetFileTypeByFullPath), decided before the helper is asked ("need_meta").
+enum class Format { kNone, kText, kPdf, kOoxml, kOdf, kAudio, kImage, kVideo };
 
-Kind KindOf(const std::string& path, const std::string& mime) {
+Format FormatOf(const std::string& path, const std::string& mime) {
   const std::string ext = GetFileExtension(path, true);
-  if (mime == "application/pdf") return Kind::kPdf;
+  if (mime == "application/pdf") return Format::kPdf;
   if (StringStartWith(mime, "application/vnd.openxmlformats-officedocument.") ||
       ((mime == "application/zip" || mime == "application/octet-stream") &&
        (ext == "docx" || ext == "xlsx" || ext == "pptx"))) {
-    return Kind::kOoxml;
+    return Format::kOoxml;
   }
   if (StringStartWith(mime, "application/vnd.oasis.opendocument.") ||
       ((mime == "application/zip" || mime == "application/octet-stream") &&
        (ext == "odt" || ext == "ods" || ext == "odp"))) {
-    return Kind::kOdf;
+    return Format::kOdf;
   }
-  if (StringStartWith(mime, "audio/")) return Kind::kAudio;
-  if (StringStartWith(mime, "image/")) return Kind::kPhoto;
-  if (StringStartWith(mime, "video/")) return Kind::kVideo;
+  if (StringStartWith(mime, "audio/")) return Format::kAudio;
+  if (StringStartWith(mime, "image/")) return Format::kImage;
+  if (StringStartWith(mime, "video/")) return Format::kVideo;
   if (StringStartWith(mime, "text/") || mime == "application/json" || mime == "application/xml" ||
       mime == "application/javascript" || mime == "application/x-subrip") {
-    return Kind::kText;
+    return Format::kText;
   }
-  return Kind::kNone;
+  return Format::kNone;
 }
 
 }  // namespace
@@ -583,34 +586,34 @@ std::string ToUtf8(const std::string& text, size_t max_bytes) {
 }
 
 Json::Value ExtractContent(const std::string& path) {
-  // Every kind, even one with nothing to extract, must at least be a readable regular file.
+  // Every format, even one with nothing to extract, must at least be a readable regular file.
   const OpenedFile file(path);
   ReadPrefix(file, 1);
   Json::Value fields(Json::objectValue);
   // The extension is the name's, not the descriptor's.
-  switch (KindOf(path, MimeTypeOf(file))) {
-    case Kind::kText:
+  switch (FormatOf(path, MimeTypeOf(file))) {
+    case Format::kText:
       ExtractText(file, fields);
       break;
-    case Kind::kPdf:
+    case Format::kPdf:
       ExtractPdf(file, fields);
       break;
-    case Kind::kOoxml:
+    case Format::kOoxml:
       ExtractOffice(file, false, fields);
       break;
-    case Kind::kOdf:
+    case Format::kOdf:
       ExtractOffice(file, true, fields);
       break;
-    case Kind::kAudio:
+    case Format::kAudio:
       ExtractAudio(file, fields);
       break;
-    case Kind::kPhoto:
+    case Format::kImage:
       ExtractPhoto(file, fields);
       break;
-    case Kind::kVideo:
+    case Format::kVideo:
       ExtractVideo(file, fields);
       break;
-    case Kind::kNone:
+    case Format::kNone:
       break;
   }
   return fields;

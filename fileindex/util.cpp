@@ -145,9 +145,38 @@ bool CanPathBeIndexed(const string& share_path) {
 }
 
 FileType GetFileTypeByFullPath(const string& full_path) {
+  return GetFileTypeByExtension(GetFileExtension(full_path, true));
+}
+
+FileType GetFileTypeByExtension(const string& ext) {
   const std::map<string, FileType>& table = FileTypeTable();
-  auto it = table.find(GetFileExtension(full_path, true));
+  auto it = table.find(ext);
   return it == table.end() ? kOther : it->second;
+}
+
+const std::vector<string>& GetExtensionsOfType(FileType type) {
+  static const std::vector<std::vector<string>> by_type = [] {
+    std::vector<std::vector<string>> lists(kOther + 1);
+    // The table is ordered, so each list comes out in byte order.
+    for (const auto& entry : FileTypeTable()) lists[entry.second].push_back(entry.first);
+    return lists;
+  }();
+  return by_type[type >= kDocument && type < kOther ? type : kOther];
+}
+
+namespace {
+const char* const kFileTypeSettings[] = {"document", "audio", "video", "photo"};
+}  // namespace
+
+const char* GetFileTypeSetting(FileType type) {
+  return type >= kDocument && type < kOther ? kFileTypeSettings[type] : nullptr;
+}
+
+FileType GetFileTypeBySetting(const string& name) {
+  for (int type = kDocument; type < kOther; ++type) {
+    if (name == kFileTypeSettings[type]) return static_cast<FileType>(type);
+  }
+  return kOther;
 }
 
 namespace {
@@ -269,6 +298,7 @@ const std::map<string, FileType>& FileTypeTable() {
 namespace {
 // Built while the library loads, so that no lookup pays for it.
 [[maybe_unused]] const std::map<string, FileType>& kBuiltAtLoad = FileTypeTable();
+[[maybe_unused]] const std::vector<string>& kListsBuiltAtLoad = GetExtensionsOfType(kDocument);
 }  // namespace
 
 }  // namespace fileindex

@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <map>
 #include <string>
+#include <vector>
 
 #include "common/util.hpp"
 
@@ -65,8 +66,20 @@ enum FileType : int32_t {
 };
 
 // The kind of a file from its lower-cased extension; kOther for an extension not in the table.
-// A name without an extension counts as a document.
+// A name without an extension counts as a document. This table is the one decision of a file's
+// kind: the folder switches, the crawl and the search filter by kind all ask it.
 FileType GetFileTypeByFullPath(const std::string& full_path);
+// The same for an extension already taken from a name and lower-cased ("" for none).
+FileType GetFileTypeByExtension(const std::string& ext);
+
+// Every extension of a kind, in byte order ("" among the documents); empty for kOther.
+const std::vector<std::string>& GetExtensionsOfType(FileType type);
+
+// The folder setting that switches extraction for a kind ("document", "audio", "video",
+// "photo"); nullptr for kOther.
+const char* GetFileTypeSetting(FileType type);
+// The kind whose folder setting is `name`; kOther when `name` is none of the four.
+FileType GetFileTypeBySetting(const std::string& name);
 
 // The extension table itself (738 keys), for tools and tests.
 const std::map<std::string, FileType>& FileTypeTable();

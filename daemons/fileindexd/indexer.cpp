@@ -581,10 +581,9 @@ bool Indexer::HasFolderBelow(const std::string& dir) const {
 
 bool Indexer::KindSwitched(const CrawlMode& mode, const std::string& path) const {
   if (!mode.kinds.isObject()) return false;
-  static const char* const kKinds[] = {"document", "audio", "video", "photo"};
-  const int type = fileindex::GetFileTypeByFullPath(path);
-  if (type < 0 || type > 3) return false;
-  const Json::Value& on = mode.kinds[kKinds[type]];
+  const char* setting = fileindex::GetFileTypeSetting(fileindex::GetFileTypeByFullPath(path));
+  if (setting == nullptr) return false;
+  const Json::Value& on = mode.kinds[setting];
   return on.isBool() && on.asBool();
 }
 
