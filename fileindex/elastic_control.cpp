@@ -18,6 +18,7 @@
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/status_mgr.hpp"
 #include "fileindex/util.hpp"
+#include "platform/fileidx.hpp"
 #include "platform/safe_dir.hpp"
 
 namespace orvane {
@@ -158,7 +159,7 @@ ParseFileFn SetParseFile(ParseFileFn parse_file) {
   return parse_file;
 }
 
-std::string GetFileIndexID(const std::string& share) { return "fileindex_" + share; }
+std::string GetFileIndexID(const std::string& share) { return platform::ComposeIndexID(share); }
 
 Json::Value GetFileIndexSettings() { return Json::Value(Json::objectValue); }
 

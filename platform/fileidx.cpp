@@ -35,11 +35,13 @@ int FILEIDXGetIndexID(const char* share_name, char* buf, size_t size) {
   if (share_name == nullptr || share_name[0] == '\0' || buf == nullptr) {
     return PLATFORM_FAIL(-1, EINVAL, kQErrBadParam);
   }
-  if (!CopyOut(std::string("fileindex_") + share_name, buf, size)) {
+  if (!CopyOut(ComposeIndexID(share_name), buf, size)) {
     return PLATFORM_FAIL(-1, ENAMETOOLONG, kQErrBufferTooSmall);
   }
   return 0;
 }
+
+std::string ComposeIndexID(const std::string& share_name) { return "fileindex_" + share_name; }
 
 }  // namespace platform
 }  // namespace orvane

@@ -6,6 +6,7 @@
 #define ORVANE_PLATFORM_FILEIDX_HPP_
 
 #include <cstddef>
+#include <string>
 
 namespace orvane {
 namespace platform {
@@ -16,6 +17,10 @@ int FILEIDXQueuePathCompose(const char* share_path, char* buf, size_t size);
 int FILEIDXDBPathCompose(const char* share_path, char* buf, size_t size);
 // "fileindex_<share name>"
 int FILEIDXGetIndexID(const char* share_name, char* buf, size_t size);
+
+// The search-engine index id of a share, "fileindex_<share name>", with no checks: the one place
+// the id is composed (the empty name gives the prefix that every id of ours begins with).
+std::string ComposeIndexID(const std::string& share_name);
 
 }  // namespace platform
 }  // namespace orvane

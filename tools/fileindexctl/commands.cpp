@@ -444,7 +444,7 @@ Json::Value SearchRequest(const Args& args) {
   if (args.Has("desc")) data["order"] = "desc";
   data["from"] = static_cast<Json::Int64>(args.GetInt("from", 0));
   data["size"] = static_cast<Json::Int64>(args.GetInt("size", 20));
-  if (args.Has("share")) data["id"] = "fileindex_" + args.Get("share");
+  if (args.Has("share")) data["id"] = elastic::GetFileIndexID(args.Get("share"));
   if (data.size() == 2 + (args.Has("share") ? 1 : 0)) {
     throw UsageError("give keywords, --name or a filter to search for");
   }
