@@ -4,6 +4,7 @@
 #include <sys/mount.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <thread>
 
@@ -59,6 +60,26 @@ TEST(FileTypeTest, LookupsByLowerCasedExtension) {
       {"/v/s/raw.X3F", kPhoto},       {"/v/s/", kDocument},
   };
   for (const auto& c : cases) EXPECT_EQ(GetFileTypeByFullPath(c.path), c.type) << c.path;
+}
+
+// The search filter and the crawl ask for a kind's extensions and its setting's name; both must
+// say what the lookup says, or a search by kind finds files the kind's switch never extracts.
+TEST(FileTypeTest, ExtensionListsAndSettingNamesAgreeWithTheLookup) {
+  size_t listed = 0;
+  for (FileType type : {kDocument, kAudio, kVideo, kPhoto}) {
+    const std::vector<std::string>& exts = GetExtensionsOfType(type);
+    EXPECT_TRUE(std::is_sorted(exts.begin(), exts.end()));
+    for (const std::string& ext : exts) EXPECT_EQ(GetFileTypeByExtension(ext), type) << ext;
+    listed += exts.size();
+    EXPECT_EQ(GetFileTypeBySetting(GetFileTypeSetting(type)), type);
+  }
+  EXPECT_EQ(listed, FileTypeTable().size());
+  EXPECT_EQ(GetExtensionsOfType(kPhoto).size(), 33u);
+  EXPECT_TRUE(GetExtensionsOfType(kOther).empty());
+  EXPECT_EQ(GetFileTypeSetting(kOther), nullptr);
+  for (const char* name : {"folder", "other", "Photo", ""}) {
+    EXPECT_EQ(GetFileTypeBySetting(name), kOther) << name;
+  }
 }
 
 // Real folders in real shares on this machine's file system.
