@@ -3,6 +3,8 @@
 // requests with the reply shapes of the protocol, and applies admission limits.
 // Thread-safe: any number of connection threads call Handle() at once; writes to one index are
 // serialised by that index's lock, and a compound request holds at most one index lock at a time.
+// The code is split by job: engine.cpp (requests, batches, document commands), registry.cpp
+// (the set of indexes and their states), index_commands.cpp, search.cpp.
 #ifndef ORVANE_DAEMONS_QUIXELASTICD_ENGINE_HPP_
 #define ORVANE_DAEMONS_QUIXELASTICD_ENGINE_HPP_
 

@@ -1,0 +1,255 @@
+// The people's commands: search and suggest over one, several or every index, each hit shown
+// only to a caller who could open its file.
+#include "daemons/quixelasticd/engine.hpp"
+
+#include <algorithm>
+#include <optional>
+
+#include "common/util.hpp"
+#include "daemons/quixelasticd/access.hpp"
+#include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/request_args.hpp"
+
+namespace orvane {
+namespace elasticd {
+
+namespace {
+
+// Deepest page a search may ask for; deeper paging is a sign of a runaway client.
+constexpr int64_t kMaxSearchFrom = 1000000;
+
+// Runs a read; a statement the guard interrupted is answered with why it stopped.
+template <typename Fn>
+auto Guarded(QueryGuard* guard, Fn fn) -> decltype(fn()) {
+  try {
+    return fn();
+  } catch (const StoreError&) {
+    if (guard != nullptr && guard->stopped() != QueryGuard::Stop::kNone) guard->Throw();
+    throw;
+  }
+}
+
+// Root sees every hit (no checker); anyone else only the files they could open. One checker
+// serves the whole request, so its folder answers are shared by every hit of every index.
+std::shared_ptr<AccessChecker> CheckerFor(const Caller& caller) {
+  if (caller.uid == 0) return nullptr;
+  return std::make_shared<AccessChecker>(caller.uid, caller.gid);
+}
+
+// The check for the hits of one index: symlinks are followed only down to its share's root.
+VisibleFn VisibleIn(const std::shared_ptr<AccessChecker>& checker, const IndexStore& store) {
+  if (!checker) return VisibleFn();
+  return [checker, root = AccessChecker::ShareRootOf(store.dir())](const std::string& path) {
+    return checker->CanOpen(path, root);
+  };
+}
+
+}  // namespace
+
+std::vector<std::shared_ptr<IndexStore>> Engine::SearchTargets(const Json::Value& data) {
+  std::vector<std::string> ids;
+  const Json::Value& id = data["id"];
+  if (id.isString()) {
+    ids.push_back(id.asString());
+  } else if (id.isArray()) {
+    for (const Json::Value& v : id) {
+      if (!v.isString()) throw EngineError(kCodeInvalidParam, "\"id\" must hold strings");
+      ids.push_back(v.asString());
+    }
+  } else if (!id.isNull()) {
+    throw EngineError(kCodeInvalidParam, "\"id\" must be a string or an array of strings");
+  }
+  std::vector<std::pair<std::string, std::shared_ptr<Entry>>> entries;
+  {
+    std::lock_guard<std::mutex> lock(registry_mu_);
+    if (ids.empty()) {
+      for (auto& [name, e] : indexes_) entries.emplace_back(name, e);
+    } else {
+      for (const std::string& name : ids) {
+        auto it = indexes_.find(name);
+        if (it == indexes_.end()) throw EngineError(kCodeIndexNotFound, "no index " + name);
+        entries.emplace_back(name, it->second);
+      }
+    }
+  }
+  std::vector<std::shared_ptr<IndexStore>> stores;
+  for (auto& [name, e] : entries) {
+    std::lock_guard<std::mutex> lock(e->view_mu);
+    if (e->view_store) {
+      stores.push_back(e->view_store);
+    } else if (!ids.empty()) {
+      // A named index that cannot answer is an error, not an empty result.
+      Entry view;
+      view.id = name;
+      view.state = e->view_state;
+      RequireReady(view);
+    }
+  }
+  return stores;
+}
+
+Json::Value Engine::Search(const Json::Value& data, const Caller& caller, QueryGuard* guard) {
+  SearchParams p;
+  const Json::Value& d = data.isObject() ? data : Json::Value(Json::objectValue);
+  auto str = [&](const char* key) {
+    const Json::Value& v = d[key];
+    if (!v.isNull() && !v.isString()) {
+      throw EngineError(kCodeInvalidParam, std::string("\"") + key + "\" must be a string");
+    }
+    return v.asString();
+  };
+  p.keywords = str("keyword");
+  p.name = str("name");
+  p.folder = str("folder");
+  const Json::Value& ext = d["ext"];
+  if (ext.isString()) {
+    p.exts.push_back(AsciiLower(ext.asString()));
+  } else if (ext.isArray()) {
+    for (const Json::Value& v : ext) {
+      if (!v.isString()) throw EngineError(kCodeInvalidParam, "\"ext\" must hold strings");
+      p.exts.push_back(AsciiLower(v.asString()));
+    }
+  } else if (!ext.isNull()) {
+    throw EngineError(kCodeInvalidParam, "\"ext\" must be a string or an array of strings");
+  }
+  const std::string type = str("file_type");
+  if (!type.empty()) {
+    static const std::map<std::string, std::vector<std::string>> kTypes = {
+        {"document", {"pdf", "doc", "docx", "odt", "rtf", "txt", "md", "xls", "xlsx", "ods",
+                      "csv", "ppt", "pptx", "odp", "html", "htm", "xml", "json", "epub"}},
+        {"audio", {"mp3", "flac", "wav", "ogg", "oga", "m4a", "aac", "wma", "aiff", "ape", "opus"}},
+        {"video", {"mp4", "mkv", "avi", "mov", "wmv", "m4v", "mpg", "mpeg", "webm", "ts", "flv",
+                   "3gp"}},
+        {"photo", {"jpg", "jpeg", "png", "gif", "bmp", "tif", "tiff", "heic", "webp", "raw",
+                   "cr2", "nef", "arw", "dng", "svg"}},
+    };
+    if (type == "folder") {
+      p.is_dir = true;
+    } else {
+      auto it = kTypes.find(type);
+      if (it == kTypes.end()) {
+        throw EngineError(kCodeInvalidParam, "unknown \"file_type\": " + type);
+      }
+      std::vector<std::string> allowed = it->second;
+      if (!p.exts.empty()) {
+        // Both filters hold: keep the named extensions of that type only.
+        std::vector<std::string> both;
+        for (const std::string& e : p.exts) {
+          if (std::find(allowed.begin(), allowed.end(), e) != allowed.end()) both.push_back(e);
+        }
+        allowed = both.empty() ? std::vector<std::string>{""} : both;
+      }
+      p.exts = allowed;
+      p.is_dir = false;
+    }
+  }
+  auto range = [&](const char* key, std::optional<int64_t>& lo, std::optional<int64_t>& hi) {
+    const Json::Value& r = d[key];
+    if (r.isNull()) return;
+    if (!r.isObject()) throw EngineError(kCodeInvalidParam, std::string("\"") + key +
+                                                                "\" must be an object");
+    for (const char* bound : {"gte", "lte"}) {
+      const Json::Value& v = r[bound];
+      if (v.isNull()) continue;
+      if (!v.isIntegral()) {
+        throw EngineError(kCodeInvalidParam, std::string("\"") + key + "\" bounds must be integers");
+      }
+      (bound[0] == 'g' ? lo : hi) = v.asLargestInt();
+    }
+  };
+  range("size_range", p.size_min, p.size_max);
+  range("mtime_range", p.mtime_min, p.mtime_max);
+  const std::string sort = str("sort");
+  if (sort.empty() || sort == "relevance") p.sort = SearchParams::Sort::kRelevance;
+  else if (sort == "name") p.sort = SearchParams::Sort::kName;
+  else if (sort == "size") p.sort = SearchParams::Sort::kSize;
+  else if (sort == "mtime") p.sort = SearchParams::Sort::kMtime;
+  else throw EngineError(kCodeInvalidParam, "unknown \"sort\": " + sort);
+  const std::string order = str("order");
+  if (!order.empty() && order != "asc" && order != "desc") {
+    throw EngineError(kCodeInvalidParam, "\"order\" must be asc or desc");
+  }
+  p.desc = order == "desc";
+  p.from = OptionalInt(d, "from", 0);
+  if (p.from > kMaxSearchFrom) {
+    throw EngineError(kCodeInvalidParam, "\"from\" is beyond " + std::to_string(kMaxSearchFrom));
+  }
+  p.size = std::min<int64_t>(OptionalInt(d, "size", 20), 1000);
+  if (p.keywords.empty() && p.name.empty() && p.folder.empty() && p.exts.empty() && !p.is_dir &&
+      !p.size_min && !p.size_max && !p.mtime_min && !p.mtime_max) {
+    throw EngineError(kCodeInvalidParam, "a search needs \"keyword\", \"name\" or a filter");
+  }
+
+  std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
+  const std::shared_ptr<AccessChecker> checker = CheckerFor(caller);
+  // Each index gives its best from + size hits; the merge keeps the global order.
+  SearchParams each = p;
+  each.from = 0;
+  each.size = p.from + p.size;
+  // With one index its page is the answer from `from` on; merged pages may take any of theirs.
+  each.snippet_from = stores.size() == 1 ? p.from : 0;
+  int64_t total = 0;
+  bool exact = true;
+  std::vector<Json::Value> hits;
+  for (auto& store : stores) {
+    SearchPage page =
+        Guarded(guard, [&] { return store->Search(each, VisibleIn(checker, *store), guard); });
+    total += page.total;
+    exact = exact && page.total_exact;
+    for (Json::Value& h : page.hits) hits.push_back(std::move(h));
+  }
+  auto key_less = [&](const Json::Value& a, const Json::Value& b) {
+    switch (p.sort) {
+      case SearchParams::Sort::kRelevance:
+        if (!p.keywords.empty()) {
+          return p.desc ? a["score"].asDouble() < b["score"].asDouble()
+                        : a["score"].asDouble() > b["score"].asDouble();
+        }
+        return false;  // index order within each index, indexes one after the other
+      case SearchParams::Sort::kName:
+        return p.desc ? AsciiLower(a["name"].asString()) > AsciiLower(b["name"].asString())
+                      : AsciiLower(a["name"].asString()) < AsciiLower(b["name"].asString());
+      case SearchParams::Sort::kSize:
+        return p.desc ? a["size"].asInt64() > b["size"].asInt64()
+                      : a["size"].asInt64() < b["size"].asInt64();
+      case SearchParams::Sort::kMtime:
+        return p.desc ? a["mtime"].asInt64() > b["mtime"].asInt64()
+                      : a["mtime"].asInt64() < b["mtime"].asInt64();
+    }
+    return false;
+  };
+  if (stores.size() > 1) std::stable_sort(hits.begin(), hits.end(), key_less);
+  Json::Value result;
+  result["total"] = static_cast<Json::Int64>(total);
+  result["total_exact"] = exact;
+  result["hits"] = Json::Value(Json::arrayValue);
+  for (int64_t i = p.from; i < static_cast<int64_t>(hits.size()) && i < p.from + p.size; ++i) {
+    result["hits"].append(hits[static_cast<size_t>(i)]);
+  }
+  return result;
+}
+
+Json::Value Engine::Suggest(const Json::Value& data, const Caller& caller, QueryGuard* guard) {
+  const Json::Value& d = data.isObject() ? data : Json::Value(Json::objectValue);
+  const std::string prefix = RequireString(d, "prefix");
+  const int64_t size = std::min<int64_t>(OptionalInt(d, "size", 10), 100);
+  std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
+  const std::shared_ptr<AccessChecker> checker = CheckerFor(caller);
+  std::vector<std::string> terms;
+  for (auto& store : stores) {
+    for (const std::string& t : Guarded(guard, [&] {
+           return store->Suggest(prefix, static_cast<size_t>(size), VisibleIn(checker, *store),
+                                 guard);
+         })) {
+      if (std::find(terms.begin(), terms.end(), t) == terms.end()) terms.push_back(t);
+    }
+  }
+  if (terms.size() > static_cast<size_t>(size)) terms.resize(static_cast<size_t>(size));
+  Json::Value result;
+  result["suggestions"] = Json::Value(Json::arrayValue);
+  for (const std::string& t : terms) result["suggestions"].append(t);
+  return result;
+}
+
+}  // namespace elasticd
+}  // namespace orvane
