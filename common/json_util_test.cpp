@@ -47,15 +47,7 @@ TEST(JsonUtilTest, GetJsonValueTypeRulesAndFailureTexts) {
   GetJsonValue(u, obj, "neg", false);
   EXPECT_EQ(u, 3u);
 
-  auto failure = [](const std::function<void()>& get) -> std::string {
-    try {
-      get();
-    } catch (const Error& e) {
-      EXPECT_EQ(e.code, kErrInvalidParam);
-      return e.what();
-    }
-    return "no error";
-  };
+  auto failure = [](const std::function<void()>& get) { return test::ErrorOf(get).message; };
   const JsonValue small = Parse(R"({"a":1,"b":true})");
   EXPECT_EQ(failure([&] { GetJsonValue(ll, small, "b", true); }),
             R"(Orvane error, code=120, reason=[Not a string, data={"a":1,"b":true}])");

@@ -42,32 +42,22 @@ struct Case {
   std::string text;  // its written form
 };
 
+// TheMappingIsOneToOne below checks every short name reads back; these pin the written form.
 std::vector<Case> Cases() {
   const auto cp = CodePointOf;
   return {
-      {"empty", "", ""},
-      {"ASCII", "/vol/share/Report 2024 (final).txt", "/vol/share/Report 2024 (final).txt"},
-      {"valid multibyte, 2 to 4 bytes", "caf\xC3\xA9 \xE6\x97\xA5 \xF0\x9F\x98\x80",
-       "caf\xC3\xA9 \xE6\x97\xA5 \xF0\x9F\x98\x80"},
+      {"ASCII and valid 2 to 4 bytes", "/v/caf\xC3\xA9 \xE6\x97\xA5 \xF0\x9F\x98\x80",
+       "/v/caf\xC3\xA9 \xE6\x97\xA5 \xF0\x9F\x98\x80"},
       {"Latin-1 name", "caf\xE9 na\xEFve.txt", "caf" + cp(0xE9) + " na" + cp(0xEF) + "ve.txt"},
-      {"lone 0xFF and continuation bytes", "\xFF\x80\xBF", cp(0xFF) + cp(0x80) + cp(0xBF)},
-      {"truncated before a slash and at the end", "\xE6\x97/x\xC3",
-       cp(0xE6) + cp(0x97) + "/x" + cp(0xC3)},
-      {"truncated 4-byte then valid", "\xF0\x9F\x98\xC3\xA9", cp(0xF0) + cp(0x9F) + cp(0x98) +
-                                                                "\xC3\xA9"},
-      {"overlong NUL, slash and 4-byte", "\xC0\x80\xC1\xAF\xE0\x80\xAF\xF0\x8F\xBF\xBF",
-       cp(0xC0) + cp(0x80) + cp(0xC1) + cp(0xAF) + cp(0xE0) + cp(0x80) + cp(0xAF) + cp(0xF0) +
-           cp(0x8F) + cp(0xBF) + cp(0xBF)},
-      {"surrogates in UTF-8", "\xED\xA0\x80\xED\xBF\xBF",
-       cp(0xED) + cp(0xA0) + cp(0x80) + cp(0xED) + cp(0xBF) + cp(0xBF)},
-      {"past U+10FFFF and never-valid leads", "\xF4\x90\x80\x80\xF5\xFE",
-       cp(0xF4) + cp(0x90) + cp(0x80) + cp(0x80) + cp(0xF5) + cp(0xFE)},
+      {"truncated 4-byte then valid", "\xF0\x9F\x98\xC3\xA9",
+       cp(0xF0) + cp(0x9F) + cp(0x98) + "\xC3\xA9"},
+      {"overlong NUL, surrogate, past U+10FFFF", "\xC0\x80\xED\xA0\x80\xF4\x90\x80\x80",
+       cp(0xC0) + cp(0x80) + cp(0xED) + cp(0xA0) + cp(0x80) + cp(0xF4) + cp(0x90) + cp(0x80) +
+           cp(0x80)},
       {"last characters before the range stay", "\xF4\x8F\xBD\xBF\xEF\xBF\xBD",
        "\xF4\x8F\xBD\xBF\xEF\xBF\xBD"},
       {"real U+10FF80 and U+10FFFF are written byte by byte", "\xF4\x8F\xBE\x80 \xF4\x8F\xBF\xBF",
-       cp(0xF4) + cp(0x8F) + cp(0xBE) + cp(0x80) + " " + cp(0xF4) + cp(0x8F) + cp(0xBF) +
-           cp(0xBF)},
-      {"invalid next to valid", "\xC3\xA9\xFF\xC3\xA9", "\xC3\xA9" + cp(0xFF) + "\xC3\xA9"},
+       cp(0xF4) + cp(0x8F) + cp(0xBE) + cp(0x80) + " " + cp(0xF4) + cp(0x8F) + cp(0xBF) + cp(0xBF)},
   };
 }
 
@@ -123,7 +113,7 @@ TEST(NameCodecTest, TheMappingIsOneToOne) {
     names.push_back(std::string(1, static_cast<char>(a)));
     for (int b = 0; b < 256; ++b) names.push_back({static_cast<char>(a), static_cast<char>(b)});
   }
-  const unsigned char edges[] = {'a', 0x7F, 0x80, 0x8F, 0x90, 0x9F, 0xA0, 0xBD, 0xBE,
+  const unsigned char edges[] = {'a',  0x7F, 0x80, 0x8F, 0x90, 0x9F, 0xA0, 0xBD, 0xBE,
                                  0xBF, 0xC0, 0xC2, 0xE0, 0xED, 0xF0, 0xF4, 0xF5, 0xFF};
   for (unsigned char a : edges) {
     for (unsigned char b : edges) {
