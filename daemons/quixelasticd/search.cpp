@@ -9,6 +9,7 @@
 #include "daemons/quixelasticd/access.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
 #include "daemons/quixelasticd/request_args.hpp"
+#include "fileindex/util.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -42,6 +43,26 @@ VisibleFn VisibleIn(const std::shared_ptr<AccessChecker>& checker, const IndexSt
   return [checker, root = AccessChecker::ShareRootOf(store.dir())](const std::string& path) {
     return checker->CanOpen(path, root);
   };
+}
+
+// The extensions a search by kind ("document", "audio", "video", "photo") matches: the library's
+// own table, the one the folders' content switches ask, so that a search by kind finds what that
+// kind's switch extracts. The index keeps only the extension, so the kind becomes a list over
+// that column: the index format stays as it was. Extensions `named` as well narrow it to those
+// of the kind; when none is, the list holds "/", which no extension can contain.
+std::vector<std::string> ExtensionsOfKind(const std::string& type,
+                                          const std::vector<std::string>& named) {
+  const fileindex::FileType kind = fileindex::GetFileTypeBySetting(type);
+  if (kind == fileindex::kOther) {
+    throw EngineError(kCodeInvalidParam, "unknown \"file_type\": " + type);
+  }
+  if (named.empty()) return fileindex::GetExtensionsOfType(kind);
+  std::vector<std::string> both;
+  for (const std::string& ext : named) {
+    if (fileindex::GetFileTypeByExtension(ext) == kind) both.push_back(ext);
+  }
+  if (both.empty()) both.push_back("/");
+  return both;
 }
 
 }  // namespace
@@ -114,32 +135,10 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller, QueryG
   }
   const std::string type = str("file_type");
   if (!type.empty()) {
-    static const std::map<std::string, std::vector<std::string>> kTypes = {
-        {"document", {"pdf", "doc", "docx", "odt", "rtf", "txt", "md", "xls", "xlsx", "ods",
-                      "csv", "ppt", "pptx", "odp", "html", "htm", "xml", "json", "epub"}},
-        {"audio", {"mp3", "flac", "wav", "ogg", "oga", "m4a", "aac", "wma", "aiff", "ape", "opus"}},
-        {"video", {"mp4", "mkv", "avi", "mov", "wmv", "m4v", "mpg", "mpeg", "webm", "ts", "flv",
-                   "3gp"}},
-        {"photo", {"jpg", "jpeg", "png", "gif", "bmp", "tif", "tiff", "heic", "webp", "raw",
-                   "cr2", "nef", "arw", "dng", "svg"}},
-    };
     if (type == "folder") {
       p.is_dir = true;
     } else {
-      auto it = kTypes.find(type);
-      if (it == kTypes.end()) {
-        throw EngineError(kCodeInvalidParam, "unknown \"file_type\": " + type);
-      }
-      std::vector<std::string> allowed = it->second;
-      if (!p.exts.empty()) {
-        // Both filters hold: keep the named extensions of that type only.
-        std::vector<std::string> both;
-        for (const std::string& e : p.exts) {
-          if (std::find(allowed.begin(), allowed.end(), e) != allowed.end()) both.push_back(e);
-        }
-        allowed = both.empty() ? std::vector<std::string>{""} : both;
-      }
-      p.exts = allowed;
+      p.exts = ExtensionsOfKind(type, p.exts);
       p.is_dir = false;
     }
   }
