@@ -259,29 +259,6 @@ bool Worker::RunPass() {
     documents_deleted_ += indexer.documents_deleted() - deleted_before;
   };
   size_t handed = 0;
-  // Applies one operation, retrying one that fails on its own and skipping it in the end.
-  const auto apply = [&](const std::shared_ptr<fileindex::OP>& op) {
-    int64_t delay = kOpRetryMicros;
-    for (int attempt = 1;; ++attempt) {
-      if (stop_.load()) throw PassAborted{false, ""};
-      try {
-        indexer.Apply(*op);
-        break;
-      } catch (const Error& e) {
-        if (IsPassFailure(e)) throw PassAborted{true, PassFailureText(share_, e)};
-        std::ostringstream what;
-        what << op;
-        if (attempt >= kOpAttempts) {
-          RecordError("skipped " + what.str() + ": " + e.what());
-          break;
-        }
-        Log(LOG_WARNING, "fileindexd: %s failed (attempt %d of %d): %s", what.str().c_str(),
-            attempt, kOpAttempts, e.what());
-        Backoff(delay);
-        delay *= 2;
-      }
-    }
-  };
   // Sends the upserts started ahead that are done, and those `op` must not overtake.
   const auto settle = [&](const fileindex::OP* op) {
     std::vector<std::shared_ptr<fileindex::OP>> failed;
@@ -291,7 +268,7 @@ bool Worker::RunPass() {
       if (IsPassFailure(e)) throw PassAborted{true, PassFailureText(share_, e)};
       throw;
     }
-    for (const auto& again : failed) apply(again);
+    for (const auto& again : failed) ApplyWithRetry(&indexer, again);
   };
   try {
     handed = mgr.ProcessOP(
@@ -300,7 +277,7 @@ bool Worker::RunPass() {
           settle(op.get());
           // A file whose contents are extracted is started ahead, so that a slow one does not
           // hold back the operations after it; it counts as done when handed over.
-          if (!indexer.UpsertAhead(op)) apply(op);
+          if (!indexer.UpsertAhead(op)) ApplyWithRetry(&indexer, op);
           std::unique_lock<std::mutex> lock(mu_);
           // One that failed or stopped half-way is not running any more.
           reconciling_ = false;
@@ -344,6 +321,30 @@ bool Worker::RunPass() {
   ops_pending_ = 0;
   last_pass_ = Env::Current()->Now();
   return true;
+}
+
+void Worker::ApplyWithRetry(Indexer* indexer, const std::shared_ptr<fileindex::OP>& op) {
+  int64_t delay = kOpRetryMicros;
+  for (int attempt = 1;; ++attempt) {
+    if (stop_.load()) throw PassAborted{false, ""};
+    try {
+      indexer->Apply(*op);
+      return;
+    } catch (const Error& e) {
+      // The engine or the volume failing is no fault of this operation: the whole batch waits.
+      if (IsPassFailure(e)) throw PassAborted{true, PassFailureText(share_, e)};
+      std::ostringstream what;
+      what << op;
+      if (attempt >= kOpAttempts) {
+        RecordError("skipped " + what.str() + ": " + e.what());
+        return;
+      }
+      Log(LOG_WARNING, "fileindexd: %s failed (attempt %d of %d): %s", what.str().c_str(),
+          attempt, kOpAttempts, e.what());
+      Backoff(delay);
+      delay *= 2;
+    }
+  }
 }
 
 void Worker::Wait(int timeout_ms) {

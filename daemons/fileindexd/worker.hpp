@@ -13,6 +13,7 @@
 #include <ctime>
 #include <functional>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <string>
 #include <thread>
@@ -23,6 +24,10 @@
 #include "daemons/fileindexd/reconciler.hpp"
 
 namespace orvane {
+namespace fileindex {
+class OP;
+}  // namespace fileindex
+
 namespace fileindexd {
 
 class Indexer;
@@ -78,6 +83,10 @@ class Worker {
 
  private:
   void Run();
+  // Applies one operation of a pass, trying one that fails on its own kOpAttempts times before
+  // it is recorded and skipped. Throws the pass's abort when the worker stops or the engine or
+  // the volume cannot take it.
+  void ApplyWithRetry(Indexer* indexer, const std::shared_ptr<fileindex::OP>& op);
   void Wait(int timeout_ms);
   // Sleeps, ending early on a stop or when `cut_short` is set.
   void Backoff(int64_t micros, const std::atomic<bool>* cut_short = nullptr);

@@ -1,11 +1,7 @@
 // quixelasticd: the search-engine daemon. Serves "/var/run/quixelasticd.sock" (under
 // ORVANE_ROOT) until SIGTERM or SIGINT; see README.md for the commands and options.
 #include <fcntl.h>
-#include <grp.h>
 #include <pwd.h>
-#include <signal.h>
-#include <sys/file.h>
-#include <sys/stat.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -15,11 +11,11 @@
 #include <string>
 
 #include "common/error.hpp"
-#include "common/fd.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
 #include "daemons/quixelasticd/engine.hpp"
 #include "daemons/quixelasticd/server.hpp"
+#include "platform/daemon_start.hpp"
 
 namespace {
 
@@ -125,6 +121,64 @@ void Daemonize() {
   }
 }
 
+// The engine's and the server's options from the flags (paths under ORVANE_ROOT).
+void ToOptions(const Flags& flags, orvane::elasticd::EngineOptions* engine_options,
+               orvane::elasticd::ServerOptions* server_options) {
+  const std::string state_dir = orvane::RootedPath(flags.state_dir);
+  engine_options->registry_file = state_dir + "/indexes.json";
+  engine_options->running_marker = state_dir + "/running";
+  engine_options->memory_limit_bytes = flags.memory_mb << 20;
+  engine_options->max_write_backlog = static_cast<int>(flags.backlog);
+  engine_options->index_root = flags.index_root;
+  engine_options->search_budget_micros = flags.search_budget_ms * 1000;
+  server_options->socket_path = orvane::RootedPath(flags.socket);
+  if (flags.public_socket != "none") {
+    server_options->public_socket_path = orvane::RootedPath(flags.public_socket);
+  }
+  server_options->max_frame_bytes = static_cast<uint32_t>(flags.max_frame);
+  server_options->max_connections = static_cast<int>(flags.connections);
+  server_options->io_timeout_micros = flags.io_timeout_s * 1000000LL;
+  server_options->max_public_connections = static_cast<int>(flags.public_connections);
+  server_options->max_public_connections_per_user = static_cast<int>(flags.public_per_user);
+  server_options->max_public_requests_per_user = static_cast<int>(flags.public_requests_per_user);
+  server_options->public_request_timeout_micros = flags.public_timeout_ms * 1000;
+  if (struct passwd* pw = ::getpwnam(flags.service_user.c_str())) {
+    server_options->service_uid = pw->pw_uid;
+    server_options->service_gid = pw->pw_gid;
+  } else {
+    Log(LOG_WARNING, "%s:%d service account %s not found: only root may change indexes",
+        SourceName(__FILE__), __LINE__, flags.service_user.c_str());
+  }
+}
+
+// Serves until a stop signal; 1 when the engine or the server could not start.
+int Serve(const Flags& flags, orvane::platform::DaemonSignals* signals) {
+  orvane::elasticd::EngineOptions engine_options;
+  orvane::elasticd::ServerOptions server_options;
+  ToOptions(flags, &engine_options, &server_options);
+  int status = 0;
+  orvane::elasticd::Engine engine(engine_options);
+  orvane::elasticd::Server server(engine, server_options);
+  try {
+    engine.Start();
+    server.Start();
+  } catch (const std::exception& e) {
+    Log(LOG_ERR, "%s:%d cannot start: %s", SourceName(__FILE__), __LINE__, e.what());
+    status = 1;
+  }
+  if (status == 0) {
+    Log(LOG_INFO, "%s:%d started, pid %d", SourceName(__FILE__), __LINE__,
+        static_cast<int>(::getpid()));
+    orvane::platform::NotifyReady();
+    const int sig = signals->Wait();
+    Log(LOG_INFO, "%s:%d stopping on signal %d", SourceName(__FILE__), __LINE__, sig);
+  }
+  // Connections in flight finish first; then every index is synced and closed.
+  server.Stop();
+  engine.Shutdown();
+  return status;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -134,82 +188,16 @@ int main(int argc, char** argv) {
   orvane::SetLogSink(orvane::SyslogSink(flags.foreground));
   ::openlog("quixelasticd", LOG_PID, LOG_DAEMON);
 
-  // Signals are taken by sigwait in this thread only; every thread started later inherits the
-  // mask, so none of them is interrupted by SIGTERM.
-  sigset_t stop_signals;
-  sigemptyset(&stop_signals);
-  sigaddset(&stop_signals, SIGTERM);
-  sigaddset(&stop_signals, SIGINT);
-  pthread_sigmask(SIG_BLOCK, &stop_signals, nullptr);
-  ::signal(SIGPIPE, SIG_IGN);
-
-  const std::string pid_path = orvane::RootedPathForWrite(flags.pid_file);
-  orvane::UniqueFd pid_fd(::open(pid_path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
-  if (!pid_fd.valid() || ::flock(pid_fd.get(), LOCK_EX | LOCK_NB) != 0) {
-    Log(LOG_ERR, "%s:%d cannot lock the pid file %s (is another daemon running?) [err: %m]",
-        SourceName(__FILE__), __LINE__, pid_path.c_str());
-    return 1;
-  }
-  const std::string pid_text = std::to_string(::getpid()) + "\n";
-  if (::ftruncate(pid_fd.get(), 0) != 0 ||
-      ::pwrite(pid_fd.get(), pid_text.data(), pid_text.size(), 0) !=
-          static_cast<ssize_t>(pid_text.size())) {
-    Log(LOG_ERR, "%s:%d cannot write the pid file %s [err: %m]", SourceName(__FILE__), __LINE__,
-        pid_path.c_str());
-    return 1;
-  }
-
-  orvane::elasticd::EngineOptions engine_options;
-  const std::string state_dir = orvane::RootedPath(flags.state_dir);
-  engine_options.registry_file = state_dir + "/indexes.json";
-  engine_options.running_marker = state_dir + "/running";
-  engine_options.memory_limit_bytes = flags.memory_mb << 20;
-  engine_options.max_write_backlog = static_cast<int>(flags.backlog);
-  engine_options.index_root = flags.index_root;
-  engine_options.search_budget_micros = flags.search_budget_ms * 1000;
-  orvane::elasticd::ServerOptions server_options;
-  server_options.socket_path = orvane::RootedPath(flags.socket);
-  if (flags.public_socket != "none") {
-    server_options.public_socket_path = orvane::RootedPath(flags.public_socket);
-  }
-  server_options.max_frame_bytes = static_cast<uint32_t>(flags.max_frame);
-  server_options.max_connections = static_cast<int>(flags.connections);
-  server_options.io_timeout_micros = flags.io_timeout_s * 1000000LL;
-  server_options.max_public_connections = static_cast<int>(flags.public_connections);
-  server_options.max_public_connections_per_user = static_cast<int>(flags.public_per_user);
-  server_options.max_public_requests_per_user = static_cast<int>(flags.public_requests_per_user);
-  server_options.public_request_timeout_micros = flags.public_timeout_ms * 1000;
-  if (struct passwd* pw = ::getpwnam(flags.service_user.c_str())) {
-    server_options.service_uid = pw->pw_uid;
-    server_options.service_gid = pw->pw_gid;
-  } else {
-    Log(LOG_WARNING, "%s:%d service account %s not found: only root may change indexes",
-        SourceName(__FILE__), __LINE__, flags.service_user.c_str());
-  }
-
+  // Before any thread starts, so that every one of them leaves the signals to the main thread.
+  orvane::platform::DaemonSignals signals(false);
   int status = 0;
-  {
-    orvane::elasticd::Engine engine(engine_options);
-    orvane::elasticd::Server server(engine, server_options);
-    try {
-      engine.Start();
-      server.Start();
-    } catch (const std::exception& e) {
-      Log(LOG_ERR, "%s:%d cannot start: %s", SourceName(__FILE__), __LINE__, e.what());
-      status = 1;
-    }
-    if (status == 0) {
-      Log(LOG_INFO, "%s:%d started, pid %d", SourceName(__FILE__), __LINE__,
-          static_cast<int>(::getpid()));
-      int sig = 0;
-      sigwait(&stop_signals, &sig);
-      Log(LOG_INFO, "%s:%d stopping on signal %d", SourceName(__FILE__), __LINE__, sig);
-    }
-    // Connections in flight finish first; then every index is synced and closed.
-    server.Stop();
-    engine.Shutdown();
+  try {
+    const orvane::platform::PidFile pid_file(orvane::RootedPathForWrite(flags.pid_file));
+    status = Serve(flags, &signals);
+  } catch (const orvane::Error& e) {
+    Log(LOG_ERR, "%s:%d %s", SourceName(__FILE__), __LINE__, e.what());
+    return 1;
   }
-  ::unlink(pid_path.c_str());
   Log(LOG_INFO, "%s:%d stopped", SourceName(__FILE__), __LINE__);
   return status;
 }

@@ -8,27 +8,41 @@
 // Runs in the foreground (a service manager puts it in the background), logs to syslog and to
 // standard error, re-reads the registrations on SIGHUP or when they change, stops on SIGTERM or
 // SIGINT after writing what it holds. Fixed paths follow ORVANE_ROOT.
-#include <signal.h>
 #include <syslog.h>
-#include <unistd.h>
 
-#include <atomic>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <fstream>
 #include <string>
 
 #include "common/error.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
 #include "daemons/quixnotifyd/watcher.hpp"
+#include "platform/daemon_start.hpp"
 
 namespace {
 
-std::atomic<bool> g_stop{false};
-
-void OnStop(int) { g_stop.store(true); }
+// Follows the registered folders until a stop signal; false when inotify failed.
+bool Serve(const orvane::quixnotifyd::WatcherOptions& options,
+           orvane::platform::DaemonSignals* signals) {
+  orvane::quixnotifyd::Watcher watcher(options);
+  // The watcher waits in its own poll; a signal cuts that wait short.
+  signals->Unblock();
+  // Whatever changed while no watcher ran (a stop, a crash, a reboot) is found by comparing
+  // every folder with its index; the watches are in place first.
+  watcher.ReconcileAll();
+  orvane::platform::NotifyReady();
+  while (!signals->stop().load()) {
+    if (!watcher.RunOnce(500)) {
+      orvane::Log(LOG_ERR, "quixnotifyd: inotify failed, stopping");
+      return false;
+    }
+    if (signals->TakeReload()) watcher.Reload();
+  }
+  watcher.Run(signals->stop(), 0);
+  return true;
+}
 
 }  // namespace
 
@@ -50,38 +64,13 @@ int main(int argc, char** argv) {
   openlog("quixnotifyd", LOG_PID, LOG_DAEMON);
   orvane::SetLogSink(orvane::SyslogSink(true));
 
-  struct sigaction stop = {};
-  stop.sa_handler = OnStop;
-  sigaction(SIGTERM, &stop, nullptr);
-  sigaction(SIGINT, &stop, nullptr);
-  signal(SIGPIPE, SIG_IGN);
-  // SIGHUP only has to interrupt the wait; the reload itself is done below.
-  std::atomic<bool> reload{false};
-  static std::atomic<bool>* reload_flag = &reload;
-  struct sigaction hup = {};
-  hup.sa_handler = [](int) { reload_flag->store(true); };
-  sigaction(SIGHUP, &hup, nullptr);
-
+  orvane::platform::DaemonSignals signals(true);
   try {
-    orvane::quixnotifyd::Watcher watcher(options);
-    // Whatever changed while no watcher ran (a stop, a crash, a reboot) is found by comparing
-    // every folder with its index; the watches are in place first.
-    watcher.ReconcileAll();
-    const std::string pid_path = orvane::RootedPathForWrite(pid_file);
-    std::ofstream(pid_path, std::ios::trunc) << getpid() << "\n";
-    while (!g_stop.load()) {
-      if (!watcher.RunOnce(500)) {
-        orvane::Log(LOG_ERR, "quixnotifyd: inotify failed, stopping");
-        unlink(pid_path.c_str());
-        return 1;
-      }
-      if (reload.exchange(false)) watcher.Reload();
-    }
-    watcher.Run(g_stop, 0);
-    unlink(pid_path.c_str());
+    // Taken before anything is watched: a second daemon must not add lines to the queues.
+    const orvane::platform::PidFile pid(orvane::RootedPathForWrite(pid_file));
+    return Serve(options, &signals) ? 0 : 1;
   } catch (const orvane::Error& e) {
     orvane::Log(LOG_ERR, "quixnotifyd: %s", e.what());
     return 1;
   }
-  return 0;
 }
