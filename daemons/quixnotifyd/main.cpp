@@ -7,7 +7,8 @@
 //
 // Runs in the foreground (a service manager puts it in the background), logs to syslog and to
 // standard error, re-reads the registrations on SIGHUP or when they change, stops on SIGTERM or
-// SIGINT after writing what it holds. Fixed paths follow ORVANE_ROOT.
+// SIGINT after writing what it holds. The pid file is locked: a second daemon refuses to start.
+// Fixed paths follow ORVANE_ROOT.
 #include <syslog.h>
 
 #include <cstdio>
