@@ -285,19 +285,37 @@ TEST_F(DaemonTest, ClientsHoldingTheSocketDoNotHoldOffOthers) {
   for (const UniqueFd& fd : idle) EXPECT_TRUE(ClosedByDaemon(fd.get(), 10000));
 
   // Any other user gets a few connections at a time; the next is refused at once, with a
-  // reason, and the user is served again once one is let go.
-  EXPECT_EQ(
-      kErrTooManyConnections, orvane::test::RunAsUser("nobody", [] {
-        std::vector<UniqueFd> held;
-        for (int i = 0; i < kMaxConnectionsPerUser; ++i) held.push_back(Connect());
-        const Json::Value refused = Command("status", Json::Value());
-        if (refused["error"]["msg"].asString().find("too many") == std::string::npos) return 1;
-        held.pop_back();
-        if (!WaitFor([] { return Command("status", Json::Value())["success"].asBool(); }, 5000)) {
-          return 2;
-        }
-        return refused["error"]["code"].asInt();
-      }));
+  // reason, and the user is served again once one is let go. A round in which the daemon's short
+  // wait let one of the held connections go before the next came (a loaded machine) proves
+  // nothing and is played again.
+  EXPECT_EQ(kErrTooManyConnections, orvane::test::RunAsUser("nobody", [] {
+              for (int round = 0; round < 5; ++round) {
+                std::vector<UniqueFd> held;
+                for (int i = 0; i < kMaxConnectionsPerUser; ++i) held.push_back(Connect());
+                const Json::Value refused = Command("status", Json::Value());
+                if (refused["success"].asBool()) {
+                  const auto one_let_go = [&held] {
+                    char byte;
+                    for (const UniqueFd& fd : held) {
+                      if (recv(fd.get(), &byte, 1, MSG_DONTWAIT) == 0) return true;
+                    }
+                    return false;
+                  };
+                  if (WaitFor(one_let_go, 3000)) continue;
+                  return 1;
+                }
+                if (refused["error"]["msg"].asString().find("too many") == std::string::npos) {
+                  return 2;
+                }
+                held.pop_back();
+                if (!WaitFor([] { return Command("status", Json::Value())["success"].asBool(); },
+                             5000)) {
+                  return 3;
+                }
+                return refused["error"]["code"].asInt();
+              }
+              return 4;
+            }));
 }
 
 TEST_F(DaemonTest, StatusShowsFileDetailsOnlyToAdministrators) {
