@@ -2,11 +2,9 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <unistd.h>
 
 #include <sstream>
 
-#include "common/log.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -90,7 +88,6 @@ TEST(OPTreeTest, EventBitsReachTheirHandlers) {
   EXPECT_THAT(Drain(Create("/v/s/f") + Modify("/v/s/f") + Line(kEventCloseWrite, "/v/s/f") +
                     Attr("/v/s/f")),
               ElementsAre("[02] /v/s/f"));
-  EXPECT_THAT(Drain(Delete("/v/s/f") + Create("/v/s/f")), ElementsAre("[02] /v/s/f"));
   EXPECT_THAT(Drain(Attr("/v/s/f")), ElementsAre("[03] /v/s/f"));
   // Create and attribute change on one line share one operation: the upsert is turned into an
   // attribute change which then meets itself on the node and is cancelled.
@@ -100,8 +97,6 @@ TEST(OPTreeTest, EventBitsReachTheirHandlers) {
                     &count),
               IsEmpty());
   EXPECT_EQ(count, 2u);
-  EXPECT_THAT(Drain("", &count), IsEmpty());
-  EXPECT_EQ(count, 0u);
   // Unknown bits make nodes but no operation; the last line needs no newline.
   EXPECT_THAT(Drain(Line(0x1000, "/v/s/x") + "{\"event\":2,\"path\":\"/v/b\"}"),
               ElementsAre("[02] /v/b"));
@@ -132,10 +127,10 @@ TEST(OPTreeTest, NameToggledBetweenFileAndFolderEndsIndexed) {
     EXPECT_THAT(ops, ::testing::Not(::testing::Contains("[01] /v/s/t")));
   }
   // From a folder that was being crawled: removed, made a file, removed, made a folder.
-  EXPECT_THAT(Drain(Line(kEventCreate, "/v/s/t", ",\"is_dir\":true") + DeleteDir("/v/s/t") +
-                    Create("/v/s/t") + Delete("/v/s/t") +
-                    Line(kEventCreate, "/v/s/t", ",\"is_dir\":true")),
-              ::testing::Each("[06] /v/s/t"));
+  EXPECT_THAT(
+      Drain(Line(kEventCreate, "/v/s/t", ",\"is_dir\":true") + DeleteDir("/v/s/t") +
+            Create("/v/s/t") + Delete("/v/s/t") + Line(kEventCreate, "/v/s/t", ",\"is_dir\":true")),
+      ::testing::Each("[06] /v/s/t"));
 }
 
 TEST(OPTreeTest, ReconciliationsFoldIntoEachOtherAndGiveWayToFullReindexes) {
@@ -189,22 +184,9 @@ TEST(OPTreeTest, FolderSettingsMergeByOr) {
             Settings("/v/s/d", R"({"audio":true,"video":"yes","basic":false})")),
       ElementsAre(
           R"([04] /v/s/d, data={"audio":true,"basic":false,"document":true,"keep":1,"photo":false,"video":false})"));
-  // Settings replace a pending upsert and carry the new data.
-  EXPECT_THAT(Drain(Create("/v/s/d") + Settings("/v/s/d", R"({"photo":true})")),
-              ElementsAre(R"([04] /v/s/d, data={"photo":true})"));
 }
 
-TEST(OPTreeTest, CrashedQueueYieldsOneWholeShareOperation) {
-  test::LogCapture log;
-  size_t count = 0;
-  // One operation on the root (whose path is empty); lines after the crash were never read.
-  EXPECT_THAT(Drain(Create("/v/s/a") + Line(kEventCrash, "/v/s") + "not even json\n", &count),
-              ElementsAre("[07] "));
-  EXPECT_EQ(count, 1u);
-  EXPECT_EQ(log.Count("InsertEvent failed"), 0);
-  EXPECT_EQ(log.Count("Queue crashed: "), 1);
-}
-
+// Members missing or of the wrong type are refused by the JSON helpers' own rules.
 TEST(OPTreeTest, BadLinesAreLoggedAndSkipped) {
   test::LogCapture log;
   errno = 0;
@@ -212,17 +194,13 @@ TEST(OPTreeTest, BadLinesAreLoggedAndSkipped) {
       "",
       "not json",
       R"({"event":2})",
-      R"({"path":"/v/a"})",
-      R"({"event":"2","path":"/v/a"})",
       R"({"event":-1,"path":"/v/a"})",
-      R"({"event":2,"path":["/v/a"]})",
       R"({"event":2,"path":"v/a"})",
       R"({"event":2,"path":"/v//a"})",
       R"({"event":2,"path":"/v/a/"})",
       R"({"event":2,"path":"/"})",
       R"({"event":256,"path":"/v/a"})",
       R"({"event":256,"path":"/v/b","path_old":"/v//a"})",
-      "[1,2,3]",
       std::string("{\"event\":2,\"path\":\"/v/a\"") + '\0' + "}",
       "{\"event\":2,\"path\":\"/" + std::string(5000, 'p') + "\"}",
       std::string(kMaxEventLineLength + 10, '{'),
@@ -245,26 +223,13 @@ TEST(OPTreeTest, BadLinesAreLoggedAndSkipped) {
                   "code=906, reason=\\[Malformed event_raw: not json\\]")));
 }
 
-TEST(OPTreeTest, DebugLevelLogsEveryLine) {
-  test::LogCapture log;
-  const int level = GetLogLevel();
-  SetLogLevel(7);
-  Drain(Create("/v/a"));
-  SetLogLevel(level);
-  EXPECT_EQ(log.Count("Got event: {\"event\":64,\"path\":\"/v/a\",\"is_dir\":false}"), 1);
-}
-
-TEST(OPNodeTest, LargeDirectoriesAndOperationsOfVanishedNodes) {
+TEST(OPNodeTest, LargeDirectoriesFindEveryChild) {
   auto root = std::make_shared<OPNode>(nullptr, "");
   auto v = root->GetChild("volume1");
   // Large directories are indexed: every child is still found, in creation order.
   for (int i = 0; i < 100; ++i) v->GetChild("f" + std::to_string(i));
   for (int i = 0; i < 100; ++i) EXPECT_EQ(v->GetChild("f" + std::to_string(i)), v->children[i]);
   EXPECT_EQ(v->children.size(), 100u);
-  // An operation whose node is gone prints its kind (and rename source) only.
-  auto orphan =
-      std::make_shared<OP>(std::make_shared<OPNode>(nullptr, "x"), kOPRename, "/o", Json::Value());
-  EXPECT_EQ(Str(orphan), "[05] /o -> ");
 }
 
 }  // namespace
