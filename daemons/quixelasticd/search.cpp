@@ -4,6 +4,8 @@
 
 #include <algorithm>
 #include <optional>
+#include <string>
+#include <vector>
 
 #include "common/util.hpp"
 #include "daemons/quixelasticd/access.hpp"
@@ -45,6 +47,30 @@ VisibleFn VisibleIn(const std::shared_ptr<AccessChecker>& checker, const IndexSt
   };
 }
 
+// The value of `key`: a string, or "" when absent.
+std::string OptionalString(const Json::Value& d, const char* key) {
+  const Json::Value& v = d[key];
+  if (!v.isNull() && !v.isString()) {
+    throw EngineError(kCodeInvalidParam, std::string("\"") + key + "\" must be a string");
+  }
+  return v.asString();
+}
+
+std::vector<std::string> ReadExts(const Json::Value& ext) {
+  std::vector<std::string> exts;
+  if (ext.isString()) {
+    exts.push_back(AsciiLower(ext.asString()));
+  } else if (ext.isArray()) {
+    for (const Json::Value& v : ext) {
+      if (!v.isString()) throw EngineError(kCodeInvalidParam, "\"ext\" must hold strings");
+      exts.push_back(AsciiLower(v.asString()));
+    }
+  } else if (!ext.isNull()) {
+    throw EngineError(kCodeInvalidParam, "\"ext\" must be a string or an array of strings");
+  }
+  return exts;
+}
+
 // The extensions a search by kind ("document", "audio", "video", "photo") matches: the library's
 // own table, the one the folders' content switches ask, so that a search by kind finds what that
 // kind's switch extracts. The index keeps only the extension, so the kind becomes a list over
@@ -63,6 +89,121 @@ std::vector<std::string> ExtensionsOfKind(const std::string& type,
   }
   if (both.empty()) both.push_back("/");
   return both;
+}
+
+void ReadRange(const Json::Value& d, const char* key, std::optional<int64_t>* lo,
+               std::optional<int64_t>* hi) {
+  const Json::Value& r = d[key];
+  if (r.isNull()) return;
+  if (!r.isObject()) throw EngineError(kCodeInvalidParam, std::string("\"") + key +
+                                                              "\" must be an object");
+  for (const char* bound : {"gte", "lte"}) {
+    const Json::Value& v = r[bound];
+    if (v.isNull()) continue;
+    if (!v.isIntegral()) {
+      throw EngineError(kCodeInvalidParam, std::string("\"") + key + "\" bounds must be integers");
+    }
+    *(bound[0] == 'g' ? lo : hi) = v.asLargestInt();
+  }
+}
+
+SearchParams::Sort ReadSort(const std::string& sort) {
+  if (sort.empty() || sort == "relevance") return SearchParams::Sort::kRelevance;
+  if (sort == "name") return SearchParams::Sort::kName;
+  if (sort == "size") return SearchParams::Sort::kSize;
+  if (sort == "mtime") return SearchParams::Sort::kMtime;
+  throw EngineError(kCodeInvalidParam, "unknown \"sort\": " + sort);
+}
+
+// A search request's parameters, checked in the order of its keys' errors.
+SearchParams ParseSearch(const Json::Value& d) {
+  SearchParams p;
+  p.keywords = OptionalString(d, "keyword");
+  p.name = OptionalString(d, "name");
+  p.folder = OptionalString(d, "folder");
+  p.exts = ReadExts(d["ext"]);
+  const std::string type = OptionalString(d, "file_type");
+  if (type == "folder") {
+    p.is_dir = true;
+  } else if (!type.empty()) {
+    p.exts = ExtensionsOfKind(type, p.exts);
+    p.is_dir = false;
+  }
+  ReadRange(d, "size_range", &p.size_min, &p.size_max);
+  ReadRange(d, "mtime_range", &p.mtime_min, &p.mtime_max);
+  p.sort = ReadSort(OptionalString(d, "sort"));
+  const std::string order = OptionalString(d, "order");
+  if (!order.empty() && order != "asc" && order != "desc") {
+    throw EngineError(kCodeInvalidParam, "\"order\" must be asc or desc");
+  }
+  p.desc = order == "desc";
+  p.from = OptionalInt(d, "from", 0);
+  if (p.from > kMaxSearchFrom) {
+    throw EngineError(kCodeInvalidParam, "\"from\" is beyond " + std::to_string(kMaxSearchFrom));
+  }
+  p.size = std::min<int64_t>(OptionalInt(d, "size", 20), 1000);
+  if (p.keywords.empty() && p.name.empty() && p.folder.empty() && p.exts.empty() && !p.is_dir &&
+      !p.size_min && !p.size_max && !p.mtime_min && !p.mtime_max) {
+    throw EngineError(kCodeInvalidParam, "a search needs \"keyword\", \"name\" or a filter");
+  }
+  return p;
+}
+
+// The hits of every index, each index giving its best from + size, with their totals summed.
+SearchPage SearchEach(const std::vector<std::shared_ptr<IndexStore>>& stores,
+                      const SearchParams& p, const Caller& caller, QueryGuard* guard) {
+  const std::shared_ptr<AccessChecker> checker = CheckerFor(caller);
+  SearchParams each = p;
+  each.from = 0;
+  each.size = p.from + p.size;
+  // With one index its page is the answer from `from` on; merged pages may take any of theirs.
+  each.snippet_from = stores.size() == 1 ? p.from : 0;
+  SearchPage all;
+  for (auto& store : stores) {
+    SearchPage page =
+        Guarded(guard, [&] { return store->Search(each, VisibleIn(checker, *store), guard); });
+    all.total += page.total;
+    all.total_exact = all.total_exact && page.total_exact;
+    for (Json::Value& h : page.hits) all.hits.push_back(std::move(h));
+  }
+  return all;
+}
+
+// Puts the hits of several indexes in the asked order; a stable sort keeps each index's own
+// order among equals.
+void MergeOrder(const SearchParams& p, std::vector<Json::Value>* hits) {
+  auto key_less = [&](const Json::Value& a, const Json::Value& b) {
+    switch (p.sort) {
+      case SearchParams::Sort::kRelevance:
+        if (!p.keywords.empty()) {
+          return p.desc ? a["score"].asDouble() < b["score"].asDouble()
+                        : a["score"].asDouble() > b["score"].asDouble();
+        }
+        return false;  // index order within each index, indexes one after the other
+      case SearchParams::Sort::kName:
+        return p.desc ? AsciiLower(a["name"].asString()) > AsciiLower(b["name"].asString())
+                      : AsciiLower(a["name"].asString()) < AsciiLower(b["name"].asString());
+      case SearchParams::Sort::kSize:
+        return p.desc ? a["size"].asInt64() > b["size"].asInt64()
+                      : a["size"].asInt64() < b["size"].asInt64();
+      case SearchParams::Sort::kMtime:
+        return p.desc ? a["mtime"].asInt64() > b["mtime"].asInt64()
+                      : a["mtime"].asInt64() < b["mtime"].asInt64();
+    }
+    return false;
+  };
+  std::stable_sort(hits->begin(), hits->end(), key_less);
+}
+
+Json::Value SearchReply(const SearchPage& all, const SearchParams& p) {
+  Json::Value result;
+  result["total"] = static_cast<Json::Int64>(all.total);
+  result["total_exact"] = all.total_exact;
+  result["hits"] = Json::Value(Json::arrayValue);
+  for (int64_t i = p.from; i < static_cast<int64_t>(all.hits.size()) && i < p.from + p.size; ++i) {
+    result["hits"].append(all.hits[static_cast<size_t>(i)]);
+  }
+  return result;
 }
 
 }  // namespace
@@ -110,122 +251,12 @@ std::vector<std::shared_ptr<IndexStore>> Engine::SearchTargets(const Json::Value
 }
 
 Json::Value Engine::Search(const Json::Value& data, const Caller& caller, QueryGuard* guard) {
-  SearchParams p;
   const Json::Value& d = data.isObject() ? data : Json::Value(Json::objectValue);
-  auto str = [&](const char* key) {
-    const Json::Value& v = d[key];
-    if (!v.isNull() && !v.isString()) {
-      throw EngineError(kCodeInvalidParam, std::string("\"") + key + "\" must be a string");
-    }
-    return v.asString();
-  };
-  p.keywords = str("keyword");
-  p.name = str("name");
-  p.folder = str("folder");
-  const Json::Value& ext = d["ext"];
-  if (ext.isString()) {
-    p.exts.push_back(AsciiLower(ext.asString()));
-  } else if (ext.isArray()) {
-    for (const Json::Value& v : ext) {
-      if (!v.isString()) throw EngineError(kCodeInvalidParam, "\"ext\" must hold strings");
-      p.exts.push_back(AsciiLower(v.asString()));
-    }
-  } else if (!ext.isNull()) {
-    throw EngineError(kCodeInvalidParam, "\"ext\" must be a string or an array of strings");
-  }
-  const std::string type = str("file_type");
-  if (!type.empty()) {
-    if (type == "folder") {
-      p.is_dir = true;
-    } else {
-      p.exts = ExtensionsOfKind(type, p.exts);
-      p.is_dir = false;
-    }
-  }
-  auto range = [&](const char* key, std::optional<int64_t>& lo, std::optional<int64_t>& hi) {
-    const Json::Value& r = d[key];
-    if (r.isNull()) return;
-    if (!r.isObject()) throw EngineError(kCodeInvalidParam, std::string("\"") + key +
-                                                                "\" must be an object");
-    for (const char* bound : {"gte", "lte"}) {
-      const Json::Value& v = r[bound];
-      if (v.isNull()) continue;
-      if (!v.isIntegral()) {
-        throw EngineError(kCodeInvalidParam, std::string("\"") + key + "\" bounds must be integers");
-      }
-      (bound[0] == 'g' ? lo : hi) = v.asLargestInt();
-    }
-  };
-  range("size_range", p.size_min, p.size_max);
-  range("mtime_range", p.mtime_min, p.mtime_max);
-  const std::string sort = str("sort");
-  if (sort.empty() || sort == "relevance") p.sort = SearchParams::Sort::kRelevance;
-  else if (sort == "name") p.sort = SearchParams::Sort::kName;
-  else if (sort == "size") p.sort = SearchParams::Sort::kSize;
-  else if (sort == "mtime") p.sort = SearchParams::Sort::kMtime;
-  else throw EngineError(kCodeInvalidParam, "unknown \"sort\": " + sort);
-  const std::string order = str("order");
-  if (!order.empty() && order != "asc" && order != "desc") {
-    throw EngineError(kCodeInvalidParam, "\"order\" must be asc or desc");
-  }
-  p.desc = order == "desc";
-  p.from = OptionalInt(d, "from", 0);
-  if (p.from > kMaxSearchFrom) {
-    throw EngineError(kCodeInvalidParam, "\"from\" is beyond " + std::to_string(kMaxSearchFrom));
-  }
-  p.size = std::min<int64_t>(OptionalInt(d, "size", 20), 1000);
-  if (p.keywords.empty() && p.name.empty() && p.folder.empty() && p.exts.empty() && !p.is_dir &&
-      !p.size_min && !p.size_max && !p.mtime_min && !p.mtime_max) {
-    throw EngineError(kCodeInvalidParam, "a search needs \"keyword\", \"name\" or a filter");
-  }
-
-  std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
-  const std::shared_ptr<AccessChecker> checker = CheckerFor(caller);
-  // Each index gives its best from + size hits; the merge keeps the global order.
-  SearchParams each = p;
-  each.from = 0;
-  each.size = p.from + p.size;
-  // With one index its page is the answer from `from` on; merged pages may take any of theirs.
-  each.snippet_from = stores.size() == 1 ? p.from : 0;
-  int64_t total = 0;
-  bool exact = true;
-  std::vector<Json::Value> hits;
-  for (auto& store : stores) {
-    SearchPage page =
-        Guarded(guard, [&] { return store->Search(each, VisibleIn(checker, *store), guard); });
-    total += page.total;
-    exact = exact && page.total_exact;
-    for (Json::Value& h : page.hits) hits.push_back(std::move(h));
-  }
-  auto key_less = [&](const Json::Value& a, const Json::Value& b) {
-    switch (p.sort) {
-      case SearchParams::Sort::kRelevance:
-        if (!p.keywords.empty()) {
-          return p.desc ? a["score"].asDouble() < b["score"].asDouble()
-                        : a["score"].asDouble() > b["score"].asDouble();
-        }
-        return false;  // index order within each index, indexes one after the other
-      case SearchParams::Sort::kName:
-        return p.desc ? AsciiLower(a["name"].asString()) > AsciiLower(b["name"].asString())
-                      : AsciiLower(a["name"].asString()) < AsciiLower(b["name"].asString());
-      case SearchParams::Sort::kSize:
-        return p.desc ? a["size"].asInt64() > b["size"].asInt64()
-                      : a["size"].asInt64() < b["size"].asInt64();
-      case SearchParams::Sort::kMtime:
-        return p.desc ? a["mtime"].asInt64() > b["mtime"].asInt64()
-                      : a["mtime"].asInt64() < b["mtime"].asInt64();
-    }
-    return false;
-  };
-  if (stores.size() > 1) std::stable_sort(hits.begin(), hits.end(), key_less);
-  Json::Value result;
-  result["total"] = static_cast<Json::Int64>(total);
-  result["total_exact"] = exact;
-  result["hits"] = Json::Value(Json::arrayValue);
-  for (int64_t i = p.from; i < static_cast<int64_t>(hits.size()) && i < p.from + p.size; ++i) {
-    result["hits"].append(hits[static_cast<size_t>(i)]);
-  }
-  return result;
+  const SearchParams p = ParseSearch(d);
+  const std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
+  SearchPage all = SearchEach(stores, p, caller, guard);
+  if (stores.size() > 1) MergeOrder(p, &all.hits);
+  return SearchReply(all, p);
 }
 
 Json::Value Engine::Suggest(const Json::Value& data, const Caller& caller, QueryGuard* guard) {

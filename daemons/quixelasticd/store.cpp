@@ -619,110 +619,26 @@ struct Arg {
   int64_t number;
 };
 
-Json::Value HitOf(Stmt& st, bool has_keywords) {
-  Json::Value hit;
-  hit["path"] = st.Text(0);
-  hit["name"] = st.Text(1);
-  hit["size"] = static_cast<Json::Int64>(st.Int(2));
-  hit["mtime"] = static_cast<Json::Int64>(st.Int(3));
-  hit["is_dir"] = st.Int(4) != 0;
-  hit["ext"] = st.Text(5);
-  if (has_keywords) hit["score"] = -st.Double(6);
-  return hit;
-}
-
-}  // namespace
-
-SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard) {
-  // The full-text tables hold written forms; the other columns hold the names' bytes.
-  const std::string match = MatchExpression(EncodeName(p.keywords));
-  const bool has_keywords = !match.empty();
-  const std::string name = EncodeName(AsciiLower(p.name));
+// A search as SQL: the joins and conditions its filters need, the order it is read in, and the
+// values of its '?' marks.
+struct SearchSql {
+  std::string match;  // the keywords as a full-text query; empty without keywords
+  std::string from = " FROM docs d";
+  std::string where = " WHERE 1";
+  std::string order;
   std::vector<Arg> args;
-  auto text = [&](const std::string& v) { args.push_back({true, v, 0}); };
-  auto number = [&](int64_t v) { args.push_back({false, std::string(), v}); };
 
+  bool has_keywords() const { return !match.empty(); }
+  void Text(std::string v) { args.push_back({true, std::move(v), 0}); }
+  void Number(int64_t v) { args.push_back({false, std::string(), v}); }
   // Snippets are made for the returned page only, after the rows are chosen: counting and
   // sorting never pay for them.
-  const std::string columns =
-      std::string("SELECT d.path, d.name, d.size, d.mtime, d.is_dir, d.ext") +
-      (has_keywords ? ", bm25(fts_all), d.rowid" : "");
-  std::string sql = " FROM docs d";
-  std::string where = " WHERE 1";
-  if (has_keywords) {
-    sql += " JOIN fts_all ON fts_all.rowid = d.rowid";
-    where += " AND fts_all MATCH ?";
-    text(match);
+  std::string Select() const {
+    return std::string("SELECT d.path, d.name, d.size, d.mtime, d.is_dir, d.ext") +
+           (has_keywords() ? ", bm25(fts_all), d.rowid" : "") + from + where + order;
   }
-  if (!name.empty()) {
-    sql += " JOIN fts_name ON fts_name.rowid = d.rowid";
-    // The trigram index answers substrings of three characters or more as a phrase of
-    // trigrams, from positions alone; shorter ones scan the names.
-    if (DisplayLength(name) >= 3) {
-      std::string phrase = "\"";
-      for (char c : name) {
-        if (c == '"') phrase += '"';
-        phrase += c;
-      }
-      where += " AND fts_name MATCH ?";
-      text(phrase + "\"");
-    } else {
-      where += " AND fts_name.name LIKE ? ESCAPE '\\'";
-      text("%" + EscapeLike(name) + "%");
-    }
-  }
-  if (!p.folder.empty()) {
-    std::string folder = p.folder;
-    while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
-    const std::string under = folder == "/" ? "/" : folder + "/";
-    const std::string upper = *PrefixUpperBound(under);
-    // The path range uses the path index; the ancestor test is what scopes.
-    where += " AND d.path >= ? AND d.path < ? AND (d.ancestor = ? OR (d.ancestor >= ? AND"
-             " d.ancestor < ?))";
-    text(under);
-    text(upper);
-    text(folder);
-    text(under);
-    text(upper);
-  }
-  if (!p.exts.empty()) {
-    where += " AND d.ext IN (";
-    for (size_t i = 0; i < p.exts.size(); ++i) {
-      where += i == 0 ? "?" : ",?";
-      text(AsciiLower(p.exts[i]));
-    }
-    where += ")";
-  }
-  auto bound = [&](const std::optional<int64_t>& v, const char* cond) {
-    if (!v) return;
-    where += cond;
-    number(*v);
-  };
-  bound(p.size_min, " AND d.size >= ?");
-  bound(p.size_max, " AND d.size <= ?");
-  bound(p.mtime_min, " AND d.mtime >= ?");
-  bound(p.mtime_max, " AND d.mtime <= ?");
-  if (p.is_dir) where += *p.is_dir ? " AND d.is_dir = 1" : " AND d.is_dir = 0";
-  const std::string base = columns + sql + where;
-  const char* dir = p.desc ? " DESC" : " ASC";
-  std::string order;
-  switch (p.sort) {
-    case SearchParams::Sort::kRelevance:
-      // Without keywords there is no score: hits come in index order, which costs no sort.
-      order = has_keywords ? std::string(" ORDER BY bm25(fts_all)") + (p.desc ? " DESC" : "")
-                           : "";
-      break;
-    case SearchParams::Sort::kName:
-      order = std::string(" ORDER BY d.name COLLATE NOCASE") + dir + ", d.path";
-      break;
-    case SearchParams::Sort::kSize:
-      order = std::string(" ORDER BY d.size") + dir + ", d.path";
-      break;
-    case SearchParams::Sort::kMtime:
-      order = std::string(" ORDER BY d.mtime") + dir + ", d.path";
-      break;
-  }
-  auto bind_all = [&](Stmt& st) {
+  // Binds every value from the first mark on; the index of the next mark.
+  int BindAll(Stmt& st) const {
     int i = 1;
     for (const Arg& a : args) {
       if (a.is_text) {
@@ -732,62 +648,183 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, Q
       }
     }
     return i;
-  };
+  }
+};
 
-  std::unique_ptr<Db> db = TakeReader();
+void AddNameFilter(const std::string& name, SearchSql* q) {
+  q->from += " JOIN fts_name ON fts_name.rowid = d.rowid";
+  // The trigram index answers substrings of three characters or more as a phrase of
+  // trigrams, from positions alone; shorter ones scan the names.
+  if (DisplayLength(name) >= 3) {
+    std::string phrase = "\"";
+    for (char c : name) {
+      if (c == '"') phrase += '"';
+      phrase += c;
+    }
+    q->where += " AND fts_name MATCH ?";
+    q->Text(phrase + "\"");
+  } else {
+    q->where += " AND fts_name.name LIKE ? ESCAPE '\\'";
+    q->Text("%" + EscapeLike(name) + "%");
+  }
+}
+
+void AddFolderFilter(std::string folder, SearchSql* q) {
+  while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
+  const std::string under = folder == "/" ? "/" : folder + "/";
+  const std::string upper = *PrefixUpperBound(under);
+  // The path range uses the path index; the ancestor test is what scopes.
+  q->where += " AND d.path >= ? AND d.path < ? AND (d.ancestor = ? OR (d.ancestor >= ? AND"
+              " d.ancestor < ?))";
+  q->Text(under);
+  q->Text(upper);
+  q->Text(folder);
+  q->Text(under);
+  q->Text(upper);
+}
+
+std::string OrderBy(const SearchParams& p, bool has_keywords) {
+  const char* dir = p.desc ? " DESC" : " ASC";
+  switch (p.sort) {
+    case SearchParams::Sort::kRelevance:
+      // Without keywords there is no score: hits come in index order, which costs no sort.
+      return has_keywords ? std::string(" ORDER BY bm25(fts_all)") + (p.desc ? " DESC" : "")
+                          : "";
+    case SearchParams::Sort::kName:
+      return std::string(" ORDER BY d.name COLLATE NOCASE") + dir + ", d.path";
+    case SearchParams::Sort::kSize:
+      return std::string(" ORDER BY d.size") + dir + ", d.path";
+    case SearchParams::Sort::kMtime:
+      return std::string(" ORDER BY d.mtime") + dir + ", d.path";
+  }
+  return "";
+}
+
+SearchSql SearchSqlOf(const SearchParams& p) {
+  SearchSql q;
+  // The full-text tables hold written forms; the other columns hold the names' bytes.
+  q.match = MatchExpression(EncodeName(p.keywords));
+  if (q.has_keywords()) {
+    q.from += " JOIN fts_all ON fts_all.rowid = d.rowid";
+    q.where += " AND fts_all MATCH ?";
+    q.Text(q.match);
+  }
+  const std::string name = EncodeName(AsciiLower(p.name));
+  if (!name.empty()) AddNameFilter(name, &q);
+  if (!p.folder.empty()) AddFolderFilter(p.folder, &q);
+  if (!p.exts.empty()) {
+    q.where += " AND d.ext IN (";
+    for (size_t i = 0; i < p.exts.size(); ++i) {
+      q.where += i == 0 ? "?" : ",?";
+      q.Text(AsciiLower(p.exts[i]));
+    }
+    q.where += ")";
+  }
+  auto bound = [&](const std::optional<int64_t>& v, const char* cond) {
+    if (!v) return;
+    q.where += cond;
+    q.Number(*v);
+  };
+  bound(p.size_min, " AND d.size >= ?");
+  bound(p.size_max, " AND d.size <= ?");
+  bound(p.mtime_min, " AND d.mtime >= ?");
+  bound(p.mtime_max, " AND d.mtime <= ?");
+  if (p.is_dir) q.where += *p.is_dir ? " AND d.is_dir = 1" : " AND d.is_dir = 0";
+  q.order = OrderBy(p, q.has_keywords());
+  return q;
+}
+
+// The hits of a page, and the full-text rows their snippets are made from.
+struct PageRows {
   SearchPage page;
   std::vector<int64_t> rowids;
-  auto add_hit = [&](Stmt& st) {
-    page.hits.push_back(HitOf(st, has_keywords));
-    if (has_keywords) rowids.push_back(st.Int(7));
-  };
-  const ScopedQueryGuard scoped(*db, guard);
-  if (!visible) {
-    // Counting stops at a bound, so that a one-letter search over a million names stays fast.
-    Stmt count(*db, "SELECT count(*) FROM (SELECT d.rowid" + sql + where + " LIMIT " +
-                        std::to_string(kCountLimit + 1) + ")");
-    bind_all(count);
-    if (count.Step()) page.total = count.Int(0);
-    if (page.total > kCountLimit) {
-      page.total = kCountLimit;
-      page.total_exact = false;
+
+  void Add(Stmt& st, bool has_keywords) {
+    Json::Value hit;
+    hit["path"] = st.Text(0);
+    hit["name"] = st.Text(1);
+    hit["size"] = static_cast<Json::Int64>(st.Int(2));
+    hit["mtime"] = static_cast<Json::Int64>(st.Int(3));
+    hit["is_dir"] = st.Int(4) != 0;
+    hit["ext"] = st.Text(5);
+    if (has_keywords) {
+      hit["score"] = -st.Double(6);
+      rowids.push_back(st.Int(7));
     }
-    Stmt st(*db, base + order + " LIMIT ? OFFSET ?");
-    const int next = bind_all(st);
-    st.Bind(next, p.size).Bind(next + 1, p.from);
-    while (st.Step()) add_hit(st);
-  } else {
-    // Hits the user may not open are skipped before paging, so counts and pages only ever
-    // reflect what this user can see.
-    Stmt st(*db, base + order);
-    bind_all(st);
-    int64_t seen = 0;
-    int64_t inspected = 0;
-    while (st.Step()) {
-      ++inspected;
-      if (seen >= p.from + p.size && inspected > p.from + p.size + kFilteredScanLimit) {
-        page.total_exact = false;
-        break;
-      }
-      if (!visible(st.Text(0))) continue;
-      ++seen;
-      if (seen > p.from && seen <= p.from + p.size) add_hit(st);
-    }
-    page.total = seen;
+    page.hits.push_back(std::move(hit));
   }
-  if (has_keywords && !page.hits.empty()) {
-    Stmt snip(*db, std::string("SELECT ") + kSnippetFunction +
-                       "(fts_all, '<b>', '</b>', '...', 12) FROM fts_all"
-                       " WHERE fts_all MATCH ? AND rowid = ?");
-    for (size_t i = static_cast<size_t>(std::max<int64_t>(p.snippet_from, 0)); i < page.hits.size();
-         ++i) {
-      snip.Reset();
-      snip.Bind(1, match).Bind(2, rowids[i]);
-      page.hits[i]["snippet"] = snip.Step() ? DecodeName(snip.Text(0)) : std::string();
+};
+
+// Every hit is visible: the page is read with LIMIT and OFFSET, and counting stops at a bound,
+// so that a one-letter search over a million names stays fast.
+void ReadPage(Db& db, const SearchSql& q, const SearchParams& p, PageRows* rows) {
+  Stmt count(db, "SELECT count(*) FROM (SELECT d.rowid" + q.from + q.where + " LIMIT " +
+                     std::to_string(IndexStore::kCountLimit + 1) + ")");
+  q.BindAll(count);
+  SearchPage& page = rows->page;
+  if (count.Step()) page.total = count.Int(0);
+  if (page.total > IndexStore::kCountLimit) {
+    page.total = IndexStore::kCountLimit;
+    page.total_exact = false;
+  }
+  Stmt st(db, q.Select() + " LIMIT ? OFFSET ?");
+  const int next = q.BindAll(st);
+  st.Bind(next, p.size).Bind(next + 1, p.from);
+  while (st.Step()) rows->Add(st, q.has_keywords());
+}
+
+// Hits the user may not open are skipped before paging, so counts and pages only ever reflect
+// what this user can see. Past the page, counting goes on for a bounded number of rows.
+void ScanVisible(Db& db, const SearchSql& q, const SearchParams& p, const VisibleFn& visible,
+                 PageRows* rows) {
+  Stmt st(db, q.Select());
+  q.BindAll(st);
+  int64_t seen = 0;
+  int64_t inspected = 0;
+  while (st.Step()) {
+    ++inspected;
+    if (seen >= p.from + p.size && inspected > p.from + p.size + IndexStore::kFilteredScanLimit) {
+      rows->page.total_exact = false;
+      break;
     }
+    if (!visible(st.Text(0))) continue;
+    ++seen;
+    if (seen > p.from && seen <= p.from + p.size) rows->Add(st, q.has_keywords());
+  }
+  rows->page.total = seen;
+}
+
+void AddSnippets(Db& db, const std::string& match, int64_t snippet_from, PageRows* rows) {
+  std::vector<Json::Value>& hits = rows->page.hits;
+  if (hits.empty()) return;
+  Stmt snip(db, std::string("SELECT ") + kSnippetFunction +
+                    "(fts_all, '<b>', '</b>', '...', 12) FROM fts_all"
+                    " WHERE fts_all MATCH ? AND rowid = ?");
+  for (size_t i = static_cast<size_t>(std::max<int64_t>(snippet_from, 0)); i < hits.size(); ++i) {
+    snip.Reset();
+    snip.Bind(1, match).Bind(2, rows->rowids[i]);
+    hits[i]["snippet"] = snip.Step() ? DecodeName(snip.Text(0)) : std::string();
+  }
+}
+
+}  // namespace
+
+SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard) {
+  const SearchSql q = SearchSqlOf(p);
+  std::unique_ptr<Db> db = TakeReader();
+  PageRows rows;
+  {
+    // The guard and every statement are gone before the connection goes back to the pool.
+    const ScopedQueryGuard scoped(*db, guard);
+    if (visible) {
+      ScanVisible(*db, q, p, visible, &rows);
+    } else {
+      ReadPage(*db, q, p, &rows);
+    }
+    if (q.has_keywords()) AddSnippets(*db, q.match, p.snippet_from, &rows);
   }
   GiveBackReader(std::move(db));
-  return page;
+  return std::move(rows.page);
 }
 
 std::vector<std::string> IndexStore::Suggest(const std::string& prefix, size_t limit,
