@@ -146,11 +146,7 @@ class DaemonTest : public ::testing::Test {
 };
 
 TEST_F(DaemonTest, FollowsTheQueueAndAnswersItsCommands) {
-  // The scratch root must be reachable for another user to reach the socket at all.
-  for (const std::string& dir : {sys_.root(), sys_.root() + "/var", sys_.root() + "/var/run"}) {
-    MakeParentDirs(dir + "/x");
-    chmod(dir.c_str(), 0755);
-  }
+  OpenSocketFolder(sys_.root());
   auto indexd = sys_.StartIndexd();
   // Only the share whose folders are not all paused has a worker.
   EXPECT_EQ(std::set<std::string>{"docs"}, Running());
@@ -174,11 +170,6 @@ TEST_F(DaemonTest, FollowsTheQueueAndAnswersItsCommands) {
   EXPECT_TRUE(
       WaitFor([&] { return (report = Status()["shares"][0])["ops_done"].asUInt() == 2; }, 5000))
       << report;
-  EXPECT_EQ("docs", report["share"].asString());
-  for (const char* key :
-       {"queue_length", "ops_pending", "documents_written", "last_pass", "errors", "paused"}) {
-    EXPECT_TRUE(report.isMember(key)) << key;
-  }
 
   // Bad input gets an error reply, never a crash; a frame cut short is closed without one.
   EXPECT_EQ(101, Command("reboot", Json::Value())["error"]["code"].asInt());
@@ -197,14 +188,11 @@ TEST_F(DaemonTest, FollowsTheQueueAndAnswersItsCommands) {
             }));
   EXPECT_EQ(std::set<std::string>{"docs"}, Running());
 
-  // A second daemon refuses to start beside it; a clean stop removes the socket and the pid
-  // file. (A batch left by a killed daemon is proven end to end.)
-  test::ChildProcess second(sys_.root(), {FILEINDEXD_BIN});
-  EXPECT_TRUE(second.Exited(5000));
+  // A clean stop removes the socket. (The pid file's lock and removal are the shared start-up's,
+  // tested with it; a batch left by a killed daemon is proven end to end.)
   const int wstatus = indexd->Signal(SIGTERM);
   EXPECT_TRUE(WIFEXITED(wstatus) && WEXITSTATUS(wstatus) == 0) << wstatus;
   EXPECT_FALSE(IsFileExist(RootedPath("/var/run/fileindexd.sock")));
-  EXPECT_FALSE(IsFileExist(RootedPath("/var/run/fileindexd.pid")));
 }
 
 // A start after a kill queues a reconciliation of every indexed folder, paused ones included;
@@ -265,16 +253,11 @@ TEST_F(DaemonTest, SighupReReadsTheFolderConfiguration) {
   EXPECT_FALSE(indexd->Exited(500));
   EXPECT_EQ(std::set<std::string>{"music"}, Running());
 
-  // Indexed again: the worker comes back. (A queue kept while a share has no worker, and
+  // /docs/a indexed again and all of /music's folders paused: the one worker comes back, the
+  // other stops as it would not have started. (A queue kept while a share has no worker, and
   // drained when it has one again, is proven end to end.)
-  folders.append(System::Folder("/docs/a", false));
-  sys_.WriteFolders(folders);
-  ASSERT_EQ(0, kill(indexd->pid(), SIGHUP));
-  EXPECT_TRUE(WaitFor([] { return Running() == std::set<std::string>{"docs", "music"}; }, 5000));
-  EXPECT_EQ(want, sys_.Documents("music"));
-
-  // All of a share's folders paused: its worker stops, as it would not have started.
   folders[0]["paused"] = true;
+  folders.append(System::Folder("/docs/a", false));
   sys_.WriteFolders(folders);
   ASSERT_EQ(0, kill(indexd->pid(), SIGHUP));
   EXPECT_TRUE(WaitFor([] { return Running() == std::set<std::string>{"docs"}; }, 5000));
