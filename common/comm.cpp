@@ -10,8 +10,8 @@
 #include "common/error.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
+#include "common/notify.hpp"
 #include "common/root.hpp"
-#include "fileindex/notify.hpp"
 #include "platform/daemon_sock.hpp"
 
 namespace orvane {

@@ -1,6 +1,7 @@
 #include "platform/monitor_queue.hpp"
 
 #include <dirent.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -8,7 +9,6 @@
 
 #include "common/json_util.hpp"
 #include "common/root.hpp"
-#include "common/util.hpp"
 #include "platform/fault.hpp"
 
 namespace QUIX {
@@ -87,7 +87,9 @@ bool MonitorQueue::Delete(const std::string& queue_path, const std::string& app,
     errno = EINVAL;
     return false;
   }
-  return orvane::Unlink(RegistrationPath(queue_path, app, type));
+  // A registration already gone counts as deleted.
+  const std::string path = RegistrationPath(queue_path, app, type);
+  return unlink(path.c_str()) == 0 || errno == ENOENT;
 }
 
 std::vector<Json::Value> MonitorQueue::List() {

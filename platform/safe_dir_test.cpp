@@ -6,7 +6,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "common/util.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -19,6 +18,19 @@ mode_t Mode(const std::string& path) {
   struct stat st;
   return lstat(path.c_str(), &st) == 0 ? st.st_mode & 07777 : 0;
 }
+
+// What `path` itself is, links not followed.
+bool IsDir(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+bool IsFile(const std::string& path) {
+  struct stat st;
+  return lstat(path.c_str(), &st) == 0 && S_ISREG(st.st_mode);
+}
+
+// The folder of a path the test made (absolute, with no trailing "/").
+std::string Dirname(const std::string& path) { return path.substr(0, path.rfind('/')); }
 
 // `fn` run as nobody; true when it returned 0.
 bool AsNobody(const std::function<int()>& fn) { return test::RunAsUser("nobody", fn) == 0; }
@@ -106,8 +118,8 @@ TEST(SafeDirTest, AnExchangedFolderIsNeverWrittenThrough) {
            test::RenameExchange(share + "/@eaDir", share + "/bait");
   }));
   EXPECT_TRUE(held.OpenFile("queue", O_WRONLY | O_CREAT).valid());
-  EXPECT_TRUE(IsFileExist(share + "/bait/@fileindex/queue"));  // the real folder, moved
-  EXPECT_FALSE(IsFileExist(share + "/@eaDir/@fileindex/queue"));
+  EXPECT_TRUE(IsFile(share + "/bait/@fileindex/queue"));  // the real folder, moved
+  EXPECT_FALSE(IsFile(share + "/@eaDir/@fileindex/queue"));
   EXPECT_EQ(test::ErrorOf([&] { SafeDir::Open(share + "/@eaDir/@fileindex", true); }).code,
             kErrUnsafePath);
 }
@@ -121,7 +133,7 @@ TEST(SafeDirTest, RemoveTreeNeverFollowsALink) {
   ASSERT_TRUE(folder.valid());
   EXPECT_EQ(folder.RemoveTree("db"), 0);
   EXPECT_EQ(folder.RemoveTree("db"), 0);  // gone already
-  EXPECT_FALSE(IsDirExist(db, false));
+  EXPECT_FALSE(IsDir(db));
   EXPECT_EQ(test::ReadFile(keep), "k");
 }
 

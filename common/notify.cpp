@@ -1,4 +1,4 @@
-#include "fileindex/notify.hpp"
+#include "common/notify.hpp"
 
 #include <cerrno>
 
