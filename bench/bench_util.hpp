@@ -14,6 +14,7 @@
 #include <string>
 #include <vector>
 
+#include "common/wire.hpp"
 #include "daemons/quixelasticd/engine.hpp"
 #include "daemons/quixelasticd/server.hpp"
 
@@ -58,8 +59,8 @@ class InProcessEngine {
   void Stop();
 
   elasticd::Engine& engine() { return *engine_; }
-  std::string socket() const { return root_ + "/var/run/quixelasticd.sock"; }
-  std::string public_socket() const { return root_ + "/var/run/quixelasticd.search.sock"; }
+  std::string socket() const { return root_ + kElasticdSockPath; }
+  std::string public_socket() const { return root_ + kElasticdSearchSockPath; }
 
  private:
   std::string root_;

@@ -15,35 +15,17 @@
 
 #include "common/comm.hpp"
 #include "common/root.hpp"
+#include "common/wire.hpp"
 #include "fileindex/communication.hpp"
 
 namespace {
 
 using namespace orvane;  // NOLINT
 
-bool ReadExact(int fd, char* buf, size_t size) {
-  for (size_t got = 0; got < size;) {
-    const ssize_t n = read(fd, buf + got, size - got);
-    if (n <= 0) return false;
-    got += static_cast<size_t>(n);
-  }
-  return true;
-}
-
-void WriteAll(int fd, const std::string& bytes) {
-  for (size_t done = 0; done < bytes.size();) {
-    const ssize_t n = send(fd, bytes.data() + done, bytes.size() - done, MSG_NOSIGNAL);
-    if (n <= 0) return;
-    done += static_cast<size_t>(n);
-  }
-}
-
 // Answers every request frame on `path` with one fixed reply frame, one connection at a time.
 class Responder {
  public:
-  Responder(const std::string& path, const std::string& reply) : path_(path) {
-    const uint32_t length = static_cast<uint32_t>(reply.size());
-    reply_ = std::string(reinterpret_cast<const char*>(&length), 4) + reply;
+  Responder(const std::string& path, const std::string& reply) : path_(path), reply_(reply) {
     MakeParentDirs(path);
     unlink(path.c_str());
     fd_ = socket(AF_UNIX, SOCK_STREAM, 0);
@@ -71,10 +53,10 @@ class Responder {
       if (poll(&pfd, 1, 50) <= 0) continue;
       const int conn = accept(fd_, nullptr, nullptr);
       if (conn < 0) continue;
-      uint32_t length = 0;
-      if (ReadExact(conn, reinterpret_cast<char*>(&length), 4) && length <= (64u << 20)) {
-        payload.resize(length);
-        if (ReadExact(conn, &payload[0], length)) WriteAll(conn, reply_);
+      wire::Deadline never = wire::Deadline::Never();
+      if (wire::ReadFrame(conn, wire::kEngineMaxFrameBytes, &payload, never) ==
+          wire::IoStatus::kOk) {
+        wire::WriteFrame(conn, reply_, never);
       }
       close(conn);
     }
@@ -113,7 +95,7 @@ void BM_SendRequestImpl(benchmark::State& state) {
 BENCHMARK(BM_SendRequestImpl)->UseRealTime();
 
 void BM_SendCommandToDaemon1MiB(benchmark::State& state) {
-  Responder daemon(ScratchRoot() + fileindex::kFileIndexdSockPath, "{}");
+  Responder daemon(ScratchRoot() + kFileIndexdSockPath, "{}");
   Json::Value data;
   data["share_name"] = std::string(1 << 20, 's');
   for (auto _ : state) fileindex::SendCommandToDaemon("notify_setting_changed", data);

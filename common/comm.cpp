@@ -22,8 +22,11 @@ constexpr int64_t kSecond = 1000000;
 constexpr int64_t kNotReadySleep = 30 * kSecond;
 constexpr unsigned kBusyRetriesBeforeNotify = 10;
 
-bool IsBusy(int code) { return code == 1400 || code == 1401; }
-bool IsNotReady(int code) { return code == 607 || code == 608 || code == 610; }
+bool IsBusy(int code) { return code == kCodeOutOfMemory || code == kCodeOverloaded; }
+// kCodeIndexDamaged, of the same range, is deliberately not waited out.
+bool IsNotReady(int code) {
+  return code == kCodeIndexOpening || code == kCodeIndexRecovering || code == kCodeIndexMoving;
+}
 
 // A member's text for a log line: strings as they are, anything else as JSON.
 std::string MemberText(const Json::Value& value) {

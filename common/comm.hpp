@@ -7,11 +7,9 @@
 
 #include <json/json.h>
 
-namespace orvane {
+#include "common/wire.hpp"
 
-constexpr char kElasticdSockPath[] = "/var/run/quixelasticd.sock";
-// Passed to the socket client's Connect as is (milliseconds there).
-constexpr long kElasticdConnectTimeout = 864000;
+namespace orvane {
 
 // One exchange. On return `res` holds the whole reply, whose "success" is true. Throws Error 913
 // when the exchange breaks or the reply is malformed, and the daemon's own code when it reports

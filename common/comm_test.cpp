@@ -168,7 +168,7 @@ TEST_F(CommTest, CompoundFailuresAreLoggedUnlessTheDaemonWasBusy) {
 
   log_.Clear();
   const Error e = ImplError(req);  // entry 0 logged, entry 1 stops the walk
-  EXPECT_EQ(static_cast<int>(e.code), 1401);
+  EXPECT_EQ(static_cast<int>(e.code), kCodeOverloaded);
   EXPECT_STREQ(e.what(), "Orvane error, code=1401, reason=[full]");
   EXPECT_EQ(log_.Lines().size(), 1u);
 
@@ -198,7 +198,7 @@ TEST_F(CommTest, NotReadyIsRetriedEveryThirtySecondsButNot609) {
     fileindex::elastic::SendRequest(Req("commit"));
     FAIL() << "609 was retried";
   } catch (const Error& e) {
-    EXPECT_EQ(static_cast<int>(e.code), 609);
+    EXPECT_EQ(static_cast<int>(e.code), kCodeIndexDamaged);
     EXPECT_STREQ(e.what(), "Orvane error, code=609, reason=[Request failed, msg=d]");
   }
   EXPECT_EQ(log_.Lines().size(), 3u);  // the daemon's own failure is not logged here

@@ -7,7 +7,6 @@
 #include <syslog.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
 #include <cstdint>
 #include <cstring>
@@ -19,6 +18,7 @@
 #include "common/json_util.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
+#include "common/wire.hpp"
 
 namespace orvane {
 namespace fileindex {
@@ -26,75 +26,19 @@ namespace {
 
 constexpr int kConnectAttempts = 5;
 constexpr int64_t kConnectRetrySleep = 1000000;
-constexpr unsigned int kChunk = 1024;
-constexpr int kInterruptBudget = 10;
-// Reads of 0 (the peer has closed) tried before the transfer is given up.
-constexpr int kClosedReadBudget = 10;
-
-BufferIo& Io() {
-  static BufferIo io;
-  return io;
-}
-
-ssize_t DoWrite(int fd, const void* buf, size_t size) {
-  const BufferIo& io = Io();
-  return io.write ? io.write(fd, buf, size) : write(fd, buf, size);
-}
-
-ssize_t DoRead(int fd, void* buf, size_t size) {
-  const BufferIo& io = Io();
-  return io.read ? io.read(fd, buf, size) : read(fd, buf, size);
-}
 
 std::string Reason(const char* what) { return std::string(what) + strerror(errno); }
 
 }  // namespace
 
-BufferIo SetBufferIo(BufferIo io) {
-  std::swap(Io(), io);
-  return io;
-}
-
 void BufferWrite(int fd, unsigned int size, const unsigned char* buf) {
-  if (size == 0) return;
-  int budget = kInterruptBudget;
-  unsigned int done = 0;
-  while (done < size) {
-    const ssize_t n = DoWrite(fd, buf + done, std::min(size - done, kChunk));
-    if (n > 0) {
-      done += static_cast<unsigned int>(n);
-      continue;
-    }
-    if (errno == EINTR && budget > 0) {
-      --budget;
-      continue;
-    }
+  if (!wire::WriteBlocking(fd, buf, size, wire::kCommandTransfer)) {
     throw Error(kErrSystem, Reason("write failed, reason="));
   }
 }
 
 void BufferRead(int fd, unsigned int size, unsigned char* buf) {
-  if (size == 0) return;
-  int budget = kInterruptBudget;
-  int closed_budget = kClosedReadBudget;
-  unsigned int done = 0;
-  while (done < size) {
-    const ssize_t n = DoRead(fd, buf + done, std::min(size - done, kChunk));
-    if (n > 0) {
-      done += static_cast<unsigned int>(n);
-      continue;
-    }
-    if (n == 0) {
-      // The daemon answers before it closes, so an end of stream here is read again; but a
-      // closed socket never yields more, and waiting on it for ever would hang the caller.
-      if (closed_budget-- > 0) continue;
-      errno = ECONNRESET;
-      throw Error(kErrSystem, Reason("read failed, reason="));
-    }
-    if (errno == EINTR && budget > 0) {
-      --budget;
-      continue;
-    }
+  if (!wire::ReadBlocking(fd, buf, size, wire::kCommandTransfer)) {
     throw Error(kErrSystem, Reason("read failed, reason="));
   }
 }
@@ -126,11 +70,11 @@ void SendCommandToDaemon(const std::string& cmd, const Json::Value& data) {
     Log(LOG_ERR, "%s:%d socket path too long: %s", SourceName(__FILE__), __LINE__, path.c_str());
   }
 
-  struct timeval tv = {1, 0};
+  struct timeval tv = {wire::kDaemonSendTimeoutSec, 0};
   ORVANE_THROW_IF(0 > setsockopt(fd_socket, SOL_SOCKET, SO_SNDTIMEO, &tv, sizeof(tv)), kErrSystem,
                   Reason("setsockopt failed, reason="));
   // Without a receive time-out a daemon that never answers would hold the caller for ever.
-  struct timeval rtv = {kDaemonReplyTimeoutSec, 0};
+  struct timeval rtv = {wire::kDaemonReplyTimeoutSec, 0};
   ORVANE_THROW_IF(0 > setsockopt(fd_socket, SOL_SOCKET, SO_RCVTIMEO, &rtv, sizeof(rtv)), kErrSystem,
                   Reason("setsockopt failed, reason="));
 
@@ -148,7 +92,7 @@ void SendCommandToDaemon(const std::string& cmd, const Json::Value& data) {
   BufferWrite(fd_socket, length, reinterpret_cast<const unsigned char*>(text.c_str()));
 
   BufferRead(fd_socket, sizeof(length), reinterpret_cast<unsigned char*>(&length));
-  if (length > kMaxDaemonReplyBytes) {
+  if (length > wire::kMaxDaemonReplyBytes) {
     errno = EMSGSIZE;
     throw Error(kErrSystem, Reason("read failed, reason="));
   }

@@ -111,65 +111,6 @@ TEST_F(CommandChannelTest, BrokenRepliesFailQuicklyWithoutAllocatingTheAnnounced
   }
 }
 
-// Ten interrupted calls are tolerated per transfer (not per call), the eleventh is not; a closed
-// peer is read again ten times and then fails.
-TEST(BufferTransferTest, InterruptionsAndClosedPeersHaveABudget) {
-  int fds[2];
-  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
-  UniqueFd a(fds[0]), b(fds[1]);
-  int interrupts_left = 0;
-  int reads = 0;
-  bool odd = false;
-  // Interrupts every other call, until the budget of the test runs out.
-  auto interrupt = [&] {
-    odd = !odd;
-    if (!odd || interrupts_left == 0) return false;
-    --interrupts_left;
-    errno = EINTR;
-    return true;
-  };
-  BufferIo io;
-  io.write = [&](int fd, const void* buf, size_t size) -> ssize_t {
-    return interrupt() ? -1 : write(fd, buf, size);
-  };
-  io.read = [&](int fd, void* buf, size_t size) -> ssize_t {
-    ++reads;
-    return interrupt() ? -1 : read(fd, buf, size);
-  };
-  const BufferIo previous = SetBufferIo(io);
-  const std::vector<unsigned char> out(20 * 1024, 'z');
-  std::vector<unsigned char> in(out.size());
-  interrupts_left = 10;
-  BufferWrite(a.get(), out.size(), out.data());
-  interrupts_left = 10;
-  BufferRead(b.get(), in.size(), in.data());
-  EXPECT_EQ(in, out);
-
-  interrupts_left = 11;
-  EXPECT_EQ(ErrorText([&] { BufferWrite(a.get(), out.size(), out.data()); }),
-            "Orvane error, code=502, reason=[write failed, reason=Interrupted system call]");
-  // The 10 KiB that went out before the failure are what the ten reads between the eleven
-  // interruptions take, so the read never waits.
-  odd = false;
-  interrupts_left = 11;
-  EXPECT_EQ(ErrorText([&] { BufferRead(b.get(), in.size(), in.data()); }),
-            "Orvane error, code=502, reason=[read failed, reason=Interrupted system call]");
-
-  // A peer that sends "ab" and closes.
-  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);
-  a.Reset(fds[0]);
-  b.Reset(fds[1]);
-  ASSERT_EQ(write(a.get(), "ab", 2), 2);
-  a.Reset();
-  reads = 0;
-  unsigned char buf[4];
-  EXPECT_EQ(ErrorText([&] { BufferRead(b.get(), sizeof(buf), buf); }),
-            "Orvane error, code=502, reason=[read failed, reason=Connection reset by peer]");
-  EXPECT_EQ(reads, 12);  // the two bytes, the first end of stream and ten more tries
-  EXPECT_EQ(std::string(buf, buf + 2), "ab");
-  SetBufferIo(previous);
-}
-
 }  // namespace
 }  // namespace fileindex
 }  // namespace orvane

@@ -1,12 +1,10 @@
-// Client end of the platform daemons' Unix-domain sockets. A message travels as one frame: a
-// 4-byte unsigned length in host byte order, then that many bytes of payload. One connection
-// object per exchange; it owns its descriptor and closes it when destroyed. Not thread-safe.
+// Client end of the platform daemons' Unix-domain sockets: one frame out, one frame in (see
+// common/wire.hpp). One connection object per exchange; it owns its descriptor and closes it
+// when destroyed. Not thread-safe.
 //
 // Time-outs: Connect() bounds the wait for a full listen backlog; once connected, Recv() waits
-// at most the reply time-out (10 minutes by default) for the first byte of a frame, since a
-// daemon may work that long before it answers, and at most the idle time-out (30 seconds by
-// default) for each further byte: a daemon writes a frame in one go, so silence in the middle of
-// one means it is stuck. Send() gives a peer that does not read the idle time-out per wait.
+// at most the reply time-out for the first byte of a frame and at most the idle time-out for
+// each further byte; Send() gives a peer that does not read the idle time-out per wait.
 #ifndef ORVANE_PLATFORM_DAEMON_SOCK_HPP_
 #define ORVANE_PLATFORM_DAEMON_SOCK_HPP_
 
@@ -14,14 +12,9 @@
 #include <string>
 
 #include "common/fd.hpp"
+#include "common/wire.hpp"
 
 namespace quixdaemon {
-
-// The largest frame Recv() accepts; a longer announced length fails at once, before anything
-// is allocated.
-constexpr uint32_t kDefaultMaxFrameBytes = 128u << 20;
-constexpr int kDefaultReplyTimeoutMs = 10 * 60 * 1000;
-constexpr int kDefaultIdleTimeoutMs = 30 * 1000;
 
 // A connected stream socket carrying frames. Failures return false with errno telling why:
 // ETIMEDOUT for a time-out, ECONNRESET for a peer that closed in the middle of a frame or before
@@ -46,6 +39,8 @@ class SockConnection {
     reply_timeout_ms_ = reply_timeout_ms;
     idle_timeout_ms_ = idle_timeout_ms;
   }
+  // The largest frame Recv() accepts; a longer announced length fails at once, before anything
+  // is allocated.
   void SetMaxFrameBytes(uint32_t max_frame_bytes) { max_frame_bytes_ = max_frame_bytes; }
 
  protected:
@@ -54,12 +49,9 @@ class SockConnection {
   orvane::UniqueFd fd_;
 
  private:
-  // Fills `size` bytes; the first wait may last `first_timeout_ms`, later ones the idle time-out.
-  bool RecvExact(char* buf, size_t size, int first_timeout_ms);
-
-  int reply_timeout_ms_ = kDefaultReplyTimeoutMs;
-  int idle_timeout_ms_ = kDefaultIdleTimeoutMs;
-  uint32_t max_frame_bytes_ = kDefaultMaxFrameBytes;
+  int reply_timeout_ms_ = orvane::wire::kClientReplyTimeoutMs;
+  int idle_timeout_ms_ = orvane::wire::kClientIdleTimeoutMs;
+  uint32_t max_frame_bytes_ = orvane::wire::kClientMaxFrameBytes;
 };
 
 // A SockConnection to a Unix-domain socket path.

@@ -4,7 +4,6 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/time.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -12,27 +11,14 @@
 #include <cstring>
 #include <memory>
 #include <stdexcept>
+#include <string_view>
 
 #include "common/json_util.hpp"
 #include "common/root.hpp"
+#include "common/wire.hpp"
 
 namespace orvane {
 namespace test {
-namespace {
-
-bool ReadExact(int fd, char* buf, size_t size) {
-  size_t got = 0;
-  while (got < size) {
-    const ssize_t n = read(fd, buf + got, size - got);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    got += static_cast<size_t>(n);
-  }
-  return true;
-}
-
-}  // namespace
-
 FakeDaemon::FakeDaemon(const std::string& socket_path, Handler handler, bool read_request)
     : path_(socket_path), handler_(std::move(handler)), read_request_(read_request) {
   MakeParentDirs(path_);
@@ -74,20 +60,18 @@ void FakeDaemon::Serve() {
     if (fd < 0) continue;
     ++connections_;
     // A client that never sends a whole frame must not hold the daemon for ever.
-    struct timeval tv = {5, 0};
-    setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof(tv));
+    wire::Deadline deadline = wire::Deadline::Idle(5000, 5000);
     std::string payload;
-    if (read_request_) {
-      uint32_t length = 0;
-      if (ReadExact(fd, reinterpret_cast<char*>(&length), sizeof(length)) &&
-          length <= (256u << 20)) {
-        payload.resize(length);
-        if (!ReadExact(fd, &payload[0], length)) payload.clear();
-        std::lock_guard<std::mutex> lock(mu_);
-        requests_.push_back(payload);
-        raw_frames_.push_back(std::string(reinterpret_cast<char*>(&length), sizeof(length)) +
-                              payload);
+    uint32_t length = 0;
+    if (read_request_ && wire::ReadFrameLength(fd, &length, deadline) == wire::IoStatus::kOk &&
+        length <= (256u << 20)) {
+      payload.resize(length);
+      if (wire::ReadExact(fd, &payload[0], length, deadline) != wire::IoStatus::kOk) {
+        payload.clear();
       }
+      std::lock_guard<std::mutex> lock(mu_);
+      requests_.push_back(payload);
+      raw_frames_.push_back(wire::EncodeFrame(payload));
     }
     handler_(fd, payload);
     close(fd);
@@ -106,28 +90,24 @@ std::vector<std::string> FakeDaemon::raw_frames() const {
 
 std::vector<Json::Value> FakeDaemon::json_requests() const {
   std::vector<Json::Value> out;
-  for (std::string text : requests()) {
-    if (!text.empty() && text.back() == '\0') text.pop_back();
+  for (const std::string& payload : requests()) {
+    const std::string_view text = wire::PayloadText(payload);
     JsonValue value;
-    value.fromString(text);
+    value.fromString(text.data(), text.data() + text.size());
     out.push_back(value);
   }
   return out;
 }
 
+// A failed write means the client gave up; what it saw is what the test checks.
 void FakeDaemon::WriteAll(int fd, const std::string& bytes) {
-  size_t done = 0;
-  while (done < bytes.size()) {
-    const ssize_t n = send(fd, bytes.data() + done, bytes.size() - done, MSG_NOSIGNAL);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return;  // the client gave up; what it saw is what the test checks
-    done += static_cast<size_t>(n);
-  }
+  wire::Deadline never = wire::Deadline::Never();
+  wire::WriteExact(fd, bytes.data(), bytes.size(), never);
 }
 
 void FakeDaemon::WriteFrame(int fd, const std::string& payload) {
-  const uint32_t length = static_cast<uint32_t>(payload.size());
-  WriteAll(fd, std::string(reinterpret_cast<const char*>(&length), sizeof(length)) + payload);
+  wire::Deadline never = wire::Deadline::Never();
+  wire::WriteFrame(fd, payload, never);
 }
 
 void FakeDaemon::WaitForPeerClose(int fd, int timeout_ms) {

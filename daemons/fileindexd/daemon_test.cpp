@@ -25,6 +25,7 @@
 #include "common/root.hpp"
 #include "common/sdk/share.hpp"
 #include "common/util.hpp"
+#include "common/wire.hpp"
 #include "daemons/fileindexd/index_daemon.hpp"
 #include "daemons/fileindexd/server.hpp"
 #include "daemons/fileindexd/test_system.hpp"
@@ -172,18 +173,20 @@ TEST_F(DaemonTest, FollowsTheQueueAndAnswersItsCommands) {
       << report;
 
   // Bad input gets an error reply, never a crash; a frame cut short is closed without one.
-  EXPECT_EQ(101, Command("reboot", Json::Value())["error"]["code"].asInt());
-  EXPECT_EQ(120, Command("worker_create", Json::Value())["error"]["code"].asInt());
-  EXPECT_EQ(120, Command("pause", Json::Value(Json::objectValue))["error"]["code"].asInt());
-  EXPECT_NE(std::string::npos, RawFrame(8, "not json").find("\"code\":100"));
-  EXPECT_NE(std::string::npos, RawFrame(1u << 30, "").find("104"));
+  EXPECT_EQ(kCodeUnknownCommand, Command("reboot", Json::Value())["error"]["code"].asInt());
+  EXPECT_EQ(kErrInvalidParam, Command("worker_create", Json::Value())["error"]["code"].asInt());
+  EXPECT_EQ(kErrInvalidParam,
+            Command("pause", Json::Value(Json::objectValue))["error"]["code"].asInt());
+  EXPECT_NE(std::string::npos,
+            RawFrame(8, "not json").find("\"code\":" + std::to_string(kCodeMalformed)));
+  EXPECT_NE(std::string::npos, RawFrame(1u << 30, "").find(std::to_string(kCodeTooLarge)));
   EXPECT_EQ("", test::RawCommand("ab"));
 
   // Anyone may ask how it is doing; only root and its own user may control it.
   EXPECT_EQ(1, orvane::test::RunAsUser("nobody", [] {
               return Command("status", Json::Value())["success"].asBool() ? 1 : 0;
             }));
-  EXPECT_EQ(103, orvane::test::RunAsUser("nobody", [] {
+  EXPECT_EQ(kCodePermissionDenied, orvane::test::RunAsUser("nobody", [] {
               return Command("worker_delete", Share("docs"))["error"]["code"].asInt();
             }));
   EXPECT_EQ(std::set<std::string>{"docs"}, Running());
@@ -288,7 +291,7 @@ TEST_F(DaemonTest, ClientsHoldingTheSocketDoNotHoldOffOthers) {
   // reason, and the user is served again once one is let go. The refusal comes unasked, as the
   // connection is taken. A round in which the daemon's short wait let a held connection go
   // before the next came (a loaded machine) proves nothing and is played again.
-  EXPECT_EQ(kErrTooManyConnections, orvane::test::RunAsUser("nobody", [] {
+  EXPECT_EQ(kCodeTooManyConnections, orvane::test::RunAsUser("nobody", [] {
               for (int round = 0; round < 5; ++round) {
                 std::vector<UniqueFd> held;
                 for (int i = 0; i < kMaxConnectionsPerUser; ++i) held.push_back(Connect());
@@ -319,7 +322,7 @@ TEST_F(DaemonTest, StatusShowsFileDetailsOnlyToAdministrators) {
     const Json::Value req = orvane::test::FakeDaemon::Parse(text);
     Json::Value reply(Json::objectValue);
     reply["success"] = req["data"]["doc_id"] != secret;
-    if (!reply["success"].asBool()) reply["error"]["code"] = 604;
+    if (!reply["success"].asBool()) reply["error"]["code"] = kCodeDocInvalid;
     if (req["command"] == "document_get_by_query") reply["data"] = Json::arrayValue;
     orvane::test::FakeDaemon::WriteFrame(fd, JsonToString(reply));
   };

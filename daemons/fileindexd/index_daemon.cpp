@@ -216,7 +216,7 @@ Json::Value IndexDaemon::Handle(const Json::Value& command, uid_t peer_uid) {
   if (type == "status") return Ok(Status(IsPrivilegedCaller(peer_uid)));
   if (peer_uid != 0 && peer_uid != geteuid()) {
     Log(LOG_WARNING, "fileindexd: \"%s\" refused to user %u", type.c_str(), peer_uid);
-    return CommandServer::ErrorReply(103, "not permitted");
+    return CommandServer::ErrorReply(kCodePermissionDenied, "not permitted");
   }
   if (type == "worker_create") {
     StartWorker(ShareOf(data));
@@ -231,7 +231,7 @@ Json::Value IndexDaemon::Handle(const Json::Value& command, uid_t peer_uid) {
   } else if (type == "notify_setting_changed") {
     Reload();
   } else {
-    return CommandServer::ErrorReply(101, "unknown command: " + type);
+    return CommandServer::ErrorReply(kCodeUnknownCommand, "unknown command: " + type);
   }
   // Workers look at the pause and their queues now rather than at their next wake-up.
   std::lock_guard<std::mutex> lock(mu_);

@@ -14,12 +14,12 @@
 #include <set>
 #include <string>
 
+#include "common/wire.hpp"
 #include "daemons/fileindexd/worker.hpp"
 
 namespace orvane {
 namespace fileindexd {
 
-constexpr char kFileIndexdSockPath[] = "/var/run/fileindexd.sock";
 constexpr char kFileIndexdPidPath[] = "/var/run/fileindexd.pid";
 
 // Root, the daemon's own user and members of the platform's administrators group: the callers
@@ -41,8 +41,8 @@ class IndexDaemon {
   void Reload();
 
   // Answers one command ({"type", "data"}) from the caller `peer_uid`. Control commands are
-  // refused (103) to anyone but root and the daemon's own user; "status" is for everyone, with
-  // the details of files only for privileged callers.
+  // refused (kCodePermissionDenied) to anyone but root and the daemon's own user; "status" is
+  // for everyone, with the details of files only for privileged callers.
   Json::Value Handle(const Json::Value& command, uid_t peer_uid);
 
   // Queues a reconciliation of every indexed folder of every share, for a start after an

@@ -31,7 +31,7 @@ using orvane::fileindexd::IndexDaemon;
 void Serve(const orvane::platform::PidFile& pid_file, orvane::platform::DaemonSignals* signals) {
   IndexDaemon daemon;
   orvane::fileindexd::CommandServer server(
-      orvane::RootedPath(orvane::fileindexd::kFileIndexdSockPath),
+      orvane::RootedPath(orvane::kFileIndexdSockPath),
       [&daemon](const Json::Value& command, uid_t uid) { return daemon.Handle(command, uid); });
   if (pid_file.left_behind()) {
     Log(LOG_WARNING,

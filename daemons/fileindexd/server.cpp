@@ -9,65 +9,32 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <chrono>
 #include <cstring>
+#include <string_view>
 #include <system_error>
-#include <vector>
 
 #include "common/error.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
+#include "common/wire.hpp"
 
 namespace orvane {
 namespace fileindexd {
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
-// Reads exactly `size` bytes before `deadline`; false on end of stream, time-out or error. The
-// deadline is for the whole command, so a client dripping a byte at a time is cut off as surely
-// as one that sends nothing.
-bool ReadFull(int fd, void* buf, size_t size, Clock::time_point deadline) {
-  char* p = static_cast<char*>(buf);
-  while (size > 0) {
-    const auto left =
-        std::chrono::duration_cast<std::chrono::milliseconds>(deadline - Clock::now()).count();
-    if (left <= 0) return false;
-    struct pollfd pfd = {fd, POLLIN, 0};
-    const int ready = poll(&pfd, 1, static_cast<int>(left));
-    if (ready < 0 && errno == EINTR) continue;
-    if (ready <= 0) return false;
-    const ssize_t n = recv(fd, p, size, MSG_DONTWAIT);
-    if (n < 0 && (errno == EINTR || errno == EAGAIN)) continue;
-    if (n <= 0) return false;
-    p += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
-}
-
-bool WriteFull(int fd, const void* buf, size_t size, int flags) {
-  const char* p = static_cast<const char*>(buf);
-  while (size > 0) {
-    const ssize_t n = send(fd, p, size, MSG_NOSIGNAL | flags);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    p += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
-}
-
-// `flags` MSG_DONTWAIT for a reply written on the accepting thread, which must never block.
-void WriteReply(int fd, const Json::Value& reply, int flags = 0) {
-  std::string text = JsonToString(reply);
-  text.push_back('\0');
-  const uint32_t len = static_cast<uint32_t>(text.size());
-  if (!WriteFull(fd, &len, sizeof(len), flags) || !WriteFull(fd, text.data(), text.size(), flags)) {
+// `deadline` NoWait for a reply written on the accepting thread, which must never block.
+void WriteReply(int fd, const Json::Value& reply, wire::Deadline deadline) {
+  if (wire::WriteTextFrame(fd, JsonToString(reply), deadline) != wire::IoStatus::kOk) {
     Log(LOG_WARNING, "fileindexd: a client left before its reply: %m");
   }
+}
+
+// A client takes each part of its reply within the command time-out.
+void WriteReply(int fd, const Json::Value& reply) {
+  WriteReply(fd, reply,
+             wire::Deadline::Idle(wire::kCommandTimeoutMillis, wire::kCommandTimeoutMillis));
 }
 
 }  // namespace
@@ -145,7 +112,8 @@ void CommandServer::Serve() {
     struct ucred cred = {};
     socklen_t cred_len = sizeof(cred);
     if (getsockopt(conn.get(), SOL_SOCKET, SO_PEERCRED, &cred, &cred_len) != 0) {
-      WriteReply(conn.get(), ErrorReply(103, "cannot identify the caller"), MSG_DONTWAIT);
+      WriteReply(conn.get(), ErrorReply(kCodePermissionDenied, "cannot identify the caller"),
+                 wire::Deadline::NoWait());
       continue;
     }
     const bool privileged = cred.uid == 0 || cred.uid == geteuid();
@@ -156,9 +124,9 @@ void CommandServer::Serve() {
         Log(LOG_WARNING, "fileindexd: connection of user %u refused: too many connections",
             cred.uid);
         WriteReply(conn.get(),
-                   ErrorReply(kErrTooManyConnections,
+                   ErrorReply(kCodeTooManyConnections,
                               "too many connections to fileindexd; try again in a moment"),
-                   MSG_DONTWAIT);
+                   wire::Deadline::NoWait());
         continue;
       }
       ++active_;
@@ -189,25 +157,25 @@ void CommandServer::Serve() {
 
 void CommandServer::ServeOne(UniqueFd conn, uid_t uid, bool privileged) {
   const int fd = conn.get();
-  const Clock::time_point deadline = Clock::now() + std::chrono::milliseconds(kClientTimeoutMillis);
-  struct timeval tv = {kClientTimeoutMillis / 1000, (kClientTimeoutMillis % 1000) * 1000};
-  setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &tv, sizeof(tv));
+  // The whole command is due this soon after connecting, so a client dripping a byte at a time
+  // is cut off as surely as one that sends nothing.
+  wire::Deadline deadline = wire::Deadline::In(wire::kCommandTimeoutMillis * 1000LL);
   [&] {
     uint32_t len = 0;
     // A client that sent nothing gets nothing.
-    if (!ReadFull(fd, &len, sizeof(len), deadline)) return;
-    if (len == 0 || len > kMaxCommandFrame) {
-      WriteReply(fd, ErrorReply(104, "frame length " + std::to_string(len) + " out of range"));
+    if (wire::ReadFrameLength(fd, &len, deadline) != wire::IoStatus::kOk) return;
+    if (len == 0 || len > wire::kMaxCommandFrame) {
+      WriteReply(
+          fd, ErrorReply(kCodeTooLarge, "frame length " + std::to_string(len) + " out of range"));
       return;
     }
-    std::vector<char> payload(len);
-    if (!ReadFull(fd, payload.data(), len, deadline)) return;
-    size_t text_len = len;
-    while (text_len > 0 && payload[text_len - 1] == '\0') --text_len;
+    std::string payload(len, '\0');
+    if (wire::ReadExact(fd, &payload[0], len, deadline) != wire::IoStatus::kOk) return;
+    const std::string_view text = wire::PayloadText(payload);
     JsonValue command;
-    if (!command.fromString(std::string(payload.data(), text_len)) || !command.isObject() ||
+    if (!command.fromString(text.data(), text.data() + text.size()) || !command.isObject() ||
         !command["type"].isString()) {
-      WriteReply(fd, ErrorReply(100, "malformed command"));
+      WriteReply(fd, ErrorReply(kCodeMalformed, "malformed command"));
       return;
     }
     Json::Value reply;

@@ -1,8 +1,9 @@
-// CommandServer serves the indexing daemon's Unix-domain command socket: one frame in (4-byte
-// host-order length, JSON text, NUL), one frame out, per connection. Connections are served
+// CommandServer serves the indexing daemon's Unix-domain command socket: one frame in (JSON text
+// and NUL, see common/wire.hpp), one frame out, per connection. Connections are served
 // concurrently, each on a thread of its own, so an idle or slow client holds only its own
 // connection; frames are bounded, a client must send its command within a short time, and
-// callers other than root and the daemon's own user have a cap of connections each and together.
+// callers other than root and the daemon's own user have a cap of connections each and together
+// (beyond it they are answered kCodeTooManyConnections).
 // The handler may run on several threads at once.
 #ifndef ORVANE_DAEMONS_FILEINDEXD_SERVER_HPP_
 #define ORVANE_DAEMONS_FILEINDEXD_SERVER_HPP_
@@ -20,21 +21,15 @@
 #include <thread>
 
 #include "common/fd.hpp"
+#include "common/wire.hpp"
 
 namespace orvane {
 namespace fileindexd {
 
-// The longest command accepted; commands are small JSON objects.
-constexpr uint32_t kMaxCommandFrame = 1 << 20;
-// A client must have sent its whole command this long after it connected, and take each part
-// of the reply within it.
-constexpr int kClientTimeoutMillis = 1000;
 // Connections served at once for callers other than root and the daemon's own user: in all,
 // and for one user. Root and the daemon's user are never turned away.
 constexpr int kMaxConnections = 64;
 constexpr int kMaxConnectionsPerUser = 8;
-// The reply to a connection over those caps.
-constexpr int kErrTooManyConnections = 105;
 
 class CommandServer {
  public:

@@ -2,8 +2,6 @@
 
 #include <fcntl.h>
 #include <signal.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -16,6 +14,7 @@
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
+#include "common/wire.hpp"
 #include "daemons/fileindexd/index_daemon.hpp"
 #include "daemons/fileindexd/indexer.hpp"
 
@@ -149,22 +148,13 @@ Json::Value System::Engine(const std::string& command, const Json::Value& data) 
 }
 
 std::string RawCommand(const std::string& bytes) {
-  const std::string path = RootedPath(kFileIndexdSockPath);
-  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) return "";
-  struct sockaddr_un addr = {};
-  addr.sun_family = AF_UNIX;
-  std::strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
+  UniqueFd fd = wire::Connect(RootedPath(kFileIndexdSockPath), 0);
+  wire::Deadline never = wire::Deadline::Never();
   std::string reply;
-  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) == 0 &&
-      send(fd, bytes.data(), bytes.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size())) {
-    uint32_t len = 0;
-    if (recv(fd, &len, sizeof(len), MSG_WAITALL) == sizeof(len) && len < (1u << 24)) {
-      reply.resize(len);
-      if (recv(fd, &reply[0], len, MSG_WAITALL) != static_cast<ssize_t>(len)) reply.clear();
-    }
+  if (fd.valid() &&
+      wire::WriteExact(fd.get(), bytes.data(), bytes.size(), never) == wire::IoStatus::kOk) {
+    wire::ReadFrame(fd.get(), wire::kMaxDaemonReplyBytes, &reply, never);
   }
-  close(fd);
   return reply;
 }
 
@@ -172,14 +162,12 @@ Json::Value Command(const std::string& type, const Json::Value& data) {
   Json::Value cmd(Json::objectValue);
   cmd["type"] = type;
   cmd["data"] = data;
-  std::string text = JsonToString(cmd);
-  text.push_back('\0');
-  const uint32_t len = static_cast<uint32_t>(text.size());
-  std::string frame(reinterpret_cast<const char*>(&len), sizeof(len));
-  std::string reply = RawCommand(frame + text);
-  while (!reply.empty() && reply.back() == '\0') reply.pop_back();
+  const std::string reply = RawCommand(wire::EncodeFrame(JsonToString(cmd) + '\0'));
+  const std::string_view text = wire::PayloadText(reply);
   JsonValue value;
-  if (reply.empty() || !value.fromString(reply)) return Json::Value();
+  if (text.empty() || !value.fromString(text.data(), text.data() + text.size())) {
+    return Json::Value();
+  }
   return std::move(value);
 }
 

@@ -14,6 +14,7 @@
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
+#include "common/wire.hpp"
 #include "daemons/fileindexd/test_system.hpp"
 #include "extract/extract_runner.hpp"
 #include "fileindex/elastic_control.hpp"
@@ -301,8 +302,9 @@ class ScriptedEngineTest : public ShareTest {
 };
 
 TEST_F(ScriptedEngineTest, AFailingOperationIsRetriedWithBackoffThenSkipped) {
-  StartEngine(
-      [this](const Json::Value& req) { return req["data"]["doc_id"] == V("a/bad.txt") ? 604 : 0; });
+  StartEngine([this](const Json::Value& req) {
+    return req["data"]["doc_id"] == V("a/bad.txt") ? kCodeDocInvalid : 0;
+  });
   Create({"a/bad.txt", "a/good.txt"});
   ASSERT_TRUE(worker_.RunPass());
   EXPECT_FALSE(IsFileExist(Tmp()));
@@ -329,7 +331,7 @@ TEST_F(ScriptedEngineTest, AnEngineThatDropsTheConnectionOrAFullVolumeKeepsTheBa
   EXPECT_TRUE(IsFileExist(Tmp()));
 
   // The volume full at the commit: the share is flagged, the administrator told once.
-  StartEngine([](const Json::Value& req) { return req["command"] == "commit" ? 605 : 0; });
+  StartEngine([](const Json::Value& req) { return req["command"] == "commit" ? kCodeStorage : 0; });
   platform::ScopedFaults faults;
   faults.Arm("QUIXQuotaIsEnough", platform::Fault{0, 0, platform::kQErrVolumeFull}, 0, -1);
   fileindex::StatusMgr::CreateIfMissing();  // as the daemon does at its start

@@ -87,7 +87,9 @@ class Flood {
             char buf[4096];
             const ssize_t n = ::recv(p.fd, buf, sizeof(buf), 0);
             const std::string got(buf, n > 0 ? static_cast<size_t>(n) : 0);
-            counts[got.find("\"code\":1401") != std::string::npos ? 1 : 2] += 1;
+            counts[got.find("\"code\":" + std::to_string(kCodeOverloaded)) != std::string::npos
+                       ? 1
+                       : 2] += 1;
             p.fd = -1;
           }
         }

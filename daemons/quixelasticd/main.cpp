@@ -13,6 +13,7 @@
 #include "common/error.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
+#include "common/wire.hpp"
 #include "daemons/quixelasticd/engine.hpp"
 #include "daemons/quixelasticd/server.hpp"
 #include "platform/daemon_start.hpp"
@@ -33,21 +34,21 @@ const char kUsage[] =
 
 struct Flags {
   bool foreground = false;
-  std::string socket = "/var/run/quixelasticd.sock";
-  std::string public_socket = "/var/run/quixelasticd.search.sock";
+  std::string socket = orvane::kElasticdSockPath;
+  std::string public_socket = orvane::kElasticdSearchSockPath;
   std::string pid_file = "/var/run/quixelasticd.pid";
   std::string state_dir = "/var/lib/quixelasticd";
   std::string service_user = "fileindex";
   std::string index_root;
-  long long max_frame = 64LL << 20;
+  long long max_frame = orvane::wire::kEngineMaxFrameBytes;
   long long memory_mb = 1024;
   long long backlog = 64;
   long long connections = 256;
-  long long io_timeout_s = 30;
+  long long io_timeout_s = orvane::wire::kEngineIoTimeoutMicros / 1000000;
   long long public_connections = 128;
   long long public_per_user = 16;
   long long public_requests_per_user = 4;
-  long long public_timeout_ms = 2000;
+  long long public_timeout_ms = orvane::wire::kEnginePublicRequestTimeoutMicros / 1000;
   long long search_budget_ms = 10000;
 };
 

@@ -16,11 +16,13 @@
 #include "common/json_util.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
-#include "daemons/quixelasticd/engine_error.hpp"
-#include "daemons/quixelasticd/frame.hpp"
+#include "common/wire.hpp"
 
 namespace orvane {
 namespace elasticd {
+
+using wire::Deadline;
+using wire::IoStatus;
 
 Server::Server(Engine& engine, ServerOptions options)
     : engine_(engine), options_(std::move(options)) {}
@@ -80,12 +82,9 @@ bool PeerUid(int fd, uid_t* uid, gid_t* gid) {
 // Answers a connection that gets no place, without waiting for it: the reply fits in the
 // socket's empty buffer, and a peer that is not reading simply loses it.
 void Refuse(int fd, const std::string& why) {
-  const std::string payload = JsonToString(Engine::ErrorReply(kCodeOverloaded, why)) + '\0';
-  const uint32_t length = static_cast<uint32_t>(payload.size());
-  std::string frame(reinterpret_cast<const char*>(&length), sizeof(length));
-  frame += payload;
   // Best effort: a full buffer or a peer already gone changes nothing.
-  (void)!::send(fd, frame.data(), frame.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+  Deadline now = Deadline::NoWait();
+  wire::WriteTextFrame(fd, JsonToString(Engine::ErrorReply(kCodeOverloaded, why)), now);
 }
 
 }  // namespace
@@ -179,15 +178,16 @@ void Server::AcceptLoop() {
 void Server::Serve(int fd, bool public_socket) {
   const int64_t wait =
       public_socket ? options_.public_request_timeout_micros : options_.io_timeout_micros;
-  const int64_t deadline = Env::Current()->NowMicros() + wait;
+  Deadline deadline = Deadline::In(wait);
   const uint32_t max_frame =
       public_socket ? std::min(options_.max_frame_bytes, options_.max_public_frame_bytes)
                     : options_.max_frame_bytes;
   auto reply = [&](const Json::Value& r) {
-    WriteFrame(fd, JsonToString(r), Env::Current()->NowMicros() + options_.io_timeout_micros);
+    Deadline taken = Deadline::In(options_.io_timeout_micros);
+    wire::WriteTextFrame(fd, JsonToString(r), taken);
   };
   uint32_t length = 0;
-  if (ReadFrameLength(fd, &length, deadline) != IoStatus::kOk) return;
+  if (wire::ReadFrameLength(fd, &length, deadline) != IoStatus::kOk) return;
   if (length > max_frame) {
     // The payload is not read: answer and close, the peer sees the reply or a reset.
     reply(Engine::ErrorReply(kCodeTooLarge, "request of " + std::to_string(length) +
@@ -230,13 +230,14 @@ void Server::Serve(int fd, bool public_socket) {
   const int refused =
       !busy.empty() ? static_cast<int>(kCodeOverloaded) : engine_.AdmitFrame(length);
   if (refused != 0) {
-    if (Discard(fd, length, deadline) != IoStatus::kOk) return;
+    if (wire::Discard(fd, length, deadline) != IoStatus::kOk) return;
     reply(Engine::ErrorReply(refused,
                              refused == kCodeOutOfMemory ? "the daemon is short of memory" : busy));
     return;
   }
   std::string payload(length, '\0');
-  const IoStatus st = length == 0 ? IoStatus::kOk : ReadExact(fd, &payload[0], length, deadline);
+  const IoStatus st =
+      length == 0 ? IoStatus::kOk : wire::ReadExact(fd, &payload[0], length, deadline);
   if (st != IoStatus::kOk) {
     engine_.ReleaseFrame(length);
     return;

@@ -17,6 +17,7 @@
 #include <thread>
 
 #include "common/fd.hpp"
+#include "common/wire.hpp"
 #include "daemons/quixelasticd/engine.hpp"
 
 namespace orvane {
@@ -25,9 +26,9 @@ namespace elasticd {
 struct ServerOptions {
   std::string socket_path;
   std::string public_socket_path;  // empty: no public socket
-  uint32_t max_frame_bytes = 64u << 20;
+  uint32_t max_frame_bytes = wire::kEngineMaxFrameBytes;
   // A request must arrive, and its reply be taken, within this time.
-  int64_t io_timeout_micros = 30 * 1000000LL;
+  int64_t io_timeout_micros = wire::kEngineIoTimeoutMicros;
   // Connections of the main socket served at once; beyond it they are answered 1401.
   int max_connections = 256;
   // The public socket. Connections beyond these limits are answered 1401 at once and closed.
@@ -38,9 +39,9 @@ struct ServerOptions {
   int max_public_requests_per_user = 4;
   // A public request must arrive whole within this time of connecting, or the connection is
   // closed without a reply: idle connections do not hold room.
-  int64_t public_request_timeout_micros = 2 * 1000000LL;
+  int64_t public_request_timeout_micros = wire::kEnginePublicRequestTimeoutMicros;
   // Longest request accepted on the public socket (a search is a few hundred bytes).
-  uint32_t max_public_frame_bytes = 1u << 20;
+  uint32_t max_public_frame_bytes = wire::kEnginePublicMaxFrameBytes;
   // The service account, whose processes may run index and document commands like root.
   uid_t service_uid = static_cast<uid_t>(-1);
   gid_t service_gid = static_cast<gid_t>(-1);

@@ -4,7 +4,6 @@
 #include <grp.h>
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -16,53 +15,35 @@
 
 #include "common/fd.hpp"
 #include "common/json_util.hpp"
+#include "common/wire.hpp"
 
 namespace orvane {
 namespace elasticd {
 namespace tc {
 
-std::string Frame(const std::string& payload) {
-  const uint32_t n = static_cast<uint32_t>(payload.size());
-  std::string out(4, '\0');
-  std::memcpy(&out[0], &n, 4);
-  return out + payload;
-}
+std::string Frame(const std::string& payload) { return wire::EncodeFrame(payload); }
 
 std::string RawExchange(const std::string& socket, const std::string& bytes) {
-  UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-  struct sockaddr_un addr;
-  std::memset(&addr, 0, sizeof(addr));
-  addr.sun_family = AF_UNIX;
-  std::strncpy(addr.sun_path, socket.c_str(), sizeof(addr.sun_path) - 1);
-  if (::connect(fd.get(), reinterpret_cast<struct sockaddr*>(&addr), sizeof(addr)) != 0) {
-    return "<connect failed>";
-  }
-  size_t off = 0;
-  while (off < bytes.size()) {
-    const ssize_t n = ::send(fd.get(), bytes.data() + off, bytes.size() - off, MSG_NOSIGNAL);
-    if (n <= 0) break;
-    off += static_cast<size_t>(n);
-  }
+  UniqueFd fd = wire::Connect(socket, 0);
+  if (!fd.valid()) return "<connect failed>";
+  wire::Deadline never = wire::Deadline::Never();
+  // A daemon that stops reading early still answers or closes: that is what the tests check.
+  wire::WriteExact(fd.get(), bytes.data(), bytes.size(), never);
   ::shutdown(fd.get(), SHUT_WR);
   std::string reply;
-  char buf[65536];
-  for (;;) {
-    const ssize_t n = ::recv(fd.get(), buf, sizeof(buf), 0);
-    if (n <= 0) break;
-    reply.append(buf, static_cast<size_t>(n));
+  wire::ReadFrame(fd.get(), UINT32_MAX, &reply, never);
+  // Returns once the daemon has closed, so that its connection is over when the test goes on.
+  char buf[4096];
+  while (::recv(fd.get(), buf, sizeof(buf), 0) > 0) {
   }
-  if (reply.size() < 4) return std::string();
-  uint32_t len = 0;
-  std::memcpy(&len, reply.data(), 4);
-  if (reply.size() - 4 < len) return std::string();
-  return reply.substr(4, len);
+  return reply;
 }
 
 Json::Value Request(const std::string& socket, const Json::Value& request) {
-  std::string payload = RawExchange(socket, Frame(JsonToString(request) + std::string(1, '\0')));
-  while (!payload.empty() && payload.back() == '\0') payload.pop_back();
+  const std::string payload = RawExchange(socket, Frame(JsonToString(request) + '\0'));
+  const std::string_view text = wire::PayloadText(payload);
   JsonValue reply;
-  if (!reply.fromString(payload)) return Json::Value();
+  if (!reply.fromString(text.data(), text.data() + text.size())) return Json::Value();
   return reply;
 }
 

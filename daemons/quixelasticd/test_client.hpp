@@ -12,6 +12,8 @@
 #include <string>
 #include <vector>
 
+#include "common/wire.hpp"
+
 namespace orvane {
 namespace elasticd {
 namespace tc {
@@ -38,8 +40,8 @@ class DaemonProcess {
   // Sends a signal and waits for the exit; returns the wait status.
   int Signal(int sig);
   pid_t pid() const { return pid_; }
-  std::string socket() const { return root_ + "/var/run/quixelasticd.sock"; }
-  std::string public_socket() const { return root_ + "/var/run/quixelasticd.search.sock"; }
+  std::string socket() const { return root_ + kElasticdSockPath; }
+  std::string public_socket() const { return root_ + kElasticdSearchSockPath; }
 
  private:
   std::string root_;

@@ -19,6 +19,7 @@
 #include "common/root.hpp"
 #include "common/sdk/share.hpp"
 #include "common/util.hpp"
+#include "common/wire.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/index_mgr.hpp"
 #include "fileindex/notifyd_cfg.hpp"
@@ -51,10 +52,6 @@ void Output::Done(const std::string& message) {
 namespace {
 
 using namespace orvane::fileindex;  // NOLINT: the operations read best unqualified here
-
-const char kEngineSearchSocket[] = "/var/run/quixelasticd.search.sock";
-const char kEngineSocket[] = "/var/run/quixelasticd.sock";
-const char kIndexerSocket[] = "/var/run/fileindexd.sock";
 
 // A folder named on the command line: a share path ("/music/rock") as the configuration keeps
 // it, or a folder on disk inside a share, turned into its share path.
@@ -158,8 +155,8 @@ Json::Value AskEngine(const std::string& command, const Json::Value& data) {
   Json::Value req(Json::objectValue);
   req["command"] = command;
   req["data"] = data;
-  std::string socket = RootedPath(kEngineSearchSocket);
-  if (access(socket.c_str(), F_OK) != 0) socket = RootedPath(kEngineSocket);
+  std::string socket = RootedPath(kElasticdSearchSockPath);
+  if (access(socket.c_str(), F_OK) != 0) socket = RootedPath(kElasticdSockPath);
   Json::Value reply;
   std::string error;
   if (!Exchange(socket, JsonToString(req), reply, error)) throw Error(kErrElastic, error);
@@ -510,7 +507,7 @@ bool AskIndexerStatus(Json::Value& reply, std::string& error) {
   Json::Value cmd(Json::objectValue);
   cmd["type"] = "status";
   cmd["data"] = Json::Value();
-  return Exchange(RootedPath(kIndexerSocket), JsonToString(cmd) + std::string(1, '\0'), reply,
+  return Exchange(RootedPath(kFileIndexdSockPath), JsonToString(cmd) + std::string(1, '\0'), reply,
                   error);
 }
 
@@ -587,7 +584,7 @@ Json::Value EngineIndexes() {
   req["data"] = Json::Value(Json::objectValue);
   Json::Value reply;
   std::string error;
-  if (!Exchange(RootedPath(kEngineSocket), JsonToString(req), reply, error) ||
+  if (!Exchange(RootedPath(kElasticdSockPath), JsonToString(req), reply, error) ||
       !reply["success"].asBool() || !reply["data"].isArray()) {
     return Json::Value(Json::arrayValue);
   }
