@@ -42,9 +42,10 @@ struct EngineOptions {
   std::string registry_file;
   // Present while the daemon runs; found at start, it means the last run did not stop cleanly.
   std::string running_marker;
-  // Write requests in progress or waiting beyond which new ones are answered 1401.
+  // Write requests in progress or waiting beyond which new ones are answered kCodeOverloaded.
   int max_write_backlog = 64;
-  // Request bytes in flight plus the store's own memory beyond which requests are answered 1400.
+  // Request bytes in flight plus the store's own memory beyond which requests are answered
+  // kCodeOutOfMemory.
   int64_t memory_limit_bytes = int64_t{1} << 30;
   // When set, index folders must lie below it (a deployment that keeps every index database
   // under one volume, and the fuzz harness).
@@ -52,7 +53,7 @@ struct EngineOptions {
   int64_t default_page_size = 1000;
   int64_t max_page_size = 10000;
   // Time a request's searches and suggestions may take together before they are stopped and
-  // answered 1402; 0: no limit.
+  // answered kCodeSearchTooLong; 0: no limit.
   int64_t search_budget_micros = 10 * 1000000LL;
 };
 
@@ -64,7 +65,8 @@ class Engine {
   Engine& operator=(const Engine&) = delete;
 
   // Reads the registry and opens every index in a background thread; until an index is open
-  // its requests are answered 607 (608 while it is checked after an unclean stop).
+  // its requests are answered kCodeIndexOpening (kCodeIndexRecovering while it is checked after
+  // an unclean stop).
   void Start();
   // Blocks until the background opening is done (tests, benchmarks).
   void WaitOpened();

@@ -78,7 +78,7 @@ void Engine::OpenAll(bool after_crash) {
       waiting = e->state;
     }
     // Opening and checking run without the index's lock, so that its requests are answered
-    // 607 or 608 meanwhile instead of waiting.
+    // kCodeIndexOpening or kCodeIndexRecovering meanwhile instead of waiting.
     std::shared_ptr<IndexStore> store;
     std::string failure;
     bool damaged = false;

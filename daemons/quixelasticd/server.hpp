@@ -29,13 +29,14 @@ struct ServerOptions {
   uint32_t max_frame_bytes = wire::kEngineMaxFrameBytes;
   // A request must arrive, and its reply be taken, within this time.
   int64_t io_timeout_micros = wire::kEngineIoTimeoutMicros;
-  // Connections of the main socket served at once; beyond it they are answered 1401.
+  // Connections of the main socket served at once; beyond it they are answered kCodeOverloaded.
   int max_connections = 256;
-  // The public socket. Connections beyond these limits are answered 1401 at once and closed.
+  // The public socket. Connections beyond these limits are answered kCodeOverloaded at once and
+  // closed.
   int max_public_connections = 128;          // all users together
   int max_public_connections_per_user = 16;  // by the peer's uid
   // Requests of one user being worked on at once (the rest of its connections wait for their
-  // request to arrive); beyond it they are answered 1401.
+  // request to arrive); beyond it they are answered kCodeOverloaded.
   int max_public_requests_per_user = 4;
   // A public request must arrive whole within this time of connecting, or the connection is
   // closed without a reply: idle connections do not hold room.
