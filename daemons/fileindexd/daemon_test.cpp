@@ -94,17 +94,15 @@ bool ClosedByDaemon(int fd, int timeout_ms) {
 // The reply the daemon sends on `fd` without being asked (a refusal); null when it sends none
 // within `timeout_ms` or closes the connection.
 Json::Value UnaskedReply(int fd, int timeout_ms) {
-  struct pollfd ready = {fd, POLLIN, 0};
-  uint32_t len = 0;
-  if (poll(&ready, 1, timeout_ms) != 1 || recv(fd, &len, sizeof(len), MSG_WAITALL) != 4 ||
-      len > kMaxCommandFrame) {
+  wire::Deadline deadline = wire::Deadline::Idle(timeout_ms, timeout_ms);
+  std::string payload;
+  if (wire::ReadFrame(fd, wire::kMaxCommandFrame, &payload, deadline) != wire::IoStatus::kOk) {
     return Json::Value();
   }
-  std::string text(len, '\0');
-  if (recv(fd, &text[0], len, MSG_WAITALL) != static_cast<ssize_t>(len)) return Json::Value();
-  while (!text.empty() && text.back() == '\0') text.pop_back();
+  const std::string_view text = wire::PayloadText(payload);
   JsonValue reply;
-  return reply.fromString(text) ? Json::Value(std::move(reply)) : Json::Value();
+  return reply.fromString(text.data(), text.data() + text.size()) ? Json::Value(std::move(reply))
+                                                                  : Json::Value();
 }
 
 // Runs fileindexctl with `args`; its standard output and error together, and its exit status.
