@@ -56,8 +56,8 @@ TEST(WireTest, FramesKeepEveryByteThroughPartialTransfers) {
   EXPECT_EQ(payload, big);
   std::string raw(4 + 3, '?');
   EXPECT_EQ(ReadExact(p.b.get(), &raw[0], raw.size(), never), IoStatus::kOk);
-  EXPECT_EQ(raw, EncodeFrame(std::string("{}\0", 3)));
   EXPECT_EQ(raw, LengthBytes(3) + std::string("{}\0", 3));
+  EXPECT_EQ(EncodeFrame(raw.substr(4)), raw);
   EXPECT_EQ(PayloadText(raw.substr(4)), "{}");
   EXPECT_EQ(ReadFrame(p.b.get(), 0, &payload, never), IoStatus::kOk);
   EXPECT_EQ(payload, "");
@@ -77,12 +77,10 @@ TEST(WireTest, BrokenFramesFailWithTheirReason) {
   };
   const std::vector<Case> cases = {
       {"closes without a frame", "", true, 100, IoStatus::kClosed, ECONNRESET},
-      {"closes inside the length", "ab", true, 100, IoStatus::kClosed, ECONNRESET},
       {"closes inside the payload", LengthBytes(10) + "0123", true, 100, IoStatus::kClosed,
        ECONNRESET},
       {"announces 4 GiB", LengthBytes(0xFFFFFFFFu) + "{}", false, kClientMaxFrameBytes,
        IoStatus::kTooLarge, EMSGSIZE},
-      {"one byte over the bound", LengthBytes(100), false, 99, IoStatus::kTooLarge, EMSGSIZE},
       {"stalls inside the payload", LengthBytes(10) + "0123", false, 100, IoStatus::kTimeout,
        ETIMEDOUT},
       {"never sends", "", false, 100, IoStatus::kTimeout, ETIMEDOUT},
