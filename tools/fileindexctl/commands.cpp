@@ -362,24 +362,27 @@ void FolderGroupsCmd(const Args&, Output& out) {
 
 // ---- shares, volumes, users, homes
 
-std::function<void(const Args&, Output&)> OneArg(void (*op)(const std::string&),
-                                                 const std::string& what, const std::string& done) {
-  return [op, what, done](const Args& args, Output& out) {
-    const std::string value = args.At(0, what);
-    op(value);
-    out.Done(done + " " + value);
-  };
+// A command that names one thing (or two, the second its new name or place), hands it to the
+// library and says what it did: usage and argument count follow from the argument names.
+Command OneArg(const char* group, const char* name, const std::string& what, const char* summary,
+               void (*op)(const std::string&), const std::string& done) {
+  return {group, name, what, summary, {}, {}, 1, [op, what, done](const Args& args, Output& out) {
+            const std::string value = args.At(0, what);
+            op(value);
+            out.Done(done + " " + value);
+          }};
 }
 
-std::function<void(const Args&, Output&)> TwoArgs(
-    void (*op)(const std::string&, const std::string&), const std::string& first,
-    const std::string& second, const std::string& done) {
-  return [=](const Args& args, Output& out) {
-    const std::string a = args.At(0, first);
-    const std::string b = args.At(1, second);
-    op(a, b);
-    out.Done(done + " " + a + " -> " + b);
-  };
+Command TwoArgs(const char* group, const char* name, const std::string& first,
+                const std::string& second, const char* summary,
+                void (*op)(const std::string&, const std::string&), const std::string& done) {
+  return {
+      group, name, first + " " + second, summary, {}, {}, 2, [=](const Args& args, Output& out) {
+        const std::string a = args.At(0, first);
+        const std::string b = args.At(1, second);
+        op(a, b);
+        out.Done(done + " " + a + " -> " + b);
+      }};
 }
 
 unsigned int Uid(const Args& args) {
@@ -400,6 +403,28 @@ platform::AUTH_TYPE Auth(const Args& args) {
   if (auth == "ldap") return platform::AUTH_LDAP;
   if (auth == "all") return platform::AUTH_ALL;
   throw UsageError("--auth takes local, domain, ldap or all");
+}
+
+Command UserHome(const char* name, const char* summary, void (*op)(unsigned int),
+                 const std::string& done) {
+  return {"user", name, "USER", summary, {}, {}, 1, [op, done](const Args& args, Output& out) {
+            op(Uid(args));
+            out.Done(done + " " + args.At(0, "USER"));
+          }};
+}
+
+Command HomeService(const char* name, const char* summary, void (*op)(platform::AUTH_TYPE)) {
+  return {"home",
+          name,
+          "[--auth local|domain|ldap|all]",
+          summary,
+          {"auth"},
+          {},
+          0,
+          [op](const Args& args, Output& out) {
+            op(Auth(args));
+            out.Done("home recycle bins queued for re-indexing");
+          }};
 }
 
 // ---- search
@@ -858,146 +883,35 @@ const std::vector<Command>& Commands() {
        1,
        FolderCheckCmd},
       {"folder", "groups", "", "list the groups folders are shown to", {}, {}, 0, FolderGroupsCmd},
-      {"share",
-       "rename",
-       "FROM TO",
-       "follow a share's new name",
-       {},
-       {},
-       2,
-       TwoArgs(ShareRename, "FROM", "TO", "renamed share")},
-      {"share",
-       "pause",
-       "SHARE",
-       "stop indexing a share",
-       {},
-       {},
-       1,
-       OneArg(SharePause, "SHARE", "paused share")},
-      {"share",
-       "resume",
-       "SHARE",
-       "index a paused share again",
-       {},
-       {},
-       1,
-       OneArg(ShareResume, "SHARE", "resumed share")},
-      {"share",
-       "rebuild",
-       "SHARE",
-       "rebuild a share's index from scratch",
-       {},
-       {},
-       1,
-       OneArg(ShareRebuild, "SHARE", "rebuilding share")},
-      {"share",
-       "clear-paused",
-       "SHARE SHARE_PATH",
-       "drop a paused share's index data",
-       {},
-       {},
-       2,
-       TwoArgs(ShareClearPaused, "SHARE", "SHARE_PATH", "cleared")},
-      {"share",
-       "auto-clean",
-       "SHARE",
-       "drop the folders of a share that is gone",
-       {},
-       {},
-       1,
-       OneArg(ShareAutoClean, "SHARE", "cleaned share")},
-      {"share",
-       "check-recycle",
-       "SHARE",
-       "apply the recycle-bin rules to a share again",
-       {},
-       {},
-       1,
-       OneArg(ShareCheckRecycle, "SHARE", "re-checking recycle bin of")},
-      {"share",
-       "migrate",
-       "SHARE FROM_PATH",
-       "follow a share moved to another volume",
-       {},
-       {},
-       2,
-       TwoArgs(ShareMigrate, "SHARE", "FROM_PATH", "migrated")},
-      {"volume",
-       "pause",
-       "VOLUME",
-       "stop indexing every share on a volume",
-       {},
-       {},
-       1,
-       OneArg(VolumePause, "VOLUME", "paused volume")},
-      {"volume",
-       "resume",
-       "VOLUME",
-       "index a volume's shares again",
-       {},
-       {},
-       1,
-       OneArg(VolumeResume, "VOLUME", "resumed volume")},
-      {"volume",
-       "clear-paused",
-       "VOLUME",
-       "drop the index data of a paused volume",
-       {},
-       {},
-       1,
-       OneArg(VolumeClearPaused, "VOLUME", "cleared volume")},
-      {"user",
-       "rename",
-       "FROM TO",
-       "follow a user's new name",
-       {},
-       {},
-       2,
-       TwoArgs(UserRename, "FROM", "TO", "renamed user")},
-      {"user",
-       "delete",
-       "USER",
-       "drop the indexed folders of a deleted user's home",
-       {},
-       {},
-       1,
-       [](const Args& args, Output& out) {
-         UserDelete(Uid(args));
-         out.Done("removed the home folders of user " + args.At(0, "USER"));
-       }},
-      {"user",
-       "remember",
-       "USER",
-       "record a user's home for a later delete",
-       {},
-       {},
-       1,
-       [](const Args& args, Output& out) {
-         UserRemember(Uid(args));
-         out.Done("remembered the home of user " + args.At(0, "USER"));
-       }},
-      {"home",
-       "enable",
-       "[--auth local|domain|ldap|all]",
-       "the home service was switched on",
-       {"auth"},
-       {},
-       0,
-       [](const Args& args, Output& out) {
-         HomeEnable(Auth(args));
-         out.Done("home recycle bins queued for re-indexing");
-       }},
-      {"home",
-       "disable",
-       "[--auth local|domain|ldap|all]",
-       "the home service was switched off",
-       {"auth"},
-       {},
-       0,
-       [](const Args& args, Output& out) {
-         HomeDisable(Auth(args));
-         out.Done("home recycle bins queued for re-indexing");
-       }},
+      TwoArgs("share", "rename", "FROM", "TO", "follow a share's new name", ShareRename,
+              "renamed share"),
+      OneArg("share", "pause", "SHARE", "stop indexing a share", SharePause, "paused share"),
+      OneArg("share", "resume", "SHARE", "index a paused share again", ShareResume,
+             "resumed share"),
+      OneArg("share", "rebuild", "SHARE", "rebuild a share's index from scratch", ShareRebuild,
+             "rebuilding share"),
+      TwoArgs("share", "clear-paused", "SHARE", "SHARE_PATH", "drop a paused share's index data",
+              ShareClearPaused, "cleared"),
+      OneArg("share", "auto-clean", "SHARE", "drop the folders of a share that is gone",
+             ShareAutoClean, "cleaned share"),
+      OneArg("share", "check-recycle", "SHARE", "apply the recycle-bin rules to a share again",
+             ShareCheckRecycle, "re-checking recycle bin of"),
+      TwoArgs("share", "migrate", "SHARE", "FROM_PATH", "follow a share moved to another volume",
+              ShareMigrate, "migrated"),
+      OneArg("volume", "pause", "VOLUME", "stop indexing every share on a volume", VolumePause,
+             "paused volume"),
+      OneArg("volume", "resume", "VOLUME", "index a volume's shares again", VolumeResume,
+             "resumed volume"),
+      OneArg("volume", "clear-paused", "VOLUME", "drop the index data of a paused volume",
+             VolumeClearPaused, "cleared volume"),
+      TwoArgs("user", "rename", "FROM", "TO", "follow a user's new name", UserRename,
+              "renamed user"),
+      UserHome("delete", "drop the indexed folders of a deleted user's home", UserDelete,
+               "removed the home folders of user"),
+      UserHome("remember", "record a user's home for a later delete", UserRemember,
+               "remembered the home of user"),
+      HomeService("enable", "the home service was switched on", HomeEnable),
+      HomeService("disable", "the home service was switched off", HomeDisable),
       {"services",
        "prepare",
        "",
