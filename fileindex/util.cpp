@@ -5,6 +5,8 @@
 #include <climits>
 #include <cstdlib>
 #include <cstring>
+#include <sstream>
+#include <utility>
 #include <vector>
 
 #include "common/error.hpp"
@@ -181,117 +183,72 @@ FileType GetFileTypeBySetting(const string& name) {
 
 namespace {
 
-constexpr FileType D = kDocument;
-constexpr FileType A = kAudio;
-constexpr FileType V = kVideo;
-constexpr FileType P = kPhoto;
+// The extensions of each kind, split on white space. The empty extension (a name without a dot)
+// counts as a document and is added on its own; "prc" is listed twice and kept once.
+const char kDocumentExtensions[] = R"(
+!!! $00 $01 $02 $04 $05 $o1 $ol 1 12da 1st 7 7z 82t 92t _me abap abl ac ada adiumhtmllog adiumlog
+adl adt adw ahk aiml alx aml android annot ans ansi application aprj apx aqt arff artask as asc
+ascii asl asp ass assoc atc att awa awb awd awh awp axt azw3 ba1 bad bas bat bbs bbxt bcr bdp bdr
+bea bel bep big big5 bk blm bln blw bmtp bna bnx bog box bpdx brf bsdl bss bt bz2 bzw c cag cas
+cascii cbl cc cd2 cfm charset chm cho chord cif cil ckn clg cli clix clj cmd cmtx cof coffee conf
+coo cpp crash crd cs csassembly csmanifest css csv ctd ctf ctl ctx d dart dcd dce ddd ddt de
+dectest des desc dfe dfm diff dii diskdefines diz dk dkz dmr dne doc docm docx dok dot dotm dotx
+dp dpv dqy drp dsc dsml dtd dwl ecsv edml edn edt efm eia ejs eml emulecollection en enc enf eng
+epub erl err es esw etf etx euc ext extra f faq fff ffp fin first flr fmr fnx fon forth fr fra frm
+fsa fth ftl full gbf gdt gen ger glsl gnu gnumeric go gpl groovy gs gthr gtx guide gz haml
+handlebars hdr hhc hhs hlm hlx hp8 hs hsk ht3 htm html htmls htx hvc hwl hx hz id31 id32 idc idt
+idx iem igv igy iif inc ini inuse ion ipr iqy isr it ivp ja jack jad jade jam java jeb jis jl jp1
+js json jsp jss jsx jtx kahl kar kch key kix klg kor la label las latex lay less lin linux linx
+liquid lisp lit lnc lo_ log lrc ls lsl lst ltr ltt ltx lua lue luf lwd lxfml lyr lyt m man
+manifest map mar markdown mathml maxfr mcw md mdl mdle mdown mdtext mdtxt mdwn me mez mf mib mit
+mk mkd mkdn mno mnu mobi modd mpsub msg mss mtx mtxt mvg mw mysql nbr nclk ncm new nfo nix nlc
+nmbd nokogiri not notes now npdt nt numbers nwctxt ocaml ocr odb odc odf odg odi odm odoc odp ods
+odt oh ojp omn oogl oot opc openbsd opml ort osheet osi oslides otc otf otg oth oti otp ots ott
+p3x pages panic pascal pbd pc5 pcl pd pdb pdf pdu perl pfs pgw php pjs pl pla plf plg plist plk
+pln pml pmo pod pot potm potx ppa pps ppsm ppsx ppt pptm pptx prc prc prn pro prr ps psb psi2 pt3
+pts pvj pvw py q&a qdt qud r rar rb rbdf rbw rdf rea readme reg rel rep resp rest rff rhtml ris
+rml rqy rs rst rt rtf rtl rtx ru rus rzk rzn s s19 s2k sami sass sbv scad scala scm scss sct sdnf
+sen seq set sfb sgp sh sha1 sha512 sjs skcard skv slk sls smali smf smi sms snw soap soundscript
+spa spec spg spn spx sql srt srx ss ssa ssf st1 stf stq strings styl sub syn t t2t tab tar tbd tbl
+tbx tbz tce tcl tcm tdf ted tex text textclipping textile tfw tgf tgz thml thp tlb tle tlx tm tml
+tmprtf tmx tnef tph tpl trn trt tsv tt ttbl tte ttpl ttxt tx8 tx? txa txd txe txh txt u3i uax
+uhtml uk unauth uni unx us usa user usf usg utf8 utx utxt v vb ver vet vfk vhd vhdl vis vkp vmg
+vmsg vna vsmproj vw vw3 vxml wer wir wkf wn wrd wrl wsc wst wtf wtl wtx x20 x60 x70 x80 x90 xb0
+xc0 xct xd0 xdl xdp xfd xff xhtm xlf xls xlsm xlsx xlt xltm xltx xml xq xquery xqy xsd xsl xslt
+xsr xwp xy xy3 xyp xyw xyz yaml yml zanebug zed zhp zib zip zw zxe
+)";
+
+const char kAudioExtensions[] = R"(
+aac ac3 aif aiff ape cue dff dsf flac m3u m4a m4b m4p mp1 mp2 mp3 mpa ogg pcm pls ra ram wav wma
+wpl
+)";
+
+const char kVideoExtensions[] = R"(
+3g2 3gp asf avi dat divx dvr-ms f4v flv ifo iso m2t m2ts m4v mkv mov mp4 mpeg mpg mts qt rm rmvb
+swf tp trp ts vdr vob wmv xvid
+)";
+
+const char kPhotoExtensions[] = R"(
+3fr arw bmp cr2 crw dcr dng erf gif ico jpe jpeg jpg k25 kdc mef mos mrw nef orf pef png psd ptx
+raf raw rw2 sr2 srf tif tiff ufo x3f
+)";
 
 }  // namespace
 
-// "prc" is listed twice and kept once.
 const std::map<string, FileType>& FileTypeTable() {
-  static const std::map<string, FileType> table = {
-      {"", D}, {"!!!", D}, {"$00", D}, {"$01", D}, {"$02", D}, {"$04", D}, {"$05", D}, {"$o1", D},
-      {"$ol", D}, {"1", D}, {"12da", D}, {"1st", D}, {"7", D}, {"7z", D}, {"82t", D}, {"92t", D},
-      {"_me", D}, {"abap", D}, {"abl", D}, {"ac", D}, {"ada", D}, {"adiumhtmllog", D},
-      {"adiumlog", D}, {"adl", D}, {"adt", D}, {"adw", D}, {"ahk", D}, {"aiml", D}, {"alx", D},
-      {"aml", D}, {"android", D}, {"annot", D}, {"ans", D}, {"ansi", D}, {"application", D},
-      {"aprj", D}, {"apx", D}, {"aqt", D}, {"arff", D}, {"artask", D}, {"as", D}, {"asc", D},
-      {"ascii", D}, {"asl", D}, {"asp", D}, {"ass", D}, {"assoc", D}, {"atc", D}, {"att", D},
-      {"awa", D}, {"awb", D}, {"awd", D}, {"awh", D}, {"awp", D}, {"axt", D}, {"azw3", D}, {"ba1", D},
-      {"bad", D}, {"bas", D}, {"bat", D}, {"bbs", D}, {"bbxt", D}, {"bcr", D}, {"bdp", D}, {"bdr", D},
-      {"bea", D}, {"bel", D}, {"bep", D}, {"big", D}, {"big5", D}, {"bk", D}, {"blm", D}, {"bln", D},
-      {"blw", D}, {"bmtp", D}, {"bna", D}, {"bnx", D}, {"bog", D}, {"box", D}, {"bpdx", D},
-      {"brf", D}, {"bsdl", D}, {"bss", D}, {"bt", D}, {"bz2", D}, {"bzw", D}, {"c", D}, {"cag", D},
-      {"cas", D}, {"cascii", D}, {"cbl", D}, {"cc", D}, {"cd2", D}, {"cfm", D}, {"charset", D},
-      {"chm", D}, {"cho", D}, {"chord", D}, {"cif", D}, {"cil", D}, {"ckn", D}, {"clg", D},
-      {"cli", D}, {"clix", D}, {"clj", D}, {"cmd", D}, {"cmtx", D}, {"cof", D}, {"coffee", D},
-      {"conf", D}, {"coo", D}, {"cpp", D}, {"crash", D}, {"crd", D}, {"cs", D}, {"csassembly", D},
-      {"csmanifest", D}, {"css", D}, {"csv", D}, {"ctd", D}, {"ctf", D}, {"ctl", D}, {"ctx", D},
-      {"d", D}, {"dart", D}, {"dcd", D}, {"dce", D}, {"ddd", D}, {"ddt", D}, {"de", D},
-      {"dectest", D}, {"des", D}, {"desc", D}, {"dfe", D}, {"dfm", D}, {"diff", D}, {"dii", D},
-      {"diskdefines", D}, {"diz", D}, {"dk", D}, {"dkz", D}, {"dmr", D}, {"dne", D}, {"doc", D},
-      {"docm", D}, {"docx", D}, {"dok", D}, {"dot", D}, {"dotm", D}, {"dotx", D}, {"dp", D},
-      {"dpv", D}, {"dqy", D}, {"drp", D}, {"dsc", D}, {"dsml", D}, {"dtd", D}, {"dwl", D},
-      {"ecsv", D}, {"edml", D}, {"edn", D}, {"edt", D}, {"efm", D}, {"eia", D}, {"ejs", D},
-      {"eml", D}, {"emulecollection", D}, {"en", D}, {"enc", D}, {"enf", D}, {"eng", D}, {"epub", D},
-      {"erl", D}, {"err", D}, {"es", D}, {"esw", D}, {"etf", D}, {"etx", D}, {"euc", D}, {"ext", D},
-      {"extra", D}, {"f", D}, {"faq", D}, {"fff", D}, {"ffp", D}, {"fin", D}, {"first", D},
-      {"flr", D}, {"fmr", D}, {"fnx", D}, {"fon", D}, {"forth", D}, {"fr", D}, {"fra", D}, {"frm", D},
-      {"fsa", D}, {"fth", D}, {"ftl", D}, {"full", D}, {"gbf", D}, {"gdt", D}, {"gen", D}, {"ger", D},
-      {"glsl", D}, {"gnu", D}, {"gnumeric", D}, {"go", D}, {"gpl", D}, {"groovy", D}, {"gs", D},
-      {"gthr", D}, {"gtx", D}, {"guide", D}, {"gz", D}, {"haml", D}, {"handlebars", D}, {"hdr", D},
-      {"hhc", D}, {"hhs", D}, {"hlm", D}, {"hlx", D}, {"hp8", D}, {"hs", D}, {"hsk", D}, {"ht3", D},
-      {"htm", D}, {"html", D}, {"htmls", D}, {"htx", D}, {"hvc", D}, {"hwl", D}, {"hx", D}, {"hz", D},
-      {"id31", D}, {"id32", D}, {"idc", D}, {"idt", D}, {"idx", D}, {"iem", D}, {"igv", D},
-      {"igy", D}, {"iif", D}, {"inc", D}, {"ini", D}, {"inuse", D}, {"ion", D}, {"ipr", D},
-      {"iqy", D}, {"isr", D}, {"it", D}, {"ivp", D}, {"ja", D}, {"jack", D}, {"jad", D}, {"jade", D},
-      {"jam", D}, {"java", D}, {"jeb", D}, {"jis", D}, {"jl", D}, {"jp1", D}, {"js", D}, {"json", D},
-      {"jsp", D}, {"jss", D}, {"jsx", D}, {"jtx", D}, {"kahl", D}, {"kar", D}, {"kch", D}, {"key", D},
-      {"kix", D}, {"klg", D}, {"kor", D}, {"la", D}, {"label", D}, {"las", D}, {"latex", D},
-      {"lay", D}, {"less", D}, {"lin", D}, {"linux", D}, {"linx", D}, {"liquid", D}, {"lisp", D},
-      {"lit", D}, {"lnc", D}, {"lo_", D}, {"log", D}, {"lrc", D}, {"ls", D}, {"lsl", D}, {"lst", D},
-      {"ltr", D}, {"ltt", D}, {"ltx", D}, {"lua", D}, {"lue", D}, {"luf", D}, {"lwd", D},
-      {"lxfml", D}, {"lyr", D}, {"lyt", D}, {"m", D}, {"man", D}, {"manifest", D}, {"map", D},
-      {"mar", D}, {"markdown", D}, {"mathml", D}, {"maxfr", D}, {"mcw", D}, {"md", D}, {"mdl", D},
-      {"mdle", D}, {"mdown", D}, {"mdtext", D}, {"mdtxt", D}, {"mdwn", D}, {"me", D}, {"mez", D},
-      {"mf", D}, {"mib", D}, {"mit", D}, {"mk", D}, {"mkd", D}, {"mkdn", D}, {"mno", D}, {"mnu", D},
-      {"mobi", D}, {"modd", D}, {"mpsub", D}, {"msg", D}, {"mss", D}, {"mtx", D}, {"mtxt", D},
-      {"mvg", D}, {"mw", D}, {"mysql", D}, {"nbr", D}, {"nclk", D}, {"ncm", D}, {"new", D},
-      {"nfo", D}, {"nix", D}, {"nlc", D}, {"nmbd", D}, {"nokogiri", D}, {"not", D}, {"notes", D},
-      {"now", D}, {"npdt", D}, {"nt", D}, {"numbers", D}, {"nwctxt", D}, {"ocaml", D}, {"ocr", D},
-      {"odb", D}, {"odc", D}, {"odf", D}, {"odg", D}, {"odi", D}, {"odm", D}, {"odoc", D}, {"odp", D},
-      {"ods", D}, {"odt", D}, {"oh", D}, {"ojp", D}, {"omn", D}, {"oogl", D}, {"oot", D}, {"opc", D},
-      {"openbsd", D}, {"opml", D}, {"ort", D}, {"osheet", D}, {"osi", D}, {"oslides", D}, {"otc", D},
-      {"otf", D}, {"otg", D}, {"oth", D}, {"oti", D}, {"otp", D}, {"ots", D}, {"ott", D}, {"p3x", D},
-      {"pages", D}, {"panic", D}, {"pascal", D}, {"pbd", D}, {"pc5", D}, {"pcl", D}, {"pd", D},
-      {"pdb", D}, {"pdf", D}, {"pdu", D}, {"perl", D}, {"pfs", D}, {"pgw", D}, {"php", D}, {"pjs", D},
-      {"pl", D}, {"pla", D}, {"plf", D}, {"plg", D}, {"plist", D}, {"plk", D}, {"pln", D}, {"pml", D},
-      {"pmo", D}, {"pod", D}, {"pot", D}, {"potm", D}, {"potx", D}, {"ppa", D}, {"pps", D},
-      {"ppsm", D}, {"ppsx", D}, {"ppt", D}, {"pptm", D}, {"pptx", D}, {"prc", D}, {"prc", D},
-      {"prn", D}, {"pro", D}, {"prr", D}, {"ps", D}, {"psb", D}, {"psi2", D}, {"pt3", D}, {"pts", D},
-      {"pvj", D}, {"pvw", D}, {"py", D}, {"q&a", D}, {"qdt", D}, {"qud", D}, {"r", D}, {"rar", D},
-      {"rb", D}, {"rbdf", D}, {"rbw", D}, {"rdf", D}, {"rea", D}, {"readme", D}, {"reg", D},
-      {"rel", D}, {"rep", D}, {"resp", D}, {"rest", D}, {"rff", D}, {"rhtml", D}, {"ris", D},
-      {"rml", D}, {"rqy", D}, {"rs", D}, {"rst", D}, {"rt", D}, {"rtf", D}, {"rtl", D}, {"rtx", D},
-      {"ru", D}, {"rus", D}, {"rzk", D}, {"rzn", D}, {"s", D}, {"s19", D}, {"s2k", D}, {"sami", D},
-      {"sass", D}, {"sbv", D}, {"scad", D}, {"scala", D}, {"scm", D}, {"scss", D}, {"sct", D},
-      {"sdnf", D}, {"sen", D}, {"seq", D}, {"set", D}, {"sfb", D}, {"sgp", D}, {"sh", D}, {"sha1", D},
-      {"sha512", D}, {"sjs", D}, {"skcard", D}, {"skv", D}, {"slk", D}, {"sls", D}, {"smali", D},
-      {"smf", D}, {"smi", D}, {"sms", D}, {"snw", D}, {"soap", D}, {"soundscript", D}, {"spa", D},
-      {"spec", D}, {"spg", D}, {"spn", D}, {"spx", D}, {"sql", D}, {"srt", D}, {"srx", D}, {"ss", D},
-      {"ssa", D}, {"ssf", D}, {"st1", D}, {"stf", D}, {"stq", D}, {"strings", D}, {"styl", D},
-      {"sub", D}, {"syn", D}, {"t", D}, {"t2t", D}, {"tab", D}, {"tar", D}, {"tbd", D}, {"tbl", D},
-      {"tbx", D}, {"tbz", D}, {"tce", D}, {"tcl", D}, {"tcm", D}, {"tdf", D}, {"ted", D}, {"tex", D},
-      {"text", D}, {"textclipping", D}, {"textile", D}, {"tfw", D}, {"tgf", D}, {"tgz", D},
-      {"thml", D}, {"thp", D}, {"tlb", D}, {"tle", D}, {"tlx", D}, {"tm", D}, {"tml", D},
-      {"tmprtf", D}, {"tmx", D}, {"tnef", D}, {"tph", D}, {"tpl", D}, {"trn", D}, {"trt", D},
-      {"tsv", D}, {"tt", D}, {"ttbl", D}, {"tte", D}, {"ttpl", D}, {"ttxt", D}, {"tx8", D},
-      {"tx?", D}, {"txa", D}, {"txd", D}, {"txe", D}, {"txh", D}, {"txt", D}, {"u3i", D}, {"uax", D},
-      {"uhtml", D}, {"uk", D}, {"unauth", D}, {"uni", D}, {"unx", D}, {"us", D}, {"usa", D},
-      {"user", D}, {"usf", D}, {"usg", D}, {"utf8", D}, {"utx", D}, {"utxt", D}, {"v", D}, {"vb", D},
-      {"ver", D}, {"vet", D}, {"vfk", D}, {"vhd", D}, {"vhdl", D}, {"vis", D}, {"vkp", D}, {"vmg", D},
-      {"vmsg", D}, {"vna", D}, {"vsmproj", D}, {"vw", D}, {"vw3", D}, {"vxml", D}, {"wer", D},
-      {"wir", D}, {"wkf", D}, {"wn", D}, {"wrd", D}, {"wrl", D}, {"wsc", D}, {"wst", D}, {"wtf", D},
-      {"wtl", D}, {"wtx", D}, {"x20", D}, {"x60", D}, {"x70", D}, {"x80", D}, {"x90", D}, {"xb0", D},
-      {"xc0", D}, {"xct", D}, {"xd0", D}, {"xdl", D}, {"xdp", D}, {"xfd", D}, {"xff", D}, {"xhtm", D},
-      {"xlf", D}, {"xls", D}, {"xlsm", D}, {"xlsx", D}, {"xlt", D}, {"xltm", D}, {"xltx", D},
-      {"xml", D}, {"xq", D}, {"xquery", D}, {"xqy", D}, {"xsd", D}, {"xsl", D}, {"xslt", D},
-      {"xsr", D}, {"xwp", D}, {"xy", D}, {"xy3", D}, {"xyp", D}, {"xyw", D}, {"xyz", D}, {"yaml", D},
-      {"yml", D}, {"zanebug", D}, {"zed", D}, {"zhp", D}, {"zib", D}, {"zip", D}, {"zw", D},
-      {"zxe", D}, {"aac", A}, {"ac3", A}, {"aif", A}, {"aiff", A}, {"ape", A}, {"cue", A}, {"dff", A},
-      {"dsf", A}, {"flac", A}, {"m3u", A}, {"m4a", A}, {"m4b", A}, {"m4p", A}, {"mp1", A}, {"mp2", A},
-      {"mp3", A}, {"mpa", A}, {"ogg", A}, {"pcm", A}, {"pls", A}, {"ra", A}, {"ram", A}, {"wav", A},
-      {"wma", A}, {"wpl", A}, {"3g2", V}, {"3gp", V}, {"asf", V}, {"avi", V}, {"dat", V}, {"divx", V},
-      {"dvr-ms", V}, {"f4v", V}, {"flv", V}, {"ifo", V}, {"iso", V}, {"m2t", V}, {"m2ts", V},
-      {"m4v", V}, {"mkv", V}, {"mov", V}, {"mp4", V}, {"mpeg", V}, {"mpg", V}, {"mts", V}, {"qt", V},
-      {"rm", V}, {"rmvb", V}, {"swf", V}, {"tp", V}, {"trp", V}, {"ts", V}, {"vdr", V}, {"vob", V},
-      {"wmv", V}, {"xvid", V}, {"3fr", P}, {"arw", P}, {"bmp", P}, {"cr2", P}, {"crw", P}, {"dcr", P},
-      {"dng", P}, {"erf", P}, {"gif", P}, {"ico", P}, {"jpe", P}, {"jpeg", P}, {"jpg", P}, {"k25", P},
-      {"kdc", P}, {"mef", P}, {"mos", P}, {"mrw", P}, {"nef", P}, {"orf", P}, {"pef", P}, {"png", P},
-      {"psd", P}, {"ptx", P}, {"raf", P}, {"raw", P}, {"rw2", P}, {"sr2", P}, {"srf", P}, {"tif", P},
-      {"tiff", P}, {"ufo", P}, {"x3f", P},
-  };
+  static const std::map<string, FileType> table = [] {
+    std::map<string, FileType> t = {{"", kDocument}};
+    const std::pair<const char*, FileType> lists[] = {{kDocumentExtensions, kDocument},
+                                                      {kAudioExtensions, kAudio},
+                                                      {kVideoExtensions, kVideo},
+                                                      {kPhotoExtensions, kPhoto}};
+    // An extension listed under two kinds keeps the first.
+    for (const auto& list : lists) {
+      std::istringstream words(list.first);
+      for (string ext; words >> ext;) t.emplace(ext, list.second);
+    }
+    return t;
+  }();
   return table;
 }
 
