@@ -44,7 +44,10 @@ const ShareConfig* FindShareHolding(const PlatformConfig& config, const std::str
   return best;
 }
 
+// The public flag getters differ only in the field they read; `call` names the getter for the
+// fault seam.
 int FlagGet(const char* call, const QUIXSHARE* share, int* flag, int QUIXSHARE::*field) {
+  PLATFORM_FAULT_POINT(call, flag);
   if (share == nullptr || flag == nullptr) return PLATFORM_FAIL(-1, EINVAL, kQErrBadParam);
   *flag = share->*field ? 1 : 0;
   return 0;
@@ -176,27 +179,22 @@ int QUIXShareNamePathGet(const char* path, char* name, size_t name_size, char* s
 }
 
 int QLIBShareIsEncryptedGet(const QUIXSHARE* share, int* flag) {
-  PLATFORM_FAULT_POINT("QLIBShareIsEncryptedGet", flag);
   return FlagGet(__func__, share, flag, &QUIXSHARE::fEncrypted);
 }
 
 int QLIBShareIsReadOnlyGet(const QUIXSHARE* share, int* flag) {
-  PLATFORM_FAULT_POINT("QLIBShareIsReadOnlyGet", flag);
   return FlagGet(__func__, share, flag, &QUIXSHARE::fReadOnly);
 }
 
 int QLIBShareIsEncryptionGet(const QUIXSHARE* share, int* flag) {
-  PLATFORM_FAULT_POINT("QLIBShareIsEncryptionGet", flag);
   return FlagGet(__func__, share, flag, &QUIXSHARE::fEncryption);
 }
 
 int QLIBShareRecycleStatusGet(const QUIXSHARE* share, int* flag) {
-  PLATFORM_FAULT_POINT("QLIBShareRecycleStatusGet", flag);
   return FlagGet(__func__, share, flag, &QUIXSHARE::fRecycleBin);
 }
 
 int QLIBShareHideUnreadableGet(const QUIXSHARE* share, int* flag) {
-  PLATFORM_FAULT_POINT("QLIBShareHideUnreadableGet", flag);
   return FlagGet(__func__, share, flag, &QUIXSHARE::fHideUnreadable);
 }
 

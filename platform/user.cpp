@@ -66,6 +66,21 @@ std::vector<gid_t> GroupList(const struct passwd& pw) {
   return groups;
 }
 
+namespace {
+
+// For the calls that ask about a named user under the current configuration: -1 (errno and the
+// platform error set) when the name, the configuration or the user is missing.
+int ConfigAndUser(const char* name, std::shared_ptr<const PlatformConfig>* config,
+                  PasswdEntry* entry) {
+  if (name == nullptr) return PLATFORM_FAIL(-1, EINVAL, kQErrBadParam);
+  *config = ConfigForCall();
+  if (!*config) return -1;
+  if (!LookupByName(name, entry)) return PLATFORM_FAIL(-1, errno, kQErrNoSuchUser);
+  return 0;
+}
+
+}  // namespace
+
 int QUIXUserGet(const char* name, PQUIXUSER* user) {
   PLATFORM_FAULT_POINT("QUIXUserGet", nullptr);
   if (name == nullptr || user == nullptr) return PLATFORM_FAIL(-1, EINVAL, kQErrBadParam);
@@ -88,11 +103,9 @@ void QUIXUserFree(PQUIXUSER user) { delete user; }
 
 int QLIBGroupIsAdminGroupMem(const char* name, int flags) {
   PLATFORM_FAULT_POINT("QLIBGroupIsAdminGroupMem", nullptr);
-  if (name == nullptr) return PLATFORM_FAIL(-1, EINVAL, kQErrBadParam);
-  auto config = ConfigForCall();
-  if (!config) return -1;
+  std::shared_ptr<const PlatformConfig> config;
   PasswdEntry entry;
-  if (!LookupByName(name, &entry)) return PLATFORM_FAIL(-1, errno, kQErrNoSuchUser);
+  if (ConfigAndUser(name, &config, &entry) != 0) return -1;
   struct group gr;
   struct group* found = nullptr;
   std::vector<char> buf(kNssBufferBytes);
@@ -158,11 +171,9 @@ bool ResetCredentialsByName(const char* name, bool set_groups) {
 
 int QUIXServiceUserHomeIsEnabled(const char* name) {
   PLATFORM_FAULT_POINT("QUIXServiceUserHomeIsEnabled", nullptr);
-  if (name == nullptr) return PLATFORM_FAIL(-1, EINVAL, kQErrBadParam);
-  auto config = ConfigForCall();
-  if (!config) return -1;
+  std::shared_ptr<const PlatformConfig> config;
   PasswdEntry entry;
-  if (!LookupByName(name, &entry)) return PLATFORM_FAIL(-1, errno, kQErrNoSuchUser);
+  if (ConfigAndUser(name, &config, &entry) != 0) return -1;
   return config->FindShare("homes") != nullptr ? 1 : 0;
 }
 
