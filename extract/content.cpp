@@ -22,6 +22,7 @@
 #include <cstring>
 #include <ctime>
 #include <exiv2/exiv2.hpp>
+#include <initializer_list>
 #include <map>
 #include <memory>
 #include <stdexcept>
@@ -518,29 +519,41 @@ void ExtractVideo(const OpenedFile& file, Json::Value& fields) {
 // Which parser reads a file follows its contents, so that a misnamed file is still read right.
 // Whether a file is read at all is the folder's switch for the kind its name gives
 // (fileindex::GetFileTypeByFullPath), decided before the helper is asked ("need_meta").
-enum class Format { kNone, kText, kPdf, kOoxml, kOdf, kAudio, kImage, kVideo };
+using Extractor = void (*)(const OpenedFile&, Json::Value&);
 
-Format FormatOf(const std::string& path, const std::string& mime) {
+void ExtractOoxml(const OpenedFile& file, Json::Value& fields) {
+  ExtractOffice(file, false, fields);
+}
+
+void ExtractOdf(const OpenedFile& file, Json::Value& fields) { ExtractOffice(file, true, fields); }
+
+// An office file says so in its type, or its type says only "an archive" and its name tells.
+bool IsOffice(const std::string& mime, const std::string& ext, const char* type_prefix,
+              std::initializer_list<const char*> extensions) {
+  if (StringStartWith(mime, type_prefix)) return true;
+  if (mime != "application/zip" && mime != "application/octet-stream") return false;
+  return std::find(extensions.begin(), extensions.end(), ext) != extensions.end();
+}
+
+// nullptr: a format with nothing to extract.
+Extractor ExtractorFor(const std::string& path, const std::string& mime) {
   const std::string ext = GetFileExtension(path, true);
-  if (mime == "application/pdf") return Format::kPdf;
-  if (StringStartWith(mime, "application/vnd.openxmlformats-officedocument.") ||
-      ((mime == "application/zip" || mime == "application/octet-stream") &&
-       (ext == "docx" || ext == "xlsx" || ext == "pptx"))) {
-    return Format::kOoxml;
+  if (mime == "application/pdf") return ExtractPdf;
+  if (IsOffice(mime, ext, "application/vnd.openxmlformats-officedocument.",
+               {"docx", "xlsx", "pptx"})) {
+    return ExtractOoxml;
   }
-  if (StringStartWith(mime, "application/vnd.oasis.opendocument.") ||
-      ((mime == "application/zip" || mime == "application/octet-stream") &&
-       (ext == "odt" || ext == "ods" || ext == "odp"))) {
-    return Format::kOdf;
+  if (IsOffice(mime, ext, "application/vnd.oasis.opendocument.", {"odt", "ods", "odp"})) {
+    return ExtractOdf;
   }
-  if (StringStartWith(mime, "audio/")) return Format::kAudio;
-  if (StringStartWith(mime, "image/")) return Format::kImage;
-  if (StringStartWith(mime, "video/")) return Format::kVideo;
+  if (StringStartWith(mime, "audio/")) return ExtractAudio;
+  if (StringStartWith(mime, "image/")) return ExtractPhoto;
+  if (StringStartWith(mime, "video/")) return ExtractVideo;
   if (StringStartWith(mime, "text/") || mime == "application/json" || mime == "application/xml" ||
       mime == "application/javascript" || mime == "application/x-subrip") {
-    return Format::kText;
+    return ExtractText;
   }
-  return Format::kNone;
+  return nullptr;
 }
 
 }  // namespace
@@ -591,31 +604,7 @@ Json::Value ExtractContent(const std::string& path) {
   ReadPrefix(file, 1);
   Json::Value fields(Json::objectValue);
   // The extension is the name's, not the descriptor's.
-  switch (FormatOf(path, MimeTypeOf(file))) {
-    case Format::kText:
-      ExtractText(file, fields);
-      break;
-    case Format::kPdf:
-      ExtractPdf(file, fields);
-      break;
-    case Format::kOoxml:
-      ExtractOffice(file, false, fields);
-      break;
-    case Format::kOdf:
-      ExtractOffice(file, true, fields);
-      break;
-    case Format::kAudio:
-      ExtractAudio(file, fields);
-      break;
-    case Format::kImage:
-      ExtractPhoto(file, fields);
-      break;
-    case Format::kVideo:
-      ExtractVideo(file, fields);
-      break;
-    case Format::kNone:
-      break;
-  }
+  if (const Extractor extract = ExtractorFor(path, MimeTypeOf(file))) extract(file, fields);
   return fields;
 }
 
