@@ -43,6 +43,29 @@ Json::Value Command(const char* name, Json::Value data) {
   return req;
 }
 
+// A command about one document, named by its index and path.
+Json::Value DocumentCommand(const char* name, const std::string& id, const std::string& path) {
+  Json::Value data(Json::objectValue);
+  data["id"] = id;
+  data["doc_id"] = path;
+  return Command(name, std::move(data));
+}
+
+Json::Value DocumentCommand(const char* name, const std::string& id, const std::string& path,
+                            Json::Value doc) {
+  Json::Value req = DocumentCommand(name, id, path);
+  req["data"]["data"] = std::move(doc);
+  return req;
+}
+
+// A file's extracted document, searchable by its own name and by its folder's.
+Json::Value UpsertCommand(const std::string& id, ParsePool::Result& result) {
+  Json::Value& doc = result.doc;
+  doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchFileName] = doc[QUIX::CONTENT_EXTRACT::QUIXMDFSName];
+  doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchAncestor] = doc[QUIX::CONTENT_EXTRACT::QUIXMDParent];
+  return DocumentCommand("document_upsert_by_id", id, result.path, std::move(doc));
+}
+
 }  // namespace
 
 // Collects document commands and sends them as compound requests, so a crawl of many files
@@ -91,18 +114,11 @@ class Indexer::Batch {
       return;
     }
     bytes_ += 512;
-    Json::Value data(Json::objectValue);
-    data["id"] = id_;
-    data["doc_id"] = path;
-    data["data"] = std::move(doc);
-    Add(Command("document_set_by_id", std::move(data)));
+    Add(DocumentCommand("document_set_by_id", id_, path, std::move(doc)));
     ++owner_->documents_written_;
   }
   void Delete(const std::string& path) {
-    Json::Value data(Json::objectValue);
-    data["id"] = id_;
-    data["doc_id"] = path;
-    Add(Command("document_del_by_id", std::move(data)));
+    Add(DocumentCommand("document_del_by_id", id_, path));
     ++owner_->documents_deleted_;
   }
   // Every document below `dir`, in one command.
@@ -135,16 +151,10 @@ class Indexer::Batch {
           result.error.c_str());
       return;
     }
-    Json::Value& doc = result.doc;
     // Name-only documents are small; with contents the file's size bounds the extracted text.
-    bytes_ += need_meta ? 512 + doc[QUIX::CONTENT_EXTRACT::QUIXMDFSSize].asUInt64() : 512;
-    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchFileName] = doc[QUIX::CONTENT_EXTRACT::QUIXMDFSName];
-    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchAncestor] = doc[QUIX::CONTENT_EXTRACT::QUIXMDParent];
-    Json::Value data(Json::objectValue);
-    data["id"] = id_;
-    data["doc_id"] = result.path;
-    data["data"] = std::move(doc);
-    Add(Command("document_upsert_by_id", std::move(data)));
+    bytes_ +=
+        need_meta ? 512 + result.doc[QUIX::CONTENT_EXTRACT::QUIXMDFSSize].asUInt64() : 512;
+    Add(UpsertCommand(id_, result));
     ++owner_->documents_written_;
   }
   void Add(Json::Value req) {
@@ -266,15 +276,8 @@ std::vector<std::shared_ptr<OP>> Indexer::SettleAhead(const OP* op) {
       failed.push_back(std::move(done));
       return;
     }
-    Json::Value& doc = result.doc;
-    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchFileName] = doc[QUIX::CONTENT_EXTRACT::QUIXMDFSName];
-    doc[QUIX::CONTENT_EXTRACT::QUIXMDSearchAncestor] = doc[QUIX::CONTENT_EXTRACT::QUIXMDParent];
-    Json::Value data(Json::objectValue);
-    data["id"] = id;
-    data["doc_id"] = result.path;
-    data["data"] = std::move(doc);
     try {
-      el::SendRequest(Command("document_upsert_by_id", std::move(data)));
+      el::SendRequest(UpsertCommand(id, result));
       ++documents_written_;
     } catch (const Error& e) {
       // The engine, the volume or the index failing is the pass's to handle; the rest is this
