@@ -177,8 +177,8 @@ constexpr Rules kReindexRules  = {kKeep, kToReindex, kToReindex,  kToReindex,   
 // clang-format on
 
 // Gives `op` its kind, then applies `rules` against every operation pending on the node,
-// cancelled ones included, even once `op` itself has been cancelled.
-void Coalesce(OPNode& node, OP& op, FileIndexOP kind, const Rules& rules) {
+// cancelled ones included, even once `op` itself has been cancelled. True when `op` is kept.
+bool Coalesce(OPNode& node, OP& op, FileIndexOP kind, const Rules& rules) {
   op.op = kind;
   node.TraverseOP([&](std::shared_ptr<OP> pending) {
     switch (rules[pending->op]) {
@@ -205,6 +205,7 @@ void Coalesce(OPNode& node, OP& op, FileIndexOP kind, const Rules& rules) {
     }
     op.op = kOPNone;
   });
+  return op.op != kOPNone;
 }
 
 }  // namespace
@@ -330,28 +331,23 @@ void OPTree::Accept(const std::shared_ptr<OPNode>& node, const std::shared_ptr<O
 }
 
 void OPTree::HandleCreate(std::shared_ptr<OPNode> node, std::shared_ptr<OP> op) {
-  Coalesce(*node, *op, kOPUpsert, kCreateRules);
-  if (op->op != kOPNone) Accept(node, op);
+  if (Coalesce(*node, *op, kOPUpsert, kCreateRules)) Accept(node, op);
 }
 
 void OPTree::HandleDelete(std::shared_ptr<OPNode> node, std::shared_ptr<OP> op) {
-  Coalesce(*node, *op, kOPDelete, kDeleteRules);
-  if (op->op != kOPNone) Accept(node, op);
+  if (Coalesce(*node, *op, kOPDelete, kDeleteRules)) Accept(node, op);
 }
 
 void OPTree::HandleAttr(std::shared_ptr<OPNode> node, std::shared_ptr<OP> op) {
-  Coalesce(*node, *op, kOPAttr, kAttrRules);
-  if (op->op != kOPNone) Accept(node, op);
+  if (Coalesce(*node, *op, kOPAttr, kAttrRules)) Accept(node, op);
 }
 
 void OPTree::HandleModifyAndCloseWrite(std::shared_ptr<OPNode> node, std::shared_ptr<OP> op) {
-  Coalesce(*node, *op, kOPUpsert, kModifyRules);
-  if (op->op != kOPNone) Accept(node, op);
+  if (Coalesce(*node, *op, kOPUpsert, kModifyRules)) Accept(node, op);
 }
 
 void OPTree::HandleUpdateDirectory(std::shared_ptr<OPNode> node, std::shared_ptr<OP> op) {
-  Coalesce(*node, *op, kOPUpdateDirectory, kUpdateDirRules);
-  if (op->op != kOPNone) Accept(node, op);
+  if (Coalesce(*node, *op, kOPUpdateDirectory, kUpdateDirRules)) Accept(node, op);
 }
 
 void OPTree::HandleReindex(std::shared_ptr<OPNode> node, std::shared_ptr<OP> op) {

@@ -19,20 +19,25 @@ namespace {
 
 constexpr size_t kBufferSize = 256 * 1024;
 
+// Opens (or with `create`, makes) the queue's folder. A folder that cannot be opened or made is
+// an unreadable queue or a failed append like a full volume: false with errno saying why. A
+// planted entry is the caller's to report.
+bool OpenQueueDir(const std::string& queue_path, bool create, platform::SafeDir* dir) {
+  try {
+    *dir = platform::SafeDir::Open(Dirname(queue_path), create);
+    return true;
+  } catch (const Error& e) {
+    if (e.code == kErrUnsafePath) throw;
+    if (errno == 0) errno = EIO;
+    return false;
+  }
+}
+
 }  // namespace
 
 QueueFileReader::QueueFileReader(const std::string& path) {
   platform::SafeDir dir;
-  try {
-    dir = platform::SafeDir::Open(Dirname(path), false);
-  } catch (const Error& e) {
-    // An unreadable folder is an unreadable queue (errno tells why); a planted entry is the
-    // caller's to report.
-    if (e.code == kErrUnsafePath) throw;
-    if (errno == 0) errno = EIO;
-    return;
-  }
-  if (!dir.valid()) return;
+  if (!OpenQueueDir(path, false, &dir) || !dir.valid()) return;
   fd_ = dir.OpenFile(Basename(path), O_RDONLY);
   if (fd_.valid()) buf_.reset(new char[kBufferSize]);
 }
@@ -80,15 +85,7 @@ bool QueueFileReader::ReadLine(std::string* line, size_t max_length) {
 
 bool QueueFileAppend(const std::string& queue_path, const std::string& lines) {
   platform::SafeDir dir;
-  try {
-    dir = platform::SafeDir::Open(Dirname(queue_path), true);
-  } catch (const Error& e) {
-    // A folder that cannot be made is a failed append like a full volume; a planted entry is
-    // the caller's to report.
-    if (e.code == kErrUnsafePath) throw;
-    if (errno == 0) errno = EIO;
-    return false;
-  }
+  if (!OpenQueueDir(queue_path, true, &dir)) return false;
   const std::string name = Basename(queue_path);
   for (;;) {
     UniqueFd fd = dir.OpenFile(name, O_WRONLY | O_APPEND | O_CREAT);
