@@ -122,6 +122,17 @@ bool Searchable(const std::string& name) {
   }
 }
 
+// Adds one folder and waits until `index` holds `documents`: the seconds that took.
+double IndexFolder(const std::string& path, bool contents, const std::string& index,
+                   int64_t documents) {
+  Json::Value add(Json::arrayValue);
+  add.append(System::Folder(path, contents));
+  const auto t0 = Clock::now();
+  orvane::fileindex::FolderAdd(add, false);
+  WaitFor([&] { return Documents(index) >= documents; }, 3600 * 1000);
+  return Seconds(t0, Clock::now());
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -216,13 +227,7 @@ int main(int argc, char** argv) {
   auto indexd = sys.StartIndexd();
 
   // 1. First indexing.
-  Json::Value add(Json::arrayValue);
-  add.append(System::Folder("/bench/tree", false));
-  const auto t0 = Clock::now();
-  orvane::fileindex::FolderAdd(add, false);
-  const int64_t want = files + dirs + 1;
-  WaitFor([&] { return Documents("fileindex_bench") >= want; }, 3600 * 1000);
-  const double first = Seconds(t0, Clock::now());
+  const double first = IndexFolder("/bench/tree", false, "fileindex_bench", files + dirs + 1);
   std::printf("first indexing: %d files (+%d folders) in %.2f s = %.0f files/s\n", files, dirs,
               first, files / first);
   std::printf("  CPU seconds so far: quixelasticd %.2f, quixnotifyd %.2f, fileindexd %.2f\n",
@@ -272,22 +277,13 @@ int main(int argc, char** argv) {
   // 4. Contents.
   double cpu[3] = {ProcessCpuSeconds(engine->pid()), ProcessCpuSeconds(indexd->pid()),
                    ChildrenCpuSeconds(indexd->pid())};
-  Json::Value content(Json::arrayValue);
-  content.append(System::Folder("/content", true));
-  const auto c0 = Clock::now();
-  orvane::fileindex::FolderAdd(content, false);
-  WaitFor([&] { return Documents("fileindex_content") >= kContentFiles + 21; }, 3600 * 1000);
-  const double with_content = Seconds(c0, Clock::now());
+  const double with_content =
+      IndexFolder("/content", true, "fileindex_content", kContentFiles + 21);
   std::printf("first indexing with contents: %d files, %.1f MB in %.2f s = %.2f MB/s, %.0f files/s\n",
               kContentFiles, content_bytes / 1e6, with_content,
               content_bytes / 1e6 / with_content, kContentFiles / with_content);
   PrintCpu(engine->pid(), indexd->pid(), cpu);
-  Json::Value media(Json::arrayValue);
-  media.append(System::Folder("/media", true));
-  const auto m0 = Clock::now();
-  orvane::fileindex::FolderAdd(media, false);
-  WaitFor([&] { return Documents("fileindex_media") >= kMediaFiles + 11; }, 3600 * 1000);
-  const double with_media = Seconds(m0, Clock::now());
+  const double with_media = IndexFolder("/media", true, "fileindex_media", kMediaFiles + 11);
   // The PDF and office files whose words hold "quarterly" show that their contents, not just
   // their names, were indexed.
   int quarterly = 0;
