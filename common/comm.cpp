@@ -47,6 +47,26 @@ void LogCompoundFailure(const char* file, int line, const char* func, const Json
   }
 }
 
+// The request as the wire carries it: the compact text, which keeps every byte of a string
+// (control characters escaped, other bytes as they are), so paths that are not valid UTF-8
+// survive.
+struct WireRequest {
+  const Json::Value& value;
+  std::string toString() const { return JsonToString(value); }
+};
+
+void SendWhole(quixdaemon::DomainSockConnection& conn, const WireRequest& req) {
+  ORVANE_THROW_IF_IN("SendRequestImpl", !conn.Send(req.toString()), kErrElastic, "Send failed");
+}
+
+// A reply as the exchange reads it: a text that parses to anything but an object cannot carry
+// "success" and does not count as parsed (member access on a non-object is a logic error in the
+// JSON library). What was parsed is kept for the error message.
+class Reply : public JsonValue {
+ public:
+  bool fromString(const std::string& text) { return JsonValue::fromString(text) && isObject(); }
+};
+
 }  // namespace
 
 void SendRequestImpl(Json::Value& res_out, const Json::Value& req) {
@@ -65,24 +85,13 @@ void SendRequestImpl(Json::Value& res_out, const Json::Value& req) {
 
   quixdaemon::DomainSockConnection conn(sock_path);
   ORVANE_THROW_IF(!conn.Connect(kElasticdConnectTimeout), kErrElastic, "Connect failed");
-  // The wire carries the compact text, which keeps every byte of a string (control characters
-  // escaped, other bytes as they are), so paths that are not valid UTF-8 survive.
-  if (!conn.Send(JsonToString(req))) {
-    ThrowError(__FILE__, __LINE__, __func__, "!conn.Send(req.toString())", kErrElastic,
-               "Send failed");
-  }
+  SendWhole(conn, WireRequest{req});
 
   std::string resp_raw;
-  JsonValue res;
-  // A reply that parses to something other than an object cannot carry "success" either; it is
-  // tested first because member access on a non-object is a logic error in the JSON library.
-  if (!conn.Recv(resp_raw) || !res.fromString(resp_raw) || !res.isObject() ||
-      !res.isMember("success") || !res["success"].isBool()) {
-    ThrowError(__FILE__, __LINE__, __func__,
-               "!conn.Recv(resp_raw) || !res.fromString(resp_raw) || !res.isMember(\"success\") "
-               "|| !res[\"success\"].isBool()",
-               kErrElastic, "Recv failed, res=" + res.toString());
-  }
+  Reply res;
+  ORVANE_THROW_IF(!conn.Recv(resp_raw) || !res.fromString(resp_raw) || !res.isMember("success") ||
+                      !res["success"].isBool(),
+                  kErrElastic, "Recv failed, res=" + res.toString());
   conn.Disconnect();
 
   const Json::Value& reply = res;

@@ -1,8 +1,5 @@
 #include "common/error.hpp"
 
-#include <syslog.h>
-#include <unistd.h>
-
 #include <cerrno>
 
 #include "common/log.hpp"
@@ -33,26 +30,12 @@ void ThrowError(const char* file, int line, const char* func, const char* condit
   const int saved_errno = errno;
   Error error(code, reason);
   errno = saved_errno;
-  if (saved_errno != 0) {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) Failed [%s], reason: %s [err: %m]", SourceName(file), line,
-        getpid(), geteuid(), func, condition, error.what());
-    errno = 0;
-  } else {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) Failed [%s], reason: %s", SourceName(file), line, getpid(),
-        geteuid(), func, condition, error.what());
-  }
+  LogFailedAt(file, line, func, "Failed [%s], reason: %s", condition, error.what());
   throw error;
 }
 
 void LogFailure(const char* file, int line, const char* func, const char* condition) {
-  if (errno != 0) {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) Failed [%s] [err: %m]", SourceName(file), line, getpid(),
-        geteuid(), func, condition);
-    errno = 0;
-  } else {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) Failed [%s]", SourceName(file), line, getpid(), geteuid(),
-        func, condition);
-  }
+  LogFailedAt(file, line, func, "Failed [%s]", condition);
 }
 
 }  // namespace orvane

@@ -58,15 +58,34 @@ void LogFailure(const char* file, int line, const char* func, const char* condit
 
 }  // namespace orvane
 
-// Throws Error(code, reason), logged at the throw site, when `cond` holds. The condition's own
-// text is what the log line names, so write it as the failing test reads best.
+// Throws Error(code, reason), logged at the throw site, when `cond` holds. The log line names
+// the condition by its own source text, so the code and what the log says it tested cannot
+// drift apart: shape the code so that it reads as the failure should be reported.
 #define ORVANE_THROW_IF(cond, code, reason)                                            \
   do {                                                                                 \
     if (cond) ::orvane::ThrowError(__FILE__, __LINE__, __func__, #cond, code, reason); \
   } while (0)
 
+// The same, naming `func` instead of the enclosing function: for a helper that fails on behalf
+// of the command its caller runs.
+#define ORVANE_THROW_IF_IN(func, cond, code, reason)                               \
+  do {                                                                             \
+    if (cond) ::orvane::ThrowError(__FILE__, __LINE__, func, #cond, code, reason); \
+  } while (0)
+
+// The same with a condition text given by hand, only where the text log readers know cannot be
+// the code's own.
+#define ORVANE_THROW_IF_TEXT(text, cond, code, reason)                                \
+  do {                                                                                \
+    if (cond) ::orvane::ThrowError(__FILE__, __LINE__, __func__, text, code, reason); \
+  } while (0)
+
 // Logs a failed condition without throwing; evaluates to whether it failed.
 #define ORVANE_LOG_IF(cond) \
   ((cond) ? (::orvane::LogFailure(__FILE__, __LINE__, __func__, #cond), true) : false)
+
+// The same, naming the source `source` instead of this file.
+#define ORVANE_LOG_IF_FROM(source, cond) \
+  ((cond) ? (::orvane::LogFailure(source, __LINE__, __func__, #cond), true) : false)
 
 #endif  // ORVANE_COMMON_ERROR_HPP_

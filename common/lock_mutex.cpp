@@ -16,11 +16,11 @@ bool Mutex::Unlock() { return pthread_mutex_unlock(&mutex_) == 0; }
 
 // These lines name the unit rather than the file, as every log reader of the system expects.
 LockMutex::LockMutex(Mutex& mutex) : mutex_(mutex) {
-  if (!mutex_.Lock()) LogFailure("lock_mutex", __LINE__, "LockMutex", "!mutex_.Lock()");
+  ORVANE_LOG_IF_FROM("lock_mutex", !mutex_.Lock());
 }
 
 LockMutex::~LockMutex() {
-  if (!mutex_.Unlock()) LogFailure("lock_mutex", __LINE__, "~LockMutex", "!mutex_.Unlock()");
+  ORVANE_LOG_IF_FROM("lock_mutex", !mutex_.Unlock());
 }
 
 }  // namespace orvane

@@ -1,6 +1,7 @@
 #include "common/log.hpp"
 
 #include <syslog.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
@@ -55,18 +56,13 @@ std::string ExpandErrno(const char* fmt, int saved_errno) {
   return out;
 }
 
-}  // namespace
-
-void Log(int priority, const char* fmt, ...) {
-  const int saved_errno = errno;
+// Formats like Log(): printf directives, "%m" read as `saved_errno`.
+std::string VFormat(const char* fmt, va_list args, int saved_errno) {
   const std::string format = ExpandErrno(fmt, saved_errno);
-  va_list args;
-  va_start(args, fmt);
   va_list copy;
   va_copy(copy, args);
   char small[512];
   int n = std::vsnprintf(small, sizeof(small), format.c_str(), args);
-  va_end(args);
   std::string line;
   if (n >= 0 && static_cast<size_t>(n) < sizeof(small)) {
     line.assign(small, n);
@@ -76,13 +72,57 @@ void Log(int priority, const char* fmt, ...) {
     line.resize(n);
   }
   va_end(copy);
+  return line;
+}
+
+void Emit(int priority, const std::string& line) {
   LogSink sink;
   {
     std::lock_guard<std::mutex> lock(SinkMutex());
     sink = CurrentSink();
   }
   sink(priority, line);
+}
+
+}  // namespace
+
+void Log(int priority, const char* fmt, ...) {
+  const int saved_errno = errno;
+  va_list args;
+  va_start(args, fmt);
+  const std::string line = VFormat(fmt, args, saved_errno);
+  va_end(args);
+  Emit(priority, line);
   errno = saved_errno;
+}
+
+void LogAt(const char* file, int line, int priority, const char* fmt, ...) {
+  const int saved_errno = errno;
+  std::string text = std::string(SourceName(file)) + ":" + std::to_string(line) + " ";
+  va_list args;
+  va_start(args, fmt);
+  text += VFormat(fmt, args, saved_errno);
+  va_end(args);
+  Emit(priority, text);
+  errno = saved_errno;
+}
+
+void LogFailedAt(const char* file, int line, const char* func, const char* fmt, ...) {
+  const int saved_errno = errno;
+  std::string text = std::string(SourceName(file)) + ":" + std::to_string(line) + " (" +
+                     std::to_string(getpid()) + ", " + std::to_string(geteuid()) + ") (" + func +
+                     ") ";
+  va_list args;
+  va_start(args, fmt);
+  text += VFormat(fmt, args, saved_errno);
+  va_end(args);
+  if (saved_errno != 0) {
+    text += " [err: ";
+    text += std::strerror(saved_errno);
+    text += "]";
+  }
+  Emit(LOG_ERR, text);
+  errno = 0;
 }
 
 LogSink SetLogSink(LogSink sink) {

@@ -15,6 +15,16 @@ using LogSink = std::function<void(int priority, const std::string& line)>;
 // Formats like syslog(3): printf directives plus "%m" for strerror(errno).
 void Log(int priority, const char* fmt, ...) __attribute__((format(printf, 2, 3)));
 
+// Log() of a line that starts with where it was written: "file:line <message>". Called through
+// ORVANE_LOG.
+void LogAt(const char* file, int line, int priority, const char* fmt, ...)
+    __attribute__((format(printf, 4, 5)));
+
+// The failure form: "file:line (pid, euid) (func) <message>" at LOG_ERR, with " [err: %m]"
+// appended when errno is set, and errno then cleared. Called through ORVANE_LOG_FAILED.
+void LogFailedAt(const char* file, int line, const char* func, const char* fmt, ...)
+    __attribute__((format(printf, 4, 5)));
+
 // Replaces the sink; an empty sink restores the default (syslog). Returns the previous one.
 LogSink SetLogSink(LogSink sink);
 
@@ -31,5 +41,16 @@ void SetLogLevel(int level);
 const char* SourceName(const char* file);
 
 }  // namespace orvane
+
+// Logs "file:line <message>" at `priority`; the message is formatted like Log()'s.
+#define ORVANE_LOG(priority, ...) ::orvane::LogAt(__FILE__, __LINE__, (priority), __VA_ARGS__)
+
+// Logs a failure in the enclosing function: "file:line (pid, euid) (func) <message>", errno
+// named and cleared when set.
+#define ORVANE_LOG_FAILED(...) ::orvane::LogFailedAt(__FILE__, __LINE__, __func__, __VA_ARGS__)
+
+// The same, naming `func` instead of the enclosing function.
+#define ORVANE_LOG_FAILED_IN(func, ...) \
+  ::orvane::LogFailedAt(__FILE__, __LINE__, (func), __VA_ARGS__)
 
 #endif  // ORVANE_COMMON_LOG_HPP_

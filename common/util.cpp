@@ -63,10 +63,8 @@ bool ChownOrvane(const std::string& path) {
   {
     LockMutex lock(sdk::SDKMutex());
     QUIXUSER* user_info = nullptr;
-    if (0 > QUIXUserGet(kOrvaneUser, &user_info) || !user_info) {
-      ThrowError(__FILE__, __LINE__, __func__, "0 > QUIXUserGet(kOrvaneUser, &user_info) || !user_info",
-                 kErrChown, std::string("QUIXUserGet failed, user=") + kOrvaneUser);
-    }
+    ORVANE_THROW_IF(0 > QUIXUserGet(kOrvaneUser, &user_info) || !user_info, kErrChown,
+                    std::string("QUIXUserGet failed, user=") + kOrvaneUser);
     uid = user_info->uid;
     gid = user_info->gid;
     QUIXUserFree(user_info);
@@ -77,10 +75,8 @@ bool ChownOrvane(const std::string& path) {
 std::unique_ptr<sdk::User> GetUser(const std::string& name) {
   LockMutex lock(sdk::SDKMutex());
   QUIXUSER* user_info = nullptr;
-  if (0 > QUIXUserGet(name.c_str(), &user_info) || !user_info) {
-    ThrowError(__FILE__, __LINE__, __func__, "0 > QUIXUserGet(name.c_str(), &user_info) || !user_info",
-               kErrChown, "QUIXUserGet failed, user=" + name);
-  }
+  ORVANE_THROW_IF(0 > QUIXUserGet(name.c_str(), &user_info) || !user_info, kErrChown,
+                  "QUIXUserGet failed, user=" + name);
   std::unique_ptr<QUIXUSER, void (*)(PQUIXUSER)> owned(user_info, QUIXUserFree);
   return UserOf(*user_info);
 }
@@ -88,10 +84,8 @@ std::unique_ptr<sdk::User> GetUser(const std::string& name) {
 std::unique_ptr<sdk::User> GetUserByUID(uid_t uid) {
   LockMutex lock(sdk::SDKMutex());
   QUIXUSER* user_info = nullptr;
-  if (0 > QUIXUserGetByUID(uid, &user_info) || !user_info) {
-    ThrowError(__FILE__, __LINE__, __func__, "0 > QUIXUserGetByUID(uid, &user_info) || !user_info",
-               kErrChown, "QUIXUserGetByUID failed, uid=" + std::to_string(uid));
-  }
+  ORVANE_THROW_IF(0 > QUIXUserGetByUID(uid, &user_info) || !user_info, kErrChown,
+                  "QUIXUserGetByUID failed, uid=" + std::to_string(uid));
   std::unique_ptr<QUIXUSER, void (*)(PQUIXUSER)> owned(user_info, QUIXUserFree);
   return UserOf(*user_info);
 }

@@ -116,18 +116,32 @@ Json::Value PrefixQuery(const std::string& dir) {
   return query;
 }
 
-// Sends a query for the command `func` and checks that its reply carries the hits.
+// Sends a query for the command `func` and checks that its reply carries the hits. A reply
+// that got this far is an object: the exchange refuses anything else.
 void SendQuery(Json::Value& res, const Json::Value& req, const char* func) {
   SendRequest(res, req);
-  if (!res.isObject() || !res.isMember("data") || !res["data"].isArray()) {
-    ThrowError(__FILE__, __LINE__, func, "!res.isMember(\"data\") || !res[\"data\"].isArray()",
-               kErrNoQueryData, JsonToString(res));
-  }
+  ORVANE_THROW_IF_IN(func, !res.isMember("data") || !res["data"].isArray(), kErrNoQueryData,
+                     JsonToString(res));
 }
 
 ParseFileFn& ParseFileOverride() {
   static ParseFileFn parse_file;
   return parse_file;
+}
+
+// Extraction of `path` into `doc`; whatever it throws is a file that could not be parsed.
+bool ParseFile(const std::string& path, const Json::Value& config, Json::Value& doc) {
+  try {
+    const ParseFileFn& parse_file = ParseFileOverride();
+    if (parse_file) {
+      parse_file(path, config, doc);
+    } else {
+      ce::ParseFile(path, config, doc);
+    }
+    return true;
+  } catch (...) {
+    return false;
+  }
 }
 
 // The document of `path` as extraction gives it, with the two fields the engine searches names
@@ -136,17 +150,8 @@ Json::Value ParseDocument(const std::string& path, bool need_meta, const char* f
   Json::Value config(Json::objectValue);
   config[ce::kKeyNeedMeta] = need_meta;
   Json::Value doc;
-  try {
-    const ParseFileFn& parse_file = ParseFileOverride();
-    if (parse_file) {
-      parse_file(path, config, doc);
-    } else {
-      ce::ParseFile(path, config, doc);
-    }
-  } catch (...) {
-    ThrowError(__FILE__, __LINE__, func, "ParseFile(path, config, doc)", kErrParseFile,
-               "Parse failed, path=" + path);
-  }
+  ORVANE_THROW_IF_IN(func, !ParseFile(path, config, doc), kErrParseFile,
+                     "Parse failed, path=" + path);
   doc[ce::QUIXMDSearchFileName] = doc[ce::QUIXMDFSName];
   doc[ce::QUIXMDSearchAncestor] = doc[ce::QUIXMDParent];
   return doc;
@@ -265,12 +270,10 @@ void IndexCommit(const std::string& share) {
   try {
     SendRequest(Command("commit", GetFileIndexID(share)));
   } catch (const Error&) {
-    sdk::SDKShare sdk_share(share);
-    if (sdk_share.IsSpaceEnough()) throw;
-    StatusMgr status;
-    status.SetShareStatus(share, 1);
-    ThrowError(__FILE__, __LINE__, __func__, "!share.IsSpaceEnough()", kErrSpaceNotEnough,
-               "Share (" + share + ") space not enough");
+    const bool space_enough = sdk::SDKShare(share).IsSpaceEnough();
+    if (!space_enough) StatusMgr().SetShareStatus(share, 1);
+    ORVANE_THROW_IF(!space_enough, kErrSpaceNotEnough, "Share (" + share + ") space not enough");
+    throw;
   }
 }
 
@@ -377,7 +380,7 @@ void UpdateTermSuggestion() {
     sdk::SDKShare sdk_share(share);
     const std::string db = sdk_share.GetDBName();
     if (std::find(dbs.begin(), dbs.end(), db) == dbs.end()) continue;
-    Log(LOG_ERR, "%s:%d Start building term sugg [%s]", SourceName(__FILE__), __LINE__, db.c_str());
+    ORVANE_LOG(LOG_ERR, "Start building term sugg [%s]", db.c_str());
     // The marker lies among the engine's own files, so it is written like them: through the
     // folder's descriptor, root-only, never through a link.
     const platform::SafeDir db_dir = platform::SafeDir::Open(sdk_share.GetDBPath(), false);
@@ -388,7 +391,7 @@ void UpdateTermSuggestion() {
     elastic::IndexGetByPrefixPath(db, sdk_share.GetPath(), paths);
     elastic::UpdateTermSuggestion(db, paths);
     elastic::IndexCommit(share);
-    Log(LOG_ERR, "%s:%d Done building term sugg [%s]", SourceName(__FILE__), __LINE__, db.c_str());
+    ORVANE_LOG(LOG_ERR, "Done building term sugg [%s]", db.c_str());
     ORVANE_LOG_IF(!db_dir.valid() || 0 != db_dir.Unlink(marker));
   }
 }

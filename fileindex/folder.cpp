@@ -128,20 +128,15 @@ void Folder::GetStatus(Json::Value& out) const {
   }
 }
 
-Json::Value Folder::GetDataWithAdditional(const Json::Value& additionals) const {
+// The parameter keeps the spelling that log readers search for.
+Json::Value Folder::GetDataWithAdditional(const Json::Value& addiitionals) const {
   Json::Value result = GetData();
-  if (!additionals.isArray()) {
-    ThrowError(__FILE__, __LINE__, __func__, "!addiitionals.isArray()", kErrInvalidParam,
-               JsonToString(additionals));
-  }
-  for (const Json::Value& it : additionals) {
+  ORVANE_THROW_IF(!addiitionals.isArray(), kErrInvalidParam, JsonToString(addiitionals));
+  for (const Json::Value& it : addiitionals) {
     ORVANE_THROW_IF(!it.isString(), kErrInvalidParam, JsonToString(it));
-    if (it.asString() == "status") {
-      GetStatus(result["additional"]["status"]);
-    } else {
-      ThrowError(__FILE__, __LINE__, __func__, "\"status\" != it.asString()", kErrInvalidParam,
-                 "Unknown additioal: " + it.asString());
-    }
+    ORVANE_THROW_IF("status" != it.asString(), kErrInvalidParam,
+                    "Unknown additioal: " + it.asString());
+    GetStatus(result["additional"]["status"]);
   }
   return result;
 }

@@ -20,15 +20,16 @@ const char kFolderCfgLockPath[] = "/tmp/orvane_cfg_folder.lock";
 
 FolderMgr::FolderMgr() {
   const std::string path = RootedPath(kFileIndexFoldersCfgPath);
+  // Under the installation root, and named as the file it stands for so that a failure logs
+  // the condition as it reads.
+  const char* const kFileIndexFoldersCfgPath = path.c_str();
   JsonValue folders(Json::arrayValue);
+  ORVANE_THROW_IF(
+      IsFileExist(kFileIndexFoldersCfgPath) && !folders.fromFile(kFileIndexFoldersCfgPath),
+      kErrLoadConfig, "Cannot load json: " + path);
   // A root of another type is as unusable as a broken file; it is refused the same way and the
   // file is left for the administrator to look at.
-  if (IsFileExist(path) && (!folders.fromFile(path) || !folders.isArray())) {
-    ThrowError(
-        __FILE__, __LINE__, __func__,
-        "IsFileExist(kFileIndexFoldersCfgPath) && !folders.fromFile(kFileIndexFoldersCfgPath)",
-        kErrLoadConfig, "Cannot load json: " + path);
-  }
+  ORVANE_THROW_IF(!folders.isArray(), kErrLoadConfig, "Cannot load json: " + path);
   folders_.reserve(folders.size());
   for (const Json::Value& element : folders) folders_.push_back(std::make_shared<Folder>(element));
 }
@@ -37,17 +38,14 @@ FolderMgr::~FolderMgr() = default;
 
 void FolderMgr::Save() const {
   const std::string path = RootedPath(kFileIndexFoldersCfgPath);
+  // Under the installation root, and named as the file it stands for so that a failure logs
+  // the condition as it reads.
+  const char* const kFileIndexFoldersCfgPath = path.c_str();
   JsonValue folders(Json::arrayValue);
   for (const auto& folder : folders_) folders.append(folder->GetData());
   sdk::SDKCredentials root("root");
-  if (!folders.toFile(path)) {
-    ThrowError(__FILE__, __LINE__, __func__, "!folders.toFile(kFileIndexFoldersCfgPath)",
-               kErrSaveConfig, path);
-  }
-  if (-1 == chmod(path.c_str(), 0644)) {
-    ThrowError(__FILE__, __LINE__, __func__, "-1 == chmod(kFileIndexFoldersCfgPath, 0644)",
-               kErrSystem, path);
-  }
+  ORVANE_THROW_IF(!folders.toFile(kFileIndexFoldersCfgPath), kErrSaveConfig, path);
+  ORVANE_THROW_IF(-1 == chmod(kFileIndexFoldersCfgPath, 0644), kErrSystem, path);
 }
 
 void FolderMgr::Get(std::shared_ptr<Folder>& out, const std::string& path) const {

@@ -148,9 +148,8 @@ std::vector<std::shared_ptr<Folder>> RequestedFolders(const FolderMgr& folder_mg
 const Json::Value* OptionalMember(const Json::Value& request, const std::string& key,
                                   bool (*is_type)(const Json::Value&)) {
   const Json::Value* member = request.find(key.data(), key.data() + key.size());
-  if (member != nullptr && !is_type(*member)) {
-    ThrowError(__FILE__, __LINE__, __func__, "!is_type(request[key])", kErrInvalidParam,
-               "Bad type of " + key + AppendData(request));
+  if (member != nullptr) {
+    ORVANE_THROW_IF(!is_type(*member), kErrInvalidParam, "Bad type of " + key + AppendData(request));
   }
   return member;
 }
@@ -204,27 +203,25 @@ std::vector<std::string> SharesOnVolume(const std::string& volume) {
 
 JsonValue LoadUserInfos() {
   const std::string path = RootedPath(kFileIndexUserInfosPath);
+  // Under the installation root, and named as the file it stands for so that a failure logs
+  // the condition as it reads.
+  const char* const kFileIndexUserInfosPath = path.c_str();
   JsonValue user_infos;
-  if (IsFileExist(path) && !user_infos.fromFile(path)) {
-    ThrowError(
-        __FILE__, __LINE__, __func__,
-        "IsFileExist(kFileIndexUserInfosPath) && !user_infos.fromFile(kFileIndexUserInfosPath)",
-        kErrLoadConfig, "Cannot load json: " + path);
-  }
+  ORVANE_THROW_IF(
+      IsFileExist(kFileIndexUserInfosPath) && !user_infos.fromFile(kFileIndexUserInfosPath),
+      kErrLoadConfig, "Cannot load json: " + path);
   return user_infos;
 }
 
 void SaveUserInfos(const JsonValue& user_infos) {
   const std::string path = RootedPath(kFileIndexUserInfosPath);
+  // Under the installation root, and named as the file it stands for so that a failure logs
+  // the condition as it reads.
+  const char* const kFileIndexUserInfosPath = path.c_str();
   sdk::SDKCredentials root("root");
-  if (!user_infos.toFile(path)) {
-    ThrowError(__FILE__, __LINE__, __func__, "!user_infos.toFile(kFileIndexUserInfosPath)",
-               kErrSaveConfig, "Cannot save json: " + path);
-  }
-  if (-1 == chmod(path.c_str(), 0644)) {
-    ThrowError(__FILE__, __LINE__, __func__, "-1 == chmod(kFileIndexUserInfosPath, 0644)",
-               kErrSystem, path);
-  }
+  ORVANE_THROW_IF(!user_infos.toFile(kFileIndexUserInfosPath), kErrSaveConfig,
+                  "Cannot save json: " + path);
+  ORVANE_THROW_IF(-1 == chmod(kFileIndexUserInfosPath, 0644), kErrSystem, path);
 }
 
 void ReindexHomeRecycleBins(AUTH_TYPE auth) {
@@ -240,14 +237,7 @@ void ReindexHomeRecycleBins(AUTH_TYPE auth) {
   if (0 > count) {
     const char* call =
         all ? "QUIXRecycleHomeEnumRecyclePath" : "QUIXRecycleHomeEnumRecyclePathForAuthType";
-    if (errno != 0) {
-      Log(LOG_ERR, "%s:%d (%d, %u) (%s) %s failed. auth: %d [err: %m]", SourceName(__FILE__),
-          __LINE__, getpid(), geteuid(), __func__, call, static_cast<int>(auth));
-      errno = 0;
-    } else {
-      Log(LOG_ERR, "%s:%d (%d, %u) (%s) %s failed. auth: %d", SourceName(__FILE__), __LINE__,
-          getpid(), geteuid(), __func__, call, static_cast<int>(auth));
-    }
+    ORVANE_LOG_FAILED("%s failed. auth: %d", call, static_cast<int>(auth));
     return;
   }
   // One bin that cannot be queued must not keep the others from being queued.
@@ -593,8 +583,7 @@ void UserRename(const std::string& user_from, const std::string& user_to) {
     const std::string& path = folder->GetPath();
     if (!StringStartWith(path + "/", home_from + "/")) continue;
     const std::string new_path = home_to + path.substr(home_from.size());
-    Log(LOG_ERR, "%s:%d Update homes rule: [%s] -> [%s]", SourceName(__FILE__), __LINE__,
-        path.c_str(), new_path.c_str());
+    ORVANE_LOG(LOG_ERR, "Update homes rule: [%s] -> [%s]", path.c_str(), new_path.c_str());
     folder->SetPath(new_path);
   }
   folder_mgr.Changed();
@@ -632,8 +621,7 @@ void UserRemember(unsigned int uid) {
   std::unique_ptr<sdk::User> user = GetUserByUID(uid);
   const std::string& home = user->GetHomePath();
   if (home.empty()) {
-    Log(LOG_DEBUG, "%s:%d User [%s] has no home to remember", SourceName(__FILE__), __LINE__,
-        user->GetName().c_str());
+    ORVANE_LOG(LOG_DEBUG, "User [%s] has no home to remember", user->GetName().c_str());
     return;
   }
   const std::string home_path = sdk::SharePathMgr::GetSharePath(home, *user, false);

@@ -104,20 +104,8 @@ bool HasReindex(const std::unordered_set<std::string>& reindexed, const std::str
 }
 
 void LogEventFailure(const Error& e, const std::string& share_name) {
-  const char* func = "AddCustomEvent";
-  if (errno != 0) {
-    Log(LOG_ERR,
-        "%s:%d (%d, %u) (%s) AddCustomEvent failed, code=%d, reason=%s. Set [%s] need reindex "
-        "[err: %m]",
-        SourceName(__FILE__), __LINE__, getpid(), geteuid(), func, e.code, e.what(),
-        share_name.c_str());
-    errno = 0;
-  } else {
-    Log(LOG_ERR,
-        "%s:%d (%d, %u) (%s) AddCustomEvent failed, code=%d, reason=%s. Set [%s] need reindex",
-        SourceName(__FILE__), __LINE__, getpid(), geteuid(), func, e.code, e.what(),
-        share_name.c_str());
-  }
+  ORVANE_LOG_FAILED_IN("AddCustomEvent", "AddCustomEvent failed, code=%d, reason=%s. Set [%s] need reindex",
+                       e.code, e.what(), share_name.c_str());
   // Without a share there is nothing to flag; a flag that cannot be stored must not hide the
   // error that the caller is owed.
   if (share_name.empty()) return;
@@ -125,8 +113,8 @@ void LogEventFailure(const Error& e, const std::string& share_name) {
     StatusMgr status;
     status.SetShareStatus(share_name, kShareStatusNeedReindex);
   } catch (const Error& flag_error) {
-    Log(LOG_ERR, "%s:%d Cannot flag [%s] for re-index: %s", SourceName(__FILE__), __LINE__,
-        share_name.c_str(), flag_error.what());
+    ORVANE_LOG(LOG_ERR, "Cannot flag [%s] for re-index: %s", share_name.c_str(),
+               flag_error.what());
   }
 }
 
@@ -138,10 +126,8 @@ void FlushBatches(std::vector<std::pair<std::string, QueueBatch>>& batches) {
     try {
       // The append takes the queue's lock and makes sure the file it locked is still the live
       // queue, so a line never lands in a batch that the indexer has already taken.
-      if (!QueueFileAppend(batch.queue_path, batch.lines)) {
-        ThrowError(__FILE__, __LINE__, "AddCustomEvent", "!QueueFileAppend(queue_path, line)",
-                   kErrSystem, "Cannot append to queue: " + batch.queue_path);
-      }
+      ORVANE_THROW_IF_IN("AddCustomEvent", !QueueFileAppend(batch.queue_path, batch.lines),
+                         kErrSystem, "Cannot append to queue: " + batch.queue_path);
       batch.lines.clear();
     } catch (const Error& e) {
       LogEventFailure(e, entry.first);
@@ -210,19 +196,6 @@ void AddCustomEvent(int event, const std::string& path, const std::string& path_
 
 namespace {
 
-// Logs a platform call's failure with the platform error number and where it was recorded.
-void LogPlatformFailure(int line, const char* func, const char* call) {
-  if (errno != 0) {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) %s failed: err=[0x%04X %s:%d] [err: %m]",
-        SourceName(__FILE__), line, getpid(), geteuid(), func, call, QLIBCErrGet(),
-        QLIBCErrFileGet(), QLIBCErrLineGet());
-    errno = 0;
-  } else {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) %s failed: err=[0x%04X %s:%d]", SourceName(__FILE__), line,
-        getpid(), geteuid(), func, call, QLIBCErrGet(), QLIBCErrFileGet(), QLIBCErrLineGet());
-  }
-}
-
 // Sets the file-sharing search integration to `enable` when it is not already so, restarting
 // file sharing so that the change takes effect.
 void SetSearchIntegration(bool enable, const char* func) {
@@ -231,33 +204,29 @@ void SetSearchIntegration(bool enable, const char* func) {
   if (state != (enable ? 0 : 1)) return;
   errno = 0;
   if (0 > QUIXSMBSetSpotlight(enable ? 1 : 0)) {
-    LogPlatformFailure(__LINE__, func, "QUIXSMBSetSpotlight");
+    // The platform error number and where the platform recorded it.
+    ORVANE_LOG_FAILED_IN(func, "QUIXSMBSetSpotlight failed: err=[0x%04X %s:%d]", QLIBCErrGet(),
+                         QLIBCErrFileGet(), QLIBCErrLineGet());
     return;
   }
   errno = 0;
-  if (0 > QLIBServiceRestart("samba")) LogPlatformFailure(__LINE__, func, "QLIBServiceRestart");
+  if (0 > QLIBServiceRestart("samba")) {
+    ORVANE_LOG_FAILED_IN(func, "QLIBServiceRestart failed: err=[0x%04X %s:%d]", QLIBCErrGet(),
+                         QLIBCErrFileGet(), QLIBCErrLineGet());
+  }
 }
 
 }  // namespace
 
 void SetupRelatedServices(bool enable) {
-  const char* func = "SetupRelatedServices";
-  SetSearchIntegration(enable, func);
+  SetSearchIntegration(enable, __func__);
   errno = 0;
   if (enable) {
-    if (0 > QLIBServiceStart("quixcontentextractd", TRUE)) {
-      LogFailure(__FILE__, __LINE__, func, "0 > QLIBServiceStart(\"quixcontentextractd\", TRUE)");
-    }
+    ORVANE_LOG_IF(0 > QLIBServiceStart("quixcontentextractd", TRUE));
     errno = 0;
-    if (0 > QLIBServicectlStart("pkg-Orvane-fileindexd", QLIB_SERVICECTL_UPSTART)) {
-      LogFailure(__FILE__, __LINE__, func,
-                 "0 > QLIBServicectlStart(\"pkg-Orvane-fileindexd\", QLIB_SERVICECTL_UPSTART)");
-    }
+    ORVANE_LOG_IF(0 > QLIBServicectlStart("pkg-Orvane-fileindexd", QLIB_SERVICECTL_UPSTART));
   } else {
-    if (0 > QLIBServicectlStop("pkg-Orvane-fileindexd", QLIB_SERVICECTL_UPSTART)) {
-      LogFailure(__FILE__, __LINE__, func,
-                 "0 > QLIBServicectlStop(\"pkg-Orvane-fileindexd\", QLIB_SERVICECTL_UPSTART)");
-    }
+    ORVANE_LOG_IF(0 > QLIBServicectlStop("pkg-Orvane-fileindexd", QLIB_SERVICECTL_UPSTART));
   }
 }
 

@@ -34,11 +34,11 @@ const char kStatusCfgLockPath[] = "/tmp/orvane_cfg_fi_status.lock";
 
 StatusMgr::StatusMgr() {
   const std::string path = RootedPath(kFileIndexStatusCfgPath);
-  if (IsFileExist(path) && !data_.fromFile(path)) {
-    ThrowError(__FILE__, __LINE__, __func__,
-               "IsFileExist(kFileIndexStatusCfgPath) && !data_.fromFile(kFileIndexStatusCfgPath)",
-               kErrLoadConfig, "Cannot load json: " + path);
-  }
+  // Under the installation root, and named as the file it stands for so that a failure logs
+  // the condition as it reads.
+  const char* const kFileIndexStatusCfgPath = path.c_str();
+  ORVANE_THROW_IF(IsFileExist(kFileIndexStatusCfgPath) && !data_.fromFile(kFileIndexStatusCfgPath),
+                  kErrLoadConfig, "Cannot load json: " + path);
 }
 
 long long StatusMgr::GetPauseInfo() const {
@@ -114,16 +114,14 @@ void StatusMgr::ClearShareStatus(const std::string& share) {
 
 void StatusMgr::Save() {
   const std::string path = RootedPath(kFileIndexStatusCfgPath);
+  // Under the installation root, and named as the file it stands for so that a failure logs
+  // the condition as it reads.
+  const char* const kFileIndexStatusCfgPath = path.c_str();
   sdk::SDKCredentials root("root");
-  if (!data_.toFile(path)) {
-    ThrowError(__FILE__, __LINE__, __func__, "!data_.toFile(kFileIndexStatusCfgPath)",
-               kErrSaveConfig, "Failed to save json: " + path);
-  }
-  if (-1 == chmod(path.c_str(), 0644)) {
-    const std::string reason = std::string("chmod failed, reason=") + strerror(errno);
-    ThrowError(__FILE__, __LINE__, __func__, "-1 == chmod(kFileIndexStatusCfgPath, 0644)",
-               kErrSystem, reason);
-  }
+  ORVANE_THROW_IF(!data_.toFile(kFileIndexStatusCfgPath), kErrSaveConfig,
+                  "Failed to save json: " + path);
+  ORVANE_THROW_IF(-1 == chmod(kFileIndexStatusCfgPath, 0644), kErrSystem,
+                  std::string("chmod failed, reason=") + strerror(errno));
 }
 
 void StatusMgr::CreateIfMissing() {

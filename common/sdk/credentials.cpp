@@ -26,15 +26,18 @@ std::string UserLookupFailureText() {
   return std::string(kText + offset);
 }
 
+// Every switch takes the user's groups along.
+bool ResetCredentialsByName(const std::string& name) {
+  return platform::ResetCredentialsByName(name.c_str(), true);
+}
+
 }  // namespace
 
 SDKCredentials::SDKCredentials() : euid_(geteuid()), egid_(getegid()) {
   LockMutex lock(SDKMutex());
   QUIXUSER* user_info = nullptr;
-  if (0 > QUIXUserGetByUID(euid_, &user_info) || !user_info) {
-    ThrowError(__FILE__, __LINE__, __func__, "0 > QUIXUserGetByUID(euid_, &user_info) || !user_info",
-               kErrCredentials, UserLookupFailureText());
-  }
+  ORVANE_THROW_IF(0 > QUIXUserGetByUID(euid_, &user_info) || !user_info, kErrCredentials,
+                  UserLookupFailureText());
   username_ = user_info->szName;
   QUIXUserFree(user_info);
 }
@@ -47,19 +50,14 @@ SDKCredentials::SDKCredentials(const std::string& name)
 SDKCredentials::~SDKCredentials() {
   if (geteuid() == euid_ && getegid() == egid_) return;
   LockMutex lock(SDKMutex());
-  if (!ResetCredentialsByName(username_.c_str(), true)) {
-    LogFailure(__FILE__, __LINE__, __func__, "!ResetCredentialsByName(username_)");
-  }
+  ORVANE_LOG_IF(!ResetCredentialsByName(username_));
 }
 
 void SDKCredentials::AsUser(const std::string& name) {
   LockMutex lock(SDKMutex());
   std::string target_username = name;
   if (QLIBGroupIsAdminGroupMem(name.c_str(), 0) == 1) target_username = "root";
-  if (!ResetCredentialsByName(target_username.c_str(), true)) {
-    ThrowError(__FILE__, __LINE__, __func__, "!ResetCredentialsByName(target_username)",
-               kErrCredentials, "");
-  }
+  ORVANE_THROW_IF(!ResetCredentialsByName(target_username), kErrCredentials, "");
 }
 
 }  // namespace sdk

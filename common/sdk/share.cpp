@@ -21,6 +21,16 @@ constexpr int kShareListSize = 1024;
 
 int AcceptEveryShare(const QUIXSHARE*) { return 0; }
 
+// The platform's share look-up straight into the record's owner. Adopted without the deleter's
+// lock: the caller holds it.
+template <typename Owner>
+int QUIXShareGet(const char* name, Owner* owner) {
+  QUIXSHARE* share = nullptr;
+  const int rc = platform::QUIXShareGet(name, &share);
+  owner->reset(share);
+  return rc;
+}
+
 }  // namespace
 
 void SDKShare::ShareFree::operator()(QUIXSHARE* share) const {
@@ -28,17 +38,10 @@ void SDKShare::ShareFree::operator()(QUIXSHARE* share) const {
   QUIXShareFree(share);
 }
 
-SDKShare::SDKShare(const std::string& name) : share_name_(name) {
+SDKShare::SDKShare(const std::string& share_name) : share_name_(share_name) {
   LockMutex lock(SDKMutex());
-  QUIXSHARE* share_info = nullptr;
-  const int rc = QUIXShareGet(name.c_str(), &share_info);
-  if (0 > rc || !share_info) {
-    ThrowError(__FILE__, __LINE__, __func__,
-               "0 > QUIXShareGet(share_name.c_str(), &share_info_) || !share_info_", kErrShareGet,
-               name);
-  }
-  // Adopted without the deleter's lock: this scope already holds it.
-  share_info_.reset(share_info);
+  ORVANE_THROW_IF(0 > QUIXShareGet(share_name.c_str(), &share_info_) || !share_info_, kErrShareGet,
+                  share_name);
 }
 
 SDKShare::~SDKShare() = default;
@@ -136,16 +139,13 @@ std::string SDKShare::GetPath() const { return share_info_->szPath; }
 std::set<std::string> SDKShare::Enum() {
   std::unique_ptr<QLIBSZLIST, void (*)(PSZLIST)> owned(nullptr, QLIBCSzListFree);
   PSZLIST share_list = nullptr;
-  if (nullptr == (share_list = QLIBCSzListAlloc(kShareListSize))) {
-    ThrowError(__FILE__, __LINE__, __func__, "nullptr == (share_list = QLIBCSzListAlloc(BUFSIZ))",
-               kErrShareEnum, "QLIBCSzListAlloc failed");
-  }
+  ORVANE_THROW_IF_TEXT("nullptr == (share_list = QLIBCSzListAlloc(BUFSIZ))",
+                       nullptr == (share_list = QLIBCSzListAlloc(kShareListSize)), kErrShareEnum,
+                       "QLIBCSzListAlloc failed");
   owned.reset(share_list);
-  auto enum_func = AcceptEveryShare;
-  if (0 > QLIBShareEnum(&share_list, enum_func)) {
-    ThrowError(__FILE__, __LINE__, __func__, "0 > QLIBShareEnum(&share_list, &enum_func)",
-               kErrShareEnum, "QLIBShareEnum failed");
-  }
+  auto& enum_func = AcceptEveryShare;
+  ORVANE_THROW_IF(0 > QLIBShareEnum(&share_list, &enum_func), kErrShareEnum,
+                  "QLIBShareEnum failed");
   std::set<std::string> names;
   for (int i = 0; i < QLIBCSzListCount(share_list); ++i) names.insert(QLIBCSzListGet(share_list, i));
   return names;

@@ -33,14 +33,7 @@ std::string SharePathMgr::GetSharePath(const std::string& vol_path, const User& 
   char share_path[4096] = {};
   if (0 != QUIXShareNamePathGet(vol_path.c_str(), share_name, sizeof(share_name), share_path,
                                 sizeof(share_path))) {
-    if (errno != 0) {
-      Log(LOG_ERR, "%s:%d (%d, %u) (%s) QUIXShareNamePathGet failed, vol_path=%s [err: %m]",
-          SourceName(__FILE__), __LINE__, getpid(), geteuid(), __func__, vol_path.c_str());
-      errno = 0;
-    } else {
-      Log(LOG_ERR, "%s:%d (%d, %u) (%s) QUIXShareNamePathGet failed, vol_path=%s",
-          SourceName(__FILE__), __LINE__, getpid(), geteuid(), __func__, vol_path.c_str());
-    }
+    ORVANE_LOG_FAILED("QUIXShareNamePathGet failed, vol_path=%s", vol_path.c_str());
     return "";
   }
   const std::string name = share_name;
@@ -55,14 +48,7 @@ std::string SharePathMgr::GetSharePath(const std::string& vol_path, const User& 
   }
 
   if (vol_path.size() < path.size()) {
-    if (errno != 0) {
-      Log(LOG_ERR, "%s:%d (%d, %u) (%s) Malformed input: %s, %s [err: %m]", SourceName(__FILE__),
-          __LINE__, getpid(), geteuid(), __func__, vol_path.c_str(), path.c_str());
-      errno = 0;
-    } else {
-      Log(LOG_ERR, "%s:%d (%d, %u) (%s) Malformed input: %s, %s", SourceName(__FILE__), __LINE__,
-          getpid(), geteuid(), __func__, vol_path.c_str(), path.c_str());
-    }
+    ORVANE_LOG_FAILED("Malformed input: %s, %s", vol_path.c_str(), path.c_str());
     return "";
   }
   return "/" + name + vol_path.substr(path.size());
