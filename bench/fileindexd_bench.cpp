@@ -28,8 +28,8 @@
 #include "bench/bench_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
-#include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/index_mgr.hpp"
+#include "test/daemon_system.hpp"
 #include "test/sample_files.hpp"
 
 namespace {

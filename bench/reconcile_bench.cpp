@@ -23,10 +23,10 @@
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/fileindexd/reconciler.hpp"
-#include "daemons/fileindexd/test_system.hpp"
 #include "daemons/fileindexd/worker.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/queue_file.hpp"
+#include "test/daemon_system.hpp"
 
 namespace {
 

@@ -13,9 +13,9 @@
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
-#include "platform/fault.hpp"
 #include "platform/platform_error.hpp"
 #include "test/fake_daemon.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

@@ -4,8 +4,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "fileindex/admin_test_env.hpp"
 #include "platform/unicode.hpp"
+#include "test/admin_env.hpp"
 
 namespace orvane {
 namespace fileindex {

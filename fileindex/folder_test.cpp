@@ -2,8 +2,8 @@
 
 #include <gtest/gtest.h>
 
-#include "fileindex/admin_test_env.hpp"
 #include "fileindex/status_mgr.hpp"
+#include "test/admin_env.hpp"
 
 namespace orvane {
 namespace fileindex {

@@ -8,11 +8,11 @@
 #include <map>
 #include <set>
 
-#include "fileindex/admin_test_env.hpp"
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/status_mgr.hpp"
-#include "platform/fault.hpp"
 #include "platform/platform_error.hpp"
+#include "test/admin_env.hpp"
+#include "test/faults.hpp"
 
 namespace orvane {
 namespace fileindex {

@@ -3,12 +3,12 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "fileindex/admin_test_env.hpp"
 #include "fileindex/optree.hpp"
 #include "fileindex/status_mgr.hpp"
-#include "platform/fault.hpp"
 #include "platform/monitor_queue.hpp"
 #include "platform/platform_error.hpp"
+#include "test/admin_env.hpp"
+#include "test/faults.hpp"
 
 namespace orvane {
 namespace fileindex {

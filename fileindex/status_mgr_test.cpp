@@ -6,8 +6,8 @@
 
 #include <cerrno>
 
-#include "fileindex/admin_test_env.hpp"
 #include "fileindex/notify.hpp"
+#include "test/admin_env.hpp"
 
 namespace orvane {
 namespace fileindex {

@@ -10,8 +10,8 @@
 
 #include "common/error.hpp"
 #include "common/root.hpp"
-#include "platform/fault.hpp"
 #include "platform/fs.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

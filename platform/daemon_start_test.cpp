@@ -10,7 +10,7 @@
 #include <cerrno>
 #include <thread>
 
-#include "platform/fault.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

@@ -1,81 +1,23 @@
 #include "platform/fault.hpp"
 
 #include <atomic>
-#include <map>
-#include <mutex>
 
 namespace orvane {
 namespace platform {
 namespace {
 
-struct Armed {
-  Fault fault;
-  int skip;
-  int times;
-};
-
-struct Table {
-  std::mutex mu;
-  std::multimap<std::string, Armed> armed;
-  std::map<std::string, int> calls;
-};
-
-Table& GetTable() {
-  static Table* table = new Table();  // never destroyed: platform calls may run during exit
-  return *table;
-}
-
-// Counting is only switched on once a test touched the seam, so production calls stay lock-free.
-std::atomic<bool> g_active{false};
+// A hook is a plain function with no state of its own to publish, so relaxed ordering is enough.
+std::atomic<FaultHook> g_hook{nullptr};
 
 }  // namespace
 
-void ArmFault(const std::string& name, const Fault& fault, int skip, int times) {
-  Table& table = GetTable();
-  std::lock_guard<std::mutex> lock(table.mu);
-  table.armed.emplace(name, Armed{fault, skip, times});
-  g_active.store(true, std::memory_order_relaxed);
-}
-
-void ClearFaults() {
-  Table& table = GetTable();
-  std::lock_guard<std::mutex> lock(table.mu);
-  table.armed.clear();
-  table.calls.clear();
-}
-
-int CallCount(const std::string& name) {
-  Table& table = GetTable();
-  std::lock_guard<std::mutex> lock(table.mu);
-  auto it = table.calls.find(name);
-  return it == table.calls.end() ? 0 : it->second;
-}
+void SetFaultHook(FaultHook hook) { g_hook.store(hook, std::memory_order_relaxed); }
 
 std::optional<Fault> FaultFor(const char* name) {
-  if (!g_active.load(std::memory_order_relaxed)) return std::nullopt;
-  Table& table = GetTable();
-  std::lock_guard<std::mutex> lock(table.mu);
-  ++table.calls[name];
-  auto range = table.armed.equal_range(name);
-  for (auto it = range.first; it != range.second; ++it) {
-    Armed& armed = it->second;
-    if (armed.skip > 0) {
-      --armed.skip;
-      continue;
-    }
-    Fault fault = armed.fault;
-    if (armed.times > 0 && --armed.times == 0) table.armed.erase(it);
-    return fault;
-  }
-  return std::nullopt;
+  const FaultHook hook = g_hook.load(std::memory_order_relaxed);
+  if (hook == nullptr) return std::nullopt;
+  return hook(name);
 }
-
-ScopedFaults::ScopedFaults() {
-  ClearFaults();
-  g_active.store(true, std::memory_order_relaxed);
-}
-
-ScopedFaults::~ScopedFaults() { ClearFaults(); }
 
 }  // namespace platform
 }  // namespace orvane

@@ -10,9 +10,9 @@
 #include <cstring>
 #include <filesystem>
 
-#include "platform/fault.hpp"
 #include "platform/platform_error.hpp"
 #include "platform/user.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

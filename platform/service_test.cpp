@@ -8,9 +8,9 @@
 
 #include "common/json_util.hpp"
 #include "common/root.hpp"
-#include "platform/fault.hpp"
 #include "platform/notifier.hpp"
 #include "platform/platform_error.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

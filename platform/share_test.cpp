@@ -7,10 +7,10 @@
 #include <memory>
 
 #include "common/root.hpp"
-#include "platform/fault.hpp"
 #include "platform/fileidx.hpp"
 #include "platform/platform_error.hpp"
 #include "platform/quota.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

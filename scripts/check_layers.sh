@@ -3,10 +3,10 @@
 # first; each may use only the layers below it:
 #   1 base      common/ error, log, fd, env, root, json_util, name_codec, lock_file, lock_mutex
 #               and wire; test/, the helpers every test links
-#   2 platform  platform/
+#   2 platform  platform/; test/faults, the table behind its fault seam
 #   3 common    the rest of common/, and common/sdk/
-#   4 index     fileindex/, extract/
-#   5 programs  daemons/, tools/, bench/
+#   4 index     fileindex/, extract/; test/admin_env, the administration tests' scratch system
+#   5 programs  daemons/, tools/, bench/; test/daemon_system, e2e_fixture and engine_client
 # A file's tests and fuzz harness belong to its layer.
 #
 #   bash scripts/check_layers.sh [SOURCE_DIR [LAYER [STAMP]]]
@@ -24,6 +24,9 @@ files=$(find common platform fileindex extract test daemons tools bench -type f 
 # source root ("common/error.hpp"), the system's and other libraries' never are.
 awk -v only="${2:-}" '
   function layer(path, base) {
+    if (path ~ /^test\/faults[._]/) return 2
+    if (path ~ /^test\/admin_env[._]/) return 4
+    if (path ~ /^test\/(daemon_system|e2e_fixture|engine_client)[._]/) return 5
     if (path ~ /^test\//) return 1
     if (path ~ /^common\/wire(\/|[._])/) return 1
     if (path ~ /^common\/[^\/]+$/) {

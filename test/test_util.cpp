@@ -4,17 +4,20 @@
 #include <ftw.h>
 #include <grp.h>
 #include <pwd.h>
+#include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <sstream>
 #include <stdexcept>
+#include <thread>
 
 #include "common/root.hpp"
 
@@ -49,6 +52,11 @@ std::string ReadFile(const std::string& path) {
   std::ostringstream out;
   out << in.rdbuf();
   return out.str();
+}
+
+void WriteFile(const std::string& path, const std::string& text) {
+  MakeParentDirs(path);
+  std::ofstream(path) << text;
 }
 
 std::string WritePlatformConfig(const std::string& root, const std::string& json_text) {
@@ -198,6 +206,50 @@ ProgramResult RunProgram(const std::string& path, const std::vector<std::string>
   int status = 0;
   waitpid(pid, &status, 0);
   return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, ReadFile(out_path), ReadFile(err_path)};
+}
+
+bool WaitFor(const std::function<bool()>& pred, int timeout_ms) {
+  const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeout_ms);
+  while (std::chrono::steady_clock::now() < end) {
+    if (pred()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  return pred();
+}
+
+ChildProcess::ChildProcess(const std::string& root, std::vector<std::string> argv) {
+  pid_ = fork();
+  if (pid_ == 0) {
+    setenv("ORVANE_ROOT", root.c_str(), 1);
+    std::vector<char*> args;
+    for (std::string& a : argv) args.push_back(&a[0]);
+    args.push_back(nullptr);
+    if (getenv("FILEINDEXD_TEST_STDERR") == nullptr) {
+      const int null = open("/dev/null", O_WRONLY);
+      if (null >= 0) dup2(null, 2);
+    }
+    execv(args[0], args.data());
+    _exit(127);
+  }
+}
+
+ChildProcess::~ChildProcess() { Signal(SIGKILL); }
+
+int ChildProcess::Signal(int sig) {
+  if (pid_ <= 0) return -1;
+  kill(pid_, sig);
+  int status = 0;
+  waitpid(pid_, &status, 0);
+  pid_ = -1;
+  return status;
+}
+
+bool ChildProcess::Exited(int timeout_ms) {
+  if (pid_ <= 0) return true;
+  int status = 0;
+  const bool gone = WaitFor([&] { return waitpid(pid_, &status, WNOHANG) == pid_; }, timeout_ms);
+  if (gone) pid_ = -1;
+  return gone;
 }
 
 ScopedRoot::ScopedRoot(const std::string& root) {

@@ -1,5 +1,5 @@
-// Helpers shared by every test: a scratch folder, a log capture, a fake clock and an
-// ORVANE_ROOT scope. Each is a scoped object that undoes itself; none is thread-safe.
+// Helpers shared by every test: a scratch folder, a log capture, a fake clock, an ORVANE_ROOT
+// scope and child programs. Each is a scoped object that undoes itself; none is thread-safe.
 #ifndef ORVANE_TEST_TEST_UTIL_HPP_
 #define ORVANE_TEST_TEST_UTIL_HPP_
 
@@ -9,6 +9,8 @@
 #include <mutex>
 #include <string>
 #include <vector>
+
+#include <sys/types.h>
 
 #include <gmock/gmock.h>
 
@@ -39,6 +41,8 @@ class TempDir {
 
 // Reads a whole file; "" when it cannot be read.
 std::string ReadFile(const std::string& path);
+// Writes `text` to the file at `path`, making its parent folders.
+void WriteFile(const std::string& path, const std::string& text);
 
 // Writes the platform configuration (shares, administrators group, ...) that the platform layer
 // reads under `root` (the test's ORVANE_ROOT): `root`/etc/orvane/platform.json. Returns its path.
@@ -116,6 +120,28 @@ struct ProgramResult {
 // environment, ORVANE_ROOT replaced by `root` unless that is empty, and waits for it.
 ProgramResult RunProgram(const std::string& path, const std::vector<std::string>& args,
                          const std::string& root = std::string());
+
+// Polls `pred` every 20 ms until it holds or `timeout_ms` passes; returns its last answer.
+bool WaitFor(const std::function<bool()>& pred, int timeout_ms);
+
+// A program (argv[0] its path) run in a child process under `root` as ORVANE_ROOT, its standard
+// error sent to /dev/null unless FILEINDEXD_TEST_STDERR is set (a daemon's log lines would drown
+// the test's output; syslog still has them). Killed (SIGKILL) at scope end unless stopped before.
+class ChildProcess {
+ public:
+  ChildProcess(const std::string& root, std::vector<std::string> argv);
+  ~ChildProcess();
+  ChildProcess(const ChildProcess&) = delete;
+  ChildProcess& operator=(const ChildProcess&) = delete;
+  // Sends `sig` and waits for the exit; returns the wait status (-1 when not running).
+  int Signal(int sig);
+  // Waits up to `timeout_ms` for the process to end by itself; true when it did (it is reaped).
+  bool Exited(int timeout_ms);
+  pid_t pid() const { return pid_; }
+
+ private:
+  pid_t pid_ = -1;
+};
 
 // Sets ORVANE_ROOT for its lifetime and restores the former value.
 class ScopedRoot {

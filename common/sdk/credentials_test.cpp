@@ -4,8 +4,8 @@
 #include <unistd.h>
 
 #include "common/error.hpp"
-#include "platform/fault.hpp"
 #include "platform/user.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

@@ -4,7 +4,7 @@
 
 #include "common/error.hpp"
 #include "common/util.hpp"
-#include "platform/fault.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

@@ -6,8 +6,8 @@
 
 #include "common/error.hpp"
 #include "platform/config.hpp"
-#include "platform/fault.hpp"
 #include "platform/platform_error.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

@@ -28,12 +28,12 @@
 #include "common/wire.hpp"
 #include "daemons/fileindexd/index_daemon.hpp"
 #include "daemons/fileindexd/server.hpp"
-#include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/notifyd_cfg.hpp"
 #include "fileindex/optree.hpp"
 #include "fileindex/queue_file.hpp"
+#include "test/daemon_system.hpp"
 #include "test/fake_daemon.hpp"
 #include "test/test_util.hpp"
 

@@ -19,11 +19,11 @@
 #include "common/json_util.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
-#include "daemons/fileindexd/e2e_fixture.hpp"
 #include "daemons/fileindexd/indexer.hpp"
-#include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/index_mgr.hpp"
 #include "fileindex/util.hpp"
+#include "test/daemon_system.hpp"
+#include "test/e2e_fixture.hpp"
 
 namespace orvane {
 namespace fileindexd {

@@ -12,10 +12,10 @@
 #include "common/json_util.hpp"
 #include "common/name_codec.hpp"
 #include "common/root.hpp"
-#include "daemons/fileindexd/e2e_fixture.hpp"
-#include "daemons/fileindexd/test_system.hpp"
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/index_mgr.hpp"
+#include "test/daemon_system.hpp"
+#include "test/e2e_fixture.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

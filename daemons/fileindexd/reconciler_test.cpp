@@ -10,7 +10,7 @@
 
 #include <algorithm>
 
-#include "daemons/fileindexd/test_system.hpp"
+#include "test/daemon_system.hpp"
 
 namespace orvane {
 namespace fileindexd {

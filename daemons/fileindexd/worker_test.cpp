@@ -15,14 +15,14 @@
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "common/wire.hpp"
-#include "daemons/fileindexd/test_system.hpp"
 #include "extract/extract_runner.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/queue_file.hpp"
 #include "fileindex/status_mgr.hpp"
-#include "platform/fault.hpp"
 #include "platform/platform_error.hpp"
+#include "test/daemon_system.hpp"
 #include "test/fake_daemon.hpp"
+#include "test/faults.hpp"
 
 namespace orvane {
 namespace fileindexd {

@@ -14,7 +14,7 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/fault.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

@@ -19,7 +19,7 @@
 #include "common/json_util.hpp"
 #include "common/util.hpp"
 #include "common/wire.hpp"
-#include "daemons/quixelasticd/test_client.hpp"
+#include "test/engine_client.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

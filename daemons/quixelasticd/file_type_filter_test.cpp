@@ -10,10 +10,10 @@
 
 #include "common/json_util.hpp"
 #include "daemons/quixelasticd/engine.hpp"
-#include "daemons/quixelasticd/test_client.hpp"
 #include "extract/content_extract.hpp"
-#include "fileindex/admin_test_env.hpp"
 #include "fileindex/folder_mgr.hpp"
+#include "test/admin_env.hpp"
+#include "test/engine_client.hpp"
 
 namespace orvane {
 namespace elasticd {

@@ -12,8 +12,8 @@
 #include "common/sdk/share.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
-#include "daemons/quixelasticd/test_client.hpp"
 #include "fileindex/elastic_control.hpp"
+#include "test/engine_client.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

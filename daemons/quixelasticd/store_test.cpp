@@ -6,7 +6,7 @@
 #include "common/json_util.hpp"
 #include "common/name_codec.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
-#include "daemons/quixelasticd/test_client.hpp"
+#include "test/engine_client.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

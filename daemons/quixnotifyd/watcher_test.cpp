@@ -21,8 +21,8 @@
 #include "common/util.hpp"
 #include "fileindex/optree.hpp"
 #include "fileindex/status_mgr.hpp"
-#include "platform/fault.hpp"
 #include "platform/monitor_queue.hpp"
+#include "test/faults.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {

@@ -2,8 +2,8 @@
 // operations: its own ORVANE_ROOT, a volume folder with the shares "photo", "music", "homes",
 // "ro" (read-only) and "Photos" (a name that differs from "photo" only in case), the platform
 // file naming them, and helpers to read and write the files the operations keep.
-#ifndef ORVANE_FILEINDEX_ADMIN_TEST_ENV_HPP_
-#define ORVANE_FILEINDEX_ADMIN_TEST_ENV_HPP_
+#ifndef ORVANE_TEST_ADMIN_ENV_HPP_
+#define ORVANE_TEST_ADMIN_ENV_HPP_
 
 #include <gtest/gtest.h>
 #include <json/json.h>
@@ -249,4 +249,4 @@ using test::ErrorOf;
 }  // namespace fileindex
 }  // namespace orvane
 
-#endif  // ORVANE_FILEINDEX_ADMIN_TEST_ENV_HPP_
+#endif  // ORVANE_TEST_ADMIN_ENV_HPP_

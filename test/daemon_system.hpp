@@ -1,14 +1,13 @@
-// Test-only: a scratch system for the indexing daemon's tests: its own ORVANE_ROOT, a volume
-// folder with shares, the platform and folder files, and the daemons as real child processes.
-// Not thread-safe.
-#ifndef ORVANE_DAEMONS_FILEINDEXD_TEST_SYSTEM_HPP_
-#define ORVANE_DAEMONS_FILEINDEXD_TEST_SYSTEM_HPP_
+// A scratch system for the tests and benchmarks of the indexing daemon: its own ORVANE_ROOT, a
+// volume folder with shares, the platform and folder files, and the daemons as real child
+// processes. Not thread-safe.
+#ifndef ORVANE_TEST_DAEMON_SYSTEM_HPP_
+#define ORVANE_TEST_DAEMON_SYSTEM_HPP_
 
 #include <json/json.h>
-#include <sys/types.h>
 
-#include <functional>
 #include <initializer_list>
+#include <memory>
 #include <set>
 #include <string>
 #include <vector>
@@ -19,29 +18,9 @@ namespace orvane {
 namespace fileindexd {
 namespace test {
 
-// A program run in a child process under `root` as ORVANE_ROOT; killed (SIGKILL) at scope end
-// unless stopped before.
-class ChildProcess {
- public:
-  ChildProcess(const std::string& root, std::vector<std::string> argv);
-  ~ChildProcess();
-  ChildProcess(const ChildProcess&) = delete;
-  ChildProcess& operator=(const ChildProcess&) = delete;
-  // Sends `sig` and waits for the exit; returns the wait status (-1 when not running).
-  int Signal(int sig);
-  // Waits up to `timeout_ms` for the process to end by itself; true when it did (it is reaped).
-  bool Exited(int timeout_ms);
-  pid_t pid() const { return pid_; }
-
- private:
-  pid_t pid_ = -1;
-};
-
-// Writes `text` to the file at `path`, making its parent folders.
-void WriteFile(const std::string& path, const std::string& text);
-
-// Polls `pred` every 20 ms until it holds or `timeout_ms` passes; returns its last answer.
-bool WaitFor(const std::function<bool()>& pred, int timeout_ms);
+using orvane::test::ChildProcess;
+using orvane::test::WaitFor;
+using orvane::test::WriteFile;
 
 class System {
  public:
@@ -86,4 +65,4 @@ std::string RawCommand(const std::string& bytes);
 }  // namespace fileindexd
 }  // namespace orvane
 
-#endif  // ORVANE_DAEMONS_FILEINDEXD_TEST_SYSTEM_HPP_
+#endif  // ORVANE_TEST_DAEMON_SYSTEM_HPP_

@@ -1,7 +1,7 @@
 // Test-only: a minimal client of the daemon's framing and a scoped daemon process, so that the
 // tests talk to the real daemon through its real socket. Not thread-safe.
-#ifndef ORVANE_DAEMONS_QUIXELASTICD_TEST_CLIENT_HPP_
-#define ORVANE_DAEMONS_QUIXELASTICD_TEST_CLIENT_HPP_
+#ifndef ORVANE_TEST_ENGINE_CLIENT_HPP_
+#define ORVANE_TEST_ENGINE_CLIENT_HPP_
 
 #include <sys/types.h>
 
@@ -71,4 +71,4 @@ Json::Value FileMappings();
 }  // namespace elasticd
 }  // namespace orvane
 
-#endif  // ORVANE_DAEMONS_QUIXELASTICD_TEST_CLIENT_HPP_
+#endif  // ORVANE_TEST_ENGINE_CLIENT_HPP_

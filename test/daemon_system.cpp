@@ -1,4 +1,4 @@
-#include "daemons/fileindexd/test_system.hpp"
+#include "test/daemon_system.hpp"
 
 #include <fcntl.h>
 #include <signal.h>
@@ -21,57 +21,6 @@
 namespace orvane {
 namespace fileindexd {
 namespace test {
-
-ChildProcess::ChildProcess(const std::string& root, std::vector<std::string> argv) {
-  pid_ = fork();
-  if (pid_ == 0) {
-    setenv("ORVANE_ROOT", root.c_str(), 1);
-    std::vector<char*> args;
-    for (std::string& a : argv) args.push_back(&a[0]);
-    args.push_back(nullptr);
-    // Their logs go to syslog; on the test's output they would drown the failures, unless asked
-    // for while a test is being debugged.
-    if (getenv("FILEINDEXD_TEST_STDERR") == nullptr) {
-      const int null = open("/dev/null", O_WRONLY);
-      if (null >= 0) dup2(null, 2);
-    }
-    execv(args[0], args.data());
-    _exit(127);
-  }
-}
-
-ChildProcess::~ChildProcess() { Signal(SIGKILL); }
-
-int ChildProcess::Signal(int sig) {
-  if (pid_ <= 0) return -1;
-  kill(pid_, sig);
-  int status = 0;
-  waitpid(pid_, &status, 0);
-  pid_ = -1;
-  return status;
-}
-
-bool ChildProcess::Exited(int timeout_ms) {
-  if (pid_ <= 0) return true;
-  int status = 0;
-  const bool gone = WaitFor([&] { return waitpid(pid_, &status, WNOHANG) == pid_; }, timeout_ms);
-  if (gone) pid_ = -1;
-  return gone;
-}
-
-void WriteFile(const std::string& path, const std::string& text) {
-  MakeParentDirs(path);
-  std::ofstream(path) << text;
-}
-
-bool WaitFor(const std::function<bool()>& pred, int timeout_ms) {
-  const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeout_ms);
-  while (std::chrono::steady_clock::now() < end) {
-    if (pred()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(20));
-  }
-  return pred();
-}
 
 System::System(const std::vector<std::string>& shares) : scoped_root_(root_.path()) {
   std::string list;

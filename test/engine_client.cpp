@@ -1,4 +1,4 @@
-#include "daemons/quixelasticd/test_client.hpp"
+#include "test/engine_client.hpp"
 
 #include <fcntl.h>
 #include <grp.h>

@@ -1,8 +1,8 @@
 // Test-only: the fixture of the end-to-end tests: a scratch System on the given shares with no
 // folders yet, and the engine, the file-change daemon and the indexer started as real processes
 // before each test. The fixture owns the processes; they are killed when it goes.
-#ifndef ORVANE_DAEMONS_FILEINDEXD_E2E_FIXTURE_HPP_
-#define ORVANE_DAEMONS_FILEINDEXD_E2E_FIXTURE_HPP_
+#ifndef ORVANE_TEST_E2E_FIXTURE_HPP_
+#define ORVANE_TEST_E2E_FIXTURE_HPP_
 
 #include <gtest/gtest.h>
 #include <json/json.h>
@@ -12,7 +12,7 @@
 #include <string>
 #include <vector>
 
-#include "daemons/fileindexd/test_system.hpp"
+#include "test/daemon_system.hpp"
 
 namespace orvane {
 namespace fileindexd {
@@ -40,4 +40,4 @@ class RunningSystemTest : public ::testing::Test {
 }  // namespace fileindexd
 }  // namespace orvane
 
-#endif  // ORVANE_DAEMONS_FILEINDEXD_E2E_FIXTURE_HPP_
+#endif  // ORVANE_TEST_E2E_FIXTURE_HPP_
