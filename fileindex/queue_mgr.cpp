@@ -62,7 +62,7 @@ void QueueMgr::DeleteTmp() {
 }
 
 bool QueueMgr::FindQueue(const std::string& path,
-                         const std::function<bool(const Event&)>& pred) const {
+                         const std::function<bool(const Event&)>& pred) {
   if (!IsFileExist(path)) return false;
   QueueFileReader input_stream(path);
   ORVANE_THROW_IF(!input_stream, kErrSystem,

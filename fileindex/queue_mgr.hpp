@@ -41,9 +41,12 @@ class QueueMgr {
   // Whether a plain re-index of `full_path` or of one of its ancestors is queued.
   bool IsFullPathHasReindex(const std::string& full_path);
 
- private:
-  bool FindQueue(const std::string& path, const std::function<bool(const Event&)>& pred) const;
+  // Whether `pred` holds for an event of the queue file at `path`, read in order until it does;
+  // false when there is no file. Throws Error 502 when the file cannot be opened, Error 906 for a
+  // line over the event limit. A `pred` that always answers false visits every event.
+  static bool FindQueue(const std::string& path, const std::function<bool(const Event&)>& pred);
 
+ private:
   std::string queue_path_;
   std::string queue_path_tmp_;
   mutable std::shared_ptr<OPTree> op_tree_;
