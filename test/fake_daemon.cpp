@@ -128,6 +128,18 @@ FakeDaemon::Handler FakeDaemon::Replies(std::vector<std::string> replies) {
   };
 }
 
+FakeDaemon::Handler FakeDaemon::EngineReplies(std::function<int(const Json::Value&)> fail) {
+  return [fail](int fd, const std::string& request) {
+    const Json::Value req = Parse(request);
+    const int code = fail(req);
+    Json::Value reply(Json::objectValue);
+    reply["success"] = code == 0;
+    if (code != 0) reply["error"]["code"] = code;
+    if (req["command"] == "document_get_by_query") reply["data"] = Json::arrayValue;
+    WriteFrame(fd, JsonToString(reply));
+  };
+}
+
 Json::Value FakeDaemon::Parse(const std::string& text) {
   JsonValue value;
   EXPECT_TRUE(value.fromString(text)) << text;

@@ -44,6 +44,9 @@ class FakeDaemon {
 
   // A handler that answers the n-th request with replies[n] as a frame, the last one repeated.
   static Handler Replies(std::vector<std::string> replies);
+  // A search engine's answers: success for every request save those `fail` gives a nonzero code,
+  // which is answered with it; queries find nothing.
+  static Handler EngineReplies(std::function<int(const Json::Value&)> fail);
   // Parses `text`, or fails the test.
   static Json::Value Parse(const std::string& text);
 

@@ -82,37 +82,29 @@ class WorkerTest : public ShareTest {
   std::unique_ptr<test::ChildProcess> engine_;
 };
 
+// Renames, moves in and out and trees deleted are followed end to end; here, what the rules
+// keep out or let in that the disk alone does not say.
 TEST_F(WorkerTest, EventsFollowTheDiskWithinTheRules) {
-  for (const char* rel :
-       {"a/x.txt", "a/sub/y.txt", "a/sub/deeper/z.txt", "a/sub/@eaDir/thumb.txt", "a/sub/.DS_Store",
-        "a/d/f1.txt", "a/dx.txt", "a/out.txt", "c/not-under-a-folder.txt", "c/m/inner.txt"}) {
+  for (const char* rel : {"a/x.txt", "a/sub/y.txt", "a/sub/@eaDir/thumb.txt", "a/sub/.DS_Store",
+                          "a/d/f1.txt", "a/dx.txt", "c/not-under-a-folder.txt"}) {
     Write(rel, rel);
   }
   ASSERT_EQ(0, symlink(V("a/x.txt").c_str(), V("a/sub/link.txt").c_str()));
-  EXPECT_EQ(Expect({"a/x.txt", "a/sub", "a/sub/y.txt", "a/sub/deeper", "a/sub/deeper/z.txt", "a/d",
-                    "a/d/f1.txt", "a/dx.txt", "a/out.txt"}),
+  EXPECT_EQ(Expect({"a/x.txt", "a/sub", "a/sub/y.txt", "a/d", "a/d/f1.txt", "a/dx.txt"}),
             Pass(Line(0x40, "a/x.txt") + Line(0x8, "a/x.txt") + Line(0x40, "a/sub", true) +
                  Line(0x40, "c/not-under-a-folder.txt") + Line(0x40, "a/gone.txt") +
-                 Line(0x40, "a/d", true) + Line(0x40, "a/dx.txt") + Line(0x40, "a/out.txt")));
+                 Line(0x40, "a/d", true) + Line(0x40, "a/dx.txt")));
   const Json::Value report = worker_.Report();
   EXPECT_EQ(0u, report["errors"].asUInt() + report["queue_length"].asUInt()) << report;
   EXPECT_GT(report["last_pass"].asInt64(), 0);
 
-  // A directory renamed (its sibling whose name only begins the same stays) and one deleted; a
-  // file renamed in its folder; an attribute change of a file never indexed indexes it; a move
-  // in from an unindexed place (no old document) crawls the new name; a move out deletes.
+  // A directory renamed leaves its sibling whose name only begins the same; an attribute change
+  // of a file never indexed indexes it.
   Move("a/d", "a/e");
-  Move("a/x.txt", "a/why.txt");
   Write("a/new.txt", "n");
-  Move("c/m", "a/m");
-  Move("a/out.txt", "c/out.txt");
-  ASSERT_EQ(0, system(("rm -r " + V("a/sub")).c_str()));
   EXPECT_EQ(
-      Expect({"a/e", "a/e/f1.txt", "a/dx.txt", "a/why.txt", "a/new.txt", "a/m", "a/m/inner.txt"}),
-      Pass(Line(0x100, "a/e", true, "a/d") + Line(0x100, "a/why.txt", false, "a/x.txt") +
-           Line(0x4, "a/new.txt") + Line(0x100, "a/m", true, "c/m") +
-           Line(0x100, "c/out.txt", false, "a/out.txt") + Line(0x80, "a/sub", true)));
-  // The names and parents the documents carry are compared with the disk end to end.
+      Expect({"a/x.txt", "a/sub", "a/sub/y.txt", "a/e", "a/e/f1.txt", "a/dx.txt", "a/new.txt"}),
+      Pass(Line(0x100, "a/e", true, "a/d") + Line(0x4, "a/new.txt")));
 }
 
 TEST_F(WorkerTest, ReindexCrashAndFolderChangesSettleTheIndexWithTheDisk) {
@@ -173,6 +165,9 @@ while IFS= read -r -d '' path; do
 done)");
   ASSERT_EQ(0, chmod(helper.c_str(), 0755));
   setenv("FILEINDEX_EXTRACT_HELPER", helper.c_str(), 1);
+  const auto has = [](const std::set<std::string>& docs, const std::set<std::string>& some) {
+    return std::includes(docs.begin(), docs.end(), some.begin(), some.end());
+  };
   // Runs a pass on a thread; once `others` are in the index, records whether `held` are too,
   // then lets the slow file go and waits for the pass.
   const auto held_back = [&](const std::string& lines, const std::set<std::string>& others,
@@ -180,25 +175,17 @@ done)");
     EXPECT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), lines));
     bool done = false;
     std::thread pass([&] { done = worker_.RunPass(); });
-    const bool others_in = test::WaitFor(
-        [&] {
-          const std::set<std::string> docs = sys_.Documents("docs");
-          return std::includes(docs.begin(), docs.end(), others.begin(), others.end());
-        },
-        30000);
-    const std::set<std::string> docs = sys_.Documents("docs");
+    EXPECT_TRUE(test::WaitFor([&] { return has(sys_.Documents("docs"), others); }, 30000));
+    const bool held_in = has(sys_.Documents("docs"), held);
     test::WriteFile(release, "");
     pass.join();
-    EXPECT_TRUE(others_in);
     EXPECT_TRUE(done);
     EXPECT_EQ(0, unlink(release.c_str()));
-    return std::includes(docs.begin(), docs.end(), held.begin(), held.end());
+    return held_in;
   };
 
   // A crawl; files of a folder are crawled before its sub-folders, so the slow one comes first.
-  Write("a/d/slow.txt");
-  Write("a/d/sub/f0.txt");
-  Write("a/d/sub/f1.txt");
+  for (const char* rel : {"a/d/slow.txt", "a/d/sub/f0.txt", "a/d/sub/f1.txt"}) Write(rel);
   EXPECT_FALSE(held_back(Line(0x10000, "a"), Expect({"a/d/sub/f0.txt", "a/d/sub/f1.txt"}),
                          Expect({"a/d/slow.txt"})));
   EXPECT_EQ(Expect({"a", "a/d", "a/d/slow.txt", "a/d/sub", "a/d/sub/f0.txt", "a/d/sub/f1.txt"}),
@@ -207,8 +194,7 @@ done)");
   // Queued operations: the slow file changed, then new files, then its folder renamed. The new
   // files go in while the slow one is read; the rename waits for it, so the old names stay.
   Write("a/d/slow.txt", "changed");
-  Write("a/g1.txt");
-  Write("a/g2.txt");
+  for (const char* rel : {"a/g1.txt", "a/g2.txt"}) Write(rel);
   Move("a/d", "a/e");
   EXPECT_TRUE(held_back(Line(0x2, "a/d/slow.txt") + Line(0x40, "a/g1.txt") +
                             Line(0x40, "a/g2.txt") + Line(0x100, "a/e", true, "a/d"),
@@ -242,27 +228,19 @@ TEST_F(WorkerTest, AReconciliationWritesOnlyWhatChangedAndReportsIt) {
   EXPECT_EQ(Expect({"a", "a/same.txt", "a/caf\xe9.txt", "a/grows.txt", "a/sub", "a/sub/x.txt",
                     "a/sub/new.txt"}),
             Pass(reconcile));
-  Json::Value report = worker_.Report();
-  Json::Value last = report["last_reconcile"];
-  EXPECT_EQ(last["folder"], V("a"));
-  EXPECT_EQ(report["state"], "idle");
-  EXPECT_TRUE(report["reconciling"].isNull());
+  const Json::Value report = worker_.Report();
+  const Json::Value& last = report["last_reconcile"];
+  EXPECT_TRUE(last["folder"] == V("a") && report["state"] == "idle" &&
+              report["reconciling"].isNull() && report["reconciliations"].size() == 1)
+      << report;
   // Added the new file; removed the file and the folder of four documents; refreshed the file
-  // that grew, the one whose mode changed and the two folders whose entries changed. Nothing
-  // else was read or written.
-  EXPECT_EQ(last["added"].asUInt(), 1u);
-  EXPECT_EQ(last["removed"].asUInt(), 5u);
-  EXPECT_EQ(last["refreshed"].asUInt(), 4u);
-  EXPECT_EQ(last["compared"].asUInt(), 7u);
-  EXPECT_EQ(report["documents_written"].asUInt64() - written, 5u);
-  EXPECT_EQ(report["reconciliations"].size(), 1u);
-
-  // Again, with nothing changed: nothing is written at all.
-  EXPECT_EQ(7u, Pass(reconcile).size());
-  last = worker_.Report()["last_reconcile"];
-  EXPECT_EQ(last["added"].asUInt() + last["removed"].asUInt() + last["refreshed"].asUInt(), 0u);
-  EXPECT_EQ(worker_.Report()["documents_written"].asUInt64() - written, 5u);
-  EXPECT_GT(last["pass"].asUInt(), report["last_reconcile"]["pass"].asUInt());
+  // that grew, the one whose mode changed and the two folders whose entries changed. What the
+  // engine holds unchanged (seconds, modes, Latin-1 names) is neither re-read nor written.
+  EXPECT_EQ("+1 -5 ~4 =7 w5", "+" + last["added"].asString() + " -" + last["removed"].asString() +
+                                  " ~" + last["refreshed"].asString() + " =" +
+                                  last["compared"].asString() + " w" +
+                                  std::to_string(report["documents_written"].asUInt64() - written))
+      << report;
 }
 
 // The engine replaced by a scripted one: every write succeeds except those `fail` picks, which
@@ -275,26 +253,15 @@ class ScriptedEngineTest : public ShareTest {
     engine_.reset();  // it removes the socket file when it goes
     engine_ = std::make_unique<orvane::test::FakeDaemon>(
         RootedPathForWrite("/var/run/quixelasticd.sock"),
-        [fail, hang_up](int fd, const std::string& request) {
-          if (hang_up) return;
-          const Json::Value req = orvane::test::FakeDaemon::Parse(request);
-          const int code = fail(req);
-          Json::Value reply(Json::objectValue);
-          reply["success"] = code == 0;
-          if (code != 0) reply["error"]["code"] = code;
-          if (req["command"] == "document_get_by_query") reply["data"] = Json::arrayValue;
-          orvane::test::FakeDaemon::WriteFrame(fd, JsonToString(reply));
-        });
+        hang_up ? [](int, const std::string&) {} : orvane::test::FakeDaemon::EngineReplies(fail));
   }
   std::string Tmp() const { return sys_.Queue("docs") + ".tmp"; }
   // Writes the files and queues their creation.
   void Create(std::initializer_list<const char*> rels) {
-    std::string lines;
     for (const char* rel : rels) {
       Write(rel, rel);
-      lines += Line(0x40, rel);
+      ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), Line(0x40, rel)));
     }
-    ASSERT_TRUE(fileindex::QueueFileAppend(sys_.Queue("docs"), lines));
   }
 
   std::unique_ptr<orvane::test::FakeDaemon> engine_;
@@ -311,9 +278,8 @@ TEST_F(ScriptedEngineTest, AFailingOperationIsRetriedWithBackoffThenSkipped) {
   // Four attempts with one, two and four seconds between them, on the fake clock.
   EXPECT_EQ(7000000, env_.slept_micros());
   const Json::Value report = worker_.Report();
-  EXPECT_EQ(1u, report["errors"].asUInt());
-  EXPECT_NE(std::string::npos, report["last_error"].asString().find("bad.txt"));
-  EXPECT_EQ(2u, report["ops_done"].asUInt());
+  EXPECT_TRUE(report["errors"].asUInt() == 1 && report["ops_done"].asUInt() == 2) << report;
+  EXPECT_THAT(report["last_error"].asString(), ::testing::HasSubstr("bad.txt"));
   int good = 0, commits = 0;
   for (const auto& req : engine_->json_requests()) {
     good += req["data"]["doc_id"] == V("a/good.txt");
@@ -368,9 +334,7 @@ TEST_F(ShareTest, APlantedQueueFolderIsReportedUntilItIsGone) {
   const Json::Value report = worker_.Report();
   EXPECT_THAT(report["unsafe"].asString(),
               ::testing::HasSubstr(share + "/@eaDir: it is a symbolic link"));
-  EXPECT_EQ(report["last_error"], report["unsafe"]);
-  EXPECT_GE(report["errors"].asUInt64(), 1u);
-  EXPECT_FALSE(IsDirExist(secret.Path("@fileindex"), false));
+  EXPECT_TRUE(report["last_error"] == report["unsafe"] && report["errors"].asUInt() >= 1) << report;
 
   ASSERT_EQ(unlink((share + "/@eaDir").c_str()), 0);
   EXPECT_TRUE(test::WaitFor([&] { return worker_.Report()["unsafe"].asString().empty(); },
