@@ -12,6 +12,7 @@
 #include "common/root.hpp"
 #include "platform/fs.hpp"
 #include "test/faults.hpp"
+#include "test/share_fixture.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -77,10 +78,9 @@ TEST(FileTypeTest, LookupsListsAndSettingNamesAgree) {
 }
 
 // Real folders in real shares on this machine's file system.
-class IndexRulesTest : public ::testing::Test {
+class IndexRulesTest : public test::ShareFixture {
  protected:
   void SetUp() override {
-    vol_ = volume_.path();
     for (const char* dir : {"music/live", "music/#recycle/old", "music/.git/objects",
                             "music/@eaDir/x", "music/#snapshot/daily", "homes/nobody/#recycle/f",
                             "homes/nobody/docs", "ro", "vault/inner", "open/sub"}) {
@@ -92,12 +92,12 @@ class IndexRulesTest : public ::testing::Test {
   }
 
   void WriteConfig() {
-    test::WritePlatformConfig(root_.path(), R"({"shares": [
+    WriteShares(R"(
       {"name": "music", "path": ")" + vol_ + R"(/music", "recycle_bin": true},
       {"name": "homes", "path": ")" + vol_ + R"(/homes", "recycle_bin": true},
       {"name": "ro", "path": ")" + vol_ + R"(/ro", "readonly": true},
       {"name": "vault", "path": ")" + vol_ + R"(/vault", "encrypted": true, "encryption": true},
-      {"name": "open", "path": ")" + vol_ + R"(/open", "encryption": true}]})");
+      {"name": "open", "path": ")" + vol_ + R"(/open", "encryption": true})");
   }
 
   // Mounts a small tmpfs on `dir` (read-only when asked); false when the machine refuses.
@@ -112,10 +112,6 @@ class IndexRulesTest : public ::testing::Test {
     for (auto it = mounts_.rbegin(); it != mounts_.rend(); ++it) umount2(it->c_str(), MNT_DETACH);
   }
 
-  test::TempDir root_;
-  test::ScopedRoot scoped_{root_.path()};
-  test::TempDir volume_;
-  std::string vol_;
   std::vector<std::string> mounts_;
 };
 

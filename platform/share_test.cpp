@@ -11,6 +11,7 @@
 #include "platform/platform_error.hpp"
 #include "platform/quota.hpp"
 #include "test/faults.hpp"
+#include "test/share_fixture.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -25,26 +26,19 @@ ShareRecord GetShare(const char* name) {
   return ShareRecord(share, QUIXShareFree);
 }
 
-class PlatformShareTest : public ::testing::Test {
+class PlatformShareTest : public test::ShareFixture {
  protected:
   void SetUp() override {
-    vol_ = volume_.path();
     chmod(vol_.c_str(), 0755);
-    test::WritePlatformConfig(root_.path(), R"({"shares": [
+    WriteShares(R"(
       {"name": "music", "path": ")" + vol_ + R"(/music", "recycle_bin": true},
       {"name": "live", "path": ")" + vol_ + R"(/music/live"},
       {"name": "mu", "path": ")" + vol_ + R"(/mu", "readonly": true},
       {"name": "homes", "path": ")" + vol_ + R"(/homes", "recycle_bin": true},
       {"name": "open", "path": ")" + vol_ + R"(/open"},
       {"name": "acl", "path": ")" + vol_ + R"(/acl",
-       "access": {"users": {"nobody": "ro", "daemon": "na"}, "groups": {"root": "rw"}}}
-    ]})");
+       "access": {"users": {"nobody": "ro", "daemon": "na"}, "groups": {"root": "rw"}}})");
   }
-
-  test::TempDir root_;
-  test::ScopedRoot scoped_{root_.path()};
-  test::TempDir volume_;
-  std::string vol_;
 };
 
 // The flags themselves are read through the share objects built on these records.

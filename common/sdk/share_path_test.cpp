@@ -5,23 +5,18 @@
 #include "common/error.hpp"
 #include "common/util.hpp"
 #include "test/faults.hpp"
+#include "test/share_fixture.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
 namespace sdk {
 namespace {
 
-class SharePathTest : public ::testing::Test {
+class SharePathTest : public test::ShareFixture {
  protected:
   void SetUp() override {
-    test::WritePlatformConfig(root_.path(), R"({"shares": [
-      {"name": "music", "path": "/v1/music"},
-      {"name": "homes", "path": "/v1/homes"}
-    ]})");
+    WriteShares(R"({"name": "music", "path": "/v1/music"}, {"name": "homes", "path": "/v1/homes"})");
   }
-
-  test::TempDir root_;
-  test::ScopedRoot scoped_{root_.path()};
 };
 
 TEST_F(SharePathTest, ShareFormAndHomeForm) {

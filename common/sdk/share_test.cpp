@@ -8,6 +8,7 @@
 #include "platform/config.hpp"
 #include "platform/platform_error.hpp"
 #include "test/faults.hpp"
+#include "test/share_fixture.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -17,18 +18,16 @@ namespace {
 using platform::Fault;
 using platform::ScopedFaults;
 
-class SDKShareTest : public ::testing::Test {
+class SDKShareTest : public test::ShareFixture {
  protected:
   void SetUp() override {
-    vol_ = volume_.path();
-    test::WritePlatformConfig(root_.path(), R"({"shares": [
+    WriteShares(R"(
       {"name": "music", "path": ")" + vol_ + R"(/music", "recycle_bin": true, "ftp_privilege": 5},
       {"name": "vault", "path": ")" + vol_ + R"(/vault", "encrypted": true, "encryption": true},
       {"name": "ro", "path": ")" + vol_ + R"(/ro", "readonly": true, "hide_unreadable": true},
       {"name": "open", "path": ")" + vol_ + R"(/open", "encryption": true},
       {"name": "my music é", "path": ")" + vol_ +
-                                                R"(/my music é"}
-    ]})");
+                                                R"(/my music é"})");
   }
 
   // Runs `fn`, expects an Error with `code` whose reason is `reason`.
@@ -43,11 +42,6 @@ class SDKShareTest : public ::testing::Test {
                                (reason.empty() ? "" : ", reason=[" + reason + "]"));
     }
   }
-
-  test::TempDir root_;
-  test::ScopedRoot scoped_{root_.path()};
-  test::TempDir volume_;
-  std::string vol_;
 };
 
 // Which shares can be indexed is judged, share flags and all, by the index rules' tests.
