@@ -179,10 +179,8 @@ TEST_F(ShareOpsTest, MigrateFollowsTheShareToItsNewFolder) {
 TEST_F(ShareOpsTest, MissingArgumentsAreRefused) {
   const std::vector<std::pair<std::function<void()>, std::string>> cases = {
       {[] { SharePause(""); }, "Missing share name"},
-      {[] { ShareCheckRecycle(""); }, "Missing share name"},
       {[] { ShareRename("", "x"); }, "Missing share_from"},
       {[] { ShareClearPaused("music", ""); }, "Missing share path"},
-      {[] { ShareMigrate("photo", ""); }, "Missing share path"},
       {[] { CleanShareIndexData("music", "music"); }, "Bad share path of music: music"},
       {[] { VolumePause(""); }, "Missing volume path"},
       {[] { UserRename("", "x"); }, "Missing user_from"}};
@@ -192,7 +190,6 @@ TEST_F(ShareOpsTest, MissingArgumentsAreRefused) {
   }
   // The share is opened before the argument is looked at.
   EXPECT_EQ(ErrorOf([] { ShareRebuild(""); }).code, kErrShareGet);
-  EXPECT_EQ(ErrorOf([] { ShareAutoClean(""); }).code, kErrShareGet);
   EXPECT_EQ(test::ReadFile(FoldersPath()), folders);
   EXPECT_TRUE(NewEngine().empty());
   EXPECT_TRUE(NewIndexd().empty());
