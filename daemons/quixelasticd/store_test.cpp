@@ -130,8 +130,8 @@ TEST_F(StoreTest, ListingPagesThroughOneFolderInIdentifierOrder) {
     for (const Json::Value& hit : hits) {
       const std::string p = hit[0].asString();
       paths.push_back(p);
-      EXPECT_EQ(JsonToString(hit), "[\"" + p + "\",7,1000," +
-                                       (p == "/v/s/a/y" ? "true,2000]" : "false,null]"));
+      EXPECT_EQ(JsonToString(hit),
+                "[\"" + p + "\",7,1000," + (p == "/v/s/a/y" ? "true,2000]" : "false,null]"));
     }
     if (hits.size() < 2) break;
     after = paths.back();
