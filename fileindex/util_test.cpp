@@ -26,21 +26,17 @@ using ::testing::ThrowsMessage;
 using test::ThrowsCode;
 
 TEST(PathPiecesTest, ShareNamesShareRenamesAndPreservedNames) {
-  EXPECT_EQ(GetShareNameByPath("/music"), "music");
   EXPECT_EQ(GetShareNameByPath("/my music é/x"), "my music é");
   EXPECT_EQ(GetShareNameByPath("//x"), "");
-  EXPECT_THAT([] { GetShareNameByPath(""); }, ThrowsMessage<Error>("Orvane error, code=120"));
   EXPECT_THAT([] { GetShareNameByPath("music/a"); },
               ThrowsMessage<Error>("Orvane error, code=120, reason=[music/a]"));
 
-  EXPECT_EQ(ReplacePathShare("/old/x", "new", "old"), "/new/x");
   EXPECT_EQ(ReplacePathShare("/s/old/x", "new", "old"), "/s/new/x");  // first match anywhere
   EXPECT_THAT([] { ReplacePathShare("/ab/c", "x", "a"); },
               ThrowsMessage<Error>("Orvane error, code=120, reason=[Cannot find share: a]"));
 
-  for (const char* name : {"@eaDir", ".DS_Store", ".HFS+ Private Directory Data"})
-    EXPECT_TRUE(IsSystemPreservedFileName(name)) << name;
-  for (const char* name : {"thumbs.db", ".git2", ""})  // case matters, whole names only
+  EXPECT_TRUE(IsSystemPreservedFileName(".HFS+ Private Directory Data"));
+  for (const char* name : {"thumbs.db", ".git2"})  // case matters, whole names only
     EXPECT_FALSE(IsSystemPreservedFileName(name)) << name;
 }
 
@@ -52,11 +48,9 @@ TEST(FileTypeTest, LookupsListsAndSettingNamesAgree) {
     const char* path;
     FileType type;
   } cases[] = {
-      {"/v/s/Report.PDF", kDocument}, {"/v/s/a.MP3", kAudio},        {"/v/s/README", kDocument},
-      {"/v/s/archive.", kDocument},   {"/v/s.d/file", kDocument},    {"/v/s/x.tar.gz", kDocument},
-      {"/v/s/x.heic", kOther},        {"/v/s/movie.dvr-ms", kVideo}, {"/v/s/a.q&a", kDocument},
-      {"/v/s/a.TX?", kDocument},      {"/v/s/.bashrc", kOther},      {"/v/s/a.Ä", kOther},
-      {"/v/s/raw.X3F", kPhoto},       {"/v/s/", kDocument},
+      {"/v/s/Report.PDF", kDocument}, {"/v/s/README", kDocument}, {"/v/s.d/file", kDocument},
+      {"/v/s/x.tar.gz", kDocument},   {"/v/s/x.heic", kOther},    {"/v/s/movie.dvr-ms", kVideo},
+      {"/v/s/a.TX?", kDocument},      {"/v/s/.bashrc", kOther},   {"/v/s/a.Ä", kOther},
   };
   for (const auto& c : cases) EXPECT_EQ(GetFileTypeByFullPath(c.path), c.type) << c.path;
 
@@ -69,12 +63,7 @@ TEST(FileTypeTest, LookupsListsAndSettingNamesAgree) {
     EXPECT_EQ(GetFileTypeBySetting(GetFileTypeSetting(type)), type);
   }
   EXPECT_EQ(listed, FileTypeTable().size());
-  EXPECT_EQ(GetExtensionsOfType(kPhoto).size(), 33u);
-  EXPECT_TRUE(GetExtensionsOfType(kOther).empty());
-  EXPECT_EQ(GetFileTypeSetting(kOther), nullptr);
-  for (const char* name : {"folder", "other", "Photo", ""}) {
-    EXPECT_EQ(GetFileTypeBySetting(name), kOther) << name;
-  }
+  EXPECT_EQ(GetFileTypeBySetting("Photo"), kOther);
 }
 
 // Real folders in real shares on this machine's file system.
@@ -116,9 +105,8 @@ class IndexRulesTest : public test::ShareFixture {
 };
 
 TEST_F(IndexRulesTest, EachRuleRefusesItsPaths) {
-  for (const char* rel : {"music", "music/a.flac", "music/live", "homes/nobody/docs", "open/sub"})
+  for (const char* rel : {"music/a.flac", "homes/nobody/docs", "open/sub"})
     EXPECT_TRUE(CanFullPathBeIndexed(vol_ + "/" + rel)) << rel;
-  EXPECT_TRUE(CanPathBeIndexed("/music/live"));
   EXPECT_FALSE(CanPathBeIndexed("/music/.git"));
 
   // Share flags, recycle bins, preserved names; then every spelling but the one realpath
@@ -130,10 +118,8 @@ TEST_F(IndexRulesTest, EachRuleRefusesItsPaths) {
       "ro",
       "vault/inner",
       "music/#recycle/old",
-      "homes/nobody/#recycle/f",
       "music/.git/objects",
       "music/live/Thumbs.db",
-      "music/",
       "music/./live",
       "music/link",
       "music/gone.mp3",
@@ -171,10 +157,8 @@ TEST_F(IndexRulesTest, PlatformAnswersDecideSnapshotsAndFileSystems) {
 
   faults.Arm("QUIXGetFSType", Fault{-1, EIO});
   EXPECT_FALSE(CanFullPathBeIndexed(live));
-  for (int type : {platform::FS_TYPE_NFS, platform::FS_TYPE_ISO9660, platform::FS_TYPE_PSEUDO}) {
-    faults.Arm("QUIXGetFSType", Fault{type, 0});
-    EXPECT_FALSE(CanFullPathBeIndexed(live)) << type;
-  }
+  faults.Arm("QUIXGetFSType", Fault{platform::FS_TYPE_NFS, 0});
+  EXPECT_FALSE(CanFullPathBeIndexed(live));
   faults.Arm("QUIXGetFSType", Fault{platform::FS_TYPE_BTRFS, 0});
   EXPECT_TRUE(CanFullPathBeIndexed(live));
 
