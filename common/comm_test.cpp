@@ -31,16 +31,10 @@ class CommTest : public ::testing::Test {
   std::string SockPath() const { return dir_.Path("var/run/quixelasticd.sock"); }
   std::string Notified() const { return test::ReadFile(dir_.Path("usr/quix/bin/notified")); }
 
-  // Runs SendRequestImpl and returns the Error it throws.
+  // The Error SendRequestImpl throws.
   Error ImplError(const Json::Value& req) {
     Json::Value res;
-    try {
-      SendRequestImpl(res, req);
-    } catch (const Error& e) {
-      return e;
-    }
-    ADD_FAILURE() << "no Error";
-    return Error(kErrInvalidParam, "no error");
+    return test::ErrorOf([&] { SendRequestImpl(res, req); });
   }
 
   test::TempDir dir_;
@@ -181,13 +175,9 @@ TEST_F(CommTest, NotReadyIsRetriedEveryThirtySecondsButNot609) {
   ASSERT_EQ(engine.requests().size(), 4u);
   for (const Json::Value& sent : engine.json_requests()) EXPECT_EQ(sent, Req("commit"));
 
-  try {
-    fileindex::elastic::SendRequest(Req("commit"));
-    FAIL() << "609 was retried";
-  } catch (const Error& e) {
-    EXPECT_EQ(static_cast<int>(e.code), kCodeIndexDamaged);
-    EXPECT_STREQ(e.what(), "Orvane error, code=609, reason=[Request failed, msg=d]");
-  }
+  const Error e = test::ErrorOf([] { fileindex::elastic::SendRequest(Req("commit")); });
+  EXPECT_EQ(static_cast<int>(e.code), kCodeIndexDamaged);
+  EXPECT_STREQ(e.what(), "Orvane error, code=609, reason=[Request failed, msg=d]");
   EXPECT_EQ(log_.Lines().size(), 3u);  // the daemon's own failure is not logged here
   EXPECT_EQ(env_.sleeps().size(), 3u);
   EXPECT_EQ(engine.requests().size(), 5u);

@@ -76,6 +76,8 @@ TEST(WireTest, BrokenFramesFailWithTheirReason) {
   };
   const std::vector<Case> cases = {
       {"closes without a frame", "", true, 100, IoStatus::kClosed, ECONNRESET},
+      {"closes inside the payload", LengthBytes(10) + "0123", true, 100, IoStatus::kClosed,
+       ECONNRESET},
       {"announces 4 GiB", LengthBytes(0xFFFFFFFFu) + "{}", false, kClientMaxFrameBytes,
        IoStatus::kTooLarge, EMSGSIZE},
       {"stalls inside the payload", LengthBytes(10) + "0123", false, 100, IoStatus::kTimeout,
@@ -139,6 +141,8 @@ TEST(WireTest, ConnectFailsWithATellingErrno) {
   test::TempDir dir;
   EXPECT_FALSE(Connect(dir.Path("none.sock"), 1000).valid());
   EXPECT_EQ(errno, ENOENT);
+  EXPECT_FALSE(Connect("/" + std::string(200, 'a'), 1000).valid());
+  EXPECT_EQ(errno, ENAMETOOLONG);
 
   // Nobody accepts: fill the backlog with non-blocking connections until one is refused.
   const std::string path = dir.Path("full.sock");

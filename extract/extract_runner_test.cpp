@@ -287,6 +287,12 @@ TEST_F(ExtractRunnerTest, ParseFileFillsFileSystemFieldsAndAddsContentOnlyWhenAs
   EXPECT_EQ(doc[ce::QUIXMDExtension], "mp3");
   EXPECT_FALSE(doc[ce::QUIXMDIsDir].asBool() || doc.isMember("QUIXMDTextContent"));
 
+  Json::Value untouched;
+  const Error missing = test::ErrorOf([&] { ce::ParseFile(dir_.Path("missing"), {}, untouched); });
+  EXPECT_EQ(missing.code, kErrSystem);
+  EXPECT_NE(std::string(missing.what()).find("No such file or directory"), std::string::npos);
+  EXPECT_TRUE(untouched.isNull());
+
   test::LogCapture log;
 
   // A helper that fails leaves the name and attributes indexed, logged and counted.

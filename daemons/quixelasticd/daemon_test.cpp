@@ -330,11 +330,13 @@ TEST_F(DaemonTest, OrdinaryUsersSearchOnlyWhatTheyCouldOpen) {
   const gid_t gid = nobody->pw_gid;
   ASSERT_EQ(::mkdir(dir_.Path("disk").c_str(), 0755), 0);
   ASSERT_EQ(::symlink("disk", dir_.Path("vol").c_str()), 0);
-  // Name, mode, ACL; the last lies in a folder only root may enter.
+  // Name, mode, ACL; "hidden" lies in a folder only root may enter, "swapped" in one anyone may
+  // write.
   const std::vector<std::tuple<std::string, mode_t, std::string>> files = {
       {"pub/memo granted.txt", 0600, "u:nobody:r--"},
       {"pub/memo denied.txt", 0644, "u:nobody:---"},
-      {"priv/memo hidden.txt", 0644, ""}};
+      {"priv/memo hidden.txt", 0644, ""},
+      {"team/memo swapped.txt", 0600, ""}};
   std::vector<Json::Value> upserts;
   for (const auto& [rel, mode, acl] : files) {
     const std::string path = dir_.Write("disk/share/" + rel, "x");
@@ -349,6 +351,8 @@ TEST_F(DaemonTest, OrdinaryUsersSearchOnlyWhatTheyCouldOpen) {
   }
   for (const char* rel : {"disk/share", "disk/share/pub"}) ::chmod(dir_.Path(rel).c_str(), 0755);
   ASSERT_EQ(::chmod(dir_.Path("disk/share/priv").c_str(), 0700), 0);
+  ASSERT_EQ(::chmod(dir_.Path("disk/share/team").c_str(), 0777), 0);
+  dir_.Write("disk/share/team/readable.txt", "x");
   Launch();
   Json::Value create = OnIndex("index_create");
   create["data"]["path"] = dir_.Path("vol/share/@eaDir/@fileindex/db");
@@ -358,6 +362,14 @@ TEST_F(DaemonTest, OrdinaryUsersSearchOnlyWhatTheyCouldOpen) {
   EXPECT_TRUE(tc::RequestAs(daemon_->socket(), Cmd("index_list", Json::Value()), uid, gid).isNull());
   const Json::Value upsert = tc::RequestAs(daemon_->public_socket(), upserts[0], uid, gid);
   EXPECT_EQ(upsert["error"]["code"], kCodePermissionDenied) << JsonToString(upsert);
+  // Nobody renames a link to a file it may read over the indexed secret: the kernel would now
+  // open the link's target, yet the index still holds the secret's words under its name.
+  ASSERT_EQ(orvane::test::RunAsUser("nobody", [&] {
+              const std::string team = dir_.Path("disk/share/team/");
+              return ::symlink("readable.txt", (team + ".t").c_str()) == 0 &&
+                     ::rename((team + ".t").c_str(), (team + "memo swapped.txt").c_str()) == 0;
+            }),
+            1);
 
   auto ask = [&](const std::string& command, const std::string& data, bool as_root) {
     const Json::Value req = tc::Parse(R"({"command": ")" + command + R"(", "data": )" + data + "}");
@@ -369,15 +381,15 @@ TEST_F(DaemonTest, OrdinaryUsersSearchOnlyWhatTheyCouldOpen) {
   const Json::Value by_name = ask("search", R"({"name": "memo"})", false);
   ASSERT_EQ(by_name["total"], 1) << JsonToString(by_name);
   EXPECT_EQ(by_name["hits"][0]["path"], dir_.Path("vol/share/pub/memo granted.txt"));
-  EXPECT_EQ(ask("search", R"({"name": "memo"})", true)["total"], 3);
-  for (const char* word : {"deniedstuff", "hiddenstuff"}) {
+  EXPECT_EQ(ask("search", R"({"name": "memo"})", true)["total"], 4);
+  for (const char* word : {"deniedstuff", "hiddenstuff", "swappedstuff"}) {
     const std::string query = std::string(R"({"keyword": ")") + word + "\"}";
     EXPECT_EQ(ask("search", query, false)["total"], 0) << word;
     EXPECT_EQ(ask("search", query, true)["total"], 1) << word;
   }
   // Suggestions offer no word found only in files nobody may not open.
   std::vector<std::string> offered;
-  for (const char* prefix : {"gran", "deni", "hidd"}) {
+  for (const char* prefix : {"gran", "deni", "hidd", "swap"}) {
     const std::string data = std::string(R"({"prefix": ")") + prefix + R"(", "size": 100})";
     const Json::Value mine = ask("suggest", data, false);
     for (const Json::Value& w : mine["suggestions"]) offered.push_back(w.asString());
