@@ -5,7 +5,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cstring>
 #include <unordered_set>
 #include <utility>
 
@@ -75,20 +74,12 @@ bool IsReconcile(uint32_t event, const Json::Value& data) {
 // Reads the plain re-index paths of one queue file; malformed lines fail as they would for the
 // queue's own questions.
 void CollectReindexes(const std::string& path, std::unordered_set<std::string>& out) {
-  if (!IsFileExist(path)) return;
-  QueueFileReader reader(path);
-  ORVANE_THROW_IF(!reader, kErrSystem,
-                  std::string("Failed to open queue, reason=") + std::strerror(errno));
-  std::string line;
-  while (reader.ReadLine(&line, kMaxEventLineLength)) {
-    if (line.size() > kMaxEventLineLength) {
-      throw Error(kErrMalformedEvent, "Event line too long: " + line.substr(0, 256) + "...");
-    }
-    Event event(line);
+  QueueMgr::FindQueue(path, [&out](const Event& event) {
     if (event.event == kEventReindex && !IsReconcile(event.event, event.data)) {
       out.insert(event.path);
     }
-  }
+    return false;
+  });
 }
 
 // Whether `path` or one of its ancestors is in `reindexed`.
