@@ -34,19 +34,6 @@ std::string MemberText(const Json::Value& value) {
   return value.isString() ? value.asString() : JsonToString(value);
 }
 
-void LogCompoundFailure(const char* file, int line, const char* func, const Json::Value& sub_req,
-                        int code, const std::string& msg) {
-  const std::string sub_text = JsonToString(sub_req);
-  if (errno != 0) {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) Compound failed: %s (%d) %s [err: %m]", SourceName(file),
-        line, getpid(), geteuid(), func, sub_text.c_str(), code, msg.c_str());
-    errno = 0;
-  } else {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) Compound failed: %s (%d) %s", SourceName(file), line,
-        getpid(), geteuid(), func, sub_text.c_str(), code, msg.c_str());
-  }
-}
-
 // The request as the wire carries it: the compact text, which keeps every byte of a string
 // (control characters escaped, other bytes as they are), so paths that are not valid UTF-8
 // survive.
@@ -77,8 +64,7 @@ void SendRequestImpl(Json::Value& res_out, const Json::Value& req) {
   // connect below fails and says so.
   for (int failures = 1; access(sock_path.c_str(), F_OK) != 0; ++failures) {
     if (failures > kSocketWaitRetries) break;
-    Log(LOG_ERR, "%s:%d elastic socket is not ready, retry ... %d", SourceName(__FILE__), __LINE__,
-        failures);
+    ORVANE_LOG(LOG_ERR, "elastic socket is not ready, retry ... %d", failures);
     env->SleepMicros(kSecond);
   }
   errno = saved_errno;
@@ -117,8 +103,9 @@ void SendRequestImpl(Json::Value& res_out, const Json::Value& req) {
       // A busy daemon dropped the request: the whole of it has to be sent again.
       if (IsBusy(code)) throw Error(static_cast<ErrorCode>(code), msg);
       const Json::Value& subs = req["compound"];
-      LogCompoundFailure(__FILE__, __LINE__, __func__,
-                         subs.isArray() ? subs[i] : Json::Value::nullSingleton(), code, msg);
+      const std::string sub_text =
+          JsonToString(subs.isArray() ? subs[i] : Json::Value::nullSingleton());
+      ORVANE_LOG_FAILED("Compound failed: %s (%d) %s", sub_text.c_str(), code, msg.c_str());
     }
   }
   res_out.swap(res);
@@ -137,8 +124,8 @@ void SendRequest(Json::Value& res, const Json::Value& req) {
       return;
     } catch (const Error& e) {
       if (IsNotReady(e.code)) {
-        Log(LOG_ERR, "%s:%d DB is not good yet, retry... (Error Code: %d)", SourceName(__FILE__),
-            __LINE__, static_cast<int>(e.code));
+        ORVANE_LOG(LOG_ERR, "DB is not good yet, retry... (Error Code: %d)",
+                   static_cast<int>(e.code));
         env->SleepMicros(kNotReadySleep);
         continue;
       }
@@ -147,8 +134,8 @@ void SendRequest(Json::Value& res, const Json::Value& req) {
       const std::string command = request.isObject() ? MemberText(request["command"]) : "";
       const std::string db =
           request.isObject() && request["data"].isObject() ? MemberText(request["data"]["id"]) : "";
-      Log(LOG_ERR, "%s:%d Retry[%u] since quixelasticd is busy. Command: %s, db: %s",
-          SourceName(__FILE__), __LINE__, busy_retries, command.c_str(), db.c_str());
+      ORVANE_LOG(LOG_ERR, "Retry[%u] since quixelasticd is busy. Command: %s, db: %s", busy_retries,
+                 command.c_str(), db.c_str());
       if (busy_retries + 1 > kBusyRetriesBeforeNotify && !notified) {
         NotifyLackOfMemory();
         notified = true;

@@ -49,8 +49,7 @@ void ParseFile(const std::string& path, const Json::Value& config, Json::Value& 
         if (!out.isMember(key)) out[key] = fields[key];
       }
     } else {
-      orvane::Log(LOG_WARNING, "%s:%d content of %s not extracted: %s",
-                  orvane::SourceName(__FILE__), __LINE__, path.c_str(), error.c_str());
+      ORVANE_LOG(LOG_WARNING, "content of %s not extracted: %s", path.c_str(), error.c_str());
     }
   }
   doc.swap(out);

@@ -67,7 +67,7 @@ void SendCommandToDaemon(const std::string& cmd, const Json::Value& data) {
       Env::Current()->SleepMicros(kConnectRetrySleep);
     }
   } else {
-    Log(LOG_ERR, "%s:%d socket path too long: %s", SourceName(__FILE__), __LINE__, path.c_str());
+    ORVANE_LOG(LOG_ERR, "socket path too long: %s", path.c_str());
   }
 
   struct timeval tv = {wire::kDaemonSendTimeoutSec, 0};

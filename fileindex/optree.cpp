@@ -227,7 +227,7 @@ void OPTree::BuildTree() {
 
 void OPTree::InsertLine(const std::string& line) {
   if (GetLogLevel() == LOG_DEBUG) {
-    Log(LOG_ERR, "%s:%d Got event: %s", SourceName(__FILE__), __LINE__, line.c_str());
+    ORVANE_LOG(LOG_ERR, "Got event: %s", line.c_str());
   }
   if (line.size() > kMaxEventLineLength) {
     // The reader keeps one byte past the limit, so the line's real length is not known here.
@@ -245,22 +245,13 @@ void OPTree::InsertLine(const std::string& line) {
 
 void OPTree::LogInsertFailure(const std::string& line, int code, const char* reason) {
   // Named after the reading loop: that is where an administrator looks for skipped lines.
-  if (errno != 0) {
-    Log(LOG_ERR,
-        "%s:%d (%d, %u) (%s) InsertEvent failed, event_raw=%s, code=%d, reason=%s [err: %m]",
-        SourceName(__FILE__), __LINE__, getpid(), geteuid(), "BuildTree", line.c_str(), code,
-        reason);
-    errno = 0;
-  } else {
-    Log(LOG_ERR, "%s:%d (%d, %u) (%s) InsertEvent failed, event_raw=%s, code=%d, reason=%s",
-        SourceName(__FILE__), __LINE__, getpid(), geteuid(), "BuildTree", line.c_str(), code,
-        reason);
-  }
+  ORVANE_LOG_FAILED_IN("BuildTree", "InsertEvent failed, event_raw=%s, code=%d, reason=%s",
+                       line.c_str(), code, reason);
 }
 
 size_t OPTree::ProcessOP(std::function<void(std::shared_ptr<OP>)> callback) {
   if (crashed) {
-    Log(LOG_ERR, "%s:%d Queue crashed: %s", SourceName(__FILE__), __LINE__, path.c_str());
+    ORVANE_LOG(LOG_ERR, "Queue crashed: %s", path.c_str());
     callback(std::make_shared<OP>(root, kOPCrash, "", Json::Value()));
     return 1;
   }

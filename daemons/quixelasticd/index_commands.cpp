@@ -71,8 +71,7 @@ Json::Value Engine::IndexCreate(const Json::Value& data) {
       WriteTxn txn(*e->store);
       e->store->SetMeta("id", id);
       txn.Commit();
-      Log(LOG_INFO, "%s:%d index %s adopts the store in %s", SourceName(__FILE__), __LINE__,
-          id.c_str(), path.c_str());
+      ORVANE_LOG(LOG_INFO, "index %s adopts the store in %s", id.c_str(), path.c_str());
     } else {
       e->store = IndexStore::Create(path, id, mappings, data["settings"], data["event_handler"]);
     }
@@ -123,7 +122,7 @@ Json::Value Engine::IndexDelete(const Json::Value& data) {
     RemoveStoreDir(e->path);
   } catch (const StoreError& err) {
     // The index is forgotten either way; what stands in its folder's place is not touched.
-    Log(LOG_ERR, "%s:%d %s", SourceName(__FILE__), __LINE__, err.what());
+    ORVANE_LOG(LOG_ERR, "%s", err.what());
   }
   Json::Value result;
   result["deleted"] = true;

@@ -147,8 +147,8 @@ void ToOptions(const Flags& flags, orvane::elasticd::EngineOptions* engine_optio
     server_options->service_uid = pw->pw_uid;
     server_options->service_gid = pw->pw_gid;
   } else {
-    Log(LOG_WARNING, "%s:%d service account %s not found: only root may change indexes",
-        SourceName(__FILE__), __LINE__, flags.service_user.c_str());
+    ORVANE_LOG(LOG_WARNING, "service account %s not found: only root may change indexes",
+               flags.service_user.c_str());
   }
 }
 
@@ -164,15 +164,14 @@ int Serve(const Flags& flags, orvane::platform::DaemonSignals* signals) {
     engine.Start();
     server.Start();
   } catch (const std::exception& e) {
-    Log(LOG_ERR, "%s:%d cannot start: %s", SourceName(__FILE__), __LINE__, e.what());
+    ORVANE_LOG(LOG_ERR, "cannot start: %s", e.what());
     status = 1;
   }
   if (status == 0) {
-    Log(LOG_INFO, "%s:%d started, pid %d", SourceName(__FILE__), __LINE__,
-        static_cast<int>(::getpid()));
+    ORVANE_LOG(LOG_INFO, "started, pid %d", static_cast<int>(::getpid()));
     orvane::platform::NotifyReady();
     const int sig = signals->Wait();
-    Log(LOG_INFO, "%s:%d stopping on signal %d", SourceName(__FILE__), __LINE__, sig);
+    ORVANE_LOG(LOG_INFO, "stopping on signal %d", sig);
   }
   // Connections in flight finish first; then every index is synced and closed.
   server.Stop();
@@ -196,9 +195,9 @@ int main(int argc, char** argv) {
     const orvane::platform::PidFile pid_file(orvane::RootedPathForWrite(flags.pid_file));
     status = Serve(flags, &signals);
   } catch (const orvane::Error& e) {
-    Log(LOG_ERR, "%s:%d %s", SourceName(__FILE__), __LINE__, e.what());
+    ORVANE_LOG(LOG_ERR, "%s", e.what());
     return 1;
   }
-  Log(LOG_INFO, "%s:%d stopped", SourceName(__FILE__), __LINE__);
+  ORVANE_LOG(LOG_INFO, "stopped");
   return status;
 }

@@ -36,8 +36,7 @@ const char* StateText(int code) {
 void Engine::Start() {
   const bool after_crash = IsFileExist(options_.running_marker);
   if (after_crash) {
-    Log(LOG_WARNING, "%s:%d the last run did not stop cleanly; checking every index",
-        SourceName(__FILE__), __LINE__);
+    ORVANE_LOG(LOG_WARNING, "the last run did not stop cleanly; checking every index");
   }
   MakeParentDirs(options_.running_marker);
   std::ofstream(options_.running_marker).put('\n');
@@ -45,8 +44,8 @@ void Engine::Start() {
     std::lock_guard<std::mutex> lock(registry_mu_);
     JsonValue reg;
     if (IsFileExist(options_.registry_file) && !reg.fromFile(options_.registry_file)) {
-      Log(LOG_ERR, "%s:%d registry %s is unreadable; starting without indexes",
-          SourceName(__FILE__), __LINE__, options_.registry_file.c_str());
+      ORVANE_LOG(LOG_ERR, "registry %s is unreadable; starting without indexes",
+                 options_.registry_file.c_str());
     }
     for (const Json::Value& item : reg["indexes"]) {
       if (!item["id"].isString() || !item["path"].isString()) continue;
@@ -112,8 +111,8 @@ void Engine::OpenAll(bool after_crash) {
       Refuse(*e, failure);
     } else {
       e->state = State::kDamaged;
-      Log(LOG_ERR, "%s:%d index %s cannot be opened (%s); it needs a rebuild",
-          SourceName(__FILE__), __LINE__, e->id.c_str(), failure.c_str());
+      ORVANE_LOG(LOG_ERR, "index %s cannot be opened (%s); it needs a rebuild", e->id.c_str(),
+                 failure.c_str());
     }
   }
   std::lock_guard<std::mutex> lock(opened_mu_);
@@ -139,8 +138,7 @@ void Engine::Shutdown() {
       e->store->Sync();
     } catch (const StoreError& err) {
       clean = false;
-      Log(LOG_ERR, "%s:%d index %s could not be synced: %s", SourceName(__FILE__), __LINE__,
-          id.c_str(), err.what());
+      ORVANE_LOG(LOG_ERR, "index %s could not be synced: %s", id.c_str(), err.what());
     }
     e->store.reset();
     e->state = State::kOpening;
@@ -187,10 +185,12 @@ void Engine::SetAside(Entry& e, const std::string& why) {
       if (folder.valid() && folder.Exists(name)) folder.Rename(name, name + stamp);
     }
   } catch (const StoreError& err) {
-    Log(LOG_ERR, "%s:%d %s", SourceName(__FILE__), __LINE__, err.what());
+    ORVANE_LOG(LOG_ERR, "%s", err.what());
   }
-  Log(LOG_ERR, "%s:%d index %s in %s is damaged (%s); its files are set aside and it needs a "
-      "rebuild", SourceName(__FILE__), __LINE__, e.id.c_str(), e.path.c_str(), why.c_str());
+  ORVANE_LOG(LOG_ERR,
+             "index %s in %s is damaged (%s); its files are set aside and it needs a "
+             "rebuild",
+             e.id.c_str(), e.path.c_str(), why.c_str());
   Publish(e);
 }
 
@@ -198,7 +198,7 @@ void Engine::HandleStoreFailure(Entry& e, const StoreError& err) {
   if (err.IsCorruption()) {
     SetAside(e, err.what());
   } else {
-    Log(LOG_ERR, "%s:%d index %s: %s", SourceName(__FILE__), __LINE__, e.id.c_str(), err.what());
+    ORVANE_LOG(LOG_ERR, "index %s: %s", e.id.c_str(), err.what());
   }
 }
 

@@ -63,8 +63,7 @@ void Server::Start() {
   if (!options_.public_socket_path.empty()) public_fd_ = Listen(options_.public_socket_path, 0666);
   started_ = true;
   acceptor_ = std::thread([this] { AcceptLoop(); });
-  Log(LOG_INFO, "%s:%d listening on %s", SourceName(__FILE__), __LINE__,
-      options_.socket_path.c_str());
+  ORVANE_LOG(LOG_INFO, "listening on %s", options_.socket_path.c_str());
 }
 
 namespace {
@@ -116,7 +115,7 @@ void Server::AcceptLoop() {
     const int rc = ::poll(fds, 3, -1);
     if (rc < 0) {
       if (errno == EINTR) continue;
-      Log(LOG_ERR, "%s:%d poll failed [err: %m]", SourceName(__FILE__), __LINE__);
+      ORVANE_LOG(LOG_ERR, "poll failed [err: %m]");
       return;
     }
     if (fds[0].revents != 0) return;
@@ -125,7 +124,7 @@ void Server::AcceptLoop() {
       UniqueFd fd(::accept4(fds[i].fd, nullptr, nullptr, SOCK_CLOEXEC));
       if (!fd.valid()) {
         if (errno != EINTR && errno != EAGAIN) {
-          Log(LOG_ERR, "%s:%d accept failed [err: %m]", SourceName(__FILE__), __LINE__);
+          ORVANE_LOG(LOG_ERR, "accept failed [err: %m]");
           // Out of descriptors: give connections in flight a moment to close some.
           if (errno == EMFILE || errno == ENFILE) Env::Current()->SleepMicros(10000);
         }
@@ -157,9 +156,8 @@ void Server::AcceptLoop() {
         // Counted, not logged one by one: a flood must not flood the log too.
         ++refused;
         if ((refused & (refused - 1)) == 0) {
-          Log(LOG_WARNING, "%s:%d search socket: %llu connections refused so far, the last: %s",
-              SourceName(__FILE__), __LINE__, static_cast<unsigned long long>(refused),
-              why.c_str());
+          ORVANE_LOG(LOG_WARNING, "search socket: %llu connections refused so far, the last: %s",
+                     static_cast<unsigned long long>(refused), why.c_str());
         }
         continue;
       }
@@ -258,15 +256,15 @@ void Server::Serve(int fd, bool public_socket) {
   } catch (const std::bad_alloc&) {
     result = Engine::ErrorReply(kCodeOutOfMemory, "out of memory");
   } catch (const std::exception& e) {
-    Log(LOG_ERR, "%s:%d request failed: %s", SourceName(__FILE__), __LINE__, e.what());
+    ORVANE_LOG(LOG_ERR, "request failed: %s", e.what());
     result = Engine::ErrorReply(kCodeStorage, e.what());
   }
   payload.clear();
   payload.shrink_to_fit();
   engine_.ReleaseFrame(length);
   if (!result["success"].asBool() && result["error"]["code"].asInt() == kCodeCallerGone) {
-    Log(LOG_INFO, "%s:%d search of uid %u stopped: its client hung up", SourceName(__FILE__),
-        __LINE__, static_cast<unsigned>(uid));
+    ORVANE_LOG(LOG_INFO, "search of uid %u stopped: its client hung up",
+               static_cast<unsigned>(uid));
     return;
   }
   reply(result);

@@ -33,8 +33,7 @@ void MoveStoreFiles(const std::string& from_dir, const std::string& to_dir) {
     if (!from.Exists(name)) continue;
     if (from.RenameTo(name, to, name) == 0) continue;
     if (errno != EXDEV) {
-      Log(LOG_ERR, "%s:%d rename %s to %s failed [err: %m]", SourceName(__FILE__), __LINE__,
-          from_file.c_str(), to_file.c_str());
+      ORVANE_LOG(LOG_ERR, "rename %s to %s failed [err: %m]", from_file.c_str(), to_file.c_str());
       throw EngineError(kCodeStorage, "cannot move " + from_file);
     }
     UniqueFd in;

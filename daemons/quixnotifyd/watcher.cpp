@@ -133,8 +133,8 @@ void Watcher::Reload() {
     }
   }
   for (size_t i = 0; i < targets_.size(); ++i) WatchTree(targets_[i].root, {i}, true);
-  Log(LOG_INFO, "%s:%d watching %zu folders of %zu registrations in %zu directories",
-      SourceName(__FILE__), __LINE__, targets_.size(), records.size(), dirs_.size());
+  ORVANE_LOG(LOG_INFO, "watching %zu folders of %zu registrations in %zu directories",
+             targets_.size(), records.size(), dirs_.size());
   for (const auto& entry : former) {
     if (dirs_.count(entry.first) == 0) inotify_rm_watch(fd_.get(), entry.first);
   }
@@ -160,8 +160,7 @@ void Watcher::ClearStaleFlags() {
       }
     }
   } catch (const Error& e) {
-    Log(LOG_ERR, "%s:%d cannot clear the flags of a former run in the status file: %s",
-        SourceName(__FILE__), __LINE__, e.what());
+    ORVANE_LOG(LOG_ERR, "cannot clear the flags of a former run in the status file: %s", e.what());
   }
 }
 
@@ -179,8 +178,7 @@ void Watcher::WatchTree(const std::string& root, const std::vector<size_t>& targ
     } else if (wd < 0) {
       // A folder that vanished meanwhile is reported by its parent.
       if (errno != ENOENT && errno != ENOTDIR) {
-        Log(LOG_ERR, "%s:%d cannot watch %s [err: %m]", SourceName(__FILE__), __LINE__,
-            path.c_str());
+        ORVANE_LOG(LOG_ERR, "cannot watch %s [err: %m]", path.c_str());
       }
       errno = 0;
       continue;
@@ -263,8 +261,8 @@ void Watcher::FlagShare(const std::string& path, int bits, bool set) {
       status.UnsetShareStatus(share, bits);
     }
   } catch (const Error& e) {
-    Log(LOG_ERR, "%s:%d cannot record the state of share %s in the status file: %s",
-        SourceName(__FILE__), __LINE__, share.c_str(), e.what());
+    ORVANE_LOG(LOG_ERR, "cannot record the state of share %s in the status file: %s", share.c_str(),
+               e.what());
   }
 }
 
@@ -288,8 +286,8 @@ void Watcher::UpdateLimitMarks() {
     it = limited_.erase(it);
   }
   for (const std::string& root : unmarked) {
-    Log(LOG_INFO, "%s:%d %s is no longer short of watches: its periodic reconciliation ends",
-        SourceName(__FILE__), __LINE__, root.c_str());
+    ORVANE_LOG(LOG_INFO, "%s is no longer short of watches: its periodic reconciliation ends",
+               root.c_str());
     const std::string share = ShareOf(root);
     // The share keeps its mark while another of its folders is still short of watches.
     if (std::none_of(limited_.begin(), limited_.end(),
@@ -302,12 +300,12 @@ void Watcher::UpdateLimitMarks() {
   const WatchLimit limit = CurrentWatchLimit();
   const long long needed = limit.value > 0 ? limit.value + static_cast<long long>(missing) : -1;
   for (const std::string& root : marked) {
-    Log(LOG_ERR,
-        "%s:%d %zu directories below %s are not watched: the inotify watch limit is reached. "
-        "Raise %s (now %lld) to at least %lld, e.g. in /etc/sysctl.d/ and with sysctl -w; "
-        "until then the folder is reconciled every %lld s",
-        SourceName(__FILE__), __LINE__, unwatched_[root], root.c_str(), limit.setting, limit.value,
-        needed, static_cast<long long>(options_.limit_retry_micros / 1000000));
+    ORVANE_LOG(LOG_ERR,
+               "%zu directories below %s are not watched: the inotify watch limit is reached. "
+               "Raise %s (now %lld) to at least %lld, e.g. in /etc/sysctl.d/ and with sysctl -w; "
+               "until then the folder is reconciled every %lld s",
+               unwatched_[root], root.c_str(), limit.setting, limit.value, needed,
+               static_cast<long long>(options_.limit_retry_micros / 1000000));
     FlagShare(root, fileindex::kShareStatusWatchLimit, true);
   }
   // One notification for the folders found short together, not one per folder.
@@ -358,10 +356,10 @@ void Watcher::Emit(const std::vector<size_t>& targets, uint32_t bits, const std:
     pending += JsonToString(line) + "\n";
     if (pending.size() > options_.max_pending_bytes) {
       pending = ReconcileLines(target.queue);
-      Log(LOG_ERR,
-          "%s:%d queue %s cannot be written: too many changes held, dropped for a "
-          "reconciliation of its folders",
-          SourceName(__FILE__), __LINE__, target.queue.c_str());
+      ORVANE_LOG(LOG_ERR,
+                 "queue %s cannot be written: too many changes held, dropped for a "
+                 "reconciliation of its folders",
+                 target.queue.c_str());
     }
   }
 }
@@ -369,8 +367,7 @@ void Watcher::Emit(const std::vector<size_t>& targets, uint32_t bits, const std:
 void Watcher::Handle(const struct inotify_event& event) {
   if (event.mask & IN_Q_OVERFLOW) {
     // Changes were lost and nothing says where: every folder is compared with its index.
-    Log(LOG_WARNING, "%s:%d the kernel's event queue overflowed: every folder is reconciled",
-        SourceName(__FILE__), __LINE__);
+    ORVANE_LOG(LOG_WARNING, "the kernel's event queue overflowed: every folder is reconciled");
     ReconcileAll();
     return;
   }
@@ -467,13 +464,13 @@ void Watcher::Flush() {
     } catch (const Error& e) {
       // A planted entry where the queue belongs: the refusal is logged where it is found, once.
       refused = e.code == kErrUnsafePath;
-      if (!refused) Log(LOG_ERR, "%s:%d %s", SourceName(__FILE__), __LINE__, e.what());
+      if (!refused) ORVANE_LOG(LOG_ERR, "%s", e.what());
       errno = 0;
     }
     if (appended) {
       if (no_space_.erase(queue) != 0) {
-        Log(LOG_INFO, "%s:%d queue %s can be written again: its folders are reconciled",
-            SourceName(__FILE__), __LINE__, queue.c_str());
+        ORVANE_LOG(LOG_INFO, "queue %s can be written again: its folders are reconciled",
+                   queue.c_str());
         FlagShare(queue, fileindex::kShareStatusQueueNoSpace, false);
       }
       it = pending_.erase(it);
@@ -483,18 +480,18 @@ void Watcher::Flush() {
       // However long the volume stays full, one reconciliation written once there is room finds
       // every change again; holding the lines meanwhile would only fill memory.
       if (no_space_.insert(queue).second) {
-        Log(LOG_ERR,
-            "%s:%d cannot append to queue %s [err: %m]: its changes are no longer queued and "
+        ORVANE_LOG(
+            LOG_ERR,
+            "cannot append to queue %s [err: %m]: its changes are no longer queued and "
             "its folders will be reconciled once it can be written; free space on its volume",
-            SourceName(__FILE__), __LINE__, queue.c_str());
+            queue.c_str());
         FlagShare(queue, fileindex::kShareStatusQueueNoSpace, true);
         fileindex::SendZRMNotify();
       }
       it->second = ReconcileLines(queue);
     } else if (!refused) {
       // Kept and tried again on the next pass; Emit() bounds what is kept.
-      Log(LOG_ERR, "%s:%d cannot append to queue %s [err: %m]", SourceName(__FILE__), __LINE__,
-          queue.c_str());
+      ORVANE_LOG(LOG_ERR, "cannot append to queue %s [err: %m]", queue.c_str());
     }
     errno = 0;
     ++it;
@@ -531,7 +528,7 @@ bool Watcher::RunOnce(int timeout_ms) {
 void Watcher::Run(const std::atomic<bool>& stop, int tick_ms) {
   while (!stop.load()) {
     if (!RunOnce(tick_ms)) {
-      Log(LOG_ERR, "%s:%d inotify failed [err: %m]", SourceName(__FILE__), __LINE__);
+      ORVANE_LOG(LOG_ERR, "inotify failed [err: %m]");
       return;
     }
   }
