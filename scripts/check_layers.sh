@@ -6,7 +6,7 @@
 #   2 platform  platform/; test/faults, the table behind its fault seam
 #   3 common    the rest of common/, and common/sdk/
 #   4 index     fileindex/, extract/; test/admin_env, the administration tests' scratch system
-#   5 programs  daemons/, tools/, bench/; test/daemon_system, e2e_fixture and engine_client
+#   5 programs  daemons/, tools/, bench/; test/daemon_system and engine_client
 # A file's tests and fuzz harness belong to its layer.
 #
 #   bash scripts/check_layers.sh [SOURCE_DIR [LAYER [STAMP]]]
@@ -26,7 +26,7 @@ awk -v only="${2:-}" '
   function layer(path, base) {
     if (path ~ /^test\/faults[._]/) return 2
     if (path ~ /^test\/admin_env[._]/) return 4
-    if (path ~ /^test\/(daemon_system|e2e_fixture|engine_client)[._]/) return 5
+    if (path ~ /^test\/(daemon_system|engine_client)[._]/) return 5
     if (path ~ /^test\//) return 1
     if (path ~ /^common\/wire(\/|[._])/) return 1
     if (path ~ /^common\/[^\/]+$/) {

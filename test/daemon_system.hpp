@@ -1,11 +1,13 @@
 // A scratch system for the tests and benchmarks of the indexing daemon: its own ORVANE_ROOT, a
 // volume folder with shares, the platform and folder files, and the daemons as real child
-// processes. Not thread-safe.
+// processes, and the fixture that runs all three. Not thread-safe.
 #ifndef ORVANE_TEST_DAEMON_SYSTEM_HPP_
 #define ORVANE_TEST_DAEMON_SYSTEM_HPP_
 
+#include <gtest/gtest.h>
 #include <json/json.h>
 
+#include <cstdlib>
 #include <initializer_list>
 #include <memory>
 #include <set>
@@ -60,6 +62,27 @@ class System {
 Json::Value Command(const std::string& type, const Json::Value& data);
 // Raw bytes to the daemon's socket; the raw reply payload.
 std::string RawCommand(const std::string& bytes);
+
+// A scratch System on the given shares with no folders yet, and the engine, the file-change
+// daemon and the indexer started as real processes before each test; they are killed when the
+// fixture goes.
+class RunningSystemTest : public ::testing::Test {
+ protected:
+  explicit RunningSystemTest(const std::vector<std::string>& shares) : sys_(shares) {}
+
+  void SetUp() override {
+    setenv("FILEINDEX_EXTRACT_HELPER", EXTRACT_HELPER_BIN, 1);
+    sys_.WriteFolders(Json::Value(Json::arrayValue));
+    engine_ = sys_.StartEngine();
+    notifyd_ = sys_.StartNotifyd();
+    indexd_ = sys_.StartIndexd();
+  }
+
+  System sys_;
+  std::unique_ptr<ChildProcess> engine_;
+  std::unique_ptr<ChildProcess> notifyd_;
+  std::unique_ptr<ChildProcess> indexd_;
+};
 
 }  // namespace test
 }  // namespace fileindexd

@@ -1,15 +1,11 @@
 #include "test/engine_client.hpp"
 
-#include <fcntl.h>
 #include <grp.h>
-#include <signal.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstring>
-#include <thread>
 
 #include <gtest/gtest.h>
 
@@ -75,26 +71,13 @@ Json::Value RequestAs(const std::string& socket, const Json::Value& request, uid
 }
 
 DaemonProcess::DaemonProcess(const std::string& root, std::vector<std::string> extra_args)
-    : root_(root) {
-  pid_ = ::fork();
-  if (pid_ == 0) {
-    ::setenv("ORVANE_ROOT", root.c_str(), 1);
-    std::vector<std::string> args = {QUIXELASTICD_BINARY, "--foreground", "--service-user",
-                                     "nobody-such-account"};
-    args.insert(args.end(), extra_args.begin(), extra_args.end());
-    std::vector<char*> argv;
-    for (std::string& a : args) argv.push_back(&a[0]);
-    argv.push_back(nullptr);
-    // The daemon's stderr log would drown the test output; syslog still has it.
-    const int null = ::open("/dev/null", O_WRONLY);
-    if (null >= 0) ::dup2(null, 2);
-    ::execv(argv[0], argv.data());
-    _exit(127);
-  }
-}
+    : root_(root), process_(root, Argv(std::move(extra_args))) {}
 
-DaemonProcess::~DaemonProcess() {
-  if (pid_ > 0) Signal(SIGKILL);
+std::vector<std::string> DaemonProcess::Argv(std::vector<std::string> extra_args) {
+  std::vector<std::string> args = {QUIXELASTICD_BINARY, "--foreground", "--service-user",
+                                   "nobody-such-account"};
+  args.insert(args.end(), extra_args.begin(), extra_args.end());
+  return args;
 }
 
 bool DaemonProcess::WaitReady() {
@@ -102,23 +85,6 @@ bool DaemonProcess::WaitReady() {
     const Json::Value r = Request(socket(), Cmd("index_list", Json::Value(Json::objectValue)));
     return r.isObject() && r["success"].asBool();
   });
-}
-
-int DaemonProcess::Signal(int sig) {
-  if (pid_ <= 0) return -1;
-  ::kill(pid_, sig);
-  int status = 0;
-  ::waitpid(pid_, &status, 0);
-  pid_ = -1;
-  return status;
-}
-
-bool Eventually(const std::function<bool()>& pred) {
-  for (int i = 0; i < 400; ++i) {
-    if (pred()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(25));
-  }
-  return pred();
 }
 
 Json::Value Cmd(const std::string& command, const Json::Value& data) {

@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "common/wire.hpp"
+#include "test/test_util.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -27,29 +28,31 @@ Json::Value Request(const std::string& socket, const Json::Value& request);
 Json::Value RequestAs(const std::string& socket, const Json::Value& request, uid_t uid, gid_t gid);
 std::string Frame(const std::string& payload);
 
-// The daemon binary run in the foreground under a scratch ORVANE_ROOT.
+// The daemon binary run in the foreground under a scratch ORVANE_ROOT, as a service user that
+// does not exist.
 class DaemonProcess {
  public:
   DaemonProcess(const std::string& root, std::vector<std::string> extra_args = {});
-  ~DaemonProcess();
-  DaemonProcess(const DaemonProcess&) = delete;
-  DaemonProcess& operator=(const DaemonProcess&) = delete;
 
   // Waits until the socket answers; false after ~10 s.
   bool WaitReady();
   // Sends a signal and waits for the exit; returns the wait status.
-  int Signal(int sig);
-  pid_t pid() const { return pid_; }
-  std::string socket() const { return root_ + kElasticdSockPath; }
-  std::string public_socket() const { return root_ + kElasticdSearchSockPath; }
+  int Signal(int sig) { return process_.Signal(sig); }
+  pid_t pid() const { return process_.pid(); }
+  std::string socket() const { return root_ + "/var/run/quixelasticd.sock"; }
+  std::string public_socket() const { return root_ + "/var/run/quixelasticd.search.sock"; }
 
  private:
+  static std::vector<std::string> Argv(std::vector<std::string> extra_args);
+
   std::string root_;
-  pid_t pid_ = -1;
+  orvane::test::ChildProcess process_;
 };
 
-// Polls `pred` every 25 ms for up to ten seconds; its last answer.
-bool Eventually(const std::function<bool()>& pred);
+// Polls `pred` for up to ten seconds; its last answer.
+inline bool Eventually(const std::function<bool()>& pred) {
+  return orvane::test::WaitFor(pred, 10000);
+}
 
 // A request {"command": command, "data": data}.
 Json::Value Cmd(const std::string& command, const Json::Value& data);

@@ -15,7 +15,6 @@
 #include "fileindex/folder_mgr.hpp"
 #include "fileindex/index_mgr.hpp"
 #include "test/daemon_system.hpp"
-#include "test/e2e_fixture.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
