@@ -129,6 +129,7 @@ SearchParams ParseSearch(const Json::Value& d) {
     p.exts = ExtensionsOfKind(type, p.exts);
     p.is_dir = false;
   }
+  if (!d["query"].isNull()) p.query = CompileQueryTree(d["query"]);
   ReadRange(d, "size_range", &p.size_min, &p.size_max);
   ReadRange(d, "mtime_range", &p.mtime_min, &p.mtime_max);
   p.sort = ReadSort(OptionalString(d, "sort"));
@@ -143,7 +144,7 @@ SearchParams ParseSearch(const Json::Value& d) {
   }
   p.size = std::min<int64_t>(OptionalInt(d, "size", 20), 1000);
   if (p.keywords.empty() && p.name.empty() && p.folder.empty() && p.exts.empty() && !p.is_dir &&
-      !p.size_min && !p.size_max && !p.mtime_min && !p.mtime_max) {
+      !p.size_min && !p.size_max && !p.mtime_min && !p.mtime_max && !p.query) {
     throw EngineError(kCodeInvalidParam, "a search needs \"keyword\", \"name\" or a filter");
   }
   return p;

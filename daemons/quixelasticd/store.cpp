@@ -617,6 +617,7 @@ struct Arg {
   bool is_text;
   std::string text;
   int64_t number;
+  std::optional<double> real;
 };
 
 // A search as SQL: the joins and conditions its filters need, the order it is read in, and the
@@ -629,8 +630,9 @@ struct SearchSql {
   std::vector<Arg> args;
 
   bool has_keywords() const { return !match.empty(); }
-  void Text(std::string v) { args.push_back({true, std::move(v), 0}); }
-  void Number(int64_t v) { args.push_back({false, std::string(), v}); }
+  void Text(std::string v) { args.push_back({true, std::move(v), 0, std::nullopt}); }
+  void Number(int64_t v) { args.push_back({false, std::string(), v, std::nullopt}); }
+  void Real(double v) { args.push_back({false, std::string(), 0, v}); }
   // Snippets are made for the returned page only, after the rows are chosen: counting and
   // sorting never pay for them.
   std::string Select() const {
@@ -643,6 +645,8 @@ struct SearchSql {
     for (const Arg& a : args) {
       if (a.is_text) {
         st.Bind(i++, a.text);
+      } else if (a.real) {
+        st.Bind(i++, *a.real);
       } else {
         st.Bind(i++, a.number);
       }
@@ -730,6 +734,22 @@ SearchSql SearchSqlOf(const SearchParams& p) {
   bound(p.mtime_min, " AND d.mtime >= ?");
   bound(p.mtime_max, " AND d.mtime <= ?");
   if (p.is_dir) q.where += *p.is_dir ? " AND d.is_dir = 1" : " AND d.is_dir = 0";
+  if (p.query) {
+    q.where += " AND " + p.query->sql;
+    for (const SqlValue& v : p.query->values) {
+      switch (v.kind) {
+        case SqlValue::Kind::kText:
+          q.Text(v.text);
+          break;
+        case SqlValue::Kind::kInt:
+          q.Number(v.integer);
+          break;
+        case SqlValue::Kind::kReal:
+          q.Real(v.real);
+          break;
+      }
+    }
+  }
   q.order = OrderBy(p, q.has_keywords());
   return q;
 }

@@ -20,6 +20,7 @@
 #include <vector>
 
 #include "daemons/quixelasticd/query_guard.hpp"
+#include "daemons/quixelasticd/query_tree.hpp"
 #include "daemons/quixelasticd/schema.hpp"
 #include "daemons/quixelasticd/sqlite_util.hpp"
 #include "platform/safe_dir.hpp"
@@ -46,6 +47,8 @@ struct SearchParams {
   std::optional<bool> is_dir;
   std::optional<int64_t> size_min, size_max, mtime_min, mtime_max;
   std::string folder;
+  // A structured query, ANDed with the members above.
+  std::optional<SqlCondition> query;
   Sort sort = Sort::kRelevance;
   bool desc = false;
   int64_t from = 0;

@@ -1,0 +1,42 @@
+// A structured search query (a tree of and/or/not over name and content patterns, ranges,
+// extension and kind lists, folder scopes), checked and turned into a SQL condition over the
+// store's `docs d` table with every value a bound parameter. Pure functions; thread-safe.
+#ifndef ORVANE_DAEMONS_QUIXELASTICD_QUERY_TREE_HPP_
+#define ORVANE_DAEMONS_QUIXELASTICD_QUERY_TREE_HPP_
+
+#include <json/json.h>
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace orvane {
+namespace elasticd {
+
+// A bound value, in the order of the condition's '?' marks.
+struct SqlValue {
+  enum class Kind { kText, kInt, kReal };
+  Kind kind = Kind::kText;
+  std::string text;
+  int64_t integer = 0;
+  double real = 0;
+};
+
+// A condition that is never NULL (so NOT inverts it exactly) and its bound values.
+struct SqlCondition {
+  std::string sql;
+  std::vector<SqlValue> values;
+};
+
+// Limits of a tree: deeper or larger ones are refused before anything runs.
+constexpr int kMaxQueryDepth = 32;
+constexpr int kMaxQueryNodes = 256;
+
+// Reads a query tree; throws EngineError(kCodeInvalidParam) with a message naming the fault
+// (unknown operator or field, a value of the wrong type, too deep, too many nodes).
+SqlCondition CompileQueryTree(const Json::Value& tree);
+
+}  // namespace elasticd
+}  // namespace orvane
+
+#endif  // ORVANE_DAEMONS_QUIXELASTICD_QUERY_TREE_HPP_
