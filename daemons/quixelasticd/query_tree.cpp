@@ -69,8 +69,9 @@ class Compiler {
   SqlCondition Run(const Json::Value& tree) {
     if (!tree.isObject()) Refuse("must be an object");
     SqlCondition c;
-    c.sql = Node(tree, 1);
+    c.sql = Node(tree, 1, true);
     c.values = std::move(values_);
+    c.join = join_;
     return c;
   }
 
@@ -105,7 +106,8 @@ class Compiler {
     return op;
   }
 
-  std::string Node(const Json::Value& q, int depth) {
+  // `required`: every hit must match this node (the root, and the nodes of an "and" that is).
+  std::string Node(const Json::Value& q, int depth, bool required) {
     if (!q.isObject()) Refuse("a node must be an object, not " + JsonToString(q));
     if (depth > kMaxQueryDepth) {
       Refuse("deeper than " + std::to_string(kMaxQueryDepth) + " levels");
@@ -120,12 +122,12 @@ class Compiler {
       std::string sql = "(";
       for (Json::ArrayIndex i = 0; i < arg.size(); ++i) {
         if (i > 0) sql += op == "and" ? " AND " : " OR ";
-        sql += Node(arg[i], depth + 1);
+        sql += Node(arg[i], depth + 1, required && op == "and");
       }
       return sql + ")";
     }
-    if (op == "not") return "(NOT " + Node(arg, depth + 1) + ")";
-    if (op == "match") return Match(q);
+    if (op == "not") return "(NOT " + Node(arg, depth + 1, false) + ")";
+    if (op == "match") return Match(q, required);
     if (op == "range") return Range(q);
     if (op == "in") return In(q);
     if (op == "under") return Under(arg);
@@ -133,7 +135,7 @@ class Compiler {
     return "1";
   }
 
-  std::string Match(const Json::Value& q) {
+  std::string Match(const Json::Value& q, bool required) {
     const std::string field = q["match"].isString() ? q["match"].asString() : "";
     if (field != "name" && field != "content" && field != "any") {
       Refuse("unknown \"match\" field " + JsonToString(q["match"]) + " (name, content or any)");
@@ -143,18 +145,22 @@ class Compiler {
       Refuse("\"pattern\" of a match must be a non-empty string");
     }
     if (pattern.asString().find_first_not_of('*') == std::string::npos) return "1";
-    if (field == "name") return NameMatch(pattern.asString());
-    if (field == "content") return ContentCondition(pattern.asString());
+    // A full-text MATCH may not stand under OR or NOT: only a required pattern is joined.
+    const bool joined = required && join_.empty() && field != "any";
+    if (joined) join_ = field == "name" ? "fts_name" : "fts_all";
+    if (field == "name") return NameMatch(pattern.asString(), joined);
+    if (field == "content") return ContentCondition(pattern.asString(), joined);
     // Two statements: the values are bound in the order of the marks.
-    std::string sql = "(" + NameMatch(pattern.asString());
-    sql += " OR " + ContentCondition(pattern.asString());
+    std::string sql = "(" + NameMatch(pattern.asString(), false);
+    sql += " OR " + ContentCondition(pattern.asString(), false);
     return sql + ")";
   }
 
   // Names match as a whole, with '*' standing for any run of characters. The trigram index
   // narrows the rows by every literal run of three characters or more; the LIKE then checks
-  // the runs' order and the name's ends. Without such a run the names are scanned.
-  std::string NameMatch(const std::string& pattern) {
+  // the runs' order and the name's ends. Without such a run the names are scanned. A single
+  // run between two '*' is a substring, which the trigram phrase alone answers exactly.
+  std::string NameMatch(const std::string& pattern, bool joined) {
     const std::string low = EncodeName(AsciiLower(pattern));
     std::string match;
     std::string like;
@@ -172,21 +178,30 @@ class Compiler {
       wild = true;
       i = star + 1;
     }
-    std::string sql = "d.rowid IN (SELECT rowid FROM fts_name WHERE ";
+    const bool substring = low.size() >= 2 && low.front() == '*' && low.back() == '*' &&
+                           low.find('*', 1) == low.size() - 1 && !match.empty();
+    std::string sql;
     if (!match.empty()) {
-      sql += "fts_name MATCH ? AND ";
+      sql += "fts_name MATCH ?";
       Text(match);
     }
-    Text(like);
-    return sql + "name LIKE ? ESCAPE '\\')";
+    if (!substring) {
+      sql += std::string(sql.empty() ? "" : " AND ") + "fts_name.name LIKE ? ESCAPE '\\'";
+      Text(like);
+    }
+    return joined ? "(" + sql + ")" : "d.rowid IN (SELECT rowid FROM fts_name WHERE " + sql + ")";
   }
 
-  std::string ContentCondition(const std::string& pattern) {
+  std::string ContentCondition(const std::string& pattern, bool joined) {
     // The word index holds the written form of names, as the catch-all text does.
     const std::string match = ContentMatch(EncodeName(pattern));
-    if (match.empty()) return "1";
+    if (match.empty()) {
+      if (joined) join_.clear();
+      return "1";
+    }
     Text(match);
-    return "d.rowid IN (SELECT rowid FROM fts_all WHERE fts_all MATCH ?)";
+    return joined ? "fts_all MATCH ?"
+                  : "d.rowid IN (SELECT rowid FROM fts_all WHERE fts_all MATCH ?)";
   }
 
   std::string Range(const Json::Value& q) {
@@ -291,6 +306,7 @@ class Compiler {
 
   int nodes_ = 0;
   std::vector<SqlValue> values_;
+  std::string join_;
 };
 
 }  // namespace

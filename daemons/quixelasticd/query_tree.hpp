@@ -22,10 +22,14 @@ struct SqlValue {
   double real = 0;
 };
 
-// A condition that is never NULL (so NOT inverts it exactly) and its bound values.
+// A condition that is never NULL (so NOT inverts it exactly) and its bound values. One pattern
+// every hit must match is read through `join`, a full-text table ("fts_name" or "fts_all", or
+// none) the statement must join on the document's rowid: the search then runs from that
+// table's matches and stops at its limit, instead of first collecting every match.
 struct SqlCondition {
   std::string sql;
   std::vector<SqlValue> values;
+  std::string join;
 };
 
 // Limits of a tree: deeper or larger ones are refused before anything runs.

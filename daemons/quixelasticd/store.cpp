@@ -735,6 +735,11 @@ SearchSql SearchSqlOf(const SearchParams& p) {
   bound(p.mtime_max, " AND d.mtime <= ?");
   if (p.is_dir) q.where += *p.is_dir ? " AND d.is_dir = 1" : " AND d.is_dir = 0";
   if (p.query) {
+    // The name and keyword filters above join the same tables on the same row.
+    if ((p.query->join == "fts_name" && name.empty()) ||
+        (p.query->join == "fts_all" && !q.has_keywords())) {
+      q.from += " JOIN " + p.query->join + " ON " + p.query->join + ".rowid = d.rowid";
+    }
     q.where += " AND " + p.query->sql;
     for (const SqlValue& v : p.query->values) {
       switch (v.kind) {
