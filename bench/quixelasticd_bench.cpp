@@ -244,7 +244,15 @@ int main(int argc, char** argv) {
   tree_search("content, one word as a prefix (about a tenth of the documents)", [&](uint64_t i) {
     return match("content", std::string(kWords[i % 20]).substr(0, 4) + "*");
   });
-  tree_search("name and folder and size range", [&](uint64_t i) {
+  tree_search("name *substring* under the share's root, as the gateway scopes it", [&](uint64_t i) {
+    const std::string name = NameOf(i);
+    const size_t len = 3 + i % 4;
+    Json::Value tree;
+    tree["and"].append(match("name", "*" + name.substr(i % (name.size() - len), len) + "*"));
+    tree["and"].append(Json::Value(Json::objectValue))["under"] = "/volume1/share";
+    return tree;
+  });
+  tree_search("a common name word in a folder of 1000, size range", [&](uint64_t i) {
     Json::Value tree;
     tree["and"].append(match("name", "*" + std::string(kWords[i % 20]) + "*"));
     tree["and"].append(Json::Value(Json::objectValue))["under"] =
