@@ -1,0 +1,359 @@
+#include "daemons/searchgw/gateway.hpp"
+
+#include <syslog.h>
+
+#include <atomic>
+#include <boost/asio.hpp>
+#include <boost/beast/core.hpp>
+#include <boost/beast/http.hpp>
+#include <algorithm>
+#include <chrono>
+#include <cstring>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "common/error.hpp"
+#include "common/json_util.hpp"
+#include "common/log.hpp"
+#include "common/wire.hpp"
+#include "daemons/searchgw/search_request.hpp"
+#include "platform/daemon_sock.hpp"
+
+namespace orvane {
+namespace searchgw {
+namespace {
+
+namespace asio = boost::asio;
+namespace beast = boost::beast;
+namespace http = beast::http;
+using tcp = asio::ip::tcp;
+using Millis = std::chrono::milliseconds;
+
+// A failure answered with an error body instead of hits.
+struct Failure {
+  http::status status;
+  std::string type;
+  std::string reason;
+};
+
+bool IsPowerOfTwo(uint64_t n) { return n != 0 && (n & (n - 1)) == 0; }
+
+// The text of a query for the log: long ones cut, so a client cannot fill the log.
+std::string ForLog(const std::string& text) {
+  return text.size() <= 300 ? text : text.substr(0, 300) + "...";
+}
+
+}  // namespace
+
+struct Gateway::Impl {
+  explicit Impl(GatewayOptions o) : opt(std::move(o)) {}
+
+  bool Admit(const asio::ip::address& peer);
+  void Release(const asio::ip::address& peer);
+  void Accept();
+  void Refuse(tcp::socket socket, const std::string& why);
+  // The engine's answer to one search; a Failure when there is none to give.
+  std::optional<Failure> Search(const std::vector<std::string>& ids, const SearchRequest& req,
+                                std::string* body);
+
+  GatewayOptions opt;
+  // Declared before the I/O context so that they outlive the connections it destroys.
+  std::mutex mu;
+  std::map<asio::ip::address, int> per_address;
+  int connections = 0;
+  std::atomic<uint64_t> refused{0};
+  uint16_t port = 0;
+
+  asio::io_context ioc;
+  std::optional<tcp::acceptor> acceptor;
+  std::optional<asio::steady_timer> retry;
+  std::vector<std::thread> threads;
+};
+
+namespace {
+
+// One client connection: requests read one after another, each answered before the next is
+// read. Lives as long as an operation of it is pending.
+class Session : public std::enable_shared_from_this<Session> {
+ public:
+  Session(Gateway::Impl* gw, tcp::socket socket, asio::ip::address peer)
+      : gw_(gw), stream_(std::move(socket)), peer_(std::move(peer)) {}
+  ~Session() { gw_->Release(peer_); }
+
+  void WaitForRequest() {
+    parser_.emplace();
+    parser_->header_limit(static_cast<uint32_t>(gw_->opt.max_header_bytes));
+    parser_->body_limit(gw_->opt.max_body_bytes);
+    if (buffer_.size() > 0) return ReadRest();
+    // An idle keep-alive connection may wait long for its next request; once a byte has come,
+    // the whole request must follow within the shorter time, so dripping bytes buys nothing.
+    stream_.expires_after(Millis(gw_->opt.idle_timeout_ms));
+    stream_.async_read_some(buffer_.prepare(1024),
+                            [self = shared_from_this()](beast::error_code ec, size_t n) {
+                              if (ec) return self->Close();
+                              self->buffer_.commit(n);
+                              self->ReadRest();
+                            });
+  }
+
+ private:
+  void ReadRest() {
+    stream_.expires_after(Millis(gw_->opt.request_timeout_ms));
+    http::async_read(stream_, buffer_, *parser_,
+                     [self = shared_from_this()](beast::error_code ec, size_t) {
+                       self->OnRead(ec);
+                     });
+  }
+
+  void OnRead(beast::error_code ec) {
+    if (!ec) return Handle();
+    if (ec.category() != http::make_error_code(http::error::bad_target).category() ||
+        ec == http::error::end_of_stream || ec == http::error::partial_message) {
+      return Close();  // gone, timed out or cut short: nobody to answer
+    }
+    Failure f{http::status::bad_request, "http_parse_exception",
+              "malformed HTTP request: " + ec.message()};
+    if (ec == http::error::header_limit) {
+      f = {http::status::request_header_fields_too_large, "http_parse_exception",
+           "the request's header is longer than " + std::to_string(gw_->opt.max_header_bytes) +
+               " bytes"};
+    } else if (ec == http::error::body_limit) {
+      f = {http::status::payload_too_large, "http_parse_exception",
+           "the request's body is longer than " + std::to_string(gw_->opt.max_body_bytes) +
+               " bytes"};
+    }
+    Log(LOG_WARNING, "%s:%d request from %s refused: %s", SourceName(__FILE__), __LINE__,
+        peer_.to_string().c_str(), f.reason.c_str());
+    Reply(11, f.status, BuildErrorBody(f.type, f.reason, static_cast<int>(f.status)), false);
+  }
+
+  void Handle() {
+    const http::request<http::string_body>& req = parser_->get();
+    std::string target(req.target());
+    target = target.substr(0, target.find('?'));
+    std::string body;
+    std::optional<Failure> failure;
+    const size_t slash = target.find('/', 1);
+    if (target.size() < 2 || target[0] != '/' || slash == std::string::npos ||
+        target.compare(slash, std::string::npos, "/_search") != 0) {
+      failure = Failure{http::status::not_found, "no_handler_found_exception",
+                        "no handler for " + std::string(req.method_string()) + " " + target +
+                            ": the gateway answers POST /INDEX/_search"};
+    } else if (req.method() != http::verb::post && req.method() != http::verb::get) {
+      failure = Failure{http::status::method_not_allowed, "method_not_allowed_exception",
+                        "_search takes POST or GET, not " + std::string(req.method_string())};
+    } else {
+      try {
+        const std::vector<std::string> ids = ReadIndexList(target.substr(1, slash - 1));
+        const SearchRequest search = ReadSearchBody(req.body());
+        failure = gw_->Search(ids, search, &body);
+      } catch (const RequestError& e) {
+        failure = Failure{http::status::bad_request, e.type(), e.what()};
+      }
+    }
+    if (failure) {
+      Log(LOG_WARNING, "%s:%d search from %s refused (%d %s): %s; body: %s",
+          SourceName(__FILE__), __LINE__, peer_.to_string().c_str(),
+          static_cast<int>(failure->status), failure->type.c_str(), failure->reason.c_str(),
+          ForLog(req.body()).c_str());
+      body = BuildErrorBody(failure->type, failure->reason, static_cast<int>(failure->status));
+    }
+    Reply(req.version(), failure ? failure->status : http::status::ok, std::move(body),
+          req.keep_alive());
+  }
+
+  void Reply(unsigned version, http::status status, std::string body, bool keep_alive) {
+    res_ = {};
+    res_.version(version == 11 || version == 10 ? version : 11);
+    res_.result(status);
+    res_.set(http::field::content_type, "application/json; charset=UTF-8");
+    res_.keep_alive(keep_alive);
+    res_.body() = std::move(body);
+    res_.prepare_payload();
+    stream_.expires_after(Millis(gw_->opt.request_timeout_ms));
+    http::async_write(stream_, res_, [self = shared_from_this()](beast::error_code ec, size_t) {
+      if (ec || !self->res_.keep_alive()) return self->Close();
+      self->WaitForRequest();
+    });
+  }
+
+  void Close() {
+    beast::error_code ignored;
+    stream_.socket().shutdown(tcp::socket::shutdown_both, ignored);
+    stream_.close();
+  }
+
+  Gateway::Impl* gw_;
+  beast::tcp_stream stream_;
+  asio::ip::address peer_;
+  beast::flat_buffer buffer_;
+  std::optional<http::request_parser<http::string_body>> parser_;
+  http::response<http::string_body> res_;
+};
+
+}  // namespace
+
+bool Gateway::Impl::Admit(const asio::ip::address& peer) {
+  std::lock_guard<std::mutex> lock(mu);
+  int& mine = per_address[peer];
+  if (connections >= opt.max_connections || mine >= opt.max_connections_per_address) {
+    if (mine == 0) per_address.erase(peer);
+    return false;
+  }
+  ++mine;
+  ++connections;
+  return true;
+}
+
+void Gateway::Impl::Release(const asio::ip::address& peer) {
+  std::lock_guard<std::mutex> lock(mu);
+  --connections;
+  if (--per_address[peer] <= 0) per_address.erase(peer);
+}
+
+void Gateway::Impl::Refuse(tcp::socket socket, const std::string& why) {
+  const uint64_t n = ++refused;
+  if (IsPowerOfTwo(n)) {
+    Log(LOG_WARNING, "%s:%d connection refused: %s (%llu refused so far)", SourceName(__FILE__),
+        __LINE__, why.c_str(), static_cast<unsigned long long>(n));
+  }
+  // One try without waiting: a refused client costs an accept, a write and a close.
+  const std::string body = BuildErrorBody("es_rejected_execution_exception", why, 429);
+  const std::string text = "HTTP/1.1 429 Too Many Requests\r\nContent-Type: application/json\r\n"
+                           "Connection: close\r\nContent-Length: " +
+                           std::to_string(body.size()) + "\r\n\r\n" + body;
+  beast::error_code ignored;
+  socket.non_blocking(true, ignored);
+  socket.write_some(asio::buffer(text), ignored);
+  socket.close(ignored);
+}
+
+void Gateway::Impl::Accept() {
+  acceptor->async_accept(asio::make_strand(ioc), [this](beast::error_code ec, tcp::socket s) {
+    if (ec == asio::error::operation_aborted || !acceptor->is_open()) return;
+    if (ec) {
+      // Out of descriptors, most likely: connections closing will free some.
+      Log(LOG_WARNING, "%s:%d accept failed: %s", SourceName(__FILE__), __LINE__,
+          ec.message().c_str());
+      retry->expires_after(Millis(100));
+      retry->async_wait([this](beast::error_code e) {
+        if (!e) Accept();
+      });
+      return;
+    }
+    beast::error_code peer_ec;
+    const asio::ip::address peer = s.remote_endpoint(peer_ec).address();
+    if (peer_ec) {
+      s.close(peer_ec);
+    } else if (!Admit(peer)) {
+      Refuse(std::move(s), "too many connections (at most " + std::to_string(opt.max_connections) +
+                               ", " + std::to_string(opt.max_connections_per_address) +
+                               " per address): close some and try again");
+    } else {
+      std::make_shared<Session>(this, std::move(s), peer)->WaitForRequest();
+    }
+    Accept();
+  });
+}
+
+std::optional<Failure> Gateway::Impl::Search(const std::vector<std::string>& ids,
+                                             const SearchRequest& req, std::string* body) {
+  Json::Value request(Json::objectValue);
+  request["command"] = "search";
+  Json::Value& data = request["data"];
+  data["query"] = req.query;
+  data["from"] = Json::Int64(req.from);
+  data["size"] = Json::Int64(req.size);
+  if (!ids.empty()) {
+    for (const std::string& id : ids) data["id"].append(id);
+  }
+  const Failure down{http::status::service_unavailable, "unavailable_shards_exception",
+                     "the search engine at " + opt.engine_socket +
+                         " does not answer: is quixelasticd running?"};
+  quixdaemon::DomainSockConnection conn(opt.engine_socket);
+  conn.SetTimeouts(opt.engine_timeout_ms, opt.engine_timeout_ms);
+  std::string text;
+  if (!conn.Connect(opt.engine_timeout_ms) || !conn.Send(JsonToString(request)) ||
+      !conn.Recv(text)) {
+    Log(LOG_ERR, "%s:%d search engine at %s: %s", SourceName(__FILE__), __LINE__,
+        opt.engine_socket.c_str(), std::strerror(errno));
+    return down;
+  }
+  Json::Value reply;
+  std::string errors;
+  Json::CharReaderBuilder builder;
+  const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+  const std::string_view payload = wire::PayloadText(text);
+  if (!reader->parse(payload.data(), payload.data() + payload.size(), &reply, &errors) ||
+      !reply.isObject()) {
+    Log(LOG_ERR, "%s:%d search engine at %s answered something that is not JSON",
+        SourceName(__FILE__), __LINE__, opt.engine_socket.c_str());
+    return down;
+  }
+  if (reply["success"].asBool()) {
+    *body = BuildSearchReply(reply["data"]);
+    return std::nullopt;
+  }
+  const int code = reply["error"]["code"].asInt();
+  const std::string msg = reply["error"]["msg"].asString();
+  switch (code) {
+    case kCodeIndexNotFound:
+      return Failure{http::status::bad_request, "index_not_found_exception", msg};
+    case kCodeMalformed: case kCodeInvalidParam:
+      return Failure{http::status::bad_request, "query_shard_exception", msg};
+    case kCodeOutOfMemory: case kCodeOverloaded:
+      return Failure{http::status::too_many_requests, "es_rejected_execution_exception", msg};
+    default:
+      return Failure{http::status::service_unavailable, "unavailable_shards_exception",
+                     "the search engine answered " + std::to_string(code) + ": " + msg};
+  }
+}
+
+Gateway::Gateway(GatewayOptions options) : impl_(std::make_unique<Impl>(std::move(options))) {}
+
+Gateway::~Gateway() { Stop(); }
+
+void Gateway::Start() {
+  Impl& g = *impl_;
+  beast::error_code ec;
+  const asio::ip::address address = asio::ip::make_address(g.opt.address, ec);
+  ORVANE_THROW_IF(ec, kErrInvalidParam,
+                  "\"" + g.opt.address + "\" is not an IP address: give one such as 127.0.0.1");
+  const tcp::endpoint endpoint(address, g.opt.port);
+  g.acceptor.emplace(g.ioc);
+  g.retry.emplace(g.ioc);
+  const std::string where = g.opt.address + " port " + std::to_string(g.opt.port);
+  g.acceptor->open(endpoint.protocol(), ec);
+  if (!ec) g.acceptor->set_option(asio::socket_base::reuse_address(true), ec);
+  if (!ec) g.acceptor->bind(endpoint, ec);
+  if (!ec) g.acceptor->listen(asio::socket_base::max_listen_connections, ec);
+  ORVANE_THROW_IF(ec, kErrSystem,
+                  "cannot listen on " + where + ": " + ec.message() +
+                      " (another program may hold the port: choose another with --port)");
+  g.port = g.acceptor->local_endpoint().port();
+  g.Accept();
+  for (int i = 0; i < std::max(1, g.opt.threads); ++i) {
+    g.threads.emplace_back([&g] { g.ioc.run(); });
+  }
+}
+
+void Gateway::Stop() {
+  Impl& g = *impl_;
+  if (g.threads.empty()) return;
+  asio::post(g.ioc, [&g] {
+    beast::error_code ignored;
+    g.acceptor->close(ignored);
+  });
+  g.ioc.stop();
+  for (std::thread& t : g.threads) t.join();
+  g.threads.clear();
+}
+
+uint16_t Gateway::port() const { return impl_->port; }
+
+}  // namespace searchgw
+}  // namespace orvane
