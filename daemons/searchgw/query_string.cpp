@@ -19,13 +19,13 @@ struct Token {
   size_t pos = 0;        // offset in the query, for messages
 };
 
-bool IsSpecial(char c, bool in_range) {
+bool IsSpecial(char c, bool in_value) {
   switch (c) {
     case '(': case ')': case '[': case ']': case '{': case '}': case '"':
       return true;
     case ':':
-      // Times in a range ("2024-01-02T10:00:00Z") carry colons; a field name never stands there.
-      return !in_range;
+      // Times ("2024-01-02T10:00:00Z") carry colons; where a value stands, no field name can.
+      return !in_value;
     default:
       return std::isspace(static_cast<unsigned char>(c)) != 0;
   }
@@ -64,16 +64,17 @@ class Tokenizer {
         t.text = Phrase();
       } else {
         t.type = Token::kWord;
-        t.text = Word(&t.escaped);
+        const bool in_value = in_range_ || (!out.empty() && out.back().type == Token::kColon);
+        t.text = Word(in_value, &t.escaped);
       }
       out.push_back(std::move(t));
     }
   }
 
  private:
-  std::string Word(bool* escaped) {
+  std::string Word(bool in_value, bool* escaped) {
     std::string w;
-    while (pos_ < text_.size() && !IsSpecial(text_[pos_], in_range_)) {
+    while (pos_ < text_.size() && !IsSpecial(text_[pos_], in_value)) {
       if (text_[pos_] == '\\') {
         if (pos_ + 1 == text_.size()) {
           throw QuerySyntaxError("the query ends with a lone backslash at position " +

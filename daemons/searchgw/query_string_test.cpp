@@ -5,6 +5,7 @@
 #include "common/json_util.hpp"
 #include "daemons/searchgw/query_string.hpp"
 #include "daemons/searchgw/search_request.hpp"
+#include "test/test_util.hpp"
 
 namespace orvane {
 namespace searchgw {
@@ -44,6 +45,10 @@ TEST(QueryStringTest, QueriesBecomeEngineTrees) {
       {"crtime:{* TO 2024-01-01T00:00:00.250+00:00}", R"({"lt":1704067200,"range":"crtime"})"},
       {"type:kind.photo OR type:ext.pdf",
        R"({"or":[{"in":"kind","values":["photo"]},{"in":"ext","values":["pdf"]}]})"},
+      {"type:(kind.audio ext.flac\\ ext.ogg)",
+       R"({"or":[{"in":"kind","values":["audio"]},{"or":[{"in":"ext","values":["flac"]},)"
+       R"({"in":"ext","values":["ogg"]}]}]})"},
+      {"NOT mtime:2024-01-01T00\\:00:00Z", R"({"not":{"gte":1704067200,"lte":1704067200,"range":"mtime"}})"},
       {"path.real:/srv/share/", R"({"under":"/srv/share"})"},
       {"path.real:\\/srv\\/x\\/*", R"({"under":"/srv/x"})"},
   };
@@ -100,6 +105,29 @@ TEST(QueryStringTest, MalformedQueriesAndUnknownFieldsAreRefusedWithAReason) {
   std::string nots;
   for (int i = 0; i < 50000; ++i) nots += "NOT ";
   EXPECT_THROW(ParseQueryString(nots + "a"), QuerySyntaxError);
+}
+
+// Every attribute and content type of the shipped mappings file, as the file server writes it
+// into a query, is one the gateway reads.
+TEST(QueryStringTest, TheShippedMappingsFileNamesOnlyWhatTheGatewayReads) {
+  Json::Value mappings;
+  std::string errors;
+  ASSERT_TRUE(JsonParseChecked(test::ReadFile(SEARCHGW_MAPPINGS), &mappings, &errors)) << errors;
+  const Json::Value& attributes = mappings["attribute_mappings"];
+  ASSERT_GE(attributes.size(), 15u);
+  for (const std::string& name : attributes.getMemberNames()) {
+    const std::string type = attributes[name]["type"].asString();
+    const std::string field = attributes[name]["attribute"].asString();
+    std::string query = "x";
+    if (type == "str") query = field + ":*x*";
+    if (type == "num") query = field + ":{1 TO *}";
+    if (type == "date") query = field + ":[2024-01-01T00\\:00\\:00Z TO 2024-02-01T00:00:00Z]";
+    if (type == "type") query = field + ":(ext.pdf)";
+    EXPECT_NO_THROW(Tree(query)) << name << ": " << query;
+  }
+  for (const std::string& id : mappings["mime_mappings"].getMemberNames()) {
+    EXPECT_NO_THROW(Tree("type:(" + mappings["mime_mappings"][id].asString() + ")")) << id;
+  }
 }
 
 TEST(SearchBodyTest, BothRequestShapesAreRead) {

@@ -42,7 +42,7 @@ constexpr Field kFields[] = {
     {"path.real.fulltext", FieldKind::kFolder, ""},
 };
 
-const char* const kKinds[] = {"document", "audio", "video", "photo", "folder"};
+const char* const kKinds[] = {"document", "audio", "video", "photo", "folder", "other"};
 
 const Field& FindField(const std::string& name) {
   for (const Field& f : kFields) {
@@ -108,27 +108,39 @@ Json::Value Range(const Field& f, const std::string& low, bool low_in, const std
   return n;
 }
 
-// A type value: "kind.photo" or "ext.pdf", as the mappings file's content types spell them.
-Json::Value TypeValue(const std::string& value) {
-  const size_t dot = value.find('.');
-  const std::string what = value.substr(0, dot);
-  const std::string v = dot == std::string::npos ? "" : value.substr(dot + 1);
-  bool ok = !v.empty() && v.find('*') == std::string::npos;
-  if (ok && what == "kind") {
-    ok = false;
-    for (const char* k : kKinds) ok = ok || v == k;
-  } else if (what != "ext") {
-    ok = false;
+// A type value: "kind.photo" or "ext.pdf", as the mappings file's content types spell them;
+// several of them, separated by spaces, are any of them.
+Json::Value TypeValues(const std::string& text) {
+  Json::Value parts(Json::arrayValue);
+  size_t start = 0;
+  while (start < text.size()) {
+    size_t end = text.find(' ', start);
+    if (end == std::string::npos) end = text.size();
+    const std::string value = text.substr(start, end - start);
+    start = end + 1;
+    if (value.empty()) continue;
+    const size_t dot = value.find('.');
+    const std::string what = value.substr(0, dot);
+    const std::string v = dot == std::string::npos ? "" : value.substr(dot + 1);
+    bool ok = !v.empty() && v.find('*') == std::string::npos;
+    if (ok && what == "kind") {
+      ok = false;
+      for (const char* k : kKinds) ok = ok || v == k;
+    } else if (what != "ext") {
+      ok = false;
+    }
+    if (!ok) {
+      throw RequestError(kBadQuery, "unknown type \"" + value +
+                                        "\": a type is kind.document, kind.audio, kind.video, "
+                                        "kind.photo, kind.folder, kind.other or ext.EXTENSION");
+    }
+    Json::Value n(Json::objectValue);
+    n["in"] = what;
+    n["values"].append(v);
+    parts.append(std::move(n));
   }
-  if (!ok) {
-    throw RequestError(kBadQuery, "unknown type \"" + value +
-                                      "\": a type is kind.document, kind.audio, kind.video, "
-                                      "kind.photo, kind.folder or ext.EXTENSION");
-  }
-  Json::Value n(Json::objectValue);
-  n["in"] = what;
-  n["values"].append(v);
-  return n;
+  if (parts.empty()) throw RequestError(kBadQuery, "a type query names no type");
+  return parts.size() == 1 ? parts[0] : Node("or", std::move(parts));
 }
 
 Json::Value Leaf(const QueryNode& q) {
@@ -140,7 +152,7 @@ Json::Value Leaf(const QueryNode& q) {
     case FieldKind::kFolder:
       return Under(text, f.name);
     case FieldKind::kType:
-      return TypeValue(text);
+      return TypeValues(text);
     case FieldKind::kNumber:
     case FieldKind::kDate:
       if (q.kind == QueryNode::kTerm && text == "*") return Node("all", true);

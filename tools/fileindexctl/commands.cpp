@@ -28,6 +28,7 @@
 #include "fileindex/status_mgr.hpp"
 #include "fileindex/util.hpp"
 #include "platform/daemon_sock.hpp"
+#include "tools/fileindexctl/spotlight_conf.hpp"
 
 namespace orvane {
 namespace ctl {
@@ -828,6 +829,29 @@ void StatusCmd(const Args& args, Output& out) {
 
 }  // namespace
 
+// Prints, or writes into an smb.conf, the lines that send a share's Spotlight searches to the
+// search gateway.
+void ShareSpotlightCmd(const Args& args, Output& out) {
+  SpotlightSettings s;
+  s.share = args.At(0, "SHARE");
+  s.address = args.Get("address", s.address);
+  s.mappings = args.Get("mappings", s.mappings);
+  const long long port = args.GetInt("port", s.port);
+  if (port < 1 || port > 65535) throw UsageError("--port takes a port number (1 to 65535)");
+  s.port = static_cast<int>(port);
+  if (args.Has("write")) {
+    const std::string path = args.Get("write");
+    WriteSpotlightConf(path, s);
+    out.Done("wrote the Spotlight settings of share " + s.share + " into " + path +
+             "; reload the file server's configuration (smbcontrol smbd reload-config)");
+    return;
+  }
+  Json::Value value(Json::objectValue);
+  for (const auto& kv : SpotlightGlobalLines(s)) value["global"][kv.first] = kv.second;
+  for (const auto& kv : SpotlightShareLines(s)) value["share"][kv.first] = kv.second;
+  out.Emit(value, [&](std::ostream& o) { o << SpotlightConfText(s); });
+}
+
 const std::vector<Command>& Commands() {
   static const std::vector<Command> commands = {
       {"folder",
@@ -898,6 +922,15 @@ const std::vector<Command>& Commands() {
              ShareCheckRecycle, "re-checking recycle bin of"),
       TwoArgs("share", "migrate", "SHARE", "FROM_PATH", "follow a share moved to another volume",
               ShareMigrate, "migrated"),
+      {"share",
+       "spotlight",
+       "SHARE [--address IP] [--port N] [--mappings PATH] [--write SMB_CONF]",
+       "print (or write into smb.conf) the lines that send a share's Spotlight searches to the "
+       "search gateway",
+       {"address", "port", "mappings", "write"},
+       {},
+       1,
+       ShareSpotlightCmd},
       OneArg("volume", "pause", "VOLUME", "stop indexing every share on a volume", VolumePause,
              "paused volume"),
       OneArg("volume", "resume", "VOLUME", "index a volume's shares again", VolumeResume,
