@@ -56,9 +56,12 @@ struct Gateway::Impl {
   void Release(const asio::ip::address& peer);
   void Accept();
   void Refuse(tcp::socket socket, const std::string& why);
-  // The engine's answer to one search; a Failure when there is none to give.
+  // The reply body for one search; a Failure when there is none to give.
   std::optional<Failure> Search(const std::vector<std::string>& ids, const SearchRequest& req,
                                 std::string* body);
+  // One search request to the engine: its reply's data, or why there is none.
+  std::optional<Failure> Engine(const Json::Value& query, const std::vector<std::string>& ids,
+                                int64_t from, int64_t size, Json::Value* data);
 
   GatewayOptions opt;
   // Declared before the I/O context so that they outlive the connections it destroys.
@@ -260,17 +263,15 @@ void Gateway::Impl::Accept() {
   });
 }
 
-std::optional<Failure> Gateway::Impl::Search(const std::vector<std::string>& ids,
-                                             const SearchRequest& req, std::string* body) {
+std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query, const std::vector<std::string>& ids,
+                                             int64_t from, int64_t size, Json::Value* data) {
   Json::Value request(Json::objectValue);
   request["command"] = "search";
-  Json::Value& data = request["data"];
-  data["query"] = req.query;
-  data["from"] = Json::Int64(req.from);
-  data["size"] = Json::Int64(req.size);
-  if (!ids.empty()) {
-    for (const std::string& id : ids) data["id"].append(id);
-  }
+  Json::Value& d = request["data"];
+  d["query"] = query;
+  d["from"] = Json::Int64(from);
+  d["size"] = Json::Int64(size);
+  for (const std::string& id : ids) d["id"].append(id);
   const Failure down{http::status::service_unavailable, "unavailable_shards_exception",
                      "the search engine at " + opt.engine_socket +
                          " does not answer: is quixelasticd running?"};
@@ -295,7 +296,8 @@ std::optional<Failure> Gateway::Impl::Search(const std::vector<std::string>& ids
     return down;
   }
   if (reply["success"].asBool()) {
-    *body = BuildSearchReply(reply["data"]);
+    *data = std::move(reply["data"]);
+    if (!(*data)["hits"].isArray()) (*data)["hits"] = Json::Value(Json::arrayValue);
     return std::nullopt;
   }
   const int code = reply["error"]["code"].asInt();
@@ -311,6 +313,63 @@ std::optional<Failure> Gateway::Impl::Search(const std::vector<std::string>& ids
       return Failure{http::status::service_unavailable, "unavailable_shards_exception",
                      "the search engine answered " + std::to_string(code) + ": " + msg};
   }
+}
+
+std::optional<Failure> Gateway::Impl::Search(const std::vector<std::string>& ids,
+                                             const SearchRequest& req, std::string* body) {
+  Json::Value data;
+  std::optional<Failure> failure;
+  if (req.scope.empty()) {
+    failure = Engine(req.query, ids, req.from, req.size, &data);
+    if (!failure) *body = BuildSearchReply(data);
+    return failure;
+  }
+  // The scope folder matches its own scope; it is taken out of the hits and of the total. The
+  // pages before this one are read too, so that where it falls shifts no page.
+  auto is_scope = [&](const Json::Value& hit) { return hit["path"].asString() == req.scope; };
+  const bool whole = req.from + req.size + 1 <= kMaxPageSize;
+  const int64_t from = whole ? 0 : req.from;
+  failure = Engine(req.query, ids, from, req.from + req.size + 1 - from, &data);
+  if (failure) return failure;
+  Json::Value& hits = data["hits"];
+  bool found = false;
+  Json::Value kept(Json::arrayValue);
+  for (Json::Value& hit : hits) {
+    if (is_scope(hit)) {
+      found = true;
+    } else {
+      kept.append(std::move(hit));
+    }
+  }
+  int64_t total = data["total"].asInt64();
+  if (!found && total > static_cast<int64_t>(hits.size())) {
+    // Past the hits read: the folder's own name, within the scope, finds it if it is there.
+    Json::Value check(Json::objectValue);
+    const std::string name = req.scope.substr(req.scope.rfind('/') + 1);
+    if (!name.empty() && name.find('*') == std::string::npos) {
+      check["and"].append(req.query);
+      Json::Value match(Json::objectValue);
+      match["match"] = "name";
+      match["pattern"] = name;
+      check["and"].append(match);
+      Json::Value named;
+      failure = Engine(check, ids, 0, kMaxPageSize, &named);
+      if (failure) return failure;
+      for (const Json::Value& hit : named["hits"]) found = found || is_scope(hit);
+    }
+  }
+  if (found) --total;
+  Json::Value page(Json::arrayValue);
+  const int64_t skip = whole ? req.from : 0;
+  for (Json::ArrayIndex i = 0; i < kept.size(); ++i) {
+    if (static_cast<int64_t>(i) >= skip && static_cast<int64_t>(page.size()) < req.size) {
+      page.append(kept[i]);
+    }
+  }
+  data["hits"] = std::move(page);
+  data["total"] = Json::Int64(std::max<int64_t>(total, 0));
+  *body = BuildSearchReply(data);
+  return std::nullopt;
 }
 
 Gateway::Gateway(GatewayOptions options) : impl_(std::make_unique<Impl>(std::move(options))) {}

@@ -95,7 +95,7 @@ class Client {
   std::string pending_;
 };
 
-// An engine that finds one file per page asked, and knows no index named "fileindex_gone".
+// An engine that finds a folder and a file in it, and knows no index named "fileindex_gone".
 void Engine(int fd, const std::string& request) {
   const Json::Value req = FakeDaemon::Parse(std::string(wire::PayloadText(request)));
   for (const Json::Value& id : req["data"]["id"]) {
@@ -105,8 +105,8 @@ void Engine(int fd, const std::string& request) {
       return;
     }
   }
-  FakeDaemon::WriteFrame(fd, R"({"success":true,"data":{"total":3,"total_exact":true,)"
-                             R"("hits":[{"path":"/srv/s/a.txt","name":"a.txt"}]}})");
+  FakeDaemon::WriteFrame(fd, R"({"success":true,"data":{"total":2,"total_exact":true,)"
+                             R"("hits":[{"path":"/srv/s","name":"s"},{"path":"/srv/s/a.txt"}]}})");
 }
 
 class GatewayTest : public ::testing::Test {
@@ -134,12 +134,15 @@ TEST_F(GatewayTest, SearchesOnOneKeptAliveConnectionReachTheEngineAndComeBackInS
   EXPECT_EQ(r.status_line, "HTTP/1.1 200 OK");
   EXPECT_NE(r.headers.find("Content-Length: "), std::string::npos);
   EXPECT_EQ(r.headers.find("chunked"), std::string::npos);
-  EXPECT_EQ(r.body, R"({"hits":{"total":{"value":3,"relation":"eq"},"hits":[)"
+  // The folder searched in is no hit of its own search.
+  EXPECT_EQ(r.body, R"({"hits":{"total":{"value":1,"relation":"eq"},"hits":[)"
                     R"({"_source":{"path":{"real":"/srv/s/a.txt"}}}]}})");
 
   // The same connection: an index list, then all indexes, then one the engine does not know.
   EXPECT_EQ(c.Search("fileindex_s,fileindex_t", R"({"from": 50, "size": 50})").status, 200);
-  EXPECT_EQ(c.Search("_all", "{}", "?pretty").status, 200);
+  r = c.Search("_all", "{}", "?pretty");
+  EXPECT_EQ(r.status, 200);
+  EXPECT_NE(r.body.find(R"("total":{"value":2,)"), std::string::npos);
   r = c.Search("fileindex_gone", "{}");
   EXPECT_EQ(r.status, 400);
   EXPECT_EQ(FakeDaemon::Parse(r.body)["error"]["type"].asString(), "index_not_found_exception");
@@ -148,7 +151,7 @@ TEST_F(GatewayTest, SearchesOnOneKeptAliveConnectionReachTheEngineAndComeBackInS
   ASSERT_EQ(sent.size(), 4u);
   EXPECT_EQ(JsonToString(sent[0]),
             R"({"command":"search","data":{"from":0,"id":["fileindex_s"],"query":{"and":[)"
-            R"({"match":"name","pattern":"*a*"},{"under":"/srv/s"}]},"size":50}})");
+            R"({"match":"name","pattern":"*a*"},{"under":"/srv/s"}]},"size":51}})");
   EXPECT_EQ(JsonToString(sent[1]["data"]["id"]), R"(["fileindex_s","fileindex_t"])");
   EXPECT_EQ(sent[1]["data"]["from"].asInt(), 50);
   EXPECT_FALSE(sent[2]["data"].isMember("id"));

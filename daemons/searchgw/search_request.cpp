@@ -341,6 +341,16 @@ SearchRequest ReadSearchBody(const std::string& body) {
                            std::to_string(kMaxPageSize) + ": ask for fewer and page with from");
   }
   r.query = root.isMember("query") ? ReadJsonQuery(root["query"], 0) : Node("all", true);
+  if (r.query.isMember("under")) {
+    r.scope = r.query["under"].asString();
+  } else if (r.query.isMember("and")) {
+    for (const Json::Value& part : r.query["and"]) {
+      if (part.isMember("under")) {
+        r.scope = part["under"].asString();
+        break;
+      }
+    }
+  }
   return r;
 }
 

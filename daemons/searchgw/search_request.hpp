@@ -37,6 +37,9 @@ struct SearchRequest {
   Json::Value query;  // the engine's query tree
   int64_t from = 0;
   int64_t size = 10;
+  // The folder the query is confined to (a folder node ANDed at its top), as the engine spells
+  // paths; empty when there is none. The folder itself is never a hit: clients search inside it.
+  std::string scope;
 };
 
 // The body of a `_search` request: {"from", "size", "query"} where the query is a
