@@ -64,5 +64,13 @@ The system is running in $ORVANE_ROOT. Try:
   $fi_bin/tools/fileindexctl/fileindexctl search marker
   $fi_bin/tools/fileindexctl/fileindexctl status
   $fi_bin/tools/fileindexctl/fileindexctl --help
+Search the share from macOS Finder through Samba: run the search gateway
+  ORVANE_ROOT=$ORVANE_ROOT $fi_bin/daemons/searchgw/searchgw --port 9210
+and give Samba the lines below (or merge them with --write /etc/samba/smb.conf, then
+smbcontrol smbd reload-config); the share's section must have path = $folder:
+EOT
+ctl share spotlight "$share" --mappings "$fi_top/daemons/searchgw/spotlight_mappings.json"
+cat <<EOT
+
 Stop everything with: bash scripts/quickstop.sh
 EOT

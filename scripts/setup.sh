@@ -11,6 +11,7 @@ packages=(
   libxml2-dev libuchardet-dev libmediainfo-dev
   e2fsprogs mount util-linux acl passwd
   python3
+  samba smbclient
 )
 
 missing=()
@@ -23,5 +24,14 @@ echo "setup: installing ${missing[*]}" >&2
 sudo=""
 [ "$(id -u)" -eq 0 ] || sudo="sudo"
 export DEBIAN_FRONTEND=noninteractive
+# samba is here for the search gateway's test, which runs an smbd of its own: the package must
+# not start the machine's file-server services, so starting services is refused while it is
+# installed (unless the machine already has a policy of its own).
+policy=/usr/sbin/policy-rc.d
+if [ ! -e "$policy" ]; then
+  printf '#!/bin/sh\nexit 101\n' | $sudo tee "$policy" >/dev/null
+  $sudo chmod 755 "$policy"
+  trap '$sudo rm -f "$policy"' EXIT
+fi
 $sudo apt-get update -qq
 $sudo apt-get install -y -qq --no-install-recommends "${missing[@]}"
