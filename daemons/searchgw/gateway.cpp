@@ -16,6 +16,7 @@
 #include <utility>
 #include <vector>
 
+#include "common/env.hpp"
 #include "common/error.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
@@ -39,6 +40,9 @@ struct Failure {
   std::string type;
   std::string reason;
 };
+
+// Busy answers of the engine tried again, about half a second in all.
+constexpr int kBusyAttempts = 30;
 
 bool IsPowerOfTwo(uint64_t n) { return n != 0 && (n & (n - 1)) == 0; }
 
@@ -275,25 +279,35 @@ std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query, const std
   const Failure down{http::status::service_unavailable, "unavailable_shards_exception",
                      "the search engine at " + opt.engine_socket +
                          " does not answer: is quixelasticd running?"};
-  quixdaemon::DomainSockConnection conn(opt.engine_socket);
-  conn.SetTimeouts(opt.engine_timeout_ms, opt.engine_timeout_ms);
-  std::string text;
-  if (!conn.Connect(opt.engine_timeout_ms) || !conn.Send(JsonToString(request)) ||
-      !conn.Recv(text)) {
-    Log(LOG_ERR, "%s:%d search engine at %s: %s", SourceName(__FILE__), __LINE__,
-        opt.engine_socket.c_str(), std::strerror(errno));
-    return down;
-  }
+  const std::string request_text = JsonToString(request);
   Json::Value reply;
-  std::string errors;
-  Json::CharReaderBuilder builder;
-  const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-  const std::string_view payload = wire::PayloadText(text);
-  if (!reader->parse(payload.data(), payload.data() + payload.size(), &reply, &errors) ||
-      !reply.isObject()) {
-    Log(LOG_ERR, "%s:%d search engine at %s answered something that is not JSON",
-        SourceName(__FILE__), __LINE__, opt.engine_socket.c_str());
-    return down;
+  // The engine counts a search as running until its connection is done with, a moment after
+  // the answer came: searches one after another may meet the count of the one before, so a
+  // busy answer is tried again for a short while before the client is told.
+  for (int attempt = 1;; ++attempt) {
+    quixdaemon::DomainSockConnection conn(opt.engine_socket);
+    conn.SetTimeouts(opt.engine_timeout_ms, opt.engine_timeout_ms);
+    std::string text;
+    if (!conn.Connect(opt.engine_timeout_ms) || !conn.Send(request_text) || !conn.Recv(text)) {
+      Log(LOG_ERR, "%s:%d search engine at %s: %s", SourceName(__FILE__), __LINE__,
+          opt.engine_socket.c_str(), std::strerror(errno));
+      return down;
+    }
+    std::string errors;
+    Json::CharReaderBuilder builder;
+    const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
+    const std::string_view payload = wire::PayloadText(text);
+    if (!reader->parse(payload.data(), payload.data() + payload.size(), &reply, &errors) ||
+        !reply.isObject()) {
+      Log(LOG_ERR, "%s:%d search engine at %s answered something that is not JSON",
+          SourceName(__FILE__), __LINE__, opt.engine_socket.c_str());
+      return down;
+    }
+    if (reply["success"].asBool() || reply["error"]["code"].asInt() != kCodeOverloaded ||
+        attempt == kBusyAttempts) {
+      break;
+    }
+    Env::Current()->SleepMicros(std::min(attempt, 10) * 2000);
   }
   if (reply["success"].asBool()) {
     *data = std::move(reply["data"]);
