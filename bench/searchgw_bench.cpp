@@ -30,9 +30,9 @@ using orvane::bench::Cmd;
 using orvane::bench::Seconds;
 
 const char kId[] = "fileindex_bench";
-const char* kWords[] = {"holiday", "report", "invoice", "summer", "family", "project", "draft",
-                        "final", "budget", "meeting", "photo", "scan", "notes", "backup",
-                        "music", "video", "contract", "slides", "thesis", "recipe"};
+const char* kWords[] = {"holiday", "report", "invoice",  "summer", "family", "project", "draft",
+                        "final",   "budget", "meeting",  "photo",  "scan",   "notes",   "backup",
+                        "music",   "video",  "contract", "slides", "thesis", "recipe"};
 const char* kExts[] = {"jpg", "pdf", "docx", "mp3", "mp4", "txt", "xlsx", "png"};
 std::string g_socket;
 
@@ -100,12 +100,14 @@ class Http {
   // One search; the number of hits the reply's total gives, or exits on a failure.
   long Search(const std::string& query) {
     std::string body = R"({"from": 0, "size": 50, "_source": ["path.real"], "query": )"
-                       R"({"query_string": {"query": ")" + query + R"("}}})";
+                       R"({"query_string": {"query": ")" +
+                       query + R"("}}})";
     const std::string req = "POST /" + std::string(kId) +
                             "/_search HTTP/1.1\r\nHost: 127.0.0.1\r\nContent-Type: "
                             "application/json\r\nContent-Length: " +
                             std::to_string(body.size()) + "\r\n\r\n" + body;
-    if (::send(fd_.get(), req.data(), req.size(), MSG_NOSIGNAL) != ssize_t(req.size())) std::exit(1);
+    if (::send(fd_.get(), req.data(), req.size(), MSG_NOSIGNAL) != ssize_t(req.size()))
+      std::exit(1);
     std::string in;
     size_t head_end, length = 0;
     char buf[65536];
@@ -141,10 +143,11 @@ void Measure(const char* what, Http* http, const std::vector<std::string>& queri
     ms.push_back(Seconds(start) * 1000);
   }
   std::sort(ms.begin(), ms.end());
-  std::printf("%-44s p50 %6.1f ms  p95 %6.1f ms  max %6.1f ms  (%zu searches, %.0f hits each on"
-              " average)\n",
-              what, ms[ms.size() / 2], ms[ms.size() * 95 / 100], ms.back(), ms.size(),
-              double(hits) / double(ms.size()));
+  std::printf(
+      "%-44s p50 %6.1f ms  p95 %6.1f ms  max %6.1f ms  (%zu searches, %.0f hits each on"
+      " average)\n",
+      what, ms[ms.size() / 2], ms[ms.size() * 95 / 100], ms.back(), ms.size(),
+      double(hits) / double(ms.size()));
 }
 
 }  // namespace

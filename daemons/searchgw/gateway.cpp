@@ -2,11 +2,11 @@
 
 #include <syslog.h>
 
+#include <algorithm>
 #include <atomic>
 #include <boost/asio.hpp>
 #include <boost/beast/core.hpp>
 #include <boost/beast/http.hpp>
-#include <algorithm>
 #include <chrono>
 #include <cstring>
 #include <map>
@@ -110,10 +110,9 @@ class Session : public std::enable_shared_from_this<Session> {
  private:
   void ReadRest() {
     stream_.expires_after(Millis(gw_->opt.request_timeout_ms));
-    http::async_read(stream_, buffer_, *parser_,
-                     [self = shared_from_this()](beast::error_code ec, size_t) {
-                       self->OnRead(ec);
-                     });
+    http::async_read(
+        stream_, buffer_, *parser_,
+        [self = shared_from_this()](beast::error_code ec, size_t) { self->OnRead(ec); });
   }
 
   void OnRead(beast::error_code ec) {
@@ -133,8 +132,8 @@ class Session : public std::enable_shared_from_this<Session> {
            "the request's body is longer than " + std::to_string(gw_->opt.max_body_bytes) +
                " bytes"};
     }
-    Log(LOG_WARNING, "%s:%d request from %s refused: %s", SourceName(__FILE__), __LINE__,
-        peer_.to_string().c_str(), f.reason.c_str());
+    ORVANE_LOG(LOG_WARNING, "request from %s refused: %s", peer_.to_string().c_str(),
+               f.reason.c_str());
     Reply(11, f.status, BuildErrorBody(f.type, f.reason, static_cast<int>(f.status)), false);
   }
 
@@ -163,10 +162,9 @@ class Session : public std::enable_shared_from_this<Session> {
       }
     }
     if (failure) {
-      Log(LOG_WARNING, "%s:%d search from %s refused (%d %s): %s; body: %s",
-          SourceName(__FILE__), __LINE__, peer_.to_string().c_str(),
-          static_cast<int>(failure->status), failure->type.c_str(), failure->reason.c_str(),
-          ForLog(req.body()).c_str());
+      ORVANE_LOG(LOG_WARNING, "search from %s refused (%d %s): %s; body: %s",
+                 peer_.to_string().c_str(), static_cast<int>(failure->status),
+                 failure->type.c_str(), failure->reason.c_str(), ForLog(req.body()).c_str());
       body = BuildErrorBody(failure->type, failure->reason, static_cast<int>(failure->status));
     }
     Reply(req.version(), failure ? failure->status : http::status::ok, std::move(body),
@@ -225,14 +223,15 @@ void Gateway::Impl::Release(const asio::ip::address& peer) {
 void Gateway::Impl::Refuse(tcp::socket socket, const std::string& why) {
   const uint64_t n = ++refused;
   if (IsPowerOfTwo(n)) {
-    Log(LOG_WARNING, "%s:%d connection refused: %s (%llu refused so far)", SourceName(__FILE__),
-        __LINE__, why.c_str(), static_cast<unsigned long long>(n));
+    ORVANE_LOG(LOG_WARNING, "connection refused: %s (%llu refused so far)", why.c_str(),
+               static_cast<unsigned long long>(n));
   }
   // One try without waiting: a refused client costs an accept, a write and a close.
   const std::string body = BuildErrorBody("es_rejected_execution_exception", why, 429);
-  const std::string text = "HTTP/1.1 429 Too Many Requests\r\nContent-Type: application/json\r\n"
-                           "Connection: close\r\nContent-Length: " +
-                           std::to_string(body.size()) + "\r\n\r\n" + body;
+  const std::string text =
+      "HTTP/1.1 429 Too Many Requests\r\nContent-Type: application/json\r\n"
+      "Connection: close\r\nContent-Length: " +
+      std::to_string(body.size()) + "\r\n\r\n" + body;
   beast::error_code ignored;
   socket.non_blocking(true, ignored);
   socket.write_some(asio::buffer(text), ignored);
@@ -244,8 +243,7 @@ void Gateway::Impl::Accept() {
     if (ec == asio::error::operation_aborted || !acceptor->is_open()) return;
     if (ec) {
       // Out of descriptors, most likely: connections closing will free some.
-      Log(LOG_WARNING, "%s:%d accept failed: %s", SourceName(__FILE__), __LINE__,
-          ec.message().c_str());
+      ORVANE_LOG(LOG_WARNING, "accept failed: %s", ec.message().c_str());
       retry->expires_after(Millis(100));
       retry->async_wait([this](beast::error_code e) {
         if (!e) Accept();
@@ -267,8 +265,9 @@ void Gateway::Impl::Accept() {
   });
 }
 
-std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query, const std::vector<std::string>& ids,
-                                             int64_t from, int64_t size, Json::Value* data) {
+std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query,
+                                             const std::vector<std::string>& ids, int64_t from,
+                                             int64_t size, Json::Value* data) {
   Json::Value request(Json::objectValue);
   request["command"] = "search";
   Json::Value& d = request["data"];
@@ -276,9 +275,9 @@ std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query, const std
   d["from"] = Json::Int64(from);
   d["size"] = Json::Int64(size);
   for (const std::string& id : ids) d["id"].append(id);
-  const Failure down{http::status::service_unavailable, "unavailable_shards_exception",
-                     "the search engine at " + opt.engine_socket +
-                         " does not answer: is quixelasticd running?"};
+  const Failure down{
+      http::status::service_unavailable, "unavailable_shards_exception",
+      "the search engine at " + opt.engine_socket + " does not answer: is quixelasticd running?"};
   const std::string request_text = JsonToString(request);
   Json::Value reply;
   // The engine counts a search as running until its connection is done with, a moment after
@@ -289,8 +288,8 @@ std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query, const std
     conn.SetTimeouts(opt.engine_timeout_ms, opt.engine_timeout_ms);
     std::string text;
     if (!conn.Connect(opt.engine_timeout_ms) || !conn.Send(request_text) || !conn.Recv(text)) {
-      Log(LOG_ERR, "%s:%d search engine at %s: %s", SourceName(__FILE__), __LINE__,
-          opt.engine_socket.c_str(), std::strerror(errno));
+      ORVANE_LOG(LOG_ERR, "search engine at %s: %s", opt.engine_socket.c_str(),
+                 std::strerror(errno));
       return down;
     }
     std::string errors;
@@ -299,8 +298,8 @@ std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query, const std
     const std::string_view payload = wire::PayloadText(text);
     if (!reader->parse(payload.data(), payload.data() + payload.size(), &reply, &errors) ||
         !reply.isObject()) {
-      Log(LOG_ERR, "%s:%d search engine at %s answered something that is not JSON",
-          SourceName(__FILE__), __LINE__, opt.engine_socket.c_str());
+      ORVANE_LOG(LOG_ERR, "search engine at %s answered something that is not JSON",
+                 opt.engine_socket.c_str());
       return down;
     }
     if (reply["success"].asBool() || reply["error"]["code"].asInt() != kCodeOverloaded ||
@@ -319,9 +318,11 @@ std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query, const std
   switch (code) {
     case kCodeIndexNotFound:
       return Failure{http::status::bad_request, "index_not_found_exception", msg};
-    case kCodeMalformed: case kCodeInvalidParam:
+    case kCodeMalformed:
+    case kCodeInvalidParam:
       return Failure{http::status::bad_request, "query_shard_exception", msg};
-    case kCodeOutOfMemory: case kCodeOverloaded:
+    case kCodeOutOfMemory:
+    case kCodeOverloaded:
       return Failure{http::status::too_many_requests, "es_rejected_execution_exception", msg};
     default:
       return Failure{http::status::service_unavailable, "unavailable_shards_exception",

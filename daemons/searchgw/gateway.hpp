@@ -16,9 +16,9 @@ namespace searchgw {
 struct GatewayOptions {
   // Loopback unless an administrator names another address.
   std::string address = "127.0.0.1";
-  uint16_t port = 9210;  // 0: any free port (see Gateway::port())
+  uint16_t port = 9210;       // 0: any free port (see Gateway::port())
   std::string engine_socket;  // a real path (already under ORVANE_ROOT)
-  int threads = 4;  // also the most engine searches in progress at once
+  int threads = 4;            // also the most engine searches in progress at once
   int max_connections = 64;
   int max_connections_per_address = 32;
   int idle_timeout_ms = 60000;    // wait for the first byte of the next request

@@ -72,7 +72,8 @@ class Client {
 
   Response Search(const std::string& index, const std::string& body,
                   const std::string& suffix = "") {
-    Send("POST /" + index + "/_search" + suffix + " HTTP/1.1\r\nHost: 127.0.0.1\r\n"
+    Send("POST /" + index + "/_search" + suffix +
+         " HTTP/1.1\r\nHost: 127.0.0.1\r\n"
          "Content-Type: application/json\r\nContent-Length: " +
          std::to_string(body.size()) + "\r\n\r\n" + body);
     return Read();
@@ -129,8 +130,9 @@ TEST_F(GatewayTest, SearchesOnOneKeptAliveConnectionReachTheEngineAndComeBackInS
   Client c(port());
   ASSERT_TRUE(c.connected());
 
-  Response r = c.Search("fileindex_s", R"({"from": 0, "size": 50, "query": {"query_string": )"
-                                       R"({"query": "name:*a* AND path.real.fulltext:\"/srv/s\""}}})");
+  Response r =
+      c.Search("fileindex_s", R"({"from": 0, "size": 50, "query": {"query_string": )"
+                              R"({"query": "name:*a* AND path.real.fulltext:\"/srv/s\""}}})");
   EXPECT_EQ(r.status_line, "HTTP/1.1 200 OK");
   EXPECT_NE(r.headers.find("Content-Length: "), std::string::npos);
   EXPECT_EQ(r.headers.find("chunked"), std::string::npos);

@@ -20,9 +20,6 @@
 
 namespace {
 
-using orvane::Log;
-using orvane::SourceName;
-
 const char kUsage[] =
     "usage: searchgw [--foreground] [--address IP] [--port N] [--engine-socket PATH]\n"
     "                [--pid-file PATH] [--threads N] [--max-connections N]\n"
@@ -64,17 +61,28 @@ bool ParseFlags(int argc, char** argv, Flags* f) {
       return true;
     };
     bool ok = true;
-    if (arg == "--foreground") f->foreground = true;
-    else if (arg == "--address") ok = text(&g.address);
-    else if (arg == "--port") ok = number(0, 65535, &g.port);
-    else if (arg == "--engine-socket") ok = text(&f->engine_socket);
-    else if (arg == "--pid-file") ok = text(&f->pid_file);
-    else if (arg == "--threads") ok = number(1, 64, &g.threads);
-    else if (arg == "--max-connections") ok = number(1, 100000, &g.max_connections);
-    else if (arg == "--max-connections-per-address") ok = number(1, 100000, &g.max_connections_per_address);
-    else if (arg == "--idle-timeout-ms") ok = number(1, 86400000, &g.idle_timeout_ms);
-    else if (arg == "--request-timeout-ms") ok = number(1, 600000, &g.request_timeout_ms);
-    else ok = false;
+    if (arg == "--foreground")
+      f->foreground = true;
+    else if (arg == "--address")
+      ok = text(&g.address);
+    else if (arg == "--port")
+      ok = number(0, 65535, &g.port);
+    else if (arg == "--engine-socket")
+      ok = text(&f->engine_socket);
+    else if (arg == "--pid-file")
+      ok = text(&f->pid_file);
+    else if (arg == "--threads")
+      ok = number(1, 64, &g.threads);
+    else if (arg == "--max-connections")
+      ok = number(1, 100000, &g.max_connections);
+    else if (arg == "--max-connections-per-address")
+      ok = number(1, 100000, &g.max_connections_per_address);
+    else if (arg == "--idle-timeout-ms")
+      ok = number(1, 86400000, &g.idle_timeout_ms);
+    else if (arg == "--request-timeout-ms")
+      ok = number(1, 600000, &g.request_timeout_ms);
+    else
+      ok = false;
     if (!ok) {
       std::cerr << "searchgw: bad or incomplete option " << arg << "\n" << kUsage;
       return false;
@@ -117,17 +125,16 @@ int main(int argc, char** argv) {
     const orvane::platform::PidFile pid_file(orvane::RootedPathForWrite(flags.pid_file));
     orvane::searchgw::Gateway gateway(flags.gateway);
     gateway.Start();
-    Log(LOG_INFO, "%s:%d serving on %s port %u, pid %d", SourceName(__FILE__), __LINE__,
-        flags.gateway.address.c_str(), static_cast<unsigned>(gateway.port()),
-        static_cast<int>(::getpid()));
+    ORVANE_LOG(LOG_INFO, "serving on %s port %u, pid %d", flags.gateway.address.c_str(),
+               static_cast<unsigned>(gateway.port()), static_cast<int>(::getpid()));
     orvane::platform::NotifyReady();
     const int sig = signals.Wait();
-    Log(LOG_INFO, "%s:%d stopping on signal %d", SourceName(__FILE__), __LINE__, sig);
+    ORVANE_LOG(LOG_INFO, "stopping on signal %d", sig);
     gateway.Stop();
   } catch (const std::exception& e) {
-    Log(LOG_ERR, "%s:%d cannot serve: %s", SourceName(__FILE__), __LINE__, e.what());
+    ORVANE_LOG(LOG_ERR, "cannot serve: %s", e.what());
     return 1;
   }
-  Log(LOG_INFO, "%s:%d stopped", SourceName(__FILE__), __LINE__);
+  ORVANE_LOG(LOG_INFO, "stopped");
   return 0;
 }

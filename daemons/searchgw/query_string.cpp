@@ -21,7 +21,13 @@ struct Token {
 
 bool IsSpecial(char c, bool in_value) {
   switch (c) {
-    case '(': case ')': case '[': case ']': case '{': case '}': case '"':
+    case '(':
+    case ')':
+    case '[':
+    case ']':
+    case '{':
+    case '}':
+    case '"':
       return true;
     case ':':
       // Times ("2024-01-02T10:00:00Z") carry colons; where a value stands, no field name can.
@@ -128,7 +134,9 @@ class Parser {
     switch (Peek().type) {
       case Token::kWord:
         return !IsOp("AND") && !IsOp("OR");
-      case Token::kPhrase: case Token::kLParen: case Token::kRangeOpen:
+      case Token::kPhrase:
+      case Token::kLParen:
+      case Token::kRangeOpen:
         return true;
       default:
         return false;
@@ -137,18 +145,23 @@ class Parser {
 
   [[noreturn]] void Fail(const std::string& expected) const {
     const Token& t = Peek();
-    std::string seen = t.type == Token::kEnd ? "the end of the query"
-                                             : "\"" + Describe(t) + "\" at position " +
-                                                   std::to_string(t.pos);
+    std::string seen = t.type == Token::kEnd
+                           ? "the end of the query"
+                           : "\"" + Describe(t) + "\" at position " + std::to_string(t.pos);
     throw QuerySyntaxError("expected " + expected + ", found " + seen);
   }
   static std::string Describe(const Token& t) {
     switch (t.type) {
-      case Token::kColon: return ":";
-      case Token::kLParen: return "(";
-      case Token::kRParen: return ")";
-      case Token::kPhrase: return "\"" + t.text + "\"";
-      default: return t.text;
+      case Token::kColon:
+        return ":";
+      case Token::kLParen:
+        return "(";
+      case Token::kRParen:
+        return ")";
+      case Token::kPhrase:
+        return "\"" + t.text + "\"";
+      default:
+        return t.text;
     }
   }
 
@@ -238,7 +251,10 @@ class Parser {
     Take();
     if (word.text.empty()) Fail("a field name");
     switch (Peek().type) {
-      case Token::kLParen: case Token::kRangeOpen: case Token::kPhrase: case Token::kWord:
+      case Token::kLParen:
+      case Token::kRangeOpen:
+      case Token::kPhrase:
+      case Token::kWord:
         if (Peek().type == Token::kWord && !StartsOperand()) break;
         return Primary(word.text, depth);
       default:
@@ -271,9 +287,7 @@ class Parser {
 
 }  // namespace
 
-QueryNode ParseQueryString(const std::string& text) {
-  return Parser(Tokenizer(text).Run()).Run();
-}
+QueryNode ParseQueryString(const std::string& text) { return Parser(Tokenizer(text).Run()).Run(); }
 
 }  // namespace searchgw
 }  // namespace orvane

@@ -48,7 +48,8 @@ TEST(QueryStringTest, QueriesBecomeEngineTrees) {
       {"type:(kind.audio ext.flac\\ ext.ogg)",
        R"({"or":[{"in":"kind","values":["audio"]},{"or":[{"in":"ext","values":["flac"]},)"
        R"({"in":"ext","values":["ogg"]}]}]})"},
-      {"NOT mtime:2024-01-01T00\\:00:00Z", R"({"not":{"gte":1704067200,"lte":1704067200,"range":"mtime"}})"},
+      {"NOT mtime:2024-01-01T00\\:00:00Z",
+       R"({"not":{"gte":1704067200,"lte":1704067200,"range":"mtime"}})"},
       {"path.real:/srv/share/", R"({"under":"/srv/share"})"},
       {"path.real:\\/srv\\/x\\/*", R"({"under":"/srv/x"})"},
   };
@@ -78,8 +79,8 @@ TEST(QueryStringTest, MalformedQueriesAndUnknownFieldsAreRefusedWithAReason) {
       ParseQueryString(r.query);
       ADD_FAILURE() << r.query << " parsed";
     } catch (const QuerySyntaxError& e) {
-      EXPECT_NE(std::string(e.what()).find(r.says), std::string::npos) << r.query << ": "
-                                                                       << e.what();
+      EXPECT_NE(std::string(e.what()).find(r.says), std::string::npos)
+          << r.query << ": " << e.what();
     }
   }
   const Row meaning[] = {
@@ -96,8 +97,8 @@ TEST(QueryStringTest, MalformedQueriesAndUnknownFieldsAreRefusedWithAReason) {
       ADD_FAILURE() << r.query << " translated";
     } catch (const RequestError& e) {
       EXPECT_EQ(e.type(), "query_shard_exception");
-      EXPECT_NE(std::string(e.what()).find(r.says), std::string::npos) << r.query << ": "
-                                                                       << e.what();
+      EXPECT_NE(std::string(e.what()).find(r.says), std::string::npos)
+          << r.query << ": " << e.what();
     }
   }
   // Nesting is bounded, so a hostile query costs an error, not the stack.

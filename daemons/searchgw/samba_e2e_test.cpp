@@ -102,31 +102,54 @@ class ScratchSmbd {
     for (const char* sub : {"private", "lock", "state", "cache", "pid", "ncalrpc", "log"}) {
       std::filesystem::create_directories(dir + "/" + sub);
     }
-    WriteFile(conf_, "[global]\n"
-                     "\tinterfaces = lo\n"
-                     "\tbind interfaces only = yes\n"
-                     "\tdisable netbios = yes\n"
-                     "\tserver role = standalone server\n"
-                     "\tpassdb backend = tdbsam:" + dir + "/private/passdb.tdb\n"
-                     "\tprivate dir = " + dir + "/private\n"
-                     "\tlock directory = " + dir + "/lock\n"
-                     "\tstate directory = " + dir + "/state\n"
-                     "\tcache directory = " + dir + "/cache\n"
-                     "\tpid directory = " + dir + "/pid\n"
-                     "\tncalrpc dir = " + dir + "/ncalrpc\n"
-                     "\tlog file = " + dir + "/log/log.%m\n"
-                     "\tload printers = no\n"
-                     "\tprintcap name = /dev/null\n"
-                     "\tdisable spoolss = yes\n"
-                     "\telasticsearch:mappings = " + mappings + "\n"
-                     "[share]\n"
-                     "\tpath = " + share_path + "\n"
-                     "\tread only = yes\n"
-                     "\tspotlight = yes\n"
-                     "\tspotlight backend = elasticsearch\n"
-                     "\telasticsearch:address = 127.0.0.1\n"
-                     "\telasticsearch:port = " + std::to_string(kGatewayPort) + "\n"
-                     "\telasticsearch:index = fileindex_share\n");
+    WriteFile(conf_,
+              "[global]\n"
+              "\tinterfaces = lo\n"
+              "\tbind interfaces only = yes\n"
+              "\tdisable netbios = yes\n"
+              "\tserver role = standalone server\n"
+              "\tpassdb backend = tdbsam:" +
+                  dir +
+                  "/private/passdb.tdb\n"
+                  "\tprivate dir = " +
+                  dir +
+                  "/private\n"
+                  "\tlock directory = " +
+                  dir +
+                  "/lock\n"
+                  "\tstate directory = " +
+                  dir +
+                  "/state\n"
+                  "\tcache directory = " +
+                  dir +
+                  "/cache\n"
+                  "\tpid directory = " +
+                  dir +
+                  "/pid\n"
+                  "\tncalrpc dir = " +
+                  dir +
+                  "/ncalrpc\n"
+                  "\tlog file = " +
+                  dir +
+                  "/log/log.%m\n"
+                  "\tload printers = no\n"
+                  "\tprintcap name = /dev/null\n"
+                  "\tdisable spoolss = yes\n"
+                  "\telasticsearch:mappings = " +
+                  mappings +
+                  "\n"
+                  "[share]\n"
+                  "\tpath = " +
+                  share_path +
+                  "\n"
+                  "\tread only = yes\n"
+                  "\tspotlight = yes\n"
+                  "\tspotlight backend = elasticsearch\n"
+                  "\telasticsearch:address = 127.0.0.1\n"
+                  "\telasticsearch:port = " +
+                  std::to_string(kGatewayPort) +
+                  "\n"
+                  "\telasticsearch:index = fileindex_share\n");
     root_ = root;
   }
   ~ScratchSmbd() {
@@ -144,8 +167,7 @@ class ScratchSmbd {
   }
   void Start() {
     smbd_ = std::make_unique<ChildProcess>(
-        root_, std::vector<std::string>{"/usr/sbin/smbd", "--foreground",
-                                        "--configfile=" + conf_});
+        root_, std::vector<std::string>{"/usr/sbin/smbd", "--foreground", "--configfile=" + conf_});
   }
   const std::string& conf() const { return conf_; }
 
@@ -163,8 +185,8 @@ class SambaSpotlightTest : public ::testing::Test {
 
   // The share-relative paths mdsearch prints for `query`, optionally within `scope`.
   std::set<std::string> Mdsearch(const std::string& query, const std::string& scope = "") {
-    std::vector<std::string> args = {"60", "mdsearch", "-s", smbd_->conf(),
-                                     "-U", user_.name + "%" + kPassword};
+    std::vector<std::string> args = {"60",          "mdsearch", "-s",
+                                     smbd_->conf(), "-U",       user_.name + "%" + kPassword};
     if (!scope.empty()) {
       args.push_back("-p");
       args.push_back(scope);
@@ -183,7 +205,8 @@ class SambaSpotlightTest : public ::testing::Test {
 
   // The files and folders below the share, by what the disk says of them (the share-relative
   // path and its status), that `pred` keeps.
-  std::set<std::string> OnDisk(const std::function<bool(const std::string&, const struct stat&)>& pred) {
+  std::set<std::string> OnDisk(
+      const std::function<bool(const std::string&, const struct stat&)>& pred) {
     std::set<std::string> out;
     const std::string root = sys_.Vol("share");
     namespace fs = std::filesystem;
@@ -237,8 +260,8 @@ TEST_F(SambaSpotlightTest, MdsearchListsExactlyTheMatchingFilesOfARealShare) {
   ASSERT_TRUE(WaitFor([&] { return sys_.Documents("share").size() == entries + 1; }, 60000))
       << "indexing did not finish";
 
-  ChildProcess gateway(sys_.root(), {SEARCHGW_BIN, "--foreground", "--port",
-                                     std::to_string(kGatewayPort)});
+  ChildProcess gateway(sys_.root(),
+                       {SEARCHGW_BIN, "--foreground", "--port", std::to_string(kGatewayPort)});
   ASSERT_TRUE(WaitFor([] { return CanConnect(kGatewayPort); }, 20000));
   test::TempDir smb_dir;
   smbd_ = std::make_unique<ScratchSmbd>(sys_.root(), smb_dir.path(), sys_.Vol("share"),
@@ -259,10 +282,9 @@ TEST_F(SambaSpotlightTest, MdsearchListsExactlyTheMatchingFilesOfARealShare) {
             OnDisk([](const std::string&, const struct stat& st) {
               return S_ISREG(st.st_mode) && st.st_size > 100000;
             }));
-  EXPECT_EQ(Mdsearch("kMDItemFSContentChangeDate<$time.iso(2010-01-01T00:00:00Z)"),
-            OnDisk([](const std::string&, const struct stat& st) {
-              return st.st_mtime < 1262304000;
-            }));
+  EXPECT_EQ(
+      Mdsearch("kMDItemFSContentChangeDate<$time.iso(2010-01-01T00:00:00Z)"),
+      OnDisk([](const std::string&, const struct stat& st) { return st.st_mtime < 1262304000; }));
   EXPECT_EQ(Mdsearch("kMDItemDisplayName==\"*foo*\"", "docs"),
             OnDisk([](const std::string& rel, const struct stat&) {
               return rel.rfind("docs/", 0) == 0 && Basename(rel).find("foo") != std::string::npos;
@@ -272,8 +294,8 @@ TEST_F(SambaSpotlightTest, MdsearchListsExactlyTheMatchingFilesOfARealShare) {
   // takes is the benchmark's business).
   WriteFile(S("docs/late_foo.txt"), "late");
   const auto start = std::chrono::steady_clock::now();
-  EXPECT_TRUE(WaitFor([&] { return Mdsearch("kMDItemDisplayName==\"*late*\"").size() == 1; },
-                      20000));
+  EXPECT_TRUE(
+      WaitFor([&] { return Mdsearch("kMDItemDisplayName==\"*late*\"").size() == 1; }, 20000));
   std::cerr << "a new file was found after "
             << std::chrono::duration_cast<std::chrono::milliseconds>(
                    std::chrono::steady_clock::now() - start)

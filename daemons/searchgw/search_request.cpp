@@ -71,8 +71,8 @@ Json::Value Under(std::string folder, const std::string& field) {
   if (!folder.empty() && folder.back() == '*') folder.pop_back();
   while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
   if (folder.empty() || folder[0] != '/' || folder.find('*') != std::string::npos) {
-    throw RequestError(kBadQuery, "the value of " + field + " must be an absolute folder, not \"" +
-                                      folder + "\"");
+    throw RequestError(
+        kBadQuery, "the value of " + field + " must be an absolute folder, not \"" + folder + "\"");
   }
   return Node("under", EncodeName(folder));
 }
@@ -170,7 +170,8 @@ void AppendClauses(const Json::Value& v, const char* member, int depth, Json::Va
   } else if (v.isArray()) {
     for (const Json::Value& c : v) out->append(ReadJsonQuery(c, depth + 1));
   } else {
-    throw RequestError(kParsing, std::string("bool.") + member + " must be a query or a list of them");
+    throw RequestError(kParsing,
+                       std::string("bool.") + member + " must be a query or a list of them");
   }
 }
 
@@ -311,9 +312,9 @@ std::vector<std::string> ReadIndexList(const std::string& part) {
     const size_t comma = part.find(',', start);
     std::string id = part.substr(start, comma == std::string::npos ? comma : comma - start);
     if (id.size() <= prefix.size() || id.compare(0, prefix.size(), prefix) != 0) {
-      throw RequestError("index_not_found_exception",
-                         "no such index [" + id + "]: an index is named " + prefix +
-                             "SHARE (the share's name), or _all");
+      throw RequestError("index_not_found_exception", "no such index [" + id +
+                                                          "]: an index is named " + prefix +
+                                                          "SHARE (the share's name), or _all");
     }
     ids.push_back(std::move(id));
     if (comma == std::string::npos) return ids;
@@ -328,8 +329,7 @@ SearchRequest ReadSearchBody(const std::string& body) {
   builder["strictRoot"] = true;
   builder["rejectDupKeys"] = true;
   const std::unique_ptr<Json::CharReader> reader(builder.newCharReader());
-  if (!reader->parse(body.data(), body.data() + body.size(), &root, &errors) ||
-      !root.isObject()) {
+  if (!reader->parse(body.data(), body.data() + body.size(), &root, &errors) || !root.isObject()) {
     throw RequestError(kParsing, "the request body is not a JSON object");
   }
   SearchRequest r;
@@ -359,8 +359,7 @@ std::string BuildSearchReply(const Json::Value& engine_data) {
   std::string out = "{\"hits\":{\"total\":{\"value\":";
   out += std::to_string(total.isIntegral() ? total.asLargestInt() : 0);
   out += ",\"relation\":\"";
-  out += engine_data["total_exact"].isBool() && !engine_data["total_exact"].asBool() ? "gte"
-                                                                                      : "eq";
+  out += engine_data["total_exact"].isBool() && !engine_data["total_exact"].asBool() ? "gte" : "eq";
   out += "\"},\"hits\":[";
   const std::string tail = "]}}";
   bool first = true;

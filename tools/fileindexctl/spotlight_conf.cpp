@@ -154,9 +154,9 @@ void WriteSpotlightConf(const std::string& path, const SpotlightSettings& s) {
   if (!ok) {
     const int failure = errno;
     ::unlink(tmp.c_str());
-    ORVANE_THROW_IF(true, kErrSystem,
-                    "cannot replace " + path + ": " + std::strerror(failure) +
-                        " (the file is unchanged)");
+    ORVANE_THROW_IF(
+        true, kErrSystem,
+        "cannot replace " + path + ": " + std::strerror(failure) + " (the file is unchanged)");
   }
 }
 
