@@ -106,6 +106,18 @@ void Engine(int fd, const std::string& request) {
       return;
     }
   }
+  // Within /srv/deep, the folder itself comes past the first page; asked by its name, it is found.
+  const std::string tree = JsonToString(req["data"]["query"]);
+  if (tree.find(R"({"match":"name","pattern":"deep"})") != std::string::npos) {
+    FakeDaemon::WriteFrame(fd,
+                           R"({"success":true,"data":{"total":1,"hits":[{"path":"/srv/deep"}]}})");
+    return;
+  }
+  if (tree.find(R"({"under":"/srv/deep"})") != std::string::npos) {
+    FakeDaemon::WriteFrame(
+        fd, R"({"success":true,"data":{"total":5,"hits":[{"path":"/srv/deep/a"}]}})");
+    return;
+  }
   FakeDaemon::WriteFrame(fd, R"({"success":true,"data":{"total":2,"total_exact":true,)"
                              R"("hits":[{"path":"/srv/s","name":"s"},{"path":"/srv/s/a.txt"}]}})");
 }
@@ -149,8 +161,11 @@ TEST_F(GatewayTest, SearchesOnOneKeptAliveConnectionReachTheEngineAndComeBackInS
   EXPECT_EQ(r.status, 400);
   EXPECT_EQ(FakeDaemon::Parse(r.body)["error"]["type"].asString(), "index_not_found_exception");
 
+  r = c.Search("fileindex_s", R"({"query": {"prefix": {"path.real": "/srv/deep/"}}})");
+  EXPECT_NE(r.body.find(R"("total":{"value":4,)"), std::string::npos) << r.body;
+
   const std::vector<Json::Value> sent = engine.json_requests();
-  ASSERT_EQ(sent.size(), 4u);
+  ASSERT_EQ(sent.size(), 6u);
   EXPECT_EQ(JsonToString(sent[0]),
             R"({"command":"search","data":{"from":0,"id":["fileindex_s"],"query":{"and":[)"
             R"({"match":"name","pattern":"*a*"},{"under":"/srv/s"}]},"size":51}})");
