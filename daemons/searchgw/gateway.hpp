@@ -21,7 +21,9 @@ struct GatewayOptions {
   int threads = 4;            // also the most engine searches in progress at once
   int max_connections = 64;
   int max_connections_per_address = 32;
-  int idle_timeout_ms = 60000;    // wait for the first byte of the next request
+  // The wait for the next request's first byte. Long: the file server keeps one connection per
+  // share open between searches, and the first search after the gateway closed it fails.
+  int idle_timeout_ms = 3600 * 1000;
   int request_timeout_ms = 5000;  // the rest of a request, once its first byte came
   int engine_timeout_ms = 15000;  // the engine's answer
   size_t max_header_bytes = 8192;
