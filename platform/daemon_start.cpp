@@ -8,7 +8,10 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
+#include <cstdlib>
 #include <cstring>
+#include <string>
 
 #include "common/env.hpp"
 #include "common/error.hpp"
@@ -157,6 +160,24 @@ void DaemonSignals::Unblock() { pthread_sigmask(SIG_UNBLOCK, &taken_, nullptr); 
 const std::atomic<bool>& DaemonSignals::stop() const { return g_stop; }
 
 bool DaemonSignals::TakeReload() { return g_reload.exchange(false); }
+
+void Daemonize(const char* program) {
+  const pid_t pid = ::fork();
+  if (pid < 0) {
+    std::perror((std::string(program) + ": fork").c_str());
+    std::exit(1);
+  }
+  if (pid > 0) std::_Exit(0);
+  ::setsid();
+  if (::chdir("/") != 0) std::_Exit(1);
+  const int null = ::open("/dev/null", O_RDWR);
+  if (null >= 0) {
+    ::dup2(null, 0);
+    ::dup2(null, 1);
+    ::dup2(null, 2);
+    if (null > 2) ::close(null);
+  }
+}
 
 void NotifyReady() {}
 

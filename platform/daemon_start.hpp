@@ -68,6 +68,11 @@ class DaemonSignals {
   bool take_reload_;
 };
 
+// Detaches from the terminal into a session of its own, standard streams on /dev/null; the
+// parent exits only once the child is on its own. `program` names the daemon in the message of a
+// failed fork.
+void Daemonize(const char* program);
+
 // Called once the daemon serves its clients: the point a service manager's readiness notice
 // hangs off. Nothing to tell yet.
 void NotifyReady();

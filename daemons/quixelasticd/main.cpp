@@ -1,6 +1,5 @@
 // quixelasticd: the search-engine daemon. Serves "/var/run/quixelasticd.sock" (under
 // ORVANE_ROOT) until SIGTERM or SIGINT; see README.md for the commands and options.
-#include <fcntl.h>
 #include <pwd.h>
 #include <syslog.h>
 #include <unistd.h>
@@ -103,24 +102,6 @@ bool ParseFlags(int argc, char** argv, Flags* f) {
   return true;
 }
 
-// Detaches from the terminal; the parent returns only after the child is on its own.
-void Daemonize() {
-  const pid_t pid = ::fork();
-  if (pid < 0) {
-    std::perror("quixelasticd: fork");
-    std::exit(1);
-  }
-  if (pid > 0) std::_Exit(0);
-  ::setsid();
-  if (::chdir("/") != 0) std::_Exit(1);
-  const int null = ::open("/dev/null", O_RDWR);
-  if (null >= 0) {
-    ::dup2(null, 0);
-    ::dup2(null, 1);
-    ::dup2(null, 2);
-    if (null > 2) ::close(null);
-  }
-}
 
 // The engine's and the server's options from the flags (paths under ORVANE_ROOT).
 void ToOptions(const Flags& flags, orvane::elasticd::EngineOptions* engine_options,
@@ -184,7 +165,7 @@ int Serve(const Flags& flags, orvane::platform::DaemonSignals* signals) {
 int main(int argc, char** argv) {
   Flags flags;
   if (!ParseFlags(argc, argv, &flags)) return 2;
-  if (!flags.foreground) Daemonize();
+  if (!flags.foreground) orvane::platform::Daemonize("quixelasticd");
   orvane::SetLogSink(orvane::SyslogSink(flags.foreground));
   ::openlog("quixelasticd", LOG_PID, LOG_DAEMON);
 

@@ -1,7 +1,6 @@
 // searchgw: the HTTP search gateway for Samba's Spotlight service. Listens on 127.0.0.1 (port
 // 9210) until SIGTERM or SIGINT and answers `_search` requests from the search engine's
 // indexes; see README.md.
-#include <fcntl.h>
 #include <syslog.h>
 #include <unistd.h>
 
@@ -91,31 +90,13 @@ bool ParseFlags(int argc, char** argv, Flags* f) {
   return true;
 }
 
-// Detaches from the terminal; the parent returns only after the child is on its own.
-void Daemonize() {
-  const pid_t pid = ::fork();
-  if (pid < 0) {
-    std::perror("searchgw: fork");
-    std::exit(1);
-  }
-  if (pid > 0) std::_Exit(0);
-  ::setsid();
-  if (::chdir("/") != 0) std::_Exit(1);
-  const int null = ::open("/dev/null", O_RDWR);
-  if (null >= 0) {
-    ::dup2(null, 0);
-    ::dup2(null, 1);
-    ::dup2(null, 2);
-    if (null > 2) ::close(null);
-  }
-}
 
 }  // namespace
 
 int main(int argc, char** argv) {
   Flags flags;
   if (!ParseFlags(argc, argv, &flags)) return 2;
-  if (!flags.foreground) Daemonize();
+  if (!flags.foreground) orvane::platform::Daemonize("searchgw");
   orvane::SetLogSink(orvane::SyslogSink(flags.foreground));
   ::openlog("searchgw", LOG_PID, LOG_DAEMON);
 
