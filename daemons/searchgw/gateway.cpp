@@ -21,6 +21,7 @@
 #include "common/json_util.hpp"
 #include "common/log.hpp"
 #include "common/wire.hpp"
+#include "daemons/searchgw/peer_uid.hpp"
 #include "daemons/searchgw/search_request.hpp"
 #include "platform/daemon_sock.hpp"
 
@@ -59,12 +60,18 @@ struct Gateway::Impl {
   bool Admit(const asio::ip::address& peer);
   void Release(const asio::ip::address& peer);
   void Accept();
-  void Refuse(tcp::socket socket, const std::string& why);
+  // Whose searches a connection asks for: the owner of the peer's socket, root for a peer on
+  // another machine; nothing (and why) when that cannot be told.
+  std::optional<uid_t> Asker(const tcp::socket& s, const tcp::endpoint& peer,
+                             std::string* why) const;
+  void Refuse(tcp::socket socket, int status, const std::string& type, const std::string& why);
   // The reply body for one search; a Failure when there is none to give.
-  std::optional<Failure> Search(const std::vector<std::string>& ids, const SearchRequest& req,
+  std::optional<Failure> Search(uid_t uid, const std::vector<std::string>& ids,
+                                const SearchRequest& req,
                                 std::string* body);
   // One search request to the engine: its reply's data, or why there is none.
-  std::optional<Failure> Engine(const Json::Value& query, const std::vector<std::string>& ids,
+  std::optional<Failure> Engine(uid_t uid, const Json::Value& query,
+                                const std::vector<std::string>& ids,
                                 int64_t from, int64_t size, Json::Value* data);
 
   GatewayOptions opt;
@@ -87,8 +94,8 @@ namespace {
 // read. Lives as long as an operation of it is pending.
 class Session : public std::enable_shared_from_this<Session> {
  public:
-  Session(Gateway::Impl* gw, tcp::socket socket, asio::ip::address peer)
-      : gw_(gw), stream_(std::move(socket)), peer_(std::move(peer)) {}
+  Session(Gateway::Impl* gw, tcp::socket socket, asio::ip::address peer, uid_t uid)
+      : gw_(gw), stream_(std::move(socket)), peer_(std::move(peer)), uid_(uid) {}
   ~Session() { gw_->Release(peer_); }
 
   void WaitForRequest() {
@@ -156,7 +163,7 @@ class Session : public std::enable_shared_from_this<Session> {
       try {
         const std::vector<std::string> ids = ReadIndexList(target.substr(1, slash - 1));
         const SearchRequest search = ReadSearchBody(req.body());
-        failure = gw_->Search(ids, search, &body);
+        failure = gw_->Search(uid_, ids, search, &body);
       } catch (const RequestError& e) {
         failure = Failure{http::status::bad_request, e.type(), e.what()};
       }
@@ -195,6 +202,7 @@ class Session : public std::enable_shared_from_this<Session> {
   Gateway::Impl* gw_;
   beast::tcp_stream stream_;
   asio::ip::address peer_;
+  uid_t uid_;  // whose view of the index its searches get
   beast::flat_buffer buffer_;
   std::optional<http::request_parser<http::string_body>> parser_;
   http::response<http::string_body> res_;
@@ -220,17 +228,36 @@ void Gateway::Impl::Release(const asio::ip::address& peer) {
   if (--per_address[peer] <= 0) per_address.erase(peer);
 }
 
-void Gateway::Impl::Refuse(tcp::socket socket, const std::string& why) {
+std::optional<uid_t> Gateway::Impl::Asker(const tcp::socket& s, const tcp::endpoint& peer,
+                                          std::string* why) const {
+  beast::error_code ec;
+  const tcp::endpoint local = s.local_endpoint(ec);
+  if (ec) {
+    *why = ec.message();
+    return std::nullopt;
+  }
+  const std::optional<uid_t> uid = LocalPeerUid(local, peer);
+  if (uid) return uid;
+  // Not a socket of this machine: only an administrator's listening address lets such peers in,
+  // and they search as the file server's own service does.
+  if (!local.address().is_loopback()) return 0;
+  *why = "the owner of the connection cannot be told";
+  return std::nullopt;
+}
+
+void Gateway::Impl::Refuse(tcp::socket socket, int status, const std::string& type,
+                           const std::string& why) {
   const uint64_t n = ++refused;
   if (IsPowerOfTwo(n)) {
     ORVANE_LOG(LOG_WARNING, "connection refused: %s (%llu refused so far)", why.c_str(),
                static_cast<unsigned long long>(n));
   }
   // One try without waiting: a refused client costs an accept, a write and a close.
-  const std::string body = BuildErrorBody("es_rejected_execution_exception", why, 429);
+  const std::string body = BuildErrorBody(type, why, status);
   const std::string text =
-      "HTTP/1.1 429 Too Many Requests\r\nContent-Type: application/json\r\n"
-      "Connection: close\r\nContent-Length: " +
+      "HTTP/1.1 " + std::to_string(status) + " " +
+      std::string(http::obsolete_reason(static_cast<http::status>(status))) +
+      "\r\nContent-Type: application/json\r\nConnection: close\r\nContent-Length: " +
       std::to_string(body.size()) + "\r\n\r\n" + body;
   beast::error_code ignored;
   socket.non_blocking(true, ignored);
@@ -251,21 +278,27 @@ void Gateway::Impl::Accept() {
       return;
     }
     beast::error_code peer_ec;
-    const asio::ip::address peer = s.remote_endpoint(peer_ec).address();
+    const tcp::endpoint peer_end = s.remote_endpoint(peer_ec);
+    const asio::ip::address peer = peer_end.address();
+    std::string why;
+    std::optional<uid_t> uid;
     if (peer_ec) {
       s.close(peer_ec);
+    } else if (!(uid = Asker(s, peer_end, &why))) {
+      Refuse(std::move(s), 403, "security_exception", why);
     } else if (!Admit(peer)) {
-      Refuse(std::move(s), "too many connections (at most " + std::to_string(opt.max_connections) +
-                               ", " + std::to_string(opt.max_connections_per_address) +
-                               " per address): close some and try again");
+      Refuse(std::move(s), 429, "es_rejected_execution_exception",
+             "too many connections (at most " + std::to_string(opt.max_connections) + ", " +
+                 std::to_string(opt.max_connections_per_address) +
+                 " per address): close some and try again");
     } else {
-      std::make_shared<Session>(this, std::move(s), peer)->WaitForRequest();
+      std::make_shared<Session>(this, std::move(s), peer, *uid)->WaitForRequest();
     }
     Accept();
   });
 }
 
-std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query,
+std::optional<Failure> Gateway::Impl::Engine(uid_t uid, const Json::Value& query,
                                              const std::vector<std::string>& ids, int64_t from,
                                              int64_t size, Json::Value* data) {
   Json::Value request(Json::objectValue);
@@ -287,7 +320,18 @@ std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query,
     quixdaemon::DomainSockConnection conn(opt.engine_socket);
     conn.SetTimeouts(opt.engine_timeout_ms, opt.engine_timeout_ms);
     std::string text;
-    if (!conn.Connect(opt.engine_timeout_ms) || !conn.Send(request_text) || !conn.Recv(text)) {
+    bool connected;
+    {
+      // The engine judges each hit by the credentials the connection was made with.
+      const ThreadCredentials as(uid);
+      if (!as.ok()) {
+        ORVANE_LOG(LOG_ERR, "cannot search as uid %u: %m", static_cast<unsigned>(uid));
+        return Failure{http::status::forbidden, "security_exception",
+                       "cannot search as uid " + std::to_string(uid)};
+      }
+      connected = conn.Connect(opt.engine_timeout_ms);
+    }
+    if (!connected || !conn.Send(request_text) || !conn.Recv(text)) {
       ORVANE_LOG(LOG_ERR, "search engine at %s: %s", opt.engine_socket.c_str(),
                  std::strerror(errno));
       return down;
@@ -330,12 +374,12 @@ std::optional<Failure> Gateway::Impl::Engine(const Json::Value& query,
   }
 }
 
-std::optional<Failure> Gateway::Impl::Search(const std::vector<std::string>& ids,
+std::optional<Failure> Gateway::Impl::Search(uid_t uid, const std::vector<std::string>& ids,
                                              const SearchRequest& req, std::string* body) {
   Json::Value data;
   std::optional<Failure> failure;
   if (req.scope.empty()) {
-    failure = Engine(req.query, ids, req.from, req.size, &data);
+    failure = Engine(uid, req.query, ids, req.from, req.size, &data);
     if (!failure) *body = BuildSearchReply(data);
     return failure;
   }
@@ -344,7 +388,7 @@ std::optional<Failure> Gateway::Impl::Search(const std::vector<std::string>& ids
   auto is_scope = [&](const Json::Value& hit) { return hit["path"].asString() == req.scope; };
   const bool whole = req.from + req.size + 1 <= kMaxPageSize;
   const int64_t from = whole ? 0 : req.from;
-  failure = Engine(req.query, ids, from, req.from + req.size + 1 - from, &data);
+  failure = Engine(uid, req.query, ids, from, req.from + req.size + 1 - from, &data);
   if (failure) return failure;
   Json::Value& hits = data["hits"];
   bool found = false;
@@ -368,7 +412,7 @@ std::optional<Failure> Gateway::Impl::Search(const std::vector<std::string>& ids
       match["pattern"] = name;
       check["and"].append(match);
       Json::Value named;
-      failure = Engine(check, ids, 0, kMaxPageSize, &named);
+      failure = Engine(uid, check, ids, 0, kMaxPageSize, &named);
       if (failure) return failure;
       for (const Json::Value& hit : named["hits"]) found = found || is_scope(hit);
     }

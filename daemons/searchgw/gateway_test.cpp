@@ -5,10 +5,12 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -258,6 +260,35 @@ TEST_F(GatewayTest, AnEngineThatIsNotRunningIsA503) {
   const Response r = Client(port()).Search("fileindex_s", "{}");
   EXPECT_EQ(r.status, 503);
   EXPECT_NE(r.body.find("is quixelasticd running?"), std::string::npos);
+}
+
+// A local user searches with their own rights: the engine is asked on a connection made with
+// that user's credentials, and judges every hit by them.
+TEST_F(GatewayTest, EachLocalUserSearchesAsThemselves) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act as another user";
+  std::vector<uid_t> askers;
+  std::mutex mu;
+  FakeDaemon engine(dir_.Path("engine.sock"), [&](int fd, const std::string& request) {
+    ucred cred{};
+    socklen_t len = sizeof cred;
+    ::getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &cred, &len);
+    {
+      std::lock_guard<std::mutex> lock(mu);
+      askers.push_back(cred.uid);
+    }
+    Engine(fd, request);
+  });
+  // The engine's socket must be reachable by the user, as the real public socket is.
+  ASSERT_EQ(::chmod(dir_.path().c_str(), 0711), 0);
+  ASSERT_EQ(::chmod(dir_.Path("engine.sock").c_str(), 0666), 0);
+  StartGateway();
+  const uint16_t p = port();
+  // An exit status holds 8 bits: the status class comes back.
+  EXPECT_EQ(test::RunAsUser("nobody",
+                            [p] { return Client(p).Search("fileindex_s", "{}").status / 100; }),
+            2);
+  EXPECT_EQ(Client(p).Search("fileindex_s", "{}").status, 200);
+  EXPECT_EQ(askers, (std::vector<uid_t>{65534, 0}));
 }
 
 }  // namespace
