@@ -4,6 +4,7 @@
 #include <poll.h>
 #include <sys/file.h>
 #include <sys/stat.h>
+#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -15,6 +16,7 @@
 
 #include "common/env.hpp"
 #include "common/error.hpp"
+#include "common/log.hpp"
 #include "platform/fault.hpp"
 
 namespace orvane {
@@ -177,6 +179,12 @@ void Daemonize(const char* program) {
     ::dup2(null, 2);
     if (null > 2) ::close(null);
   }
+}
+
+void BecomeDaemon(const char* program, bool foreground) {
+  if (!foreground) Daemonize(program);
+  ::openlog(program, LOG_PID, LOG_DAEMON);
+  SetLogSink(SyslogSink(foreground));
 }
 
 void NotifyReady() {}

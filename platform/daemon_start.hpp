@@ -73,6 +73,10 @@ class DaemonSignals {
 // failed fork.
 void Daemonize(const char* program);
 
+// A daemon's first step: detached unless `foreground`, its log lines to the system log under the
+// name `program` (a literal: the log keeps the pointer), and to standard error in the foreground.
+void BecomeDaemon(const char* program, bool foreground);
+
 // Called once the daemon serves its clients: the point a service manager's readiness notice
 // hangs off. Nothing to tell yet.
 void NotifyReady();

@@ -71,8 +71,7 @@ int main(int argc, char** argv) {
       return 2;
     }
   }
-  openlog("fileindexd", LOG_PID, LOG_DAEMON);
-  orvane::SetLogSink(orvane::SyslogSink(true));
+  orvane::platform::BecomeDaemon("fileindexd", true);
 
   // Before any thread starts, so that every one of them leaves the signals to the main thread.
   orvane::platform::DaemonSignals signals(true);

@@ -165,9 +165,7 @@ int Serve(const Flags& flags, orvane::platform::DaemonSignals* signals) {
 int main(int argc, char** argv) {
   Flags flags;
   if (!ParseFlags(argc, argv, &flags)) return 2;
-  if (!flags.foreground) orvane::platform::Daemonize("quixelasticd");
-  orvane::SetLogSink(orvane::SyslogSink(flags.foreground));
-  ::openlog("quixelasticd", LOG_PID, LOG_DAEMON);
+  orvane::platform::BecomeDaemon("quixelasticd", flags.foreground);
 
   // Before any thread starts, so that every one of them leaves the signals to the main thread.
   orvane::platform::DaemonSignals signals(false);

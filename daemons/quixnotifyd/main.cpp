@@ -62,8 +62,7 @@ int main(int argc, char** argv) {
       return 2;
     }
   }
-  openlog("quixnotifyd", LOG_PID, LOG_DAEMON);
-  orvane::SetLogSink(orvane::SyslogSink(true));
+  orvane::platform::BecomeDaemon("quixnotifyd", true);
 
   orvane::platform::DaemonSignals signals(true);
   try {

@@ -90,15 +90,12 @@ bool ParseFlags(int argc, char** argv, Flags* f) {
   return true;
 }
 
-
 }  // namespace
 
 int main(int argc, char** argv) {
   Flags flags;
   if (!ParseFlags(argc, argv, &flags)) return 2;
-  if (!flags.foreground) orvane::platform::Daemonize("searchgw");
-  orvane::SetLogSink(orvane::SyslogSink(flags.foreground));
-  ::openlog("searchgw", LOG_PID, LOG_DAEMON);
+  orvane::platform::BecomeDaemon("searchgw", flags.foreground);
 
   orvane::platform::DaemonSignals signals(false);
   flags.gateway.engine_socket = orvane::RootedPath(flags.engine_socket);
