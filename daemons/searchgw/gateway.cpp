@@ -57,12 +57,15 @@ std::string ForLog(const std::string& text) {
 struct Gateway::Impl {
   explicit Impl(GatewayOptions o) : opt(std::move(o)) {}
 
-  bool Admit(const asio::ip::address& peer);
-  void Release(const asio::ip::address& peer);
+  // Counts a connection of `who` (a local user, or a remote address); false when it is one too
+  // many in all or for `who`.
+  bool Admit(const std::string& who);
+  void Release(const std::string& who);
   void Accept();
   // Whose searches a connection asks for: the owner of the peer's socket, root for a peer on
-  // another machine; nothing (and why) when that cannot be told.
-  std::optional<uid_t> Asker(const tcp::socket& s, const tcp::endpoint& peer,
+  // another machine; nothing (and why) when that cannot be told. `who` names the asker for the
+  // connection caps: local users share one address, so they are counted by uid.
+  std::optional<uid_t> Asker(const tcp::socket& s, const tcp::endpoint& peer, std::string* who,
                              std::string* why) const;
   void Refuse(tcp::socket socket, int status, const std::string& type, const std::string& why);
   // The reply body for one search; a Failure when there is none to give.
@@ -77,7 +80,7 @@ struct Gateway::Impl {
   GatewayOptions opt;
   // Declared before the I/O context so that they outlive the connections it destroys.
   std::mutex mu;
-  std::map<asio::ip::address, int> per_address;
+  std::map<std::string, int> per_asker;
   int connections = 0;
   std::atomic<uint64_t> refused{0};
   uint16_t port = 0;
@@ -94,9 +97,11 @@ namespace {
 // read. Lives as long as an operation of it is pending.
 class Session : public std::enable_shared_from_this<Session> {
  public:
-  Session(Gateway::Impl* gw, tcp::socket socket, asio::ip::address peer, uid_t uid)
-      : gw_(gw), stream_(std::move(socket)), peer_(std::move(peer)), uid_(uid) {}
-  ~Session() { gw_->Release(peer_); }
+  Session(Gateway::Impl* gw, tcp::socket socket, asio::ip::address peer, uid_t uid,
+          std::string who)
+      : gw_(gw), stream_(std::move(socket)), peer_(std::move(peer)), uid_(uid),
+        who_(std::move(who)) {}
+  ~Session() { gw_->Release(who_); }
 
   void WaitForRequest() {
     parser_.emplace();
@@ -203,6 +208,7 @@ class Session : public std::enable_shared_from_this<Session> {
   beast::tcp_stream stream_;
   asio::ip::address peer_;
   uid_t uid_;  // whose view of the index its searches get
+  std::string who_;  // what its place in the connection caps is counted under
   beast::flat_buffer buffer_;
   std::optional<http::request_parser<http::string_body>> parser_;
   http::response<http::string_body> res_;
@@ -210,11 +216,11 @@ class Session : public std::enable_shared_from_this<Session> {
 
 }  // namespace
 
-bool Gateway::Impl::Admit(const asio::ip::address& peer) {
+bool Gateway::Impl::Admit(const std::string& who) {
   std::lock_guard<std::mutex> lock(mu);
-  int& mine = per_address[peer];
-  if (connections >= opt.max_connections || mine >= opt.max_connections_per_address) {
-    if (mine == 0) per_address.erase(peer);
+  int& mine = per_asker[who];
+  if (connections >= opt.max_connections || mine >= opt.max_connections_per_user) {
+    if (mine == 0) per_asker.erase(who);
     return false;
   }
   ++mine;
@@ -222,14 +228,14 @@ bool Gateway::Impl::Admit(const asio::ip::address& peer) {
   return true;
 }
 
-void Gateway::Impl::Release(const asio::ip::address& peer) {
+void Gateway::Impl::Release(const std::string& who) {
   std::lock_guard<std::mutex> lock(mu);
   --connections;
-  if (--per_address[peer] <= 0) per_address.erase(peer);
+  if (--per_asker[who] <= 0) per_asker.erase(who);
 }
 
 std::optional<uid_t> Gateway::Impl::Asker(const tcp::socket& s, const tcp::endpoint& peer,
-                                          std::string* why) const {
+                                          std::string* who, std::string* why) const {
   beast::error_code ec;
   const tcp::endpoint local = s.local_endpoint(ec);
   if (ec) {
@@ -237,10 +243,16 @@ std::optional<uid_t> Gateway::Impl::Asker(const tcp::socket& s, const tcp::endpo
     return std::nullopt;
   }
   const std::optional<uid_t> uid = LocalPeerUid(local, peer);
-  if (uid) return uid;
+  if (uid) {
+    *who = "uid " + std::to_string(*uid);
+    return uid;
+  }
   // Not a socket of this machine: only an administrator's listening address lets such peers in,
   // and they search as the file server's own service does.
-  if (!local.address().is_loopback()) return 0;
+  if (!local.address().is_loopback()) {
+    *who = peer.address().to_string();
+    return 0;
+  }
   *why = "the owner of the connection cannot be told";
   return std::nullopt;
 }
@@ -280,19 +292,20 @@ void Gateway::Impl::Accept() {
     beast::error_code peer_ec;
     const tcp::endpoint peer_end = s.remote_endpoint(peer_ec);
     const asio::ip::address peer = peer_end.address();
+    std::string who;
     std::string why;
     std::optional<uid_t> uid;
     if (peer_ec) {
       s.close(peer_ec);
-    } else if (!(uid = Asker(s, peer_end, &why))) {
+    } else if (!(uid = Asker(s, peer_end, &who, &why))) {
       Refuse(std::move(s), 403, "security_exception", why);
-    } else if (!Admit(peer)) {
+    } else if (!Admit(who)) {
       Refuse(std::move(s), 429, "es_rejected_execution_exception",
              "too many connections (at most " + std::to_string(opt.max_connections) + ", " +
-                 std::to_string(opt.max_connections_per_address) +
-                 " per address): close some and try again");
+                 std::to_string(opt.max_connections_per_user) + " of " + who +
+                 "): close some and try again");
     } else {
-      std::make_shared<Session>(this, std::move(s), peer, *uid)->WaitForRequest();
+      std::make_shared<Session>(this, std::move(s), peer, *uid, std::move(who))->WaitForRequest();
     }
     Accept();
   });

@@ -19,8 +19,10 @@ struct GatewayOptions {
   uint16_t port = 9210;       // 0: any free port (see Gateway::port())
   std::string engine_socket;  // a real path (already under ORVANE_ROOT)
   int threads = 4;            // also the most engine searches in progress at once
-  int max_connections = 64;
-  int max_connections_per_address = 32;
+  // Local users all come from one address, so a local user is counted by uid (a remote peer by
+  // its address): one user holding connections leaves room for the others.
+  int max_connections = 128;
+  int max_connections_per_user = 16;
   // The wait for the next request's first byte. Long: the file server keeps one connection per
   // share open between searches, and the first search after the gateway closed it fails.
   int idle_timeout_ms = 3600 * 1000;

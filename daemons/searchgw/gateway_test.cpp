@@ -223,7 +223,7 @@ TEST_F(GatewayTest, ConnectionsBeyondTheCapAreRefusedAtOnceAndIdleOnesTimeOut) {
   FakeDaemon engine(dir_.Path("engine.sock"), Engine);
   GatewayOptions o;
   o.max_connections = 16;
-  o.max_connections_per_address = 16;
+  o.max_connections_per_user = 16;
   o.idle_timeout_ms = 2000;
   StartGateway(o);
   // A thousand connections held at once: the first sixteen are kept, every other one is told
@@ -263,7 +263,8 @@ TEST_F(GatewayTest, AnEngineThatIsNotRunningIsA503) {
 }
 
 // A local user searches with their own rights: the engine is asked on a connection made with
-// that user's credentials, and judges every hit by them.
+// that user's credentials, and judges every hit by them. Local users share one address, so each
+// is counted by uid against the connection caps.
 TEST_F(GatewayTest, EachLocalUserSearchesAsThemselves) {
   if (geteuid() != 0) GTEST_SKIP() << "needs root to act as another user";
   std::vector<uid_t> askers;
@@ -281,13 +282,19 @@ TEST_F(GatewayTest, EachLocalUserSearchesAsThemselves) {
   // The engine's socket must be reachable by the user, as the real public socket is.
   ASSERT_EQ(::chmod(dir_.path().c_str(), 0711), 0);
   ASSERT_EQ(::chmod(dir_.Path("engine.sock").c_str(), 0666), 0);
-  StartGateway();
+  GatewayOptions o;
+  o.max_connections_per_user = 2;
+  StartGateway(o);
   const uint16_t p = port();
+  // Root holding all of its places leaves another local user's unharmed.
+  Client held1(p), held2(p);
+  ASSERT_TRUE(held1.connected() && held2.connected());
+  EXPECT_EQ(Client(p).Read().status, 429);
   // An exit status holds 8 bits: the status class comes back.
   EXPECT_EQ(test::RunAsUser("nobody",
                             [p] { return Client(p).Search("fileindex_s", "{}").status / 100; }),
             2);
-  EXPECT_EQ(Client(p).Search("fileindex_s", "{}").status, 200);
+  EXPECT_EQ(held1.Search("fileindex_s", "{}").status, 200);
   EXPECT_EQ(askers, (std::vector<uid_t>{65534, 0}));
 }
 

@@ -22,7 +22,7 @@ namespace {
 const char kUsage[] =
     "usage: searchgw [--foreground] [--address IP] [--port N] [--engine-socket PATH]\n"
     "                [--pid-file PATH] [--threads N] [--max-connections N]\n"
-    "                [--max-connections-per-address N] [--idle-timeout-ms N]\n"
+    "                [--max-connections-per-user N] [--idle-timeout-ms N]\n"
     "                [--request-timeout-ms N]\n";
 
 struct Flags {
@@ -74,8 +74,8 @@ bool ParseFlags(int argc, char** argv, Flags* f) {
       ok = number(1, 64, &g.threads);
     else if (arg == "--max-connections")
       ok = number(1, 100000, &g.max_connections);
-    else if (arg == "--max-connections-per-address")
-      ok = number(1, 100000, &g.max_connections_per_address);
+    else if (arg == "--max-connections-per-user")
+      ok = number(1, 100000, &g.max_connections_per_user);
     else if (arg == "--idle-timeout-ms")
       ok = number(1, 86400000, &g.idle_timeout_ms);
     else if (arg == "--request-timeout-ms")
