@@ -61,7 +61,9 @@ PidFile::PidFile(const std::string& path) : path_(path) {
   // names once it is held.
   constexpr int kAttempts = 8;
   for (int attempt = 1;; ++attempt) {
-    fd_.Reset(open(path_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+    // Not through a link: where others may write to the pid file's folder, a planted link would
+    // have root truncate and write the file it points to.
+    fd_.Reset(open(path_.c_str(), O_RDWR | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0644));
     ORVANE_THROW_IF(!fd_.valid(), kErrSystem,
                     "cannot open the pid file " + path_ + ": " + std::strerror(errno));
     if (flock(fd_.get(), LOCK_EX | LOCK_NB) != 0) {

@@ -40,6 +40,12 @@ TEST(PidFileTest, HeldForTheLifeOfTheProcessAndRemovedAtACleanStop) {
   // A folder that cannot hold it is named too.
   EXPECT_THAT(test::ErrorOf([&] { PidFile(dir.Path("none/d.pid")); }).what(),
               HasSubstr("cannot open the pid file " + dir.Path("none/d.pid")));
+  // A link planted at the path is refused, and what it points to is left untouched.
+  const std::string target = dir.Write("victim", "keep");
+  ASSERT_EQ(symlink(target.c_str(), path.c_str()), 0);
+  EXPECT_THAT(test::ErrorOf([&] { PidFile planted(path); }).what(),
+              HasSubstr("cannot open the pid file " + path));
+  EXPECT_EQ(test::ReadFile(target), "keep");
 }
 
 TEST(PidFileTest, TheFileOfAKilledHolderIsTakenOverAndSaysTheRunDidNotStopCleanly) {
