@@ -1,8 +1,8 @@
 // Who is at the other end of a loopback TCP connection. The file server's search backend sends
 // no credentials, so the gateway tells it from other local users by the owner of its socket,
 // which the kernel tells through its socket diagnostics. Stateless; safe from any thread.
-#ifndef ORVANE_DAEMONS_SEARCHGW_PEER_UID_HPP_
-#define ORVANE_DAEMONS_SEARCHGW_PEER_UID_HPP_
+#ifndef ORVANE_DAEMONS_HTTP_PEER_UID_HPP_
+#define ORVANE_DAEMONS_HTTP_PEER_UID_HPP_
 
 #include <sys/types.h>
 
@@ -10,7 +10,7 @@
 #include <optional>
 
 namespace orvane {
-namespace searchgw {
+namespace httpd {
 
 // The uid owning the socket whose own end is `peer` and whose other end is `local` (our end of
 // an accepted connection); nothing when no such socket is listed (the peer is on another
@@ -36,7 +36,7 @@ class ThreadCredentials {
   bool ok_ = true;
 };
 
-}  // namespace searchgw
+}  // namespace httpd
 }  // namespace orvane
 
-#endif  // ORVANE_DAEMONS_SEARCHGW_PEER_UID_HPP_
+#endif  // ORVANE_DAEMONS_HTTP_PEER_UID_HPP_

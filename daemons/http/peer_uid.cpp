@@ -1,4 +1,4 @@
-#include "daemons/searchgw/peer_uid.hpp"
+#include "daemons/http/peer_uid.hpp"
 
 #include <linux/inet_diag.h>
 #include <linux/netlink.h>
@@ -16,7 +16,7 @@
 #include "common/fd.hpp"
 
 namespace orvane {
-namespace searchgw {
+namespace httpd {
 namespace {
 
 using boost::asio::ip::tcp;
@@ -100,5 +100,5 @@ ThreadCredentials::~ThreadCredentials() {
   }
 }
 
-}  // namespace searchgw
+}  // namespace httpd
 }  // namespace orvane
