@@ -10,6 +10,10 @@
 
 #include "common/util.hpp"
 #include "extract/extractor.hpp"
+#include "extract/html.hpp"
+#include "extract/mail.hpp"
+#include "extract/ocr.hpp"
+#include "extract/tool_extract.hpp"
 
 namespace orvane {
 namespace extract {
@@ -31,7 +35,8 @@ struct Kind {
 
 // Generic containers: a type that says no more than this leaves the name to tell.
 bool IsGenericContainer(const std::string& mime) {
-  return mime == "application/zip" || mime == "application/octet-stream";
+  return mime == "application/zip" || mime == "application/octet-stream" ||
+         mime == "application/CDFV2" || mime == "application/x-ole-storage";
 }
 
 const std::vector<Kind>& Kinds() {
@@ -40,11 +45,24 @@ const std::vector<Kind>& Kinds() {
       {"ooxml", {"application/vnd.openxmlformats-officedocument."}, {"docx", "xlsx", "pptx"},
        ExtractOoxml},
       {"odf", {"application/vnd.oasis.opendocument."}, {"odt", "ods", "odp"}, ExtractOdf},
+      {"epub", {"application/epub+zip"}, {"epub"}, ExtractEpub},
+      {"word97", {"application/msword"}, {"doc", "dot"}, ExtractLegacyWord},
+      {"excel97", {"application/vnd.ms-excel"}, {"xls", "xlt"}, ExtractLegacyExcel},
+      {"powerpoint97", {"application/vnd.ms-powerpoint"}, {"ppt", "pps", "pot"},
+       ExtractLegacyPowerPoint},
+      {"html", {"text/html", "application/xhtml+xml"}, {}, ExtractHtml},
+      {"xml", {"text/xml", "application/xml"}, {}, ExtractXml},
+      {"mail", {"message/rfc822"}, {}, ExtractMessage},
+      {"mbox", {"application/mbox"}, {}, ExtractMailbox},
+      {"rtf", {"text/rtf", "application/rtf"}, {}, ExtractRtf},
+      {"man", {"text/troff"}, {}, ExtractManPage},
+      {"postscript", {"application/postscript"}, {}, ExtractPostScript},
+      {"djvu", {"image/vnd.djvu"}, {}, ExtractDjvu},
       {"audio", {"audio/"}, {}, ExtractAudio},
-      {"photo", {"image/"}, {}, ExtractPhoto},
+      {"photo", {"image/"}, {}, ExtractImageWithText},
       {"video", {"video/"}, {}, ExtractVideo},
       {"text",
-       {"text/", "application/json", "application/xml", "application/javascript",
+       {"text/", "application/json", "application/javascript",
         "application/x-subrip"},
        {},
        ExtractText},

@@ -76,6 +76,7 @@ class TextSink {
     if (!text_.empty() && text_.back() != '\n' && !full()) text_ += '\n';
   }
   bool full() const { return text_.size() >= max_; }
+  bool at_line_start() const { return text_.empty() || text_.back() == '\n'; }
   size_t size() const { return text_.size(); }
   std::string Take() { return CleanUtf8(text_, max_); }
 
