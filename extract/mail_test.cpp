@@ -1,0 +1,101 @@
+#include "extract/mail.hpp"
+
+#include <gtest/gtest.h>
+
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace extract {
+namespace {
+
+// A message as a mail program writes it: encoded headers, a Latin-1 quoted-printable body with
+// an HTML alternative, and a base64 attachment.
+const char kMessage[] =
+    "From: =?ISO-8859-1?Q?Andr=E9?= <andre@example.org>\n"
+    "To: Bob <bob@example.org>\n"
+    "Cc: carol@example.org\n"
+    "Subject: Quarterly =?ISO-8859-1?Q?r=E9sum=E9?=\n"
+    "Date: Tue, 07 May 2024 09:08:09 +0000\n"
+    "MIME-Version: 1.0\n"
+    "Content-Type: multipart/mixed; boundary=\"b1\"\n"
+    "\n"
+    "--b1\n"
+    "Content-Type: multipart/alternative; boundary=\"b2\"\n"
+    "\n"
+    "--b2\n"
+    "Content-Type: text/plain; charset=iso-8859-1\n"
+    "Content-Transfer-Encoding: quoted-printable\n"
+    "\n"
+    "Le caf=E9 est pr=EAt, mailbodyword.\n"
+    "--b2\n"
+    "Content-Type: text/html; charset=utf-8\n"
+    "\n"
+    "<html><body><p>htmlpartword</p><script>scriptword</script></body></html>\n"
+    "--b2--\n"
+    "--b1\n"
+    "Content-Type: text/plain; name=\"notes.txt\"\n"
+    "Content-Disposition: attachment; filename=\"notes.txt\"\n"
+    "Content-Transfer-Encoding: base64\n"
+    "\n"
+    "YXR0YWNoZWR3b3JkIGluc2lkZQo=\n"
+    "--b1--\n";
+
+class MailTest : public ::testing::Test {
+ protected:
+  template <typename F>
+  Json::Value Run(F extract, const std::string& path) {
+    Json::Value fields(Json::objectValue);
+    extract(OpenedFile(path), fields);
+    return fields;
+  }
+
+  test::TempDir dir_;
+};
+
+TEST_F(MailTest, HeadersBecomeFieldsAndEveryPartItsText) {
+  const Json::Value f = Run(ExtractMessage, dir_.Write("m.eml", kMessage));
+  EXPECT_EQ(f["QUIXMDAuthors"], "Andr\xc3\xa9 <andre@example.org>");
+  EXPECT_EQ(f["QUIXMDRecipients"], "Bob <bob@example.org>, carol@example.org");
+  EXPECT_EQ(f["QUIXMDTitle"], "Quarterly r\xc3\xa9sum\xc3\xa9");
+  EXPECT_EQ(f["QUIXMDContentCreationDate"].asInt64(), 1715072889);
+  const std::string text = f["QUIXMDTextContent"].asString();
+  for (const char* want : {"caf\xc3\xa9 est pr\xc3\xaat, mailbodyword", "htmlpartword",
+                           "notes.txt", "attachedword inside"}) {
+    EXPECT_NE(text.find(want), std::string::npos) << want << " in " << text;
+  }
+  EXPECT_EQ(text.find("scriptword"), std::string::npos) << text;
+}
+
+TEST_F(MailTest, MailboxGivesEveryMessage) {
+  const std::string mbox =
+      "From andre@example.org Tue May  7 09:08:09 2024\n" + std::string(kMessage) +
+      "\nFrom dan@example.org Wed May  8 10:00:00 2024\n"
+      "From: Dan <dan@example.org>\nSubject: second note\n\n"
+      ">From the start, secondbodyword.\n";
+  const Json::Value f = Run(ExtractMailbox, dir_.Write("inbox.mbox", mbox));
+  const std::string text = f["QUIXMDTextContent"].asString();
+  for (const char* want : {"mailbodyword", "attachedword", "Subject: second note",
+                           "Dan <dan@example.org>", "secondbodyword"}) {
+    EXPECT_NE(text.find(want), std::string::npos) << want << " in " << text;
+  }
+  // A mailbox has no one sender or subject.
+  EXPECT_FALSE(f.isMember("QUIXMDTitle"));
+  EXPECT_THROW(Run(ExtractMailbox, dir_.Write("not.mbox", "no mailbox here\n")), std::exception);
+}
+
+TEST_F(MailTest, TenThousandPartsStopAtThePartLimit) {
+  std::string mail = "From: a@b\nSubject: many\nContent-Type: multipart/mixed; boundary=x\n\n";
+  for (int i = 0; i < 10000; ++i) {
+    mail += "--x\nContent-Type: text/plain\n\npart" + std::to_string(i) + "word\n";
+  }
+  mail += "--x--\n";
+  const std::string text =
+      Run(ExtractMessage, dir_.Write("many.eml", mail))["QUIXMDTextContent"].asString();
+  EXPECT_NE(text.find("part0word"), std::string::npos);
+  EXPECT_NE(text.find("part" + std::to_string(kMaxMailParts - 2) + "word"), std::string::npos);
+  EXPECT_EQ(text.find("part9999word"), std::string::npos);
+}
+
+}  // namespace
+}  // namespace extract
+}  // namespace orvane
