@@ -142,7 +142,8 @@ TEST_F(ContentTest, PhotoExif) {
       JsonToString(ExtractContent(path)),
       R"({"QUIXMDAcquisitionMake":"Maker","QUIXMDAcquisitionModel":"Model 5",)"
       R"("QUIXMDAperture":"f/2.8","QUIXMDContentCreationDate":1714979289,)"
-      R"("QUIXMDExposureTimeString":"1/60","QUIXMDISOSpeed":200,"QUIXMDMediaTypes":"Image"})");
+      R"("QUIXMDExposureTimeString":"1/60","QUIXMDISOSpeed":200,"QUIXMDMediaTypes":"Image",)"
+      R"("QUIXMDPixelHeight":3,"QUIXMDPixelWidth":4})");
 }
 
 }  // namespace

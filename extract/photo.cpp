@@ -22,6 +22,10 @@ void ExtractPhoto(const OpenedFile& file, Json::Value& fields) {
   if (image.get() == nullptr) Fail("not a readable image");
   image->readMetadata();
   fields["QUIXMDMediaTypes"] = "Image";
+  if (image->pixelWidth() > 0 && image->pixelHeight() > 0) {
+    fields["QUIXMDPixelWidth"] = static_cast<Json::Int64>(image->pixelWidth());
+    fields["QUIXMDPixelHeight"] = static_cast<Json::Int64>(image->pixelHeight());
+  }
   const Exiv2::ExifData& exif = image->exifData();
   auto get = [&exif](const char* key) -> const Exiv2::Exifdatum* {
     auto it = exif.findKey(Exiv2::ExifKey(key));

@@ -67,6 +67,12 @@ void ExtractVideo(const OpenedFile& file, Json::Value& fields) {
   if (double ms = number(MediaInfoLib::Stream_General, L"Duration")) {
     fields["QUIXMDDurationSecond"] = ms / 1000.0;
   }
+  const double width = number(MediaInfoLib::Stream_Video, L"Width");
+  const double height = number(MediaInfoLib::Stream_Video, L"Height");
+  if (width > 0 && height > 0) {
+    fields["QUIXMDPixelWidth"] = static_cast<Json::Int64>(width);
+    fields["QUIXMDPixelHeight"] = static_cast<Json::Int64>(height);
+  }
   if (double rate = number(MediaInfoLib::Stream_General, L"OverallBitRate")) {
     fields["QUIXMDTotalBitRate"] = static_cast<Json::Int64>(rate);
   }

@@ -74,6 +74,8 @@ const std::string& MappingsText() {
 		"QUIXMDAperture": {"analyzer": "keyword"},
 		"QUIXMDResolutionWidthDPI": {"type": "int"},
 		"QUIXMDResolutionHeightDPI": {"type": "int"},
+		"QUIXMDPixelWidth": {"type": "int"},
+		"QUIXMDPixelHeight": {"type": "int"},
 		"QUIXMDMediaTypes": {"analyzer": "keyword"},
 		"QUIXMDParent": {"analyzer": "keyword", "_all": false},
 		"QUIXMDExtension": {"analyzer": "keyword", "_all": false},

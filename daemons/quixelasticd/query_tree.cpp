@@ -1,12 +1,15 @@
 #include "daemons/quixelasticd/query_tree.hpp"
 
 #include <cctype>
+#include <memory>
+#include <optional>
 #include <set>
 
 #include "common/json_util.hpp"
 #include "common/name_codec.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
 #include "daemons/quixelasticd/schema.hpp"
+#include "daemons/quixelasticd/sqlite_util.hpp"
 #include "daemons/quixelasticd/store.hpp"
 #include "fileindex/util.hpp"
 
@@ -16,6 +19,66 @@ namespace elasticd {
 namespace {
 
 const char* const kOperators[] = {"and", "or", "not", "match", "range", "in", "under", "all"};
+
+// A field of the tree and the SQL value it reads: a column, or a member of the stored document.
+struct FieldColumn {
+  const char* name;
+  const char* column;
+};
+
+// The numbers a range compares. A document without the member is outside every range.
+constexpr FieldColumn kRangeFields[] = {
+    {"size", "d.size"},
+    {"mtime", "d.mtime"},
+    {"ctime", "json_extract(d.body, '$.QUIXMDAttributeChangeDate')"},
+    {"crtime", "json_extract(d.body, '$.QUIXMDFSCreationDate')"},
+    {"content_created", "json_extract(d.body, '$.QUIXMDContentCreationDate')"},
+    {"duration", "json_extract(d.body, '$.QUIXMDDurationSecond')"},
+    {"pixel_height", "json_extract(d.body, '$.QUIXMDPixelHeight')"},
+    {"pixel_width", "json_extract(d.body, '$.QUIXMDPixelWidth')"},
+    {"year", "json_extract(d.body, '$.QUIXMDRecordingYear')"},
+    {"track", "json_extract(d.body, '$.QUIXMDAudioTrackNumber')"},
+    {"audio_bit_rate", "json_extract(d.body, '$.QUIXMDAudioBitRate')"},
+    {"sample_rate", "json_extract(d.body, '$.QUIXMDAudioSampleRate')"},
+    {"channels", "json_extract(d.body, '$.QUIXMDAudioChannelCount')"},
+    {"iso_speed", "json_extract(d.body, '$.QUIXMDISOSpeed')"},
+};
+
+// The texts a match reads word by word, as the catch-all text holds them.
+constexpr FieldColumn kTextFields[] = {
+    {"title", "json_extract(d.body, '$.QUIXMDTitle')"},
+    {"authors", "json_extract(d.body, '$.QUIXMDAuthors')"},
+    {"album", "json_extract(d.body, '$.QUIXMDAlbum')"},
+    {"composer", "json_extract(d.body, '$.QUIXMDComposer')"},
+    {"genre", "json_extract(d.body, '$.QUIXMDMusicalGenre')"},
+    {"comment", "json_extract(d.body, '$.QUIXMDComment')"},
+    {"description", "json_extract(d.body, '$.QUIXMDDescription')"},
+    {"keywords", "json_extract(d.body, '$.QUIXMDKeywords')"},
+    {"creator", "json_extract(d.body, '$.QUIXMDCreator')"},
+    {"camera_make", "json_extract(d.body, '$.QUIXMDAcquisitionMake')"},
+    {"camera_model", "json_extract(d.body, '$.QUIXMDAcquisitionModel')"},
+    {"codecs", "json_extract(d.body, '$.QUIXMDCodecs')"},
+};
+
+template <size_t N>
+const char* ColumnOf(const FieldColumn (&fields)[N], const std::string& name) {
+  for (const FieldColumn& f : fields) {
+    if (name == f.name) return f.column;
+  }
+  return nullptr;
+}
+
+template <size_t N>
+std::string NamesOf(const FieldColumn (&fields)[N]) {
+  std::string out;
+  for (const FieldColumn& f : fields) out += std::string(out.empty() ? "" : ", ") + f.name;
+  return out;
+}
+
+// A folder of fewer rows than this is read row by row, each pattern looked up for the row,
+// rather than from a pattern's matches: a common word over a million names has tens of
+// thousands of them, a small folder a few hundred rows.
+constexpr int64_t kFolderFirstRows = 5000;
 
 [[noreturn]] void Refuse(const std::string& what) {
   throw EngineError(kCodeInvalidParam, "\"query\": " + what);
@@ -66,12 +129,16 @@ std::string EscapeLikeText(const std::string& s) {
 
 class Compiler {
  public:
+  // `by_folder`: every pattern is looked up for the row at hand, nothing is joined.
+  explicit Compiler(bool by_folder) : by_folder_(by_folder) {}
+
   SqlCondition Run(const Json::Value& tree) {
     if (!tree.isObject()) Refuse("must be an object");
     SqlCondition c;
     c.sql = Node(tree, 1, true);
     c.values = std::move(values_);
     c.join = join_;
+    c.folder = folder_;
     return c;
   }
 
@@ -130,26 +197,33 @@ class Compiler {
     if (op == "match") return Match(q, required);
     if (op == "range") return Range(q);
     if (op == "in") return In(q);
-    if (op == "under") return Under(arg);
+    if (op == "under") return Under(arg, required);
     if (!arg.isBool() || !arg.asBool()) Refuse("\"all\" must be true");
     return "1";
   }
 
   std::string Match(const Json::Value& q, bool required) {
     const std::string field = q["match"].isString() ? q["match"].asString() : "";
-    if (field != "name" && field != "content" && field != "any") {
-      Refuse("unknown \"match\" field " + JsonToString(q["match"]) + " (name, content or any)");
+    const char* text_column = ColumnOf(kTextFields, field);
+    if (field != "name" && field != "content" && field != "any" && field != "path" &&
+        text_column == nullptr) {
+      Refuse("unknown \"match\" field " + JsonToString(q["match"]) +
+             " (name, content, any, path, " + NamesOf(kTextFields) + ")");
     }
     const Json::Value& pattern = q["pattern"];
     if (!pattern.isString() || pattern.asString().empty()) {
       Refuse("\"pattern\" of a match must be a non-empty string");
     }
-    if (pattern.asString().find_first_not_of('*') == std::string::npos) return "1";
+    if (pattern.asString().find_first_not_of('*') == std::string::npos) {
+      return text_column == nullptr ? "1" : std::string("(") + text_column + " IS NOT NULL)";
+    }
+    if (field == "path") return PathMatch(pattern.asString());
     // A full-text MATCH may not stand under OR or NOT: only a required pattern is joined.
-    const bool joined = required && join_.empty() && field != "any";
+    const bool joined = required && join_.empty() && field != "any" && !by_folder_;
     if (joined) join_ = field == "name" ? "fts_name" : "fts_all";
     if (field == "name") return NameMatch(pattern.asString(), joined);
     if (field == "content") return ContentCondition(pattern.asString(), joined);
+    if (text_column != nullptr) return TextFieldMatch(text_column, pattern.asString(), joined);
     // Two statements: the values are bound in the order of the marks.
     std::string sql = "(" + NameMatch(pattern.asString(), false);
     sql += " OR " + ContentCondition(pattern.asString(), false);
@@ -189,7 +263,17 @@ class Compiler {
       sql += std::string(sql.empty() ? "" : " AND ") + "fts_name.name LIKE ? ESCAPE '\\'";
       Text(like);
     }
-    return joined ? "(" + sql + ")" : "d.rowid IN (SELECT rowid FROM fts_name WHERE " + sql + ")";
+    return joined ? "(" + sql + ")" : Lookup("fts_name", sql);
+  }
+
+  // A pattern of a full-text table that is not joined: by the table's matches, or, reading a
+  // folder's rows, by the row at hand.
+  std::string Lookup(const char* table, const std::string& sql) const {
+    if (by_folder_) {
+      return std::string("EXISTS (SELECT 1 FROM ") + table + " WHERE " + table +
+             ".rowid = d.rowid AND " + sql + ")";
+    }
+    return std::string("d.rowid IN (SELECT rowid FROM ") + table + " WHERE " + sql + ")";
   }
 
   std::string ContentCondition(const std::string& pattern, bool joined) {
@@ -200,24 +284,54 @@ class Compiler {
       return "1";
     }
     Text(match);
-    return joined ? "fts_all MATCH ?"
-                  : "d.rowid IN (SELECT rowid FROM fts_all WHERE fts_all MATCH ?)";
+    return joined ? "fts_all MATCH ?" : Lookup("fts_all", "fts_all MATCH ?");
+  }
+
+  // A text member of the document, word by word as contents are: the word index finds the
+  // documents that hold the words anywhere, and the member itself must hold each of them.
+  std::string TextFieldMatch(const char* column, const std::string& pattern, bool joined) {
+    std::string sql = ContentCondition(pattern, joined);
+    size_t i = 0;
+    while (i < pattern.size()) {
+      const size_t start = pattern.find_first_not_of(" \t\n*", i);
+      if (start == std::string::npos) break;
+      i = pattern.find_first_of(" \t\n*", start);
+      sql += std::string(" AND IFNULL(") + column + " LIKE ? ESCAPE '\\', 0)";
+      Text("%" + EscapeLikeText(pattern.substr(start, i - start)) + "%");
+    }
+    return "(" + sql + ")";
+  }
+
+  // A whole path with '*' wildcards, as the bytes are: no case is folded. The literal start
+  // of the pattern is a range of the path index.
+  std::string PathMatch(const std::string& pattern) {
+    const std::string path = EncodeName(pattern);
+    std::string glob;
+    for (char c : path) {
+      if (c == '[' || c == '?') {
+        glob += std::string("[") + c + "]";
+      } else {
+        glob += c;
+      }
+    }
+    std::string sql = "(d.path GLOB ?";
+    Text(glob);
+    const std::string prefix = path.substr(0, path.find('*'));
+    const std::optional<std::string> upper = PrefixUpperBound(prefix);
+    if (!prefix.empty() && upper) {
+      sql += " AND d.path >= ? AND d.path < ?";
+      Text(prefix);
+      Text(*upper);
+    }
+    return sql + ")";
   }
 
   std::string Range(const Json::Value& q) {
     const std::string field = q["range"].isString() ? q["range"].asString() : "";
-    std::string column;
-    if (field == "size") {
-      column = "d.size";
-    } else if (field == "mtime") {
-      column = "d.mtime";
-    } else if (field == "ctime") {
-      column = "json_extract(d.body, '$.QUIXMDAttributeChangeDate')";
-    } else if (field == "crtime") {
-      column = "json_extract(d.body, '$.QUIXMDFSCreationDate')";
-    } else {
-      Refuse("unknown \"range\" field " + JsonToString(q["range"]) +
-             " (size, mtime, ctime or crtime)");
+    const char* const column = ColumnOf(kRangeFields, field);
+    if (column == nullptr) {
+      Refuse("unknown \"range\" field " + JsonToString(q["range"]) + " (" +
+             NamesOf(kRangeFields) + ")");
     }
     std::string sql;
     for (const auto& [bound, cmp] : {std::pair<const char*, const char*>{"gte", " >= ?"},
@@ -234,7 +348,7 @@ class Compiler {
         n.real = v.asDouble();
       }
       values_.push_back(n);
-      sql += (sql.empty() ? "" : " AND ") + column + cmp;
+      sql += (sql.empty() ? "" : " AND ") + std::string(column) + cmp;
     }
     if (sql.empty()) Refuse("a range needs \"gte\", \"gt\", \"lte\" or \"lt\"");
     // A document without the value is outside every range, and inside its negation.
@@ -291,12 +405,13 @@ class Compiler {
 
   // The folder itself and everything below it. The path range uses the path index; the
   // ancestor test is what scopes, as in the search's own folder filter.
-  std::string Under(const Json::Value& arg) {
+  std::string Under(const Json::Value& arg, bool required) {
     if (!arg.isString() || arg.asString().empty() || arg.asString()[0] != '/') {
       Refuse("\"under\" must be an absolute folder path");
     }
     std::string folder = arg.asString();
     while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
+    if (required && folder_.empty()) folder_ = folder;
     const std::string under = folder == "/" ? "/" : folder + "/";
     const std::string upper = *PrefixUpperBound(under);
     for (const std::string& v : {folder, under, upper, folder, under, upper}) Text(v);
@@ -304,14 +419,30 @@ class Compiler {
            " (d.ancestor >= ? AND d.ancestor < ?))))";
   }
 
+  const bool by_folder_;
   int nodes_ = 0;
   std::vector<SqlValue> values_;
   std::string join_;
+  std::string folder_;  // the first folder every hit must lie in
 };
 
 }  // namespace
 
-SqlCondition CompileQueryTree(const Json::Value& tree) { return Compiler().Run(tree); }
+SqlCondition CompileQueryTree(const Json::Value& tree) {
+  SqlCondition c = Compiler(false).Run(tree);
+  if (!c.folder.empty() && !c.join.empty()) {
+    c.by_folder = std::make_shared<const SqlCondition>(Compiler(true).Run(tree));
+  }
+  return c;
+}
+
+const SqlCondition& ChooseQueryPlan(Db& db, const SqlCondition& c) {
+  if (!c.by_folder) return c;
+  const std::string under = c.folder == "/" ? "/" : c.folder + "/";
+  Stmt count(db, "SELECT count(*) FROM (SELECT 1 FROM docs WHERE path >= ? AND path < ? LIMIT ?)");
+  count.Bind(1, under).Bind(2, *PrefixUpperBound(under)).Bind(3, kFolderFirstRows);
+  return count.Step() && count.Int(0) < kFolderFirstRows ? *c.by_folder : c;
+}
 
 }  // namespace elasticd
 }  // namespace orvane

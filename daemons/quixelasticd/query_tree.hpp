@@ -7,6 +7,7 @@
 #include <json/json.h>
 
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -30,6 +31,11 @@ struct SqlCondition {
   std::string sql;
   std::vector<SqlValue> values;
   std::string join;
+  // When every hit lies at or below one folder and a pattern is joined: that folder, and the
+  // same condition read from the folder's rows, each pattern looked up for the row at hand.
+  // Which of the two is faster depends on how many rows the folder holds (see ChooseQueryPlan).
+  std::string folder;
+  std::shared_ptr<const SqlCondition> by_folder;
 };
 
 // Limits of a tree: deeper or larger ones are refused before anything runs.
@@ -39,6 +45,13 @@ constexpr int kMaxQueryNodes = 256;
 // Reads a query tree; throws EngineError(kCodeInvalidParam) with a message naming the fault
 // (unknown operator or field, a value of the wrong type, too deep, too many nodes).
 SqlCondition CompileQueryTree(const Json::Value& tree);
+
+class Db;
+
+// The form of `c` to run on `db`: the one read from its folder's rows when the folder holds
+// few of them (a common word in a small folder), else `c` itself. Costs one bounded count on
+// the path index.
+const SqlCondition& ChooseQueryPlan(Db& db, const SqlCondition& c);
 
 }  // namespace elasticd
 }  // namespace orvane

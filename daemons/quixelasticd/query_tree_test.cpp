@@ -77,13 +77,20 @@ TEST_F(QueryTreeTest, EachNodeKindFindsItsDocuments) {
   report["QUIXMDTextContent"] = "the quarterly revenue grew in the north";
   report["QUIXMDAttributeChangeDate"] = 150;
   report["QUIXMDFSCreationDate"] = 100;
+  report["QUIXMDTitle"] = "Annual figures";
   Json::Value tune = tc::FileDoc("/v/share/music/sub/tune.flac", 50, 50);
-  tune["QUIXMDTextContent"] = "revenues of a song";
+  tune["QUIXMDTextContent"] = "revenues of a song, in figures";
+  tune["QUIXMDAlbum"] = "Greatest Hits";
+  tune["QUIXMDAuthors"] = "The Band";
+  tune["QUIXMDDurationSecond"] = 183.5;
+  Json::Value beach = tc::FileDoc("/v/share/photos/beach.JPG", 700, 400);
+  beach["QUIXMDPixelWidth"] = 4000;
+  beach["QUIXMDPixelHeight"] = 3000;
   Json::Value photos = tc::FileDoc("/v/share/photos", 0, 5);
   photos["QUIXMDIsDir"] = true;
   for (Json::Value doc : {report, tune, photos, tc::FileDoc("/v/share/docs/report draft.txt", 100, 100),
                           tc::FileDoc("/v/share/music/100%_hits.mp3", 9000, 300),
-                          tc::FileDoc("/v/share/photos/beach.JPG", 700, 400),
+                          beach,
                           tc::FileDoc("/v/share/misc/data.qqq", 10, 10)}) {
     Add(doc);
   }
@@ -133,12 +140,32 @@ TEST_F(QueryTreeTest, EachNodeKindFindsItsDocuments) {
       {R"({"not": {"or": [{"under": "/v/share/docs"}, {"under": "/v/share/photos"}]}})",
        {"100%_hits.mp3", "data.qqq", "tune.flac"}},
       {R"({"all": true})", all},
+      // Members of the document: a text holds each word (the title, not the contents, here),
+      // a number is compared, a document without the member matches neither.
+      {R"({"match": "title", "pattern": "FIGURES"})", {"Annual_Report.PDF"}},
+      {R"({"match": "album", "pattern": "*hits*"})", {"tune.flac"}},
+      {R"({"match": "authors", "pattern": "*"})", {"tune.flac"}},
+      {R"({"not": {"match": "album", "pattern": "greatest"}})",
+       {"100%_hits.mp3", "Annual_Report.PDF", "beach.JPG", "data.qqq", "photos",
+        "report draft.txt"}},
+      {R"({"range": "duration", "gt": 180})", {"tune.flac"}},
+      {R"({"and": [{"range": "pixel_height", "gte": 3000}, {"range": "pixel_width", "lt": 5000}]})",
+       {"beach.JPG"}},
+      // Whole paths, '*' anywhere, cases as they are.
+      {R"({"match": "path", "pattern": "/v/share/music/*.flac"})", {"tune.flac"}},
+      {R"({"match": "path", "pattern": "*/sub/*"})", {"tune.flac"}},
+      {R"({"match": "path", "pattern": "/v/share/Music/*"})", {}},
   };
   for (const Row& row : rows) {
-    const Json::Value r = Search(std::string(R"({"size": 100, "query": )") + row.tree + "}");
-    EXPECT_EQ(r["success"], true) << row.tree << JsonToString(r);
-    EXPECT_EQ(Names(r), row.names) << row.tree;
-    EXPECT_EQ(r["data"]["total"].asUInt(), row.names.size()) << row.tree;
+    // Confined to a folder that holds every document, a tree finds the same; the small folder
+    // is read row by row, each pattern looked up for the row.
+    for (const std::string& tree :
+         {std::string(row.tree), R"({"and": [)" + std::string(row.tree) + R"(, {"under": "/v"}]})"}) {
+      const Json::Value r = Search(R"({"size": 100, "query": )" + tree + "}");
+      EXPECT_EQ(r["success"], true) << tree << JsonToString(r);
+      EXPECT_EQ(Names(r), row.names) << tree;
+      EXPECT_EQ(r["data"]["total"].asUInt(), row.names.size()) << tree;
+    }
   }
   // The tree narrows the other members of the search.
   EXPECT_THAT(Names(Search(R"({"ext": "txt", "query": {"all": true}})")),
@@ -166,7 +193,7 @@ TEST_F(QueryTreeTest, BadTreesAreRefusedNamingTheFault) {
       {R"({"and": [], "or": []})", "two operators"},
       {R"({"and": []})", "non-empty array"},
       {R"({"and": [7]})", "must be an object"},
-      {R"({"match": "title", "pattern": "x"})", "unknown \"match\" field"},
+      {R"({"match": "subtitle", "pattern": "x"})", "unknown \"match\" field"},
       {R"({"match": "name"})", "\"pattern\""},
       {R"({"match": "name", "pattern": ""})", "\"pattern\""},
       {R"({"match": "name", "pattern": "x", "fuzzy": true})", "unknown member \"fuzzy\""},

@@ -835,12 +835,14 @@ void AddSnippets(Db& db, const std::string& match, int64_t snippet_from, PageRow
 }  // namespace
 
 SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard) {
-  const SearchSql q = SearchSqlOf(p);
   std::unique_ptr<Db> db = TakeReader();
   PageRows rows;
   {
     // The guard and every statement are gone before the connection goes back to the pool.
     const ScopedQueryGuard scoped(*db, guard);
+    SearchParams planned = p;
+    if (p.query) planned.query = ChooseQueryPlan(*db, *p.query);
+    const SearchSql q = SearchSqlOf(planned);
     if (visible) {
       ScanVisible(*db, q, p, visible, &rows);
     } else {
