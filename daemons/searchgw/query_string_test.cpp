@@ -52,6 +52,10 @@ TEST(QueryStringTest, QueriesBecomeEngineTrees) {
        R"({"not":{"gte":1704067200,"lte":1704067200,"range":"mtime"}})"},
       {"path.real:/srv/share/", R"({"under":"/srv/share"})"},
       {"path.real:\\/srv\\/x\\/*", R"({"under":"/srv/x"})"},
+      // Members of the document: their own fields, numbers ranged, texts matched.
+      {"duration:{60 TO *}", R"({"gt":60,"range":"duration"})"},
+      {"title:\"annual report\"", R"({"match":"title","pattern":"annual report"})"},
+      {"path:\\/srv\\/s\\/*.pdf", R"({"match":"path","pattern":"/srv/s/*.pdf"})"},
   };
   for (const Row& r : rows) EXPECT_EQ(Tree(r.query), r.tree) << r.query;
 }
@@ -148,6 +152,13 @@ TEST(SearchBodyTest, BothRequestShapesAreRead) {
   EXPECT_EQ(JsonToString(new_shape.query),
             R"({"and":[{"under":"/srv/s"},{"match":"content","pattern":"bar"}]})");
 
+  // The listed fields are where a term without a field is searched; a boost changes nothing.
+  EXPECT_EQ(JsonToString(ReadSearchBody(R"({"query": {"query_string": {"query": "foo AND size:1",)"
+                                        R"( "fields": ["name^2", "title"]}}})")
+                             .query),
+            R"({"and":[{"or":[{"match":"name","pattern":"foo"},{"match":"title","pattern":"foo"}]},)"
+            R"({"gte":1,"lte":1,"range":"size"}]})");
+
   EXPECT_EQ(JsonToString(ReadSearchBody("{}").query), R"({"all":true})");
   EXPECT_EQ(JsonToString(ReadSearchBody(R"({"query": {"bool": {"must_not": {"match_all": {}},)"
                                         R"( "should": [{"prefix": {"name": "ab"}}]}}})")
@@ -168,6 +179,9 @@ TEST(SearchBodyTest, BothRequestShapesAreRead) {
       {R"({"query": {"query_string": {"query": "a AND"}}})", "parsing_exception"},
       {R"({"query": {"query_string": {"query": "nope:x"}}})", "query_shard_exception"},
       {R"({"query": {"bool": {"must": 3}}})", "parsing_exception"},
+      {R"({"query": {"query_string": {"query": "x", "fields": "name"}}})", "parsing_exception"},
+      {R"({"query": {"query_string": {"query": "x", "fields": ["nope"]}}})",
+       "query_shard_exception"},
   };
   for (const Row& r : bad) {
     try {

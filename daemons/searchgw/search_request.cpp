@@ -27,16 +27,39 @@ struct Field {
 };
 
 // The fields a query may name: the attributes the shipped Spotlight mappings file uses, and the
-// path field every client sends for a folder scope.
+// path field every client sends for a folder scope. Text and number fields are the engine's own.
 constexpr Field kFields[] = {
     {"", FieldKind::kText, "any"},
     {"*", FieldKind::kText, "any"},
     {"name", FieldKind::kText, "name"},
     {"content", FieldKind::kText, "content"},
+    {"path", FieldKind::kText, "path"},
+    {"title", FieldKind::kText, "title"},
+    {"authors", FieldKind::kText, "authors"},
+    {"album", FieldKind::kText, "album"},
+    {"composer", FieldKind::kText, "composer"},
+    {"genre", FieldKind::kText, "genre"},
+    {"comment", FieldKind::kText, "comment"},
+    {"description", FieldKind::kText, "description"},
+    {"keywords", FieldKind::kText, "keywords"},
+    {"creator", FieldKind::kText, "creator"},
+    {"camera_make", FieldKind::kText, "camera_make"},
+    {"camera_model", FieldKind::kText, "camera_model"},
+    {"codecs", FieldKind::kText, "codecs"},
     {"size", FieldKind::kNumber, "size"},
+    {"duration", FieldKind::kNumber, "duration"},
+    {"pixel_height", FieldKind::kNumber, "pixel_height"},
+    {"pixel_width", FieldKind::kNumber, "pixel_width"},
+    {"year", FieldKind::kNumber, "year"},
+    {"track", FieldKind::kNumber, "track"},
+    {"audio_bit_rate", FieldKind::kNumber, "audio_bit_rate"},
+    {"sample_rate", FieldKind::kNumber, "sample_rate"},
+    {"channels", FieldKind::kNumber, "channels"},
+    {"iso_speed", FieldKind::kNumber, "iso_speed"},
     {"mtime", FieldKind::kDate, "mtime"},
     {"ctime", FieldKind::kDate, "ctime"},
     {"crtime", FieldKind::kDate, "crtime"},
+    {"content_created", FieldKind::kDate, "content_created"},
     {"type", FieldKind::kType, ""},
     {"path.real", FieldKind::kFolder, ""},
     {"path.real.fulltext", FieldKind::kFolder, ""},
@@ -48,9 +71,11 @@ const Field& FindField(const std::string& name) {
   for (const Field& f : kFields) {
     if (name == f.name) return f;
   }
-  throw RequestError(kBadQuery, "unknown field \"" + name +
-                                    "\": the fields are name, content, size, mtime, ctime, "
-                                    "crtime, type and path.real");
+  std::string known;
+  for (const Field& f : kFields) {
+    if (std::strlen(f.name) > 1) known += std::string(known.empty() ? "" : ", ") + f.name;
+  }
+  throw RequestError(kBadQuery, "unknown field \"" + name + "\": the fields are " + known);
 }
 
 Json::Value Node(const char* op, Json::Value value) {
@@ -143,7 +168,17 @@ Json::Value TypeValues(const std::string& text) {
   return parts.size() == 1 ? parts[0] : Node("or", std::move(parts));
 }
 
-Json::Value Leaf(const QueryNode& q) {
+Json::Value Leaf(const QueryNode& q, const std::vector<std::string>& fields) {
+  if (q.field.empty() && !fields.empty()) {
+    // A term without a field searches the fields the request lists, any of them.
+    Json::Value parts(Json::arrayValue);
+    for (const std::string& name : fields) {
+      QueryNode named = q;
+      named.field = name;
+      parts.append(Leaf(named, {}));
+    }
+    return parts.size() == 1 ? parts[0] : Node("or", std::move(parts));
+  }
   const Field& f = FindField(q.field);
   const std::string& text = q.text;
   switch (f.kind) {
@@ -193,8 +228,22 @@ Json::Value ReadJsonQuery(const Json::Value& q, int depth) {
     if (!body.isObject() || !text.isString()) {
       throw RequestError(kParsing, "query_string needs a \"query\" text");
     }
+    const Json::Value& listed = body["fields"];
+    if (!listed.isNull() && !listed.isArray()) {
+      throw RequestError(kParsing, "query_string.fields must be a list of field names");
+    }
+    std::vector<std::string> fields;
+    for (const Json::Value& name : listed) {
+      if (!name.isString()) {
+        throw RequestError(kParsing, "query_string.fields must be a list of field names");
+      }
+      // A boost ("name^2") weighs a field; hits are not ranked here, so it changes nothing.
+      std::string field = name.asString().substr(0, name.asString().find('^'));
+      FindField(field);
+      fields.push_back(std::move(field));
+    }
     try {
-      return TranslateQuery(ParseQueryString(text.asString()));
+      return TranslateQuery(ParseQueryString(text.asString()), fields);
     } catch (const QuerySyntaxError& e) {
       throw RequestError(kParsing, std::string("cannot parse query_string: ") + e.what());
     }
@@ -248,16 +297,16 @@ int64_t PageNumber(const Json::Value& root, const char* member, int64_t fallback
 
 }  // namespace
 
-Json::Value TranslateQuery(const QueryNode& node) {
+Json::Value TranslateQuery(const QueryNode& node, const std::vector<std::string>& fields) {
   switch (node.kind) {
     case QueryNode::kAnd:
     case QueryNode::kOr: {
       Json::Value parts(Json::arrayValue);
-      for (const QueryNode& c : node.children) parts.append(TranslateQuery(c));
+      for (const QueryNode& c : node.children) parts.append(TranslateQuery(c, fields));
       return Node(node.kind == QueryNode::kAnd ? "and" : "or", std::move(parts));
     }
     case QueryNode::kNot:
-      return Node("not", TranslateQuery(node.children.front()));
+      return Node("not", TranslateQuery(node.children.front(), fields));
     case QueryNode::kRange: {
       const Field& f = FindField(node.field);
       if (f.kind != FieldKind::kNumber && f.kind != FieldKind::kDate) {
@@ -267,7 +316,7 @@ Json::Value TranslateQuery(const QueryNode& node) {
     }
     case QueryNode::kTerm:
     case QueryNode::kPhrase:
-      return Leaf(node);
+      return Leaf(node, fields);
   }
   return Json::Value();
 }

@@ -48,9 +48,10 @@ struct SearchRequest {
 SearchRequest ReadSearchBody(const std::string& body);
 
 // The engine's tree for a parsed query string. Fields are the gateway's own names (the ones the
-// Spotlight mappings file shipped beside it uses); bare terms search names and contents.
-// Throws RequestError for an unknown field or a value the field cannot take.
-Json::Value TranslateQuery(const QueryNode& node);
+// Spotlight mappings file shipped beside it uses); bare terms search any of `fields`, or names
+// and contents when it is empty. Throws RequestError for an unknown field or a value the field
+// cannot take.
+Json::Value TranslateQuery(const QueryNode& node, const std::vector<std::string>& fields = {});
 
 // Seconds since the epoch of an ISO-8601 UTC time ("2024-05-01", "2024-05-01T10:20:30Z",
 // fractions and "+00:00" accepted) or of a plain number of seconds; false otherwise.
