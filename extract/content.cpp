@@ -1,7 +1,12 @@
 #include "extract/content.hpp"
 
 #include <magic.h>
+#include <sys/mman.h>
+#include <sys/resource.h>
 #include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
 
 #include <algorithm>
 #include <memory>
@@ -61,6 +66,14 @@ const std::vector<Kind>& Kinds() {
       {"audio", {"audio/"}, {}, ExtractAudio},
       {"photo", {"image/"}, {}, ExtractImageWithText},
       {"video", {"video/"}, {}, ExtractVideo},
+      {"archive",
+       {"application/zip", "application/x-tar", "application/x-7z-compressed",
+        "application/x-rar", "application/vnd.rar", "application/x-cpio",
+        "application/x-archive", "application/vnd.debian.binary-package", "application/gzip",
+        "application/x-bzip2", "application/x-xz", "application/zstd", "application/x-lz4",
+        "application/x-lzma", "application/x-lzip", "application/x-compress"},
+       {},
+       ExtractArchive},
       {"text",
        {"text/", "application/json", "application/javascript",
         "application/x-subrip"},
@@ -108,7 +121,60 @@ std::string MimeTypeOf(const OpenedFile& file) {
   return type == nullptr ? "" : type;
 }
 
+void ExtractOpened(const OpenedFile& file, Json::Value& fields) {
+  // The extension is the name's, not the descriptor's.
+  if (const Kind* kind = KindFor(file.name(), MimeTypeOf(file))) kind->extract(file, fields);
+}
+
+// The helper may write no file but the in-memory copy of a member: while one is filled, the soft
+// limit on file sizes is raised to what it needs, up to the hard limit, and put back after.
+class FileWriteAllowance {
+ public:
+  explicit FileWriteAllowance(size_t bytes) {
+    struct rlimit lim;
+    if (getrlimit(RLIMIT_FSIZE, &lim) != 0 || lim.rlim_cur == RLIM_INFINITY ||
+        lim.rlim_cur >= bytes) {
+      return;
+    }
+    if (lim.rlim_max != RLIM_INFINITY && lim.rlim_max < bytes) {
+      Fail("a member of " + std::to_string(bytes) + " bytes is over the limit on members");
+    }
+    saved_ = lim;
+    lim.rlim_cur = bytes;
+    raised_ = setrlimit(RLIMIT_FSIZE, &lim) == 0;
+    if (!raised_) Fail(std::string("cannot allow a member's copy: ") + std::strerror(errno));
+  }
+  ~FileWriteAllowance() {
+    if (raised_) setrlimit(RLIMIT_FSIZE, &saved_);
+  }
+  FileWriteAllowance(const FileWriteAllowance&) = delete;
+  FileWriteAllowance& operator=(const FileWriteAllowance&) = delete;
+
+ private:
+  struct rlimit saved_ = {};
+  bool raised_ = false;
+};
+
 }  // namespace
+
+void ExtractMember(const std::string& name, const std::string& data, int depth,
+                   Json::Value& fields) {
+  if (data.size() > kMaxMemberBytes) Fail("member larger than " + std::to_string(kMaxMemberBytes));
+  // An in-memory file: every extractor reads it as it reads a file on disk, nothing reaches the
+  // disk, and a member's name (whatever "../" it holds) is never used as a path.
+  UniqueFd fd(memfd_create("member", MFD_CLOEXEC));
+  if (!fd.valid()) Fail(std::string("cannot hold a member in memory: ") + std::strerror(errno));
+  {
+    const FileWriteAllowance allowance(data.size());
+    for (size_t done = 0; done < data.size();) {
+      const ssize_t n = write(fd.get(), data.data() + done, data.size() - done);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) Fail(std::string("cannot hold a member in memory: ") + std::strerror(errno));
+      done += static_cast<size_t>(n);
+    }
+  }
+  ExtractOpened(OpenedFile(std::move(fd), name, depth), fields);
+}
 
 std::string MimeType(const std::string& path) {
   try {
@@ -123,8 +189,8 @@ Json::Value ExtractContent(const std::string& path) {
   const OpenedFile file(path);
   ReadPrefix(file, 1);
   Json::Value fields(Json::objectValue);
-  // The extension is the name's, not the descriptor's.
-  if (const Kind* kind = KindFor(file.name(), MimeTypeOf(file))) kind->extract(file, fields);
+  StartExpansionBudget();
+  ExtractOpened(file, fields);
   return fields;
 }
 

@@ -17,6 +17,10 @@ namespace extract {
 // Extracted text is cut at this many bytes (at a character boundary).
 constexpr size_t kMaxTextBytes = 1024 * 1024;
 
+// No single member of a container (an office zip, an archive, a compressed file) is read past
+// this, whatever it claims to hold; the helper may write in-memory files of at most this size.
+constexpr size_t kMaxMemberBytes = 64 * 1024 * 1024;
+
 // The MIME type libmagic sees in the file's contents ("" when it cannot tell).
 std::string MimeType(const std::string& path);
 

@@ -6,9 +6,10 @@
 // status 1 with one line on standard error when the file cannot be extracted; 2 for a usage
 // error).
 //
-// Runs under its own limits (memory, no file writes, few descriptors, no core dump, and CPU time
-// for each file), so a hostile file costs at most this one process. The limit on file writes
-// covers its output too: read it through a pipe or a socket, never redirect it to a file.
+// Runs under its own limits (memory, no file writes but its in-memory copies of archive members,
+// few descriptors, no core dump, and CPU time for each file), so a hostile file costs at most
+// this one process. The limit on file writes covers its output too: read it through a pipe or a
+// socket, never redirect it to a file.
 #include <fcntl.h>
 #include <sys/resource.h>
 #include <unistd.h>
@@ -41,10 +42,12 @@ namespace {
 constexpr rlim_t kCpuSecondsPerFile = 30;
 [[maybe_unused]] constexpr rlim_t kMemoryBytes = rlim_t{1} << 30;
 
-void Limit(int resource, rlim_t value) {
-  struct rlimit lim = {value, value};
+void Limit(int resource, rlim_t value, rlim_t hard) {
+  struct rlimit lim = {value, hard};
   setrlimit(resource, &lim);
 }
+
+void Limit(int resource, rlim_t value) { Limit(resource, value, value); }
 
 // The CPU limit counts the whole life of the process, so before each file its soft limit is
 // moved to what has been used so far (rounded up) plus one file's allowance. Overrunning it
@@ -124,7 +127,9 @@ int main(int argc, char** argv) {
     return 2;
   }
   std::setlocale(LC_ALL, "C.UTF-8");
-  Limit(RLIMIT_FSIZE, 0);
+  // No file may be written; the hard limit leaves room to fill one archive member's in-memory
+  // file, for which the soft limit is raised only while that is done.
+  Limit(RLIMIT_FSIZE, 0, orvane::extract::kMaxMemberBytes);
   Limit(RLIMIT_CORE, 0);
   Limit(RLIMIT_NOFILE, 64);
 #if !ORVANE_ASAN

@@ -18,9 +18,8 @@
 namespace orvane {
 namespace extract {
 
-// No single member of a container (an office zip, an archive, a compressed file) is read past
-// this, whatever it claims to hold.
-constexpr size_t kMaxMemberBytes = 64 * 1024 * 1024;
+// Archives in archives are opened this many levels down; deeper ones give their names only.
+constexpr int kMaxNestingDepth = 3;
 
 [[noreturn]] void Fail(const std::string& what);
 
@@ -97,6 +96,16 @@ std::map<std::string, std::string> ReadZipMembers(const OpenedFile& file,
 void WalkXml(const std::string& xml, TextSink* sink,
              const std::map<std::string, std::string>& props, Json::Value& fields);
 
+// Extracts `data`, the bytes of a member called `name` of a container `depth - 1` levels below the
+// file on disk (an archive's member, a compressed file's contents, an attachment), as if it were
+// a file of its own: an in-memory file whose kind is told as a file's is. Throws as extractors do.
+void ExtractMember(const std::string& name, const std::string& data, int depth,
+                   Json::Value& fields);
+
+// Starts the budgets that every container inside one file on disk shares (bytes expanded, CPU
+// time spent on members); called once per file on disk.
+void StartExpansionBudget();
+
 // The extractors, one per kind of file.
 using Extractor = void (*)(const OpenedFile&, Json::Value&);
 void ExtractText(const OpenedFile& file, Json::Value& fields);
@@ -106,6 +115,9 @@ void ExtractOdf(const OpenedFile& file, Json::Value& fields);
 void ExtractAudio(const OpenedFile& file, Json::Value& fields);
 void ExtractPhoto(const OpenedFile& file, Json::Value& fields);
 void ExtractVideo(const OpenedFile& file, Json::Value& fields);
+// Archives (their member names and the texts of their members) and compressed single files
+// (what they hold, extracted as its own kind).
+void ExtractArchive(const OpenedFile& file, Json::Value& fields);
 
 }  // namespace extract
 }  // namespace orvane
