@@ -219,18 +219,18 @@ xsr xwp xy xy3 xyp xyw xyz yaml yml zanebug zed zhp zib zip zw zxe
 )";
 
 const char kAudioExtensions[] = R"(
-aac ac3 aif aiff ape cue dff dsf flac m3u m4a m4b m4p mp1 mp2 mp3 mpa ogg pcm pls ra ram wav wma
-wpl
+aac ac3 aif aiff ape cue dff dsf flac m3u m4a m4b m4p mka mp1 mp2 mp3 mpa oga ogg opus pcm pls ra
+ram wav weba wma wpl
 )";
 
 const char kVideoExtensions[] = R"(
-3g2 3gp asf avi dat divx dvr-ms f4v flv ifo iso m2t m2ts m4v mkv mov mp4 mpeg mpg mts qt rm rmvb
-swf tp trp ts vdr vob wmv xvid
+3g2 3gp asf avi dat divx dvr-ms f4v flv ifo iso m2t m2ts m4v mkv mov mp4 mpeg mpg mts ogv qt rm
+rmvb swf tp trp ts vdr vob webm wmv xvid
 )";
 
 const char kPhotoExtensions[] = R"(
-3fr arw bmp cr2 crw dcr dng erf gif ico jpe jpeg jpg k25 kdc mef mos mrw nef orf pef png psd ptx
-raf raw rw2 sr2 srf tif tiff ufo x3f
+3fr arw avif bmp cr2 crw dcr dng erf gif heic heif ico jpe jpeg jpg jxl k25 kdc mef mos mrw nef
+orf pef png psd ptx raf raw rw2 sr2 srf tif tiff ufo webp x3f
 )";
 
 }  // namespace

@@ -49,8 +49,9 @@ TEST(FileTypeTest, LookupsListsAndSettingNamesAgree) {
     FileType type;
   } cases[] = {
       {"/v/s/Report.PDF", kDocument}, {"/v/s/README", kDocument}, {"/v/s.d/file", kDocument},
-      {"/v/s/x.tar.gz", kDocument},   {"/v/s/x.heic", kOther},    {"/v/s/movie.dvr-ms", kVideo},
+      {"/v/s/x.tar.gz", kDocument},   {"/v/s/x.heic", kPhoto},    {"/v/s/movie.dvr-ms", kVideo},
       {"/v/s/a.TX?", kDocument},      {"/v/s/.bashrc", kOther},   {"/v/s/a.Ä", kOther},
+      {"/v/s/b.Opus", kAudio},        {"/v/s/c.oga", kAudio},     {"/v/s/d.webp", kPhoto},
   };
   for (const auto& c : cases) EXPECT_EQ(GetFileTypeByFullPath(c.path), c.type) << c.path;
 

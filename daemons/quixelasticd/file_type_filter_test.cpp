@@ -92,7 +92,7 @@ TEST_F(FileTypeFilterTest, ASearchByKindFindsWhatThatKindsSwitchGoverns) {
   }
   const std::string music = vol_ + "/music/";
   EXPECT_EQ(Found(R"({"file_type": "photo", "ext": ["heic", "JPE", "jpg"]})"),
-            (Paths{music + "a.jpe", music + "b.JPG"}));
+            (Paths{music + "a.jpe", music + "b.JPG", music + "c.heic"}));
   // Extensions of another kind leave nothing, not the files without an extension.
   EXPECT_EQ(Found(R"({"file_type": "photo", "ext": "pdf"})"), Paths());
 }
