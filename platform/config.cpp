@@ -16,6 +16,7 @@
 #include "common/log.hpp"
 #include "common/root.hpp"
 #include "platform/platform_error.hpp"
+#include "platform/smb_conf.hpp"
 
 namespace orvane {
 namespace platform {
@@ -23,6 +24,7 @@ namespace {
 
 constexpr size_t kMaxShareNameBytes = 491;  // the share record's name field holds 492 bytes
 constexpr size_t kMaxSharePathBytes = 4095;
+constexpr char kDefaultSambaConf[] = "/etc/samba/smb.conf";
 
 [[noreturn]] void Fail(const std::string& file, const std::string& fault) {
   throw Error(kErrLoadConfig, file + ": " + fault);
@@ -125,24 +127,45 @@ ShareConfig ReadShare(const Json::Value& obj, size_t index, const std::string& f
   return share;
 }
 
+// What a configuration file looked like when it was read; a file that did not exist is recorded
+// too, so that creating it is a change.
 struct FileIdentity {
   std::string path;
+  int err = 0;  // errno of the stat, 0 when it succeeded
   dev_t dev = 0;
   ino_t ino = 0;
+  mode_t mode = 0;
   off_t size = -1;
   struct timespec mtime = {0, 0};
   struct timespec ctime = {0, 0};
 
   bool operator==(const FileIdentity& o) const {
-    return path == o.path && dev == o.dev && ino == o.ino && size == o.size &&
+    return path == o.path && err == o.err && dev == o.dev && ino == o.ino && size == o.size &&
            mtime.tv_sec == o.mtime.tv_sec && mtime.tv_nsec == o.mtime.tv_nsec &&
            ctime.tv_sec == o.ctime.tv_sec && ctime.tv_nsec == o.ctime.tv_nsec;
   }
 };
 
+FileIdentity IdentityOf(const std::string& path) {
+  FileIdentity identity;
+  identity.path = path;
+  struct stat st;
+  if (stat(path.c_str(), &st) != 0) {
+    identity.err = errno;
+    return identity;
+  }
+  identity.dev = st.st_dev;
+  identity.ino = st.st_ino;
+  identity.mode = st.st_mode;
+  identity.size = st.st_size;
+  identity.mtime = st.st_mtim;
+  identity.ctime = st.st_ctim;
+  return identity;
+}
+
 struct Cache {
   std::mutex mu;
-  FileIdentity identity;
+  std::vector<FileIdentity> identities;  // every file the cached value was read from
   std::shared_ptr<const PlatformConfig> config;
 };
 
@@ -164,6 +187,8 @@ const ShareConfig* PlatformConfig::FindShare(const std::string& name) const {
 
 std::string PlatformConfigPath() { return RootedPath("/etc/orvane/platform.json"); }
 
+std::string PlatformKeysPath() { return RootedPath("/etc/orvane/fileindex.conf"); }
+
 std::shared_ptr<const PlatformConfig> ParsePlatformConfig(const std::string& text,
                                                           const std::string& file) {
   Json::Value root;
@@ -174,6 +199,8 @@ std::shared_ptr<const PlatformConfig> ParsePlatformConfig(const std::string& tex
   if (!root.isObject()) Fail(file, "the top level is not a JSON object");
 
   auto config = std::make_shared<PlatformConfig>();
+  config->source = file;
+  config->samba_conf = RootedPath(kDefaultSambaConf);
   if (root.isMember("shares")) {
     const Json::Value& shares = root["shares"];
     if (!shares.isArray()) Fail(file, "\"shares\" is not an array");
@@ -213,35 +240,92 @@ std::shared_ptr<const PlatformConfig> ParsePlatformConfig(const std::string& tex
   return config;
 }
 
-std::shared_ptr<const PlatformConfig> LoadPlatformConfig() {
-  const std::string file = PlatformConfigPath();
-  FileIdentity identity;
-  identity.path = file;
-  struct stat st;
-  if (stat(file.c_str(), &st) != 0) {
-    Fail(file, std::string("cannot be read: ") + strerror(errno));
-  }
-  identity.dev = st.st_dev;
-  identity.ino = st.st_ino;
-  identity.size = st.st_size;
-  identity.mtime = st.st_mtim;
-  identity.ctime = st.st_ctim;
+namespace {
 
+// The keys file: "name = value" lines, '#' or ';' comments.
+void ReadKeys(const std::string& file, PlatformConfig* config) {
+  const SmbConf keys = ReadSmbConf(file, /*follow_includes=*/false);
+  if (!keys.sections.empty()) {
+    Fail(keys.sections[0].where, "this file has no [sections]; write \"key = value\" lines");
+  }
+  for (const auto& [key, value] : keys.global.params) {
+    if (key == "admin_group" && !value.text.empty()) {
+      config->admin_group = value.text;
+    } else if (key == "samba_conf" && !value.text.empty() && value.text[0] == '/') {
+      config->samba_conf = value.text;
+    } else if (key == "admin_group" || key == "samba_conf") {
+      Fail(value.where, Quoted(key) + " needs " +
+                            (key == "admin_group" ? "a group name" : "an absolute path"));
+    } else {
+      Fail(value.where, "unknown key " + Quoted(key) +
+                            "; the keys are admin_group and samba_conf");
+    }
+  }
+}
+
+// The configuration of a server without platform.json: the shares that Samba exports.
+std::shared_ptr<const PlatformConfig> LoadFromSamba(std::vector<FileIdentity>* identities) {
+  auto config = std::make_shared<PlatformConfig>();
+  config->samba_conf = RootedPath(kDefaultSambaConf);
+  const std::string keys_file = PlatformKeysPath();
+  identities->push_back(IdentityOf(keys_file));
+  if (identities->back().err == 0) ReadKeys(keys_file, config.get());
+
+  identities->push_back(IdentityOf(config->samba_conf));
+  if (identities->back().err != 0) {
+    Fail(config->samba_conf, std::string("cannot be read: ") + strerror(identities->back().err) +
+                                 "; without it or " + PlatformConfigPath() +
+                                 " no shares are known: configure Samba's shares, set "
+                                 "samba_conf in " + keys_file + ", or list the shares in " +
+                                 PlatformConfigPath());
+  }
+  const SmbConf smb = ReadSmbConf(config->samba_conf);
+  // Included files are known only once read; a change made to one in between is seen at its
+  // next change.
+  for (size_t i = 1; i < smb.files.size(); ++i) identities->push_back(IdentityOf(smb.files[i]));
+  SharesFromSmbConf(smb, &config->shares, &config->skipped);
+  config->source = config->samba_conf;
+  for (const std::string& note : config->skipped) {
+    Log(LOG_WARNING, "not indexed: %s", note.c_str());
+  }
+  return config;
+}
+
+bool Unchanged(const std::vector<FileIdentity>& identities) {
+  for (const FileIdentity& identity : identities) {
+    if (!(IdentityOf(identity.path) == identity)) return false;
+  }
+  return true;
+}
+
+}  // namespace
+
+std::shared_ptr<const PlatformConfig> LoadPlatformConfig() {
   Cache& cache = GetCache();
   {
     std::lock_guard<std::mutex> lock(cache.mu);
-    if (cache.config && cache.identity == identity) return cache.config;
+    if (cache.config && Unchanged(cache.identities)) return cache.config;
   }
-  if (!S_ISREG(st.st_mode)) Fail(file, "cannot be read: not a regular file");
-  std::ifstream in(file, std::ios::binary);
-  if (!in) Fail(file, std::string("cannot be read: ") + strerror(errno));
-  std::ostringstream text;
-  text << in.rdbuf();
-  if (in.bad()) Fail(file, "cannot be read: read error");
-  auto config = ParsePlatformConfig(text.str(), file);
+  const std::string file = PlatformConfigPath();
+  std::vector<FileIdentity> identities = {IdentityOf(file)};
+  std::shared_ptr<const PlatformConfig> config;
+  if (identities[0].err == ENOENT) {
+    config = LoadFromSamba(&identities);
+  } else {
+    if (identities[0].err != 0) {
+      Fail(file, std::string("cannot be read: ") + strerror(identities[0].err));
+    }
+    if (!S_ISREG(identities[0].mode)) Fail(file, "cannot be read: not a regular file");
+    std::ifstream in(file, std::ios::binary);
+    if (!in) Fail(file, std::string("cannot be read: ") + strerror(errno));
+    std::ostringstream text;
+    text << in.rdbuf();
+    if (in.bad()) Fail(file, "cannot be read: read error");
+    config = ParsePlatformConfig(text.str(), file);
+  }
 
   std::lock_guard<std::mutex> lock(cache.mu);
-  cache.identity = identity;
+  cache.identities = std::move(identities);
   cache.config = config;
   return config;
 }

@@ -1,7 +1,8 @@
-// The platform configuration file ($ORVANE_ROOT/etc/orvane/platform.json): the shares, the
-// administrators group, service commands and the Samba configuration path. Loaded and validated
-// whole; the parsed value is cached and re-read when the file changes on disk. Values are
-// immutable and shared; every function is safe from any thread.
+// The platform configuration: $ORVANE_ROOT/etc/orvane/platform.json (the shares, the
+// administrators group, service commands and the Samba configuration path) or, without it, the
+// shares that Samba exports and the keys of $ORVANE_ROOT/etc/orvane/fileindex.conf. Loaded and
+// validated whole; the parsed value is cached and re-read when one of its files changes on
+// disk. Values are immutable and shared; every function is safe from any thread.
 #ifndef ORVANE_PLATFORM_CONFIG_HPP_
 #define ORVANE_PLATFORM_CONFIG_HPP_
 
@@ -44,17 +45,24 @@ struct PlatformConfig {
   std::vector<ShareConfig> shares;
   std::string admin_group = "administrators";
   std::map<std::string, ServiceCommands> services;
-  std::string samba_conf = "/etc/samba/smb.conf";
+  std::string samba_conf;  // RootedPath("/etc/samba/smb.conf") unless configured
+  // Where the shares came from: platform.json or Samba's configuration file.
+  std::string source;
+  // Samba's shares that cannot be indexed, each "file:line: share [name] ...why".
+  std::vector<std::string> skipped;
 
   const ShareConfig* FindShare(const std::string& name) const;
 };
 
 // RootedPath("/etc/orvane/platform.json").
 std::string PlatformConfigPath();
+// RootedPath("/etc/orvane/fileindex.conf"): "admin_group = ..." and "samba_conf = ..." lines,
+// read when platform.json is absent.
+std::string PlatformKeysPath();
 
-// The configuration in force. Throws Error 504 naming the file and the fault when the file is
-// missing, unreadable, malformed or inconsistent (a share without a name or path, two shares of
-// one name, ...).
+// The configuration in force. Throws Error 504 naming the file (and line) and the fault when a
+// file is unreadable, malformed or inconsistent (a share without a name or path, two shares of
+// one name, ...), or when neither platform.json nor Samba's configuration exists.
 std::shared_ptr<const PlatformConfig> LoadPlatformConfig();
 
 // Parses a configuration text; `file` only names the source in error messages. Throws as above.

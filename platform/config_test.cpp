@@ -33,7 +33,7 @@ TEST(PlatformConfigTest, ReadsSharesAndDefaultsOnceWhileTheFileIsUnchanged) {
   EXPECT_TRUE(config->FindShare("music")->readonly);
   EXPECT_NE(config->FindShare("Fotos 2024 é"), nullptr);
   EXPECT_EQ(config->admin_group, "administrators");
-  EXPECT_EQ(config->samba_conf, "/etc/samba/smb.conf");
+  EXPECT_EQ(config->samba_conf, root.path() + "/etc/samba/smb.conf");
   EXPECT_EQ(LoadPlatformConfig(), config);
 }
 
@@ -41,9 +41,6 @@ TEST(PlatformConfigTest, EveryFaultIsAnErrorNamingTheFile) {
   test::TempDir root;
   test::ScopedRoot scoped(root.path());
   const std::string file = root.path() + "/etc/orvane/platform.json";
-
-  EXPECT_NE(LoadFault().find(file + ": cannot be read: No such file or directory"),
-            std::string::npos);
 
   const struct {
     const char* text;
