@@ -3,7 +3,7 @@
 # (names and contents) and plocate (path names), asks each the same file-name queries, checks
 # the answers against a walk of the tree with find, and prints a Markdown report.
 #
-#   sudo bash bench/compare.sh [TREE]
+#   bash bench/compare.sh [TREE]
 #
 # TREE (default: a fresh copy of /usr/share/doc) is indexed as it is; this system keeps its index
 # in TREE/@eaDir/@fileindex while it runs, which is removed at the end. Everything else (our
@@ -26,7 +26,7 @@ source "$(dirname "$0")/../scripts/lib.sh"
 export LC_ALL=C.UTF-8
 unset LOCATE_PATH RECOLL_CONFDIR RECOLL_CONFTOP RECOLL_CONFMID
 
-fi_require_root compare "sudo bash bench/compare.sh"
+fi_become_root "$0" "$@"
 
 base=$(realpath -m "${COMPARE_DIR:-/tmp/fileindex-compare}")
 read -r -a queries <<<"${COMPARE_QUERIES:-readme changelog copyright html lib example py}"

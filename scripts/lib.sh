@@ -6,12 +6,25 @@ fi_top=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 fi_bin=$fi_top/build
 fi_daemons=(quixelasticd fileindexd quixnotifyd)
 
-# fi_require_root NAME HOW: the library saves its configuration as root.
-fi_require_root() {
-  if [ "$(id -u)" -ne 0 ]; then
-    echo "$1: run as root ($2), the configuration is saved as root" >&2
+# fi_become_root SCRIPT [ARGS...]: the library saves its configuration as root, so a script run
+# by another user runs itself again through sudo (keeping ORVANE_ROOT and the scripts' own
+# COMPARE_* and FILEINDEX_* settings). A root shell needs no
+# sudo, which a fresh Debian machine set up with a root password does not have.
+fi_become_root() {
+  [ "$(id -u)" -eq 0 ] && return 0
+  local script=$1
+  shift
+  if ! command -v sudo >/dev/null 2>&1; then
+    echo "$(basename "$script"): run it as root (su -c 'bash $script'): the configuration is" \
+      "saved as root, and sudo is not installed" >&2
     exit 1
   fi
+  local keep=() name
+  for name in $(compgen -e); do
+    case $name in ORVANE_ROOT | COMPARE_* | FILEINDEX_*) keep+=("$name=${!name}") ;; esac
+  done
+  echo "== running $(basename "$script") as root through sudo"
+  exec sudo env "${keep[@]}" bash "$script" "$@"
 }
 
 # Installs what the build needs and builds the Release binaries into build/.

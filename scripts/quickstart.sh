@@ -3,15 +3,16 @@
 # writes a platform file whose one share is the sample folder, starts the three daemons, indexes
 # the folder, shows the progress and runs a few searches.
 #
-#   sudo bash scripts/quickstart.sh [FOLDER]
+#   bash scripts/quickstart.sh [FOLDER]
 #
 # FOLDER (default: a copy of /usr/share/doc) becomes the share named after its last component.
 # Everything else lives below $ORVANE_ROOT (default /tmp/fileindex-quickstart). Stop it all with
-# scripts/quickstop.sh. Run as root: the library saves its configuration as root.
+# scripts/quickstop.sh. It runs as root (the library saves its configuration as root): started by
+# another user, it runs itself again through sudo.
 set -euo pipefail
 source "$(dirname "$0")/lib.sh"
 
-fi_require_root quickstart "sudo bash scripts/quickstart.sh"
+fi_become_root "$0" "$@"
 fi_build
 
 export ORVANE_ROOT=${ORVANE_ROOT:-/tmp/fileindex-quickstart}
