@@ -8,6 +8,7 @@
 #include "common/json_util.hpp"
 #include "common/name_codec.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/name_fold.hpp"
 #include "daemons/quixelasticd/schema.hpp"
 #include "daemons/quixelasticd/sqlite_util.hpp"
 #include "daemons/quixelasticd/store.hpp"
@@ -20,7 +21,8 @@ namespace {
 
 const char* const kOperators[] = {"and", "or", "not", "match", "range", "in", "under", "all"};
 
-// A field of the tree and the SQL value it reads: a column, or a member of the stored document.
+// A field of the tree and the SQL value it reads: a column, or a member of the stored document
+// (members without a column of their own are kept in `rest`).
 struct FieldColumn {
   const char* name;
   const char* column;
@@ -30,34 +32,34 @@ struct FieldColumn {
 constexpr FieldColumn kRangeFields[] = {
     {"size", "d.size"},
     {"mtime", "d.mtime"},
-    {"ctime", "json_extract(d.body, '$.QUIXMDAttributeChangeDate')"},
-    {"crtime", "json_extract(d.body, '$.QUIXMDFSCreationDate')"},
-    {"content_created", "json_extract(d.body, '$.QUIXMDContentCreationDate')"},
-    {"duration", "json_extract(d.body, '$.QUIXMDDurationSecond')"},
-    {"pixel_height", "json_extract(d.body, '$.QUIXMDPixelHeight')"},
-    {"pixel_width", "json_extract(d.body, '$.QUIXMDPixelWidth')"},
-    {"year", "json_extract(d.body, '$.QUIXMDRecordingYear')"},
-    {"track", "json_extract(d.body, '$.QUIXMDAudioTrackNumber')"},
-    {"audio_bit_rate", "json_extract(d.body, '$.QUIXMDAudioBitRate')"},
-    {"sample_rate", "json_extract(d.body, '$.QUIXMDAudioSampleRate')"},
-    {"channels", "json_extract(d.body, '$.QUIXMDAudioChannelCount')"},
-    {"iso_speed", "json_extract(d.body, '$.QUIXMDISOSpeed')"},
+    {"ctime", "d.ctime"},
+    {"crtime", "d.crtime"},
+    {"content_created", "json_extract(d.rest, '$.QUIXMDContentCreationDate')"},
+    {"duration", "json_extract(d.rest, '$.QUIXMDDurationSecond')"},
+    {"pixel_height", "json_extract(d.rest, '$.QUIXMDPixelHeight')"},
+    {"pixel_width", "json_extract(d.rest, '$.QUIXMDPixelWidth')"},
+    {"year", "json_extract(d.rest, '$.QUIXMDRecordingYear')"},
+    {"track", "json_extract(d.rest, '$.QUIXMDAudioTrackNumber')"},
+    {"audio_bit_rate", "json_extract(d.rest, '$.QUIXMDAudioBitRate')"},
+    {"sample_rate", "json_extract(d.rest, '$.QUIXMDAudioSampleRate')"},
+    {"channels", "json_extract(d.rest, '$.QUIXMDAudioChannelCount')"},
+    {"iso_speed", "json_extract(d.rest, '$.QUIXMDISOSpeed')"},
 };
 
 // The texts a match reads word by word, as the catch-all text holds them.
 constexpr FieldColumn kTextFields[] = {
-    {"title", "json_extract(d.body, '$.QUIXMDTitle')"},
-    {"authors", "json_extract(d.body, '$.QUIXMDAuthors')"},
-    {"album", "json_extract(d.body, '$.QUIXMDAlbum')"},
-    {"composer", "json_extract(d.body, '$.QUIXMDComposer')"},
-    {"genre", "json_extract(d.body, '$.QUIXMDMusicalGenre')"},
-    {"comment", "json_extract(d.body, '$.QUIXMDComment')"},
-    {"description", "json_extract(d.body, '$.QUIXMDDescription')"},
-    {"keywords", "json_extract(d.body, '$.QUIXMDKeywords')"},
-    {"creator", "json_extract(d.body, '$.QUIXMDCreator')"},
-    {"camera_make", "json_extract(d.body, '$.QUIXMDAcquisitionMake')"},
-    {"camera_model", "json_extract(d.body, '$.QUIXMDAcquisitionModel')"},
-    {"codecs", "json_extract(d.body, '$.QUIXMDCodecs')"},
+    {"title", "json_extract(d.rest, '$.QUIXMDTitle')"},
+    {"authors", "json_extract(d.rest, '$.QUIXMDAuthors')"},
+    {"album", "json_extract(d.rest, '$.QUIXMDAlbum')"},
+    {"composer", "json_extract(d.rest, '$.QUIXMDComposer')"},
+    {"genre", "json_extract(d.rest, '$.QUIXMDMusicalGenre')"},
+    {"comment", "json_extract(d.rest, '$.QUIXMDComment')"},
+    {"description", "json_extract(d.rest, '$.QUIXMDDescription')"},
+    {"keywords", "json_extract(d.rest, '$.QUIXMDKeywords')"},
+    {"creator", "json_extract(d.rest, '$.QUIXMDCreator')"},
+    {"camera_make", "json_extract(d.rest, '$.QUIXMDAcquisitionMake')"},
+    {"camera_model", "json_extract(d.rest, '$.QUIXMDAcquisitionModel')"},
+    {"codecs", "json_extract(d.rest, '$.QUIXMDCodecs')"},
 };
 
 template <size_t N>
@@ -230,39 +232,14 @@ class Compiler {
     return sql + ")";
   }
 
-  // Names match as a whole, with '*' standing for any run of characters. The trigram index
-  // narrows the rows by every literal run of three characters or more; the LIKE then checks
-  // the runs' order and the name's ends. Without such a run the names are scanned. A single
-  // run between two '*' is a substring, which the trigram phrase alone answers exactly.
+  // Names match as a whole, with '*' standing for any run of characters, compared in the
+  // folded form the trigram index holds (any case, with or without diacritics). Its GLOB looks
+  // the literal runs of three characters or more up by their trigrams and checks the rows it
+  // finds; a pattern without such a run scans the names.
   std::string NameMatch(const std::string& pattern, bool joined) {
-    const std::string low = EncodeName(AsciiLower(pattern));
-    std::string match;
-    std::string like;
-    bool wild = false;  // the LIKE pattern ends in a '%' of a '*'
-    size_t i = 0;
-    while (true) {
-      const size_t star = low.find('*', i);
-      const std::string run =
-          low.substr(i, star == std::string::npos ? std::string::npos : star - i);
-      if (!run.empty()) wild = false;
-      like += EscapeLikeText(run);
-      if (DisplayLength(run) >= 3) match += (match.empty() ? "" : " AND ") + Quoted(run);
-      if (star == std::string::npos) break;
-      if (!wild) like += '%';
-      wild = true;
-      i = star + 1;
-    }
-    const bool substring = low.size() >= 2 && low.front() == '*' && low.back() == '*' &&
-                           low.find('*', 1) == low.size() - 1 && !match.empty();
-    std::string sql;
-    if (!match.empty()) {
-      sql += "fts_name MATCH ?";
-      Text(match);
-    }
-    if (!substring) {
-      sql += std::string(sql.empty() ? "" : " AND ") + "fts_name.name LIKE ? ESCAPE '\\'";
-      Text(like);
-    }
+    const std::string glob = GlobLiteral(FoldName(EncodeName(pattern)), true);
+    Text(glob);
+    const std::string sql = NameGlobCondition(glob);
     return joined ? "(" + sql + ")" : Lookup("fts_name", sql);
   }
 

@@ -16,6 +16,13 @@ const char kFieldExtension[] = "QUIXMDExtension";
 const char kFieldSize[] = "QUIXMDFSSize";
 const char kFieldMtime[] = "QUIXMDFSContentChangeDate";
 const char kFieldIsDir[] = "QUIXMDIsDir";
+const char kFieldCtime[] = "QUIXMDAttributeChangeDate";
+const char kFieldCrtime[] = "QUIXMDFSCreationDate";
+const char kFieldOwner[] = "QUIXMDOwnerUserID";
+const char kFieldGroup[] = "QUIXMDOwnerGroupID";
+const char kFieldDisplayName[] = "QUIXMDDisplayName";
+const char kFieldSearchName[] = "QUIXMDSearchFileName";
+const char kFieldKind[] = "QUIXMDKind";
 
 namespace {
 

@@ -22,6 +22,13 @@ extern const char kFieldExtension[];
 extern const char kFieldSize[];
 extern const char kFieldMtime[];
 extern const char kFieldIsDir[];
+extern const char kFieldCtime[];
+extern const char kFieldCrtime[];
+extern const char kFieldOwner[];
+extern const char kFieldGroup[];
+extern const char kFieldDisplayName[];
+extern const char kFieldSearchName[];
+extern const char kFieldKind[];
 
 enum class FieldType { kString, kText, kInt, kDouble, kBool };
 

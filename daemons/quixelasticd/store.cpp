@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <syslog.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -11,11 +12,13 @@
 
 #include "common/error.hpp"
 #include "common/fd.hpp"
+#include "common/log.hpp"
 #include "common/json_util.hpp"
 #include "common/name_codec.hpp"
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/name_fold.hpp"
 #include "daemons/quixelasticd/snippet.hpp"
 
 namespace orvane {
@@ -23,18 +26,41 @@ namespace elasticd {
 
 namespace {
 
+// The documents: the columns searches filter and sort on, and the document itself as the fields
+// those columns cannot give back (`rest`, JSON, null when there are none). `kept` says which
+// fields the columns give back (see kKept below); `ancestor` is computed, not stored, when it is
+// the folder the path itself names.
+std::string DocsTableSql(const char* table) {
+  return std::string("CREATE TABLE ") + table +
+         "(rowid INTEGER PRIMARY KEY, path TEXT NOT NULL UNIQUE, name TEXT, ext TEXT,"
+         " size INTEGER, mtime INTEGER, is_dir INTEGER, ctime INTEGER, crtime INTEGER,"
+         " owner TEXT, grp TEXT, anc TEXT, kept INTEGER NOT NULL, rest TEXT,"
+         " ancestor TEXT AS (CASE WHEN kept & 1 THEN CAST(substr(CAST(path AS BLOB), 1,"
+         " length(CAST(path AS BLOB)) - length(CAST(name AS BLOB)) - 1) AS TEXT) ELSE anc END)"
+         " VIRTUAL);";
+}
+
+// The trigram index keeps no positions and no sizes: a substring is looked up by its trigrams
+// and then checked against the folded name it stores (GLOB), which costs less than positions.
+const char kNameIndexSql[] =
+    "CREATE VIRTUAL TABLE fts_name USING fts5(name, tokenize='trigram', detail=none,"
+    " columnsize=0);";
+
 const char kSchemaSql[] =
     "CREATE TABLE meta(key TEXT PRIMARY KEY, value TEXT NOT NULL) WITHOUT ROWID;"
-    "CREATE TABLE docs(rowid INTEGER PRIMARY KEY, path TEXT NOT NULL UNIQUE, parent TEXT,"
-    " name TEXT, ext TEXT, size INTEGER, mtime INTEGER, is_dir INTEGER, ancestor TEXT,"
-    " body TEXT NOT NULL);"
     "CREATE VIRTUAL TABLE fts_all USING fts5(text, tokenize='unicode61 remove_diacritics 2');"
-    "CREATE VIRTUAL TABLE fts_name USING fts5(name, tokenize='trigram');"
     // The suggestion store: the vocabulary of the catch-all index with its document counts,
     // always in step with the documents at no cost to writes.
     "CREATE VIRTUAL TABLE sugg USING fts5vocab(fts_all, 'row');";
 
-constexpr int kFormat = 1;
+// The columns a document is read back from, in the order ReadDoc takes them.
+const char kDocColumns[] =
+    "path, name, ext, size, mtime, is_dir, ctime, crtime, owner, grp, ancestor, kept, rest";
+
+// Format 1 kept every document whole as JSON beside its columns, and positions in the name
+// index; such a store is rewritten when opened.
+constexpr int kOldFormat = 1;
+constexpr int kFormat = 2;
 
 // SQLite's default compile-time ceiling for a map (SQLITE_MAX_MMAP_SIZE).
 const char kMmapPragma[] = "PRAGMA mmap_size=2147418112";
@@ -52,21 +78,258 @@ void ConfigureWriter(Db& db) {
   db.Exec("PRAGMA wal_autocheckpoint=4096");
 }
 
-std::string FieldPath(const std::string& field) {
+// Field names with quotes or backslashes were never accepted in queries; they still are not.
+void CheckFieldName(const std::string& field) {
   if (field.find('"') != std::string::npos || field.find('\\') != std::string::npos) {
     throw EngineError(kCodeInvalidParam, "field name not allowed: " + field);
   }
-  return "$.\"" + field + "\"";
 }
 
-// The WHERE clause and its bound texts for a document query.
+Json::Value ParseBody(const std::string& body) {
+  JsonValue v;
+  if (!v.fromString(body) || !v.isObject()) {
+    throw StoreError(SQLITE_CORRUPT, "stored document is not a JSON object");
+  }
+  return v;
+}
+
+// Where a field of a document comes back from when it is read. A field is left out of `rest`
+// only when its column gives back the very value it had (same type, same text).
+enum class Source { kName, kParent, kExt, kIsDir, kSize, kMtime, kCtime, kCrtime, kOwner, kGroup };
+
+struct Shadow {
+  const char* field;
+  Source source;
+  int64_t bit;
+};
+
+// Bits of `kept`. Bit 0 is the ancestor column's own: computed from the path.
+constexpr int64_t kAncestorFromPath = 1;
+constexpr int64_t kAncestorField = 2;
+const Shadow kShadows[] = {
+    {kFieldFSName, Source::kName, 1 << 2},       {kFieldDisplayName, Source::kName, 1 << 3},
+    {kFieldSearchName, Source::kName, 1 << 4},   {kFieldParent, Source::kParent, 1 << 5},
+    {kFieldExtension, Source::kExt, 1 << 6},     {kFieldKind, Source::kExt, 1 << 7},
+    {kFieldIsDir, Source::kIsDir, 1 << 8},       {kFieldSize, Source::kSize, 1 << 9},
+    {kFieldMtime, Source::kMtime, 1 << 10},      {kFieldCtime, Source::kCtime, 1 << 11},
+    {kFieldCrtime, Source::kCrtime, 1 << 12},    {kFieldOwner, Source::kOwner, 1 << 13},
+    {kFieldGroup, Source::kGroup, 1 << 14}};
+
+const Shadow* ShadowOf(const std::string& field) {
+  for (const Shadow& s : kShadows) {
+    if (field == s.field) return &s;
+  }
+  return nullptr;
+}
+
+// The folder a path names when it ends in "/" + name; false otherwise.
+bool ParentOfPath(const std::string& path, const std::string& name, std::string* parent) {
+  if (name.empty() || path.size() <= name.size() ||
+      path.compare(path.size() - name.size(), name.size(), name) != 0 ||
+      path[path.size() - name.size() - 1] != '/') {
+    return false;
+  }
+  *parent = path.substr(0, path.size() - name.size() - 1);
+  return true;
+}
+
+// A number column that, like a value read out of JSON, is an integer, a real or absent.
+struct NumberColumn {
+  enum class Kind { kNull, kInt, kReal } kind = Kind::kNull;
+  int64_t integer = 0;
+  double real = 0;
+
+  static NumberColumn Of(const Json::Value* v) {
+    NumberColumn c;
+    if (v == nullptr) return c;
+    if (v->type() == Json::intValue ||
+        (v->type() == Json::uintValue && v->asLargestUInt() <= INT64_MAX)) {
+      c.kind = Kind::kInt;
+      c.integer = v->asInt64();
+    } else if (v->type() == Json::realValue) {
+      c.kind = Kind::kReal;
+      c.real = v->asDouble();
+    }
+    return c;
+  }
+  void BindTo(Stmt& st, int index) const {
+    if (kind == Kind::kInt) {
+      st.Bind(index, integer);
+    } else if (kind == Kind::kReal) {
+      st.Bind(index, real);
+    } else {
+      st.BindNull(index);
+    }
+  }
+};
+
+// The values of one row of `docs`.
+struct Row {
+  int64_t kept = 0;
+  std::string rest;  // empty: null
+  bool anc_null = false;
+  NumberColumn ctime, crtime;
+  std::optional<std::string> owner, grp;
+};
+
+const Json::Value* Member(const Json::Value& doc, const char* field) {
+  return doc.find(field, field + std::strlen(field));
+}
+
+Row RowOf(const Schema& schema, const Json::Value& doc, const DerivedDoc& d) {
+  Row r;
+  std::string parent;
+  const bool has_parent = ParentOfPath(d.path, d.name, &parent);
+  if (has_parent && d.ancestor == parent) {
+    r.kept |= kAncestorFromPath;
+    r.anc_null = true;
+  }
+  r.ctime = NumberColumn::Of(Member(doc, kFieldCtime));
+  r.crtime = NumberColumn::Of(Member(doc, kFieldCrtime));
+  Json::Value rest(Json::objectValue);
+  for (auto it = doc.begin(); it != doc.end(); ++it) {
+    const std::string field = it.name();
+    const Json::Value& v = *it;
+    if (field == schema.property_id()) continue;  // the path, a non-empty string
+    if (field == schema.ancestor_field() && v.isString() && v.asString() == d.ancestor) {
+      r.kept |= kAncestorField;
+      continue;
+    }
+    const Shadow* s = ShadowOf(field);
+    bool kept = false;
+    if (s != nullptr) {
+      switch (s->source) {
+        case Source::kName:
+          kept = v.isString() && v.asString() == d.name;
+          break;
+        case Source::kParent:
+          kept = has_parent && v.isString() && v.asString() == parent;
+          break;
+        case Source::kExt:
+          kept = v.isString() && v.asString() == d.ext;
+          break;
+        case Source::kIsDir:
+          kept = v.isBool();
+          break;
+        case Source::kSize:
+        case Source::kMtime:
+          kept = v.type() == Json::intValue &&
+                 v.asInt64() == (s->source == Source::kSize ? d.size : d.mtime);
+          break;
+        case Source::kCtime:
+        case Source::kCrtime:
+          kept = v.type() == Json::intValue;
+          break;
+        case Source::kOwner:
+        case Source::kGroup:
+          kept = v.isString();
+          if (kept) (s->source == Source::kOwner ? r.owner : r.grp) = v.asString();
+          break;
+      }
+    }
+    if (kept) {
+      r.kept |= s->bit;
+    } else {
+      rest[field] = v;
+    }
+  }
+  if (!rest.empty()) r.rest = JsonToString(rest);
+  return r;
+}
+
+// The document of a row read with kDocColumns from column `first` on.
+Json::Value ReadDoc(const Schema& schema, const Stmt& st, int first) {
+  const int64_t kept = st.Int(first + 11);
+  Json::Value doc =
+      st.IsNull(first + 12) ? Json::Value(Json::objectValue) : ParseBody(st.Text(first + 12));
+  const std::string path = st.Text(first);
+  const std::string name = st.Text(first + 1);
+  if (kept & kAncestorField) doc[schema.ancestor_field()] = st.Text(first + 10);
+  for (const Shadow& s : kShadows) {
+    if ((kept & s.bit) == 0) continue;
+    Json::Value& v = doc[s.field];
+    switch (s.source) {
+      case Source::kName:
+        v = name;
+        break;
+      case Source::kParent: {
+        std::string parent;
+        ParentOfPath(path, name, &parent);
+        v = parent;
+        break;
+      }
+      case Source::kExt:
+        v = st.Text(first + 2);
+        break;
+      case Source::kIsDir:
+        v = st.Int(first + 5) != 0;
+        break;
+      case Source::kSize:
+        v = Json::Int64(st.Int(first + 3));
+        break;
+      case Source::kMtime:
+        v = Json::Int64(st.Int(first + 4));
+        break;
+      case Source::kCtime:
+        v = Json::Int64(st.Int(first + 6));
+        break;
+      case Source::kCrtime:
+        v = Json::Int64(st.Int(first + 7));
+        break;
+      case Source::kOwner:
+        v = st.Text(first + 8);
+        break;
+      case Source::kGroup:
+        v = st.Text(first + 9);
+        break;
+    }
+  }
+  doc[schema.property_id()] = path;
+  return doc;
+}
+
+// A field's value as the document queries compare it: the text of a string or a number, 1 or
+// 0 for a flag, the JSON text of anything else; false when the document has no such field.
+bool QueryText(const Json::Value& doc, const std::string& field, std::string* text) {
+  const Json::Value* v = doc.find(field.data(), field.data() + field.size());
+  if (v == nullptr || v->isNull()) return false;
+  if (v->isString()) {
+    *text = v->asString();
+  } else if (v->isBool()) {
+    *text = v->asBool() ? "1" : "0";
+  } else if (v->type() == Json::intValue) {
+    *text = std::to_string(v->asInt64());
+  } else if (v->type() == Json::uintValue) {
+    *text = std::to_string(v->asUInt64());
+  } else {
+    *text = JsonToString(*v);
+  }
+  return true;
+}
+
+// The WHERE clause and its bound texts for a document query. Queries on a field without a
+// column of its own (`scan`) read every document in identifier order and test it here.
 struct Where {
   std::string sql;
   std::vector<std::string> args;
+  bool scan = false;
+  const DocQuery* query = nullptr;
+
+  bool Matches(const Json::Value& doc) const {
+    std::string text;
+    if (!QueryText(doc, query->field, &text)) return false;
+    if (query->kind == DocQuery::Kind::kTerm) {
+      // A whole value is compared as text only for strings, never for numbers and flags.
+      const std::string& f = query->field;
+      return doc.find(f.data(), f.data() + f.size())->isString() && text == query->value;
+    }
+    return text.compare(0, query->value.size(), query->value) == 0;
+  }
 };
 
 Where WhereOf(const Schema& schema, const DocQuery& q) {
   Where w;
+  w.query = &q;
   const bool id_field = q.field == schema.property_id();
   switch (q.kind) {
     case DocQuery::Kind::kAll:
@@ -81,36 +344,26 @@ Where WhereOf(const Schema& schema, const DocQuery& q) {
         const std::string under = folder == "/" ? "/" : folder + "/";
         w.sql = "(ancestor = ? OR (ancestor >= ? AND ancestor < ?))";
         w.args = {folder, under, *PrefixUpperBound(under)};
-        break;
-      }
-      if (id_field) {
+      } else if (id_field) {
         w.sql = "path = ?";
         w.args.push_back(q.value);
       } else {
-        // Values inside the stored JSON are in their written form.
-        w.sql = "json_extract(body, ?) = ?";
-        w.args.push_back(FieldPath(q.field));
-        w.args.push_back(EncodeName(q.value));
+        w.sql = "1";
+        w.scan = true;
       }
       break;
     case DocQuery::Kind::kPrefix: {
       const std::optional<std::string> upper = PrefixUpperBound(q.value);
-      if (id_field) {
-        if (!upper) {
-          w.sql = "path >= ?";
-          w.args.push_back(q.value);
-        } else {
-          w.sql = "path >= ? AND path < ?";
-          w.args.push_back(q.value);
-          w.args.push_back(*upper);
-        }
+      if (!id_field) {
+        w.sql = "1";
+        w.scan = true;
+      } else if (!upper) {
+        w.sql = "path >= ?";
+        w.args.push_back(q.value);
       } else {
-        // substr counts characters of the written form, not bytes.
-        const std::string text = EncodeName(q.value);
-        w.sql = "substr(json_extract(body, ?), 1, ?) = ?";
-        w.args.push_back(FieldPath(q.field));
-        w.args.push_back(std::to_string(DisplayLength(text)));
-        w.args.push_back(text);
+        w.sql = "path >= ? AND path < ?";
+        w.args.push_back(q.value);
+        w.args.push_back(*upper);
       }
       break;
     }
@@ -120,14 +373,6 @@ Where WhereOf(const Schema& schema, const DocQuery& q) {
 
 void BindWhere(Stmt& st, const Where& w, int first) {
   for (size_t i = 0; i < w.args.size(); ++i) st.Bind(first + static_cast<int>(i), w.args[i]);
-}
-
-Json::Value ParseBody(const std::string& body) {
-  JsonValue v;
-  if (!v.fromString(body) || !v.isObject()) {
-    throw StoreError(SQLITE_CORRUPT, "stored document is not a JSON object");
-  }
-  return v;
 }
 
 void SyncFile(const platform::SafeDir& folder, const std::string& name) {
@@ -184,14 +429,6 @@ std::string MatchExpression(const std::string& keywords) {
   return out;
 }
 
-std::string EscapeLike(const std::string& s) {
-  std::string out;
-  for (char c : s) {
-    if (c == '%' || c == '_' || c == '\\') out += '\\';
-    out += c;
-  }
-  return out;
-}
 
 }  // namespace
 
@@ -296,7 +533,7 @@ std::shared_ptr<IndexStore> IndexStore::Create(const std::string& dir, const std
   s->OpenWriter(true);
   {
     Transaction txn(s->writer_);
-    s->writer_.Exec(kSchemaSql);
+    s->writer_.Exec(std::string(kSchemaSql) + DocsTableSql("docs") + kNameIndexSql);
     Stmt put(s->writer_, "INSERT INTO meta(key, value) VALUES(?, ?)");
     auto set = [&](const std::string& k, const std::string& v) {
       put.Bind(1, k).Bind(2, v).Run();
@@ -332,7 +569,11 @@ std::shared_ptr<IndexStore> IndexStore::Open(const std::string& dir) {
 }
 
 void IndexStore::LoadSchema() {
-  const std::string format = Meta("format");
+  std::string format = Meta("format");
+  if (format == std::to_string(kOldFormat)) {
+    Upgrade();
+    format = Meta("format");
+  }
   if (format != std::to_string(kFormat)) {
     throw StoreError(SQLITE_NOTADB, "unknown store format '" + format + "' in " + file_);
   }
@@ -341,6 +582,37 @@ void IndexStore::LoadSchema() {
     throw StoreError(SQLITE_CORRUPT, "stored mappings are not JSON in " + file_);
   }
   schema_ = Schema::Parse(mappings);
+}
+
+void IndexStore::Upgrade() {
+  // One transaction: a crash midway leaves the old store as it was, to be upgraded next time.
+  // The word index keeps its rows (same row ids, same text); the name index is rebuilt over
+  // folded names.
+  JsonValue mappings;
+  if (!mappings.fromString(Meta("mappings"))) {
+    throw StoreError(SQLITE_CORRUPT, "stored mappings are not JSON in " + file_);
+  }
+  schema_ = Schema::Parse(mappings);
+  Transaction txn(writer_);
+  writer_.Exec("ALTER TABLE docs RENAME TO docs_old; DROP TABLE fts_name;" +
+               DocsTableSql("docs") + kNameIndexSql);
+  int64_t count = 0;
+  {
+    Stmt rows(writer_, "SELECT rowid, body FROM docs_old");
+    while (rows.Step()) {
+      const Json::Value doc = ParseBody(rows.Text(1));
+      const DerivedDoc d = schema_.Derive(doc);
+      DerivedDoc before = d;
+      before.name_text.clear();
+      WriteRow(rows.Int(0), doc, d, true, &before);
+      ++count;
+    }
+  }
+  writer_.Exec("DROP TABLE docs_old");
+  SetMeta("format", std::to_string(kFormat));
+  txn.Commit();
+  Log(LOG_INFO, "the index in %s was rewritten in the compact store format (%lld documents)",
+      dir_.c_str(), static_cast<long long>(count));
 }
 
 std::string IndexStore::Meta(const std::string& key) {
@@ -355,18 +627,43 @@ void IndexStore::SetMeta(const std::string& key, const std::string& value) {
   Cached("INSERT OR REPLACE INTO meta(key, value) VALUES(?, ?)").Bind(1, key).Bind(2, value).Run();
 }
 
-void IndexStore::WriteRow(int64_t rowid, const DerivedDoc& d, const std::string& body,
-                          bool insert, const DerivedDoc* old) {
-  Stmt& st = insert ? Cached("INSERT INTO docs(path, parent, name, ext, size, mtime, is_dir,"
-                             " ancestor, body, rowid) VALUES(?,?,?,?,?,?,?,?,?,?)")
-                    : Cached("UPDATE docs SET path=?, parent=?, name=?, ext=?, size=?, mtime=?,"
-                             " is_dir=?, ancestor=?, body=? WHERE rowid=?");
-  st.Bind(1, d.path).Bind(2, d.parent).Bind(3, d.name).Bind(4, d.ext).Bind(5, d.size);
-  st.Bind(6, d.mtime).Bind(7, static_cast<int64_t>(d.is_dir)).Bind(8, d.ancestor).Bind(9, body);
-  if (insert && rowid == 0) {
-    st.BindNull(10);
+void IndexStore::WriteRow(int64_t rowid, const Json::Value& doc, const DerivedDoc& d, bool insert,
+                          const DerivedDoc* old) {
+  const Row r = RowOf(schema_, doc, d);
+  Stmt& st = insert ? Cached("INSERT INTO docs(path, name, ext, size, mtime, is_dir, ctime,"
+                             " crtime, owner, grp, anc, kept, rest, rowid)"
+                             " VALUES(?,?,?,?,?,?,?,?,?,?,?,?,?,?)")
+                    : Cached("UPDATE docs SET path=?, name=?, ext=?, size=?, mtime=?, is_dir=?,"
+                             " ctime=?, crtime=?, owner=?, grp=?, anc=?, kept=?, rest=?"
+                             " WHERE rowid=?");
+  st.Bind(1, d.path).Bind(2, d.name).Bind(3, d.ext).Bind(4, d.size).Bind(5, d.mtime);
+  st.Bind(6, static_cast<int64_t>(d.is_dir));
+  r.ctime.BindTo(st, 7);
+  r.crtime.BindTo(st, 8);
+  auto text_or_null = [&](int index, const std::optional<std::string>& v) {
+    if (v) {
+      st.Bind(index, *v);
+    } else {
+      st.BindNull(index);
+    }
+  };
+  text_or_null(9, r.owner);
+  text_or_null(10, r.grp);
+  if (r.anc_null) {
+    st.BindNull(11);
   } else {
-    st.Bind(10, rowid);
+    st.Bind(11, d.ancestor);
+  }
+  st.Bind(12, r.kept);
+  if (r.rest.empty()) {
+    st.BindNull(13);
+  } else {
+    st.Bind(13, r.rest);
+  }
+  if (insert && rowid == 0) {
+    st.BindNull(14);
+  } else {
+    st.Bind(14, rowid);
   }
   st.Run();
   if (insert && rowid == 0) rowid = writer_.LastInsertRowid();
@@ -388,14 +685,15 @@ void IndexStore::WriteRow(int64_t rowid, const DerivedDoc& d, const std::string&
     }
     if (!d.name_text.empty()) {
       Cached("INSERT INTO fts_name(rowid, name) VALUES(?, ?)").Bind(1, rowid)
-          .Bind(2, EncodeName(d.name_text)).Run();
+          .Bind(2, FoldName(EncodeName(d.name_text))).Run();
     }
   }
 }
 
-void IndexStore::DeleteRow(int64_t rowid, const DerivedDoc& old) {
-  if (!old.all_text.empty()) Cached("DELETE FROM fts_all WHERE rowid = ?").Bind(1, rowid).Run();
-  if (!old.name_text.empty()) Cached("DELETE FROM fts_name WHERE rowid = ?").Bind(1, rowid).Run();
+void IndexStore::DeleteRow(int64_t rowid) {
+  // Deleting a row a full-text table does not hold (a document without that text) is a no-op.
+  Cached("DELETE FROM fts_all WHERE rowid = ?").Bind(1, rowid).Run();
+  Cached("DELETE FROM fts_name WHERE rowid = ?").Bind(1, rowid).Run();
   Cached("DELETE FROM docs WHERE rowid = ?").Bind(1, rowid).Run();
 }
 
@@ -417,10 +715,25 @@ void IndexStore::Upsert(const std::string& doc_id, const Json::Value& given) {
   Json::Value stored;
   if (FindRow(d.path, &rowid, &stored)) {
     const DerivedDoc old = schema_.Derive(stored);
-    WriteRow(rowid, d, JsonToString(doc), false, &old);
+    WriteRow(rowid, doc, d, false, &old);
   } else {
-    WriteRow(0, d, JsonToString(doc), true, nullptr);
+    WriteRow(0, doc, d, true, nullptr);
   }
+}
+
+size_t IndexStore::UpsertMany(const std::vector<Json::Value>& docs,
+                              std::vector<std::pair<size_t, std::string>>* refused) {
+  size_t written = 0;
+  for (size_t i = 0; i < docs.size(); ++i) {
+    try {
+      Upsert(std::string(), docs[i]);
+      ++written;
+    } catch (const EngineError& e) {
+      // Refused before anything of it was written: the others go on.
+      if (refused != nullptr) refused->emplace_back(i, e.what());
+    }
+  }
+  return written;
 }
 
 void IndexStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
@@ -440,28 +753,33 @@ void IndexStore::SetFields(const std::string& doc_id, const Json::Value& fields)
   const DerivedDoc d = schema_.Derive(doc);
   if (d.path != old.path) {
     // The file now lives where another document was: that file has been replaced.
-    int64_t other_row = 0;
-    Json::Value other;
-    if (FindRow(d.path, &other_row, &other)) DeleteRow(other_row, schema_.Derive(other));
+    Stmt& find = Cached("SELECT rowid FROM docs WHERE path = ?");
+    find.Bind(1, d.path);
+    const int64_t other_row = find.Step() ? find.Int(0) : 0;
+    find.Reset();
+    if (other_row != 0) DeleteRow(other_row);
   }
-  WriteRow(rowid, d, JsonToString(doc), false, &old);
+  WriteRow(rowid, doc, d, false, &old);
 }
 
 bool IndexStore::Delete(const std::string& doc_id) {
-  int64_t rowid = 0;
-  Json::Value stored;
-  if (!FindRow(doc_id, &rowid, &stored)) return false;
-  DeleteRow(rowid, schema_.Derive(stored));
+  Stmt& find = Cached("SELECT rowid FROM docs WHERE path = ?");
+  find.Bind(1, doc_id);
+  const int64_t rowid = find.Step() ? find.Int(0) : 0;
+  find.Reset();
+  if (rowid == 0) return false;
+  DeleteRow(rowid);
   return true;
 }
 
 bool IndexStore::FindRow(const std::string& path, int64_t* rowid, Json::Value* stored) {
-  Stmt& find = Cached("SELECT rowid, body FROM docs WHERE path = ?");
+  Stmt& find = Cached("SELECT rowid, path, name, ext, size, mtime, is_dir, ctime, crtime, owner,"
+                      " grp, ancestor, kept, rest FROM docs WHERE path = ?");
   find.Bind(1, path);
   const bool found = find.Step();
   if (found) {
     *rowid = find.Int(0);
-    *stored = ParseBody(find.Text(1));
+    *stored = ReadDoc(schema_, find, 1);
   }
   find.Reset();
   return found;
@@ -469,6 +787,16 @@ bool IndexStore::FindRow(const std::string& path, int64_t* rowid, Json::Value* s
 
 int64_t IndexStore::DeleteByQuery(const DocQuery& q) {
   const Where w = WhereOf(schema_, q);
+  if (w.scan) {
+    CheckFieldName(q.field);
+    std::vector<int64_t> rows;
+    Stmt st(writer_, std::string("SELECT rowid, ") + kDocColumns + " FROM docs");
+    while (st.Step()) {
+      if (w.Matches(ReadDoc(schema_, st, 1))) rows.push_back(st.Int(0));
+    }
+    for (int64_t rowid : rows) DeleteRow(rowid);
+    return static_cast<int64_t>(rows.size());
+  }
   const std::string rows = "SELECT rowid FROM docs WHERE " + w.sql;
   // Deleting rows whose text is empty from the full-text tables is a harmless no-op.
   for (const char* table : {"fts_all", "fts_name"}) {
@@ -485,17 +813,29 @@ int64_t IndexStore::DeleteByQuery(const DocQuery& q) {
 Json::Value IndexStore::GetByQuery(const DocQuery& q, const std::vector<std::string>& load,
                                    int64_t from, int64_t size) {
   const Where w = WhereOf(schema_, q);
-  Stmt st(writer_, "SELECT body FROM docs WHERE " + w.sql + " ORDER BY path LIMIT ? OFFSET ?");
+  if (w.scan) CheckFieldName(q.field);
+  std::string sql = std::string("SELECT ") + kDocColumns + " FROM docs WHERE " + w.sql +
+                    " ORDER BY path";
+  if (!w.scan) sql += " LIMIT ? OFFSET ?";
+  Stmt st(writer_, sql);
   BindWhere(st, w, 1);
-  st.Bind(static_cast<int>(w.args.size()) + 1, size);
-  st.Bind(static_cast<int>(w.args.size()) + 2, from);
+  if (!w.scan) {
+    st.Bind(static_cast<int>(w.args.size()) + 1, size);
+    st.Bind(static_cast<int>(w.args.size()) + 2, from);
+  }
   Json::Value hits(Json::arrayValue);
-  while (st.Step()) hits.append(schema_.Load(ParseBody(st.Text(0)), load));
+  int64_t matched = 0;
+  while (st.Step() && static_cast<int64_t>(hits.size()) < size) {
+    Json::Value doc = ReadDoc(schema_, st, 0);
+    if (w.scan && (!w.Matches(doc) || matched++ < from)) continue;
+    hits.append(schema_.Load(doc, load));
+  }
   return hits;
 }
 
 Json::Value IndexStore::List(const std::string& dir, const std::string& after,
                              const std::vector<std::string>& extra, int64_t size) {
+  for (const std::string& field : extra) CheckFieldName(field);
   // One range scan of the identifier index: from the folder itself (or just after the last
   // identifier of the previous page) up to the first identifier past its subtree; names that
   // only begin like the folder ("dir.txt" sorts between "dir" and "dir/") are filtered out.
@@ -503,9 +843,7 @@ Json::Value IndexStore::List(const std::string& dir, const std::string& after,
   const std::optional<std::string> upper = PrefixUpperBound(under);
   const bool resume = !after.empty() && after >= dir;
   std::string sql = "SELECT path, size, mtime, is_dir";
-  for (size_t i = 0; i < extra.size(); ++i) {
-    sql += ", json_extract(body, ?" + std::to_string(6 + i) + ")";
-  }
+  if (!extra.empty()) sql += std::string(", ") + kDocColumns;
   sql += std::string(" FROM docs WHERE path ") + (resume ? ">" : ">=") + " ?1";
   if (upper) sql += " AND path < ?2";
   sql += " AND (path = ?3 OR path >= ?4) ORDER BY path LIMIT ?5";
@@ -515,7 +853,6 @@ Json::Value IndexStore::List(const std::string& dir, const std::string& after,
   st.Bind(3, dir);
   st.Bind(4, under);
   st.Bind(5, size);
-  for (size_t i = 0; i < extra.size(); ++i) st.Bind(static_cast<int>(6 + i), FieldPath(extra[i]));
   Json::Value hits(Json::arrayValue);
   while (st.Step()) {
     Json::Value hit(Json::arrayValue);
@@ -523,14 +860,24 @@ Json::Value IndexStore::List(const std::string& dir, const std::string& after,
     hit.append(st.IsNull(1) ? Json::Value() : Json::Value(Json::Int64(st.Int(1))));
     hit.append(st.IsNull(2) ? Json::Value() : Json::Value(Json::Int64(st.Int(2))));
     hit.append(!st.IsNull(3) && st.Int(3) != 0);
-    for (size_t i = 0; i < extra.size(); ++i) {
-      const int col = static_cast<int>(4 + i);
-      if (st.IsNull(col)) {
-        hit.append(Json::Value());
-      } else if (st.IsInt(col)) {
-        hit.append(Json::Int64(st.Int(col)));
-      } else {
-        hit.append(st.Text(col));
+    if (!extra.empty()) {
+      // Each loaded field as a value of SQL would give it: whole numbers and flags as numbers,
+      // strings as they are, anything else as its JSON text.
+      const Json::Value doc = ReadDoc(schema_, st, 4);
+      for (const std::string& field : extra) {
+        const Json::Value* v = doc.find(field.data(), field.data() + field.size());
+        if (v == nullptr || v->isNull()) {
+          hit.append(Json::Value());
+        } else if (v->isBool()) {
+          hit.append(Json::Int64(v->asBool() ? 1 : 0));
+        } else if (v->type() == Json::intValue ||
+                   (v->type() == Json::uintValue && v->asUInt64() <= INT64_MAX)) {
+          hit.append(Json::Int64(v->asInt64()));
+        } else if (v->isString()) {
+          hit.append(*v);
+        } else {
+          hit.append(JsonToString(*v));
+        }
       }
     }
     hits.append(std::move(hit));
@@ -657,20 +1004,11 @@ struct SearchSql {
 
 void AddNameFilter(const std::string& name, SearchSql* q) {
   q->from += " JOIN fts_name ON fts_name.rowid = d.rowid";
-  // The trigram index answers substrings of three characters or more as a phrase of
-  // trigrams, from positions alone; shorter ones scan the names.
-  if (DisplayLength(name) >= 3) {
-    std::string phrase = "\"";
-    for (char c : name) {
-      if (c == '"') phrase += '"';
-      phrase += c;
-    }
-    q->where += " AND fts_name MATCH ?";
-    q->Text(phrase + "\"");
-  } else {
-    q->where += " AND fts_name.name LIKE ? ESCAPE '\\'";
-    q->Text("%" + EscapeLike(name) + "%");
-  }
+  // The trigram index answers a GLOB from the trigrams of its literal runs and checks the
+  // candidates against the folded names it holds; patterns under three characters scan them.
+  const std::string glob = "*" + GlobLiteral(FoldName(name)) + "*";
+  q->where += " AND " + NameGlobCondition(glob);
+  q->Text(glob);
 }
 
 void AddFolderFilter(std::string folder, SearchSql* q) {
@@ -713,7 +1051,7 @@ SearchSql SearchSqlOf(const SearchParams& p) {
     q.where += " AND fts_all MATCH ?";
     q.Text(q.match);
   }
-  const std::string name = EncodeName(AsciiLower(p.name));
+  const std::string name = EncodeName(p.name);
   if (!name.empty()) AddNameFilter(name, &q);
   if (!p.folder.empty()) AddFolderFilter(p.folder, &q);
   if (!p.exts.empty()) {

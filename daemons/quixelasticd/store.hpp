@@ -112,6 +112,12 @@ class IndexStore {
   // Adds or replaces a whole document. `doc_id` names the document it replaces; the document's
   // identity is its property_id field (filled from `doc_id` when absent).
   void Upsert(const std::string& doc_id, const Json::Value& doc);
+  // Upserts documents already decoded (the indexer's bulk form), each identified by its own
+  // property_id field. A document the schema refuses is skipped and listed in `refused` (its
+  // position and why); the others are written. Returns how many were written; throws
+  // StoreError when the store fails, leaving the caller's transaction to roll back.
+  size_t UpsertMany(const std::vector<Json::Value>& docs,
+                    std::vector<std::pair<size_t, std::string>>* refused);
   // Merges `fields` into the existing document `doc_id`; throws EngineError(kCodeDocNotFound).
   // Changing the identifying field re-keys it, replacing any document already under the new key.
   void SetFields(const std::string& doc_id, const Json::Value& fields);
@@ -148,9 +154,11 @@ class IndexStore {
   void LoadSchema();
   std::unique_ptr<Db> TakeReader();
   void GiveBackReader(std::unique_ptr<Db> db);
-  void WriteRow(int64_t rowid, const DerivedDoc& d, const std::string& body, bool insert,
+  // Rewrites a store of the previous format in this one, in one transaction.
+  void Upgrade();
+  void WriteRow(int64_t rowid, const Json::Value& doc, const DerivedDoc& d, bool insert,
                 const DerivedDoc* old);
-  void DeleteRow(int64_t rowid, const DerivedDoc& old);
+  void DeleteRow(int64_t rowid);
   // The row and stored document under `path`; false when there is none.
   bool FindRow(const std::string& path, int64_t* rowid, Json::Value* stored);
   // A prepared writer statement, reset and ready for binding.

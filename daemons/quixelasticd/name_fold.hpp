@@ -1,0 +1,30 @@
+// FoldName: the form of a file name that the trigram name index holds and that name patterns
+// are compared in: letters and digits folded exactly as the word index folds words (lower
+// case, diacritics removed, by SQLite's own unicode61 tokenizer), every other character kept,
+// ASCII letters lowered. Thread-safe; the tokenizer lives for the whole process.
+#ifndef ORVANE_DAEMONS_QUIXELASTICD_NAME_FOLD_HPP_
+#define ORVANE_DAEMONS_QUIXELASTICD_NAME_FOLD_HPP_
+
+#include <string>
+
+namespace orvane {
+namespace elasticd {
+
+// `text` is UTF-8 (names in their written form). Throws StoreError when SQLite's tokenizer
+// cannot be had, which only a broken SQLite build causes.
+std::string FoldName(const std::string& text);
+
+// `text` as a GLOB pattern that matches it literally ('?' and '[' in brackets, and '*' too
+// unless `stars` keeps them as wildcards).
+std::string GlobLiteral(const std::string& text, bool stars = false);
+
+// The condition that matches the trigram index's names against the GLOB pattern `glob` (bound
+// to its one '?'): looked up by trigrams, or, for a pattern the index would answer wrongly (a
+// literal run of three bytes or more but fewer than three characters finds nothing), by
+// scanning the names.
+std::string NameGlobCondition(const std::string& glob);
+
+}  // namespace elasticd
+}  // namespace orvane
+
+#endif  // ORVANE_DAEMONS_QUIXELASTICD_NAME_FOLD_HPP_
