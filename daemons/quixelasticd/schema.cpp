@@ -119,6 +119,7 @@ std::string AsciiLower(std::string s) {
 std::string ValueText(const Json::Value& v) {
   if (v.isString()) return v.asString();
   if (v.isBool()) return v.asBool() ? "true" : "false";
+  if (v.type() == Json::uintValue) return std::to_string(v.asLargestUInt());
   if (v.isIntegral()) return std::to_string(v.asLargestInt());
   if (v.isNumeric()) return JsonToString(v);
   if (v.isArray()) {

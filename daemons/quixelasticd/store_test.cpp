@@ -193,6 +193,164 @@ TEST_F(StoreTest, NamesThatAreNotUtf8AreFoundByTheirValidParts) {
   }
 }
 
+// Documents are kept as columns plus the fields the columns cannot give back; what comes back
+// must be what was sent, whatever the values' types and however they differ from the columns.
+TEST_F(StoreTest, DocumentsComeBackAsTheyWereSent) {
+  std::vector<Json::Value> docs;
+  docs.push_back(FileDoc("/v/s/plain.txt", 12, 1600000000));
+  for (const Spoil& spoil : std::vector<Spoil>{
+           [](Json::Value& d) {
+             d["QUIXMDFSSize"] = 3.0;
+             d["QUIXMDIsDir"] = 1;
+             d["QUIXMDExtension"] = "TXT";
+             d["QUIXMDKind"] = "document";
+             d["QUIXMDAttributeChangeDate"] = 1.5;
+             d["QUIXMDFSCreationDate"] = Json::UInt64(18000000000000000000ull);
+           },
+           [](Json::Value& d) {
+             d["QUIXMDParent"] = "/elsewhere";
+             d["QUIXMDSearchAncestor"] = "/v";
+             d["QUIXMDDisplayName"] = "Shown name";
+             d["QUIXMDOwnerUserID"] = "1026";
+             d["QUIXMDOwnerGroupID"] = Json::Value(Json::nullValue);
+             d["QUIXMDTitle"].append("one");
+             d["QUIXMDTitle"].append(2);
+           },
+           [](Json::Value& d) {
+             d["QUIXMDIsDir"] = true;
+             d["QUIXMDDisplayName"] = d["QUIXMDFSName"];
+             d["QUIXMDKind"] = d["QUIXMDExtension"];
+             d["QUIXMDAttributeChangeDate"] = -7;
+             d["QUIXMDFSCreationDate"] = 0;
+             d["QUIXMDOwnerGroupID"] = "";
+             d.removeMember("QUIXMDParent");
+             d.removeMember("QUIXMDFSContentChangeDate");
+           }}) {
+    Json::Value d = FileDoc("/v/s/f" + std::to_string(docs.size()) + "/caf\xE9.Txt", 5, 9);
+    spoil(d);
+    docs.push_back(d);
+  }
+  Json::Value odd = FileDoc("noslash");
+  odd["QUIXMDFSName"] = "noslash";
+  docs.push_back(odd);
+  std::vector<std::pair<size_t, std::string>> refused;
+  {
+    WriteTxn txn(*store_);
+    Json::Value bad = FileDoc("/v/s/bad.txt");
+    bad["QUIXMDFSSize"] = "twelve";
+    docs.push_back(bad);
+    EXPECT_EQ(store_->UpsertMany(docs, &refused), docs.size() - 1);
+    docs.pop_back();
+    txn.Commit();
+  }
+  ASSERT_EQ(refused.size(), 1u);
+  EXPECT_EQ(refused[0].first, docs.size());
+  const Schema& schema = store_->schema();
+  for (const Json::Value& d : docs) {
+    const std::string path = d["QUIXMDPath"].asString();
+    const Json::Value hits =
+        store_->GetByQuery({DocQuery::Kind::kTerm, "QUIXMDPath", path}, {}, 0, 10);
+    ASSERT_EQ(hits.size(), 1u) << path;
+    EXPECT_EQ(JsonToString(hits[0]), JsonToString(schema.Load(d, {})));
+  }
+  // Fields without a column of their own still answer queries.
+  using K = DocQuery::Kind;
+  EXPECT_THAT(Paths({K::kTerm, "QUIXMDOwnerUserID", "1026"}),
+              ElementsAre("/v/s/f2/caf\xE9.Txt"));
+  EXPECT_THAT(Paths({K::kPrefix, "QUIXMDDisplayName", "Shown"}),
+              ElementsAre("/v/s/f2/caf\xE9.Txt"));
+  EXPECT_THAT(Paths({K::kTerm, "QUIXMDParent", "/elsewhere"}), ElementsAre("/v/s/f2/caf\xE9.Txt"));
+}
+
+// Names are compared folded, as words are: any case, with or without diacritics, in either
+// Unicode form; characters that mean something to a pattern are matched as themselves.
+TEST_F(StoreTest, NamesMatchInAnyCaseWithOrWithoutDiacritics) {
+  for (const char* p : {"/v/s/Caf\xC3\xA9 Menu.txt", "/v/s/cafe.txt", "/v/s/CAFE\xCC\x81-noir.pdf",
+                        "/v/s/a[1]?.txt", "/v/s/a*b.txt", "/v/s/acb.txt", "/v/s/\xC3\x85ngstr\xC3\xB6m.doc"}) {
+    Put(FileDoc(p));
+  }
+  const std::vector<std::pair<std::string, std::vector<std::string>>> cases = {
+      {"cafe", {"Caf\xC3\xA9 Menu.txt", "cafe.txt", "CAFE\xCC\x81-noir.pdf"}},
+      {"CAF\xC3\x89", {"Caf\xC3\xA9 Menu.txt", "cafe.txt", "CAFE\xCC\x81-noir.pdf"}},
+      {"e m", {"Caf\xC3\xA9 Menu.txt"}},
+      {"angstrom", {"\xC3\x85ngstr\xC3\xB6m.doc"}},
+      {"[1]?", {"a[1]?.txt"}},
+      {"a*b", {"a*b.txt"}},
+      {"fe", {"Caf\xC3\xA9 Menu.txt", "cafe.txt", "CAFE\xCC\x81-noir.pdf"}}};
+  for (const auto& [pattern, names] : cases) {
+    std::vector<std::string> found = NamesLike(pattern);
+    std::sort(found.begin(), found.end());
+    std::vector<std::string> want = names;
+    std::sort(want.begin(), want.end());
+    EXPECT_EQ(found, want) << pattern;
+  }
+}
+
+// A store written before documents were split into columns (each whole as JSON, positions in
+// the name index) is rewritten when opened, in one transaction: if the rewrite fails, the old
+// store is left as it was.
+TEST(StoreUpgradeTest, AnOldStoreIsRewrittenAtOpenOrLeftWhole) {
+  orvane::test::TempDir dir;
+  const std::string folder = dir.Path("db");
+  const Schema schema = Schema::Parse(tc::FileMappings());
+  std::vector<Json::Value> docs = {FileDoc("/v/s/Caf\xC3\xA9.txt", 3, 7),
+                                   FileDoc("/v/s/sub/notes.md", 4, 8)};
+  docs[1]["QUIXMDTitle"] = "quarterly plans";
+  IndexStore::Create(folder, "fileindex_s", tc::FileMappings(), {}, {}).reset();
+  {
+    Db db;
+    db.Open(folder + "/" + IndexStore::kDbFile, false, false);
+    db.Exec(
+        "DROP TABLE docs; DROP TABLE fts_name; UPDATE meta SET value = '1' WHERE key = 'format';"
+        "CREATE TABLE docs(rowid INTEGER PRIMARY KEY, path TEXT NOT NULL UNIQUE, parent TEXT,"
+        " name TEXT, ext TEXT, size INTEGER, mtime INTEGER, is_dir INTEGER, ancestor TEXT,"
+        " body TEXT NOT NULL);"
+        "CREATE VIRTUAL TABLE fts_name USING fts5(name, tokenize='trigram');");
+    Stmt put(db, "INSERT INTO docs(rowid, path, parent, name, ext, size, mtime, is_dir, ancestor,"
+                 " body) VALUES(?, ?, ?, ?, ?, ?, ?, 0, ?, ?)");
+    Stmt all(db, "INSERT INTO fts_all(rowid, text) VALUES(?, ?)");
+    Stmt name(db, "INSERT INTO fts_name(rowid, name) VALUES(?, ?)");
+    for (size_t i = 0; i < docs.size(); ++i) {
+      const DerivedDoc d = schema.Derive(docs[i]);
+      const int64_t row = static_cast<int64_t>(i) + 1;
+      put.Reset();
+      put.Bind(1, row).Bind(2, d.path).Bind(3, d.parent).Bind(4, d.name).Bind(5, d.ext);
+      put.Bind(6, d.size).Bind(7, d.mtime).Bind(8, d.ancestor).Bind(9, JsonToString(docs[i]));
+      put.Run();
+      all.Reset();
+      all.Bind(1, row).Bind(2, EncodeName(d.all_text)).Run();
+      name.Reset();
+      name.Bind(1, row).Bind(2, EncodeName(d.name_text)).Run();
+    }
+    db.Exec("INSERT INTO docs(path, body) VALUES('/v/s/broken', 'not json')");
+  }
+  EXPECT_THROW(IndexStore::Open(folder), StoreError);
+  {
+    Db db;
+    db.Open(folder + "/" + IndexStore::kDbFile, false, false);
+    Stmt rows(db, "SELECT count(*) FROM docs WHERE body NOT NULL");
+    ASSERT_TRUE(rows.Step());
+    EXPECT_EQ(rows.Int(0), 3);
+    db.Exec("DELETE FROM docs WHERE path = '/v/s/broken'");
+  }
+  std::shared_ptr<IndexStore> store = IndexStore::Open(folder);
+  EXPECT_EQ(store->Meta("format"), "2");
+  for (const Json::Value& d : docs) {
+    const Json::Value hits = store->GetByQuery(
+        {DocQuery::Kind::kTerm, "QUIXMDPath", d["QUIXMDPath"].asString()}, {}, 0, 10);
+    ASSERT_EQ(hits.size(), 1u);
+    EXPECT_EQ(JsonToString(hits[0]), JsonToString(d));
+  }
+  SearchParams p;
+  p.name = "CAFE";
+  ASSERT_EQ(store->Search(p, nullptr).hits.size(), 1u);
+  p.name.clear();
+  p.keywords = "quarterly";
+  EXPECT_EQ(store->Search(p, nullptr).hits.size(), 1u);
+  std::string detail;
+  EXPECT_TRUE(store->QuickCheck(&detail)) << detail;
+}
+
 TEST_F(StoreTest, AFullDiskFailsTheWriteAndKeepsWhatWasThere) {
   Put(FileDoc("/v/s/kept.txt"));
   // The page limit stands in for a full disk: SQLite answers SQLITE_FULL the same way.
