@@ -28,16 +28,19 @@ namespace {
 
 // The documents: the columns searches filter and sort on, and the document itself as the fields
 // those columns cannot give back (`rest`, JSON, null when there are none). `kept` says which
-// fields the columns give back (see kKept below); `ancestor` is computed, not stored, when it is
-// the folder the path itself names.
+// fields the columns give back (see kShadows below). When the path ends in "/" + name, only
+// the length of the folder part is stored (`plen`) and the name is computed from the path, as
+// is the ancestor when it is that folder (bit 0 of `kept`); otherwise they are stored (`nm`,
+// `anc`). Computed columns cost nothing on disk and read as any other.
 std::string DocsTableSql(const char* table) {
   return std::string("CREATE TABLE ") + table +
-         "(rowid INTEGER PRIMARY KEY, path TEXT NOT NULL UNIQUE, name TEXT, ext TEXT,"
+         "(rowid INTEGER PRIMARY KEY, path TEXT NOT NULL UNIQUE, nm TEXT, plen INTEGER, ext TEXT,"
          " size INTEGER, mtime INTEGER, is_dir INTEGER, ctime INTEGER, crtime INTEGER,"
          " owner TEXT, grp TEXT, anc TEXT, kept INTEGER NOT NULL, rest TEXT,"
-         " ancestor TEXT AS (CASE WHEN kept & 1 THEN CAST(substr(CAST(path AS BLOB), 1,"
-         " length(CAST(path AS BLOB)) - length(CAST(name AS BLOB)) - 1) AS TEXT) ELSE anc END)"
-         " VIRTUAL);";
+         " name TEXT AS (CASE WHEN plen IS NULL THEN nm"
+         " ELSE CAST(substr(CAST(path AS BLOB), plen + 2) AS TEXT) END) VIRTUAL,"
+         " ancestor TEXT AS (CASE WHEN kept & 1 THEN CAST(substr(CAST(path AS BLOB), 1, plen)"
+         " AS TEXT) ELSE anc END) VIRTUAL);";
 }
 
 // The trigram index keeps no positions and no sizes: a substring is looked up by its trigrams
@@ -168,6 +171,7 @@ struct Row {
   int64_t kept = 0;
   std::string rest;  // empty: null
   bool anc_null = false;
+  std::optional<int64_t> plen;  // bytes of the folder part when the path ends in "/" + name
   NumberColumn ctime, crtime;
   std::optional<std::string> owner, grp;
 };
@@ -180,6 +184,7 @@ Row RowOf(const Schema& schema, const Json::Value& doc, const DerivedDoc& d) {
   Row r;
   std::string parent;
   const bool has_parent = ParentOfPath(d.path, d.name, &parent);
+  if (has_parent) r.plen = static_cast<int64_t>(parent.size());
   if (has_parent && d.ancestor == parent) {
     r.kept |= kAncestorFromPath;
     r.anc_null = true;
@@ -630,16 +635,12 @@ void IndexStore::SetMeta(const std::string& key, const std::string& value) {
 void IndexStore::WriteRow(int64_t rowid, const Json::Value& doc, const DerivedDoc& d, bool insert,
                           const DerivedDoc* old) {
   const Row r = RowOf(schema_, doc, d);
-  Stmt& st = insert ? Cached("INSERT INTO docs(path, name, ext, size, mtime, is_dir, ctime,"
+  Stmt& st = insert ? Cached("INSERT INTO docs(path, nm, plen, ext, size, mtime, is_dir, ctime,"
                              " crtime, owner, grp, anc, kept, rest, rowid)"
-                             " VALUES(?,?,?,?,?,?,?,?,?,?,?,?,?,?)")
-                    : Cached("UPDATE docs SET path=?, name=?, ext=?, size=?, mtime=?, is_dir=?,"
-                             " ctime=?, crtime=?, owner=?, grp=?, anc=?, kept=?, rest=?"
+                             " VALUES(?,?,?,?,?,?,?,?,?,?,?,?,?,?,?)")
+                    : Cached("UPDATE docs SET path=?, nm=?, plen=?, ext=?, size=?, mtime=?,"
+                             " is_dir=?, ctime=?, crtime=?, owner=?, grp=?, anc=?, kept=?, rest=?"
                              " WHERE rowid=?");
-  st.Bind(1, d.path).Bind(2, d.name).Bind(3, d.ext).Bind(4, d.size).Bind(5, d.mtime);
-  st.Bind(6, static_cast<int64_t>(d.is_dir));
-  r.ctime.BindTo(st, 7);
-  r.crtime.BindTo(st, 8);
   auto text_or_null = [&](int index, const std::optional<std::string>& v) {
     if (v) {
       st.Bind(index, *v);
@@ -647,23 +648,24 @@ void IndexStore::WriteRow(int64_t rowid, const Json::Value& doc, const DerivedDo
       st.BindNull(index);
     }
   };
-  text_or_null(9, r.owner);
-  text_or_null(10, r.grp);
-  if (r.anc_null) {
-    st.BindNull(11);
+  st.Bind(1, d.path);
+  if (r.plen) {
+    st.BindNull(2).Bind(3, *r.plen);
   } else {
-    st.Bind(11, d.ancestor);
+    st.Bind(2, d.name).BindNull(3);
   }
-  st.Bind(12, r.kept);
-  if (r.rest.empty()) {
-    st.BindNull(13);
-  } else {
-    st.Bind(13, r.rest);
-  }
+  st.Bind(4, d.ext).Bind(5, d.size).Bind(6, d.mtime).Bind(7, static_cast<int64_t>(d.is_dir));
+  r.ctime.BindTo(st, 8);
+  r.crtime.BindTo(st, 9);
+  text_or_null(10, r.owner);
+  text_or_null(11, r.grp);
+  text_or_null(12, r.anc_null ? std::nullopt : std::optional<std::string>(d.ancestor));
+  st.Bind(13, r.kept);
+  text_or_null(14, r.rest.empty() ? std::nullopt : std::optional<std::string>(r.rest));
   if (insert && rowid == 0) {
-    st.BindNull(14);
+    st.BindNull(15);
   } else {
-    st.Bind(14, rowid);
+    st.Bind(15, rowid);
   }
   st.Run();
   if (insert && rowid == 0) rowid = writer_.LastInsertRowid();
