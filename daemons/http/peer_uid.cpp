@@ -4,6 +4,7 @@
 #include <linux/netlink.h>
 #include <linux/sock_diag.h>
 #include <netinet/in.h>
+#include <grp.h>
 #include <pwd.h>
 #include <sys/syscall.h>
 #include <sys/socket.h>
@@ -77,14 +78,31 @@ std::optional<uid_t> LocalPeerUid(const tcp::endpoint& local, const tcp::endpoin
 
 // The raw system calls change the calling thread only; the C library's wrappers would change
 // every thread of the process.
-ThreadCredentials::ThreadCredentials(uid_t uid) {
+ThreadCredentials::ThreadCredentials(uid_t uid, bool with_groups) {
   if (uid == 0) return;
   std::vector<char> buf(16384);
   passwd pw;
   passwd* found = nullptr;
-  const gid_t gid = (::getpwuid_r(uid, &pw, buf.data(), buf.size(), &found) == 0 && found)
-                        ? found->pw_gid
-                        : static_cast<gid_t>(65534);  // an unnamed uid gets no group's rights
+  const bool named = ::getpwuid_r(uid, &pw, buf.data(), buf.size(), &found) == 0 && found;
+  const gid_t gid = named ? found->pw_gid : static_cast<gid_t>(65534);  // an unnamed uid gets
+                                                                        // no group's rights
+  if (with_groups) {
+    std::vector<gid_t> groups(1, gid);
+    if (named) {
+      int n = 64;
+      groups.resize(n);
+      while (::getgrouplist(found->pw_name, gid, groups.data(), &n) < 0) groups.resize(n *= 2);
+      groups.resize(n);
+    }
+    const int own = ::getgroups(0, nullptr);
+    saved_groups_.resize(own > 0 ? own : 0);
+    if (own < 0 || ::getgroups(own, saved_groups_.data()) != own ||
+        ::syscall(SYS_setgroups, groups.size(), groups.data()) != 0) {
+      ok_ = false;
+      return;
+    }
+    groups_switched_ = switched_ = true;
+  }
   if (::syscall(SYS_setresgid, -1, gid, -1) != 0) {
     ok_ = false;
     return;
@@ -96,6 +114,10 @@ ThreadCredentials::ThreadCredentials(uid_t uid) {
 ThreadCredentials::~ThreadCredentials() {
   if (!switched_) return;
   if (::syscall(SYS_setresuid, -1, 0, -1) != 0 || ::syscall(SYS_setresgid, -1, 0, -1) != 0) {
+    std::abort();
+  }
+  if (groups_switched_ &&
+      ::syscall(SYS_setgroups, saved_groups_.size(), saved_groups_.data()) != 0) {
     std::abort();
   }
 }

@@ -8,6 +8,7 @@
 
 #include <boost/asio/ip/tcp.hpp>
 #include <optional>
+#include <vector>
 
 namespace orvane {
 namespace httpd {
@@ -18,12 +19,13 @@ namespace httpd {
 std::optional<uid_t> LocalPeerUid(const boost::asio::ip::tcp::endpoint& local,
                                   const boost::asio::ip::tcp::endpoint& peer);
 
-// The calling thread acts as `uid` (and its primary group) while it lives; the rest of the process
-// keeps its own credentials. Root (uid 0) changes nothing. A thread that cannot take root back
-// ends the process: it must never go on with another user's rights.
+// The calling thread acts as `uid` (and its primary group, and with `with_groups` the account's
+// supplementary groups too) while it lives; the rest of the process keeps its own credentials.
+// Root (uid 0) changes nothing. A thread that cannot take root back ends the process: it must
+// never go on with another user's rights.
 class ThreadCredentials {
  public:
-  explicit ThreadCredentials(uid_t uid);
+  explicit ThreadCredentials(uid_t uid, bool with_groups = false);
   ~ThreadCredentials();
   ThreadCredentials(const ThreadCredentials&) = delete;
   ThreadCredentials& operator=(const ThreadCredentials&) = delete;
@@ -34,6 +36,8 @@ class ThreadCredentials {
  private:
   bool switched_ = false;
   bool ok_ = true;
+  bool groups_switched_ = false;
+  std::vector<gid_t> saved_groups_;  // the thread's own, put back when groups_switched_
 };
 
 }  // namespace httpd
