@@ -8,7 +8,7 @@ packages=(
   libjsoncpp-dev libboost-dev libsqlite3-dev libacl1-dev
   libgtest-dev libgmock-dev googletest libbenchmark-dev
   libmagic-dev libpoppler-cpp-dev libtag1-dev libexiv2-dev libarchive-dev
-  libxml2-dev libuchardet-dev libmediainfo-dev libssl-dev
+  libxml2-dev libuchardet-dev libmediainfo-dev libssl-dev libpam0g-dev
   libgmime-3.0-dev libtesseract-dev tesseract-ocr-eng unrtf catdoc ghostscript djvulibre-bin
   groff-base
   e2fsprogs mount util-linux acl passwd
