@@ -121,8 +121,8 @@ Read ReadMember(struct archive* a, ExpansionGuard* guard, size_t max_bytes, std:
 // What a compressed file holds is named by the file's name without the compression's extension.
 std::string InnerName(const std::string& name) {
   static const std::map<std::string, std::string> kSuffixes = {
-      {"gz", ""},     {"bz2", ""},    {"xz", ""},      {"zst", ""},     {"zstd", ""},
-      {"lz4", ""},    {"lzma", ""},   {"lz", ""},      {"z", ""},       {"tgz", ".tar"},
+      {"gz", ""},      {"bz2", ""},      {"xz", ""},      {"zst", ""},     {"zstd", ""},
+      {"lz4", ""},     {"lzma", ""},     {"lz", ""},      {"z", ""},       {"tgz", ".tar"},
       {"tbz", ".tar"}, {"tbz2", ".tar"}, {"txz", ".tar"}, {"tzst", ".tar"}};
   const std::string ext = GetFileExtension(name, true);
   auto it = kSuffixes.find(ext);

@@ -21,14 +21,15 @@ using Maker = std::function<void(const test::TempDir&)>;
 // Runs `script` with bash in the corpus folder; it fails the test when the tools do.
 Maker Sh(const std::string& script) {
   return [script](const test::TempDir& dir) {
-    const test::ProgramResult r =
-        test::RunProgram("/bin/bash", {"-c", "set -eo pipefail; cd '" + dir.path() + "'; " + script});
+    const test::ProgramResult r = test::RunProgram(
+        "/bin/bash", {"-c", "set -eo pipefail; cd '" + dir.path() + "'; " + script});
     ASSERT_EQ(r.status, 0) << script << "\n" << r.err;
   };
 }
 
 Maker SamplePdfAt(const std::string& name, const std::string& text) {
-  return [=](const test::TempDir& dir) { dir.Write(name, test::SamplePdf("Quarterly Report", text)); };
+  return
+      [=](const test::TempDir& dir) { dir.Write(name, test::SamplePdf("Quarterly Report", text)); };
 }
 
 struct Row {
@@ -43,13 +44,17 @@ struct Row {
 std::vector<Row> Rows() {
   return {
       {"plain.txt", Sh("echo 'one plainword here' > plain.txt"), "plainword", {}},
-      {"latin.txt", Sh("printf 'caf\\xe9 cr\\xe8me latinword d\\xe9j\\xe0 vu\\n%.0s' 1 2 3 > latin.txt"),
-       "cr\xc3\xa8me latinword", {}},
+      {"latin.txt",
+       Sh("printf 'caf\\xe9 cr\\xe8me latinword d\\xe9j\\xe0 vu\\n%.0s' 1 2 3 > latin.txt"),
+       "cr\xc3\xa8me latinword",
+       {}},
       {"wide.txt", Sh("echo 'sixteen widewordy' | iconv -t UTF-16 > wide.txt"), "widewordy", {}},
       // Binary bytes under a text's name are not text.
       {"noise.txt", Sh("head -c 4096 /dev/urandom > noise.txt"), "", {}},
       // A misnamed file is read by its contents.
-      {"report.txt", SamplePdfAt("report.txt", "misnamedpdfword"), "misnamedpdfword",
+      {"report.txt",
+       SamplePdfAt("report.txt", "misnamedpdfword"),
+       "misnamedpdfword",
        {{"QUIXMDTitle", "Quarterly Report"}}},
       {"app.log", Sh("echo 'a logword line' | gzip > app.log"), "logword", {}},
       // Compressed single files give what they hold, as its own kind.
@@ -57,7 +62,10 @@ std::vector<Row> Rows() {
       {"t.txt.bz2", Sh("echo 'bzipword' > t.txt && bzip2 t.txt"), "bzipword", {}},
       {"t.txt.xz", Sh("echo 'xzword' > t.txt && xz t.txt"), "xzword", {}},
       {"t.txt.zst", Sh("echo 'zstdword' > t.txt && zstd -q --rm t.txt"), "zstdword", {}},
-      {"t.txt.lz4", Sh("echo 'lzfourword' > t.txt && lz4 -q --rm t.txt t.txt.lz4"), "lzfourword", {}},
+      {"t.txt.lz4",
+       Sh("echo 'lzfourword' > t.txt && lz4 -q --rm t.txt t.txt.lz4"),
+       "lzfourword",
+       {}},
       {"r.pdf.gz",
        [](const test::TempDir& dir) {
          SamplePdfAt("r.pdf", "gzippedpdfword")(dir);
@@ -67,30 +75,48 @@ std::vector<Row> Rows() {
        {{"QUIXMDTitle", "Quarterly Report"}}},
       // Archives give their members' names and texts.
       {"a.zip", Sh("mkdir d && echo zipword > d/m.txt && zip -qr a.zip d"), "zipword", {}},
-      {"names.zip", Sh("head -c 100 /dev/urandom > membername.bin && zip -q names.zip membername.bin"),
-       "membername.bin", {}},
+      {"names.zip",
+       Sh("head -c 100 /dev/urandom > membername.bin && zip -q names.zip membername.bin"),
+       "membername.bin",
+       {}},
       {"a.tar", Sh("echo tarword > m.txt && tar cf a.tar m.txt"), "tarword", {}},
       {"a.tar.gz", Sh("echo targzword > m.txt && tar czf a.tar.gz m.txt"), "targzword", {}},
       {"a.tbz2", Sh("echo tbzword > m.txt && tar cjf a.tbz2 m.txt"), "tbzword", {}},
       {"a.tar.xz", Sh("echo tarxzword > m.txt && tar cJf a.tar.xz m.txt"), "tarxzword", {}},
       {"a.7z", Sh("echo sevenword > m.txt && 7z a -bd a.7z m.txt >/dev/null"), "sevenword", {}},
-      {"a.cpio", Sh("echo cpioword > m.txt && echo m.txt | cpio -o -H newc > a.cpio 2>/dev/null"),
-       "cpioword", {}},
+      {"a.cpio",
+       Sh("echo cpioword > m.txt && echo m.txt | cpio -o -H newc > a.cpio 2>/dev/null"),
+       "cpioword",
+       {}},
       {"a.a", Sh("echo arword > m.txt && ar rc a.a m.txt"), "arword", {}},
       {"p.deb",
        Sh("mkdir -p p/DEBIAN p/usr/share/doc/p && echo debword > p/usr/share/doc/p/README && "
           "printf 'Package: p\\nVersion: 1\\nArchitecture: all\\nMaintainer: m <m@x>\\n"
           "Description: d\\n' > p/DEBIAN/control && dpkg-deb -Zxz -b p p.deb >/dev/null"),
-       "debword", {}},
+       "debword",
+       {}},
+      // Encrypted members give their names only, and the archive says it holds some.
+      {"secret.zip",
+       Sh("echo secretword > s.txt && zip -q -P pw secret.zip s.txt"),
+       "s.txt",
+       {{"QUIXMDIsEncrypted", "true"}}},
+      {"a.tar.zst",
+       Sh("echo tarzstdword > m.txt && tar --zstd -cf a.tar.zst m.txt"),
+       "tarzstdword",
+       {}},
       // Members of the kinds we read are read as those kinds, archives in archives too.
       {"docs.tar.gz",
        [](const test::TempDir& dir) {
          SamplePdfAt("in.pdf", "memberpdfword")(dir);
-         Sh("echo nestedword > n.txt && zip -q inner.zip n.txt && tar czf docs.tar.gz in.pdf inner.zip")(dir);
+         Sh("echo nestedword > n.txt && zip -q inner.zip n.txt && tar czf docs.tar.gz in.pdf "
+            "inner.zip")(dir);
        },
-       "memberpdfword", {}},
-      {"nest.tgz", Sh("echo nestedword > n.txt && zip -q inner.zip n.txt && tar czf nest.tgz inner.zip"),
-       "nestedword", {}},
+       "memberpdfword",
+       {}},
+      {"nest.tgz",
+       Sh("echo nestedword > n.txt && zip -q inner.zip n.txt && tar czf nest.tgz inner.zip"),
+       "nestedword",
+       {}},
   };
 }
 

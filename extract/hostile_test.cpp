@@ -67,7 +67,8 @@ with tarfile.open("climb.tar", "w") as t:
     t.addfile(info, io.BytesIO(data))
 '
     # Cut short: the first member whole, the rest missing.
-    echo cutfirstword > first.txt && head -c 300000 /dev/urandom > noise && echo cutlastword > last.txt
+    echo cutfirstword > first.txt && echo cutlastword > last.txt
+    head -c 300000 /dev/urandom > noise
     tar czf whole.tar.gz first.txt noise last.txt && head -c 150000 whole.tar.gz > cut.tar.gz
     zip -q -0 whole.zip first.txt noise last.txt && head -c 150000 whole.zip > cut.zip
     rm whole.tar.gz whole.zip noise
