@@ -271,6 +271,7 @@ void SharesFromSmbConf(const SmbConf& conf, std::vector<ShareConfig>* shares,
               : about + " has no path; give it one");
       continue;
     }
+    const std::string at_path = path_value->where + ": share [" + section.name + "]";
     std::string path = path_value->text;
     if (lower == "homes") {
       // "<folder>/%S" (or %U, %u) is each user's own folder below one folder of homes.
@@ -283,13 +284,13 @@ void SharesFromSmbConf(const SmbConf& conf, std::vector<ShareConfig>* shares,
       }
     }
     if (path.find('%') != std::string::npos) {
-      skipped->push_back(about + ": path " + path_value->text +
+      skipped->push_back(at_path + ": path " + path_value->text +
                          " depends on who connects (%); only a fixed folder can be indexed");
       continue;
     }
     const std::string clean = CleanPath(path);
     if (clean.empty()) {
-      skipped->push_back(about + ": path " + path_value->text +
+      skipped->push_back(at_path + ": path " + path_value->text +
                          " is not an absolute path without \".\" or \"..\"; write it plainly");
       continue;
     }
@@ -298,7 +299,7 @@ void SharesFromSmbConf(const SmbConf& conf, std::vector<ShareConfig>* shares,
     // only in case.
     const std::string folder = clean.substr(clean.rfind('/') + 1);
     if (strcasecmp(folder.c_str(), section.name.c_str()) != 0) {
-      skipped->push_back(about + ": its folder " + clean +
+      skipped->push_back(at_path + ": its folder " + clean +
                          " does not bear the share's name; rename the share or the folder so "
                          "that they match");
       continue;

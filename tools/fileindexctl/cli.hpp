@@ -25,6 +25,12 @@ class UsageError : public std::runtime_error {
   using std::runtime_error::runtime_error;
 };
 
+// Thrown by a command that has printed its whole result but ends with another exit status than
+// 0 (the doctor's 1 when something would stop indexing).
+struct ExitWith {
+  int status;
+};
+
 // Options ("--name value", "--name=value", "--flag") and positional arguments, in order.
 class Args {
  public:

@@ -28,6 +28,7 @@
 #include "fileindex/status_mgr.hpp"
 #include "fileindex/util.hpp"
 #include "platform/daemon_sock.hpp"
+#include "tools/fileindexctl/doctor.hpp"
 #include "tools/fileindexctl/spotlight_conf.hpp"
 
 namespace orvane {
@@ -827,7 +828,22 @@ void StatusCmd(const Args& args, Output& out) {
   }
 }
 
+void DoctorCmd(const Args&, Output& out) {
+  const Json::Value diagnosis = Diagnose();
+  out.Emit(diagnosis, [&diagnosis](std::ostream& os) { PrintDiagnosis(diagnosis, os); });
+  if (!diagnosis["ok"].asBool()) throw ExitWith{1};
+}
+
 }  // namespace
+
+bool DaemonExchange(const std::string& socket, const std::string& payload, Json::Value& reply,
+                    std::string& error) {
+  return Exchange(socket, payload, reply, error);
+}
+
+Json::Value DaemonStateOf(const std::string& name) { return DaemonState(name); }
+
+Json::Value StatusReport() { return CollectStatus(); }
 
 // Prints, or writes into an smb.conf, the lines that send a share's Spotlight searches to the
 // search gateway.
@@ -991,6 +1007,14 @@ const std::vector<Command>& Commands() {
        {"wait"},
        0,
        StatusCmd},
+      {"",
+       "doctor",
+       "",
+       "what would stop indexing, each with what to do; exit status 1 when something does",
+       {},
+       {},
+       0,
+       DoctorCmd},
   };
   return commands;
 }

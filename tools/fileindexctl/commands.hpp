@@ -44,6 +44,16 @@ struct Command {
 
 const std::vector<Command>& Commands();
 
+// Pieces of "status" that "doctor" reads too.
+// One request and one reply over a daemon's socket; false with the reason when the daemon
+// cannot be reached or answers garbage.
+bool DaemonExchange(const std::string& socket, const std::string& payload, Json::Value& reply,
+                    std::string& error);
+// {"name", "running", "pid"} from the daemon's pid file.
+Json::Value DaemonStateOf(const std::string& name);
+// What "status --json" prints. Throws Error when the folder or status files cannot be read.
+Json::Value StatusReport();
+
 }  // namespace ctl
 }  // namespace orvane
 

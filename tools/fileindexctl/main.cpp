@@ -109,6 +109,8 @@ int main(int argc, char** argv) {
     orvane::ctl::Output out(std::cout, json);
     command->run(parsed, out);
     return 0;
+  } catch (const orvane::ctl::ExitWith& e) {
+    return e.status;
   } catch (const orvane::ctl::UsageError& e) {
     // Messages may quote names, which are bytes; the terminal gets U+FFFD for what is not text.
     std::cerr << "fileindexctl: " << orvane::DisplayName(e.what()) << '\n';
