@@ -176,6 +176,20 @@ TEST_F(EndToEndTest, TheIndexFollowsRealWorkOnDisk) {
   ExpectSettled("media", sys_.Vol("media"));
 }
 
+// What compressed files and archives hold is searchable through the real daemons: a compressed
+// text by its words, an archive by its members' names and texts.
+TEST_F(EndToEndTest, CompressedFilesAndArchivesAreFoundByWhatTheyHold) {
+  WriteFile(D("pkg/notes.txt"), "zgrepword inside a tarball");
+  WriteFile(D("pkg/log/changelog"), "fixed zcatword handling");
+  ASSERT_EQ(0, Shell("cd '" + D("pkg") + "' && gzip log/changelog && mkdir t && " +
+                     "mv notes.txt t/membername.txt && tar czf bundle.tar.gz t && rm -r t"));
+  fileindex::FolderAdd(Folder("/docs/pkg", true), false);
+  ExpectSettled("docs", D("pkg"));
+  EXPECT_TRUE(WaitFor([] { return Search("zcatword") == 1; }, 20000));
+  EXPECT_EQ(1, Search("zgrepword"));
+  EXPECT_EQ(1, Search("membername"));
+}
+
 // A link renamed over a root-only file takes its words away; a FIFO made where a file was leaves
 // no document; a name toggled between file and folder 21 times ends with the folder's document.
 TEST_F(EndToEndTest, NamesTakenByLinksFifosAndFoldersEndWithWhatIsThere) {
