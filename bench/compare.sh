@@ -18,6 +18,9 @@
 #   COMPARE_RUNS      runs of each query; the median is shown (default 3)
 #   COMPARE_CONTENTS  0 skips the runs that index contents, the slow ones (default 1)
 #   COMPARE_KEEP      1 keeps the indexes and the tree copy for a look afterwards (default 0)
+#   COMPARE_WORDS     words picked at random from recoll's contents index that both tools are
+#                     asked for, each file recoll finds and we do not listed (bench/recoll_words.sh;
+#                     default 300, 0 skips)
 #
 # Installs recoll's indexer and query tool (recollcmd, without the desktop GUI), plocate, GNU time
 # and jq when missing, and builds the Release binaries as scripts/quickstart.sh does.
@@ -33,6 +36,7 @@ read -r -a queries <<<"${COMPARE_QUERIES:-readme changelog copyright html lib ex
 runs=${COMPARE_RUNS:-3}
 with_contents=${COMPARE_CONTENTS:-1}
 keep=${COMPARE_KEEP:-0}
+words=${COMPARE_WORDS:-300}
 marker=.fileindex-compare
 
 # --- what the run needs ----------------------------------------------------------------------
@@ -344,6 +348,12 @@ ours_run() {
 
   echo "== this system ($mode): queries"
   run_queries "ours-$mode" ours_query ours_decode
+  if [ "$mode" = contents ] && [ "$words" -gt 0 ]; then
+    echo "== words from recoll's index, asked of both"
+    WORDS_COUNT=$words RECOLL_HOME=$base/recoll/home \
+      bash "$fi_top/bench/recoll_words.sh" "$base/recoll/contents" "$tree" "$base/words" |
+      tee "$base/logs/words.txt"
+  fi
 
   fi_stop_daemons >"$base/logs/stop-$mode.log"
   wait
@@ -417,6 +427,12 @@ if [ "$with_contents" = 1 ]; then tools+=("ours-contents"); heads+=("this system
   echo
   echo "Each cell: entries found below the tree, median of $runs runs of the time to list them all,"
   echo "and Δ, the size of the symmetric difference with find's answer (of which symlinks)."
+  if [ -s "$base/logs/words.txt" ]; then
+    echo
+    echo "Words from recoll's contents index, asked of recoll (no stem expansion) and of us:"
+    echo
+    sed 's/^/    /' "$base/logs/words.txt"
+  fi
 } >"$base/report.md"
 
 if [ "$keep" != 1 ]; then
