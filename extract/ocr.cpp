@@ -89,7 +89,9 @@ void AddOcrText(const OpenedFile& file, Json::Value& fields) {
 
 void ExtractImageWithText(const OpenedFile& file, Json::Value& fields) {
   ExtractPhoto(file, fields);
-  AddOcrText(file, fields);
+  // The photo switch judged the file on disk: an image inside an archive or an attachment was
+  // not chosen by it, and keeps its metadata only.
+  if (file.depth() == 0) AddOcrText(file, fields);
 }
 
 }  // namespace extract

@@ -28,7 +28,8 @@ std::string OcrLanguages();
 // image is skipped or the engine or its language data is not installed (logged once).
 void AddOcrText(const OpenedFile& file, Json::Value& fields);
 
-// An image's metadata and the text recognised in it.
+// An image's metadata and, for a file on disk (not a member of a container), the text recognised
+// in it.
 void ExtractImageWithText(const OpenedFile& file, Json::Value& fields);
 
 }  // namespace extract
