@@ -126,7 +126,9 @@ void WalkHtml(xmlNode* root, TextSink* sink, Json::Value& fields) {
   }
 }
 
-// The text of `xml`'s text nodes, a line each. No network, no entities expanded, no DTD loaded.
+// The text of `xml`'s text nodes and comments, a line each, then its vocabulary: each element
+// and attribute name and attribute value once, so that a search for a name a file uses, or a
+// value it sets, finds it. No network, no entities expanded, no DTD loaded.
 void XmlToText(const std::string& xml, TextSink* sink) {
   std::unique_ptr<xmlTextReader, void (*)(xmlTextReaderPtr)> reader(
       xmlReaderForMemory(xml.data(), static_cast<int>(xml.size()), nullptr, nullptr,
@@ -134,12 +136,37 @@ void XmlToText(const std::string& xml, TextSink* sink) {
                              XML_PARSE_RECOVER),
       xmlFreeTextReader);
   if (!reader) return;
+  std::vector<std::string> vocabulary;
+  std::set<std::string> seen;
+  size_t vocabulary_bytes = 0;
+  auto remember = [&](const xmlChar* word) {
+    if (word == nullptr || vocabulary_bytes >= kMaxTextBytes) return;
+    const std::string w = Trim(Chars(word));
+    if (w.empty() || !seen.insert(w).second) return;
+    vocabulary_bytes += w.size() + 1;
+    vocabulary.push_back(w);
+  };
   while (!sink->full() && xmlTextReaderRead(reader.get()) == 1) {
     const int type = xmlTextReaderNodeType(reader.get());
-    if (type != XML_READER_TYPE_TEXT && type != XML_READER_TYPE_CDATA) continue;
+    if (type == XML_READER_TYPE_ELEMENT) {
+      remember(xmlTextReaderConstLocalName(reader.get()));
+      while (xmlTextReaderMoveToNextAttribute(reader.get()) == 1) {
+        remember(xmlTextReaderConstLocalName(reader.get()));
+        remember(xmlTextReaderConstValue(reader.get()));
+      }
+      continue;
+    }
+    if (type != XML_READER_TYPE_TEXT && type != XML_READER_TYPE_CDATA &&
+        type != XML_READER_TYPE_COMMENT) {
+      continue;
+    }
     const xmlChar* value = xmlTextReaderConstValue(reader.get());
     if (value == nullptr) continue;
-    AddCollapsed(Chars(value), sink);
+    AddCollapsed(Trim(Chars(value)).c_str(), sink);
+    sink->Break();
+  }
+  for (const std::string& w : vocabulary) {
+    sink->Add(w);
     sink->Break();
   }
 }

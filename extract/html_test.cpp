@@ -63,9 +63,10 @@ TEST_F(HtmlTest, MalformedAndDeepPagesStillGiveTheirText) {
 
 TEST_F(HtmlTest, XmlTextNodesAreSeparateWordsAndEntitiesStayUnexpanded) {
   const Json::Value f = Run(
-      ExtractXml, dir_.Write("d.xml", "<?xml version=\"1.0\"?><r><a>alpha</a><b>beta<c>gamma"
-                                      "</c></b><![CDATA[delta]]><!-- comment --></r>"));
-  EXPECT_EQ(f["QUIXMDTextContent"], "alpha\nbeta\ngamma\ndelta");
+      ExtractXml, dir_.Write("d.xml", "<?xml version=\"1.0\"?><r><a>alpha</a><b>beta<c k=\"v\">"
+                                      "gamma</c></b><![CDATA[delta]]><!-- note --><a/></r>"));
+  // The text first, then the names and values the file uses, each once.
+  EXPECT_EQ(f["QUIXMDTextContent"], "alpha\nbeta\ngamma\ndelta\nnote\nr\na\nb\nc\nk\nv");
   const Json::Value bomb =
       Run(ExtractXml, dir_.Write("lol.xml",
                                  "<?xml version=\"1.0\"?><!DOCTYPE d [<!ENTITY a \"aaaaaaaaaa\">"
