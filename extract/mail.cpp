@@ -4,6 +4,7 @@
 #include <gmime/gmime.h>
 #include <unistd.h>
 
+#include <exception>
 #include <memory>
 #include <mutex>
 
@@ -71,7 +72,8 @@ std::string DecodedContent(GMimePart* part, bool to_utf8) {
 // Walks one message's parts into the text.
 class MessageWalker {
  public:
-  explicit MessageWalker(TextSink* sink) : sink_(sink) {}
+  // `depth`: how deep the file being read lies in containers, so that an attachment is one deeper.
+  MessageWalker(TextSink* sink, int depth) : sink_(sink), depth_(depth) {}
 
   // The headers worth searching, as lines of text.
   void AddHeaders(GMimeMessage* message) {
@@ -116,7 +118,9 @@ class MessageWalker {
     const char* filename = g_mime_part_get_filename(part);
     if (filename != nullptr && *filename != '\0') AddLine(filename);
     const bool is_html = g_mime_content_type_is_type(type, "text", "html");
-    if (g_mime_content_type_is_type(type, "text", "*")) {
+    const bool is_text = g_mime_content_type_is_type(type, "text", "plain") ||
+                         (g_mime_content_type_is_type(type, "text", "*") && filename == nullptr);
+    if (is_text || is_html) {
       const std::string text = DecodedContent(part, true);
       if (is_html) {
         Json::Value ignored;
@@ -125,10 +129,22 @@ class MessageWalker {
       } else {
         AddLine(text);
       }
+      return;
     }
+    // Anything else is read as a file of its own kind would be, a PDF as a PDF.
+    std::string data = DecodedContent(part, false);
+    if (data.size() > kMaxMemberBytes) data.resize(kMaxMemberBytes);
+    Json::Value member(Json::objectValue);
+    try {
+      ExtractMember(filename != nullptr ? filename : "attachment", data, depth_ + 1, member);
+    } catch (const std::exception&) {
+      return;  // an attachment that cannot be read leaves its name, as a damaged member does
+    }
+    if (member["QUIXMDTextContent"].isString()) AddLine(member["QUIXMDTextContent"].asString());
   }
 
   TextSink* sink_;
+  int depth_;
   int parts_ = 0;
 };
 
@@ -165,7 +181,7 @@ void ExtractMessage(const OpenedFile& file, Json::Value& fields) {
     fields["QUIXMDContentCreationDate"] = static_cast<Json::Int64>(g_date_time_to_unix(date));
   }
   TextSink sink(kMaxTextBytes);
-  MessageWalker walker(&sink);
+  MessageWalker walker(&sink, file.depth());
   walker.Walk(g_mime_message_get_mime_part(message.get()), 0);
   SetBody(sink, fields);
 }
@@ -181,7 +197,7 @@ void ExtractMailbox(const OpenedFile& file, Json::Value& fields) {
     auto message = Owned(g_mime_parser_construct_message(parser.get(), nullptr));
     if (!message) break;
     ++messages;
-    MessageWalker walker(&sink);
+    MessageWalker walker(&sink, file.depth());
     walker.AddHeaders(message.get());
     walker.Walk(g_mime_message_get_mime_part(message.get()), 0);
     sink.Break();

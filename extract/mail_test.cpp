@@ -1,7 +1,11 @@
 #include "extract/mail.hpp"
 
+#include <glib.h>
 #include <gtest/gtest.h>
 
+#include <memory>
+
+#include "test/sample_files.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -37,8 +41,13 @@ const char kMessage[] =
     "Content-Disposition: attachment; filename=\"notes.txt\"\n"
     "Content-Transfer-Encoding: base64\n"
     "\n"
-    "YXR0YWNoZWR3b3JkIGluc2lkZQo=\n"
-    "--b1--\n";
+    "YXR0YWNoZWR3b3JkIGluc2lkZQo=\n";
+
+std::string Base64(const std::string& data) {
+  std::unique_ptr<gchar, void (*)(gpointer)> text(
+      g_base64_encode(reinterpret_cast<const guchar*>(data.data()), data.size()), g_free);
+  return text.get();
+}
 
 class MailTest : public ::testing::Test {
  protected:
@@ -53,14 +62,23 @@ class MailTest : public ::testing::Test {
 };
 
 TEST_F(MailTest, HeadersBecomeFieldsAndEveryPartItsText) {
-  const Json::Value f = Run(ExtractMessage, dir_.Write("m.eml", kMessage));
+  // A PDF attached is read as a PDF; one that is damaged leaves its name.
+  const std::string mail = std::string(kMessage) +
+                           "--b1\nContent-Type: application/pdf\nContent-Disposition: attachment;"
+                           " filename=\"report.pdf\"\nContent-Transfer-Encoding: base64\n\n" +
+                           Base64(test::SamplePdf("Report", "pdfattachmentword")) +
+                           "\n--b1\nContent-Type: application/pdf; name=\"broken.pdf\"\n"
+                           "Content-Transfer-Encoding: base64\n\n" +
+                           Base64("%PDF-1.4 cut") + "\n--b1--\n";
+  const Json::Value f = Run(ExtractMessage, dir_.Write("m.eml", mail));
   EXPECT_EQ(f["QUIXMDAuthors"], "Andr\xc3\xa9 <andre@example.org>");
   EXPECT_EQ(f["QUIXMDRecipients"], "Bob <bob@example.org>, carol@example.org");
   EXPECT_EQ(f["QUIXMDTitle"], "Quarterly r\xc3\xa9sum\xc3\xa9");
   EXPECT_EQ(f["QUIXMDContentCreationDate"].asInt64(), 1715072889);
   const std::string text = f["QUIXMDTextContent"].asString();
   for (const char* want : {"caf\xc3\xa9 est pr\xc3\xaat, mailbodyword", "htmlpartword",
-                           "notes.txt", "attachedword inside"}) {
+                           "notes.txt", "attachedword inside", "report.pdf", "pdfattachmentword",
+                           "broken.pdf"}) {
     EXPECT_NE(text.find(want), std::string::npos) << want << " in " << text;
   }
   EXPECT_EQ(text.find("scriptword"), std::string::npos) << text;
@@ -68,7 +86,7 @@ TEST_F(MailTest, HeadersBecomeFieldsAndEveryPartItsText) {
 
 TEST_F(MailTest, MailboxGivesEveryMessage) {
   const std::string mbox =
-      "From andre@example.org Tue May  7 09:08:09 2024\n" + std::string(kMessage) +
+      "From andre@example.org Tue May  7 09:08:09 2024\n" + std::string(kMessage) + "--b1--\n" +
       "\nFrom dan@example.org Wed May  8 10:00:00 2024\n"
       "From: Dan <dan@example.org>\nSubject: second note\n\n"
       ">From the start, secondbodyword.\n";
