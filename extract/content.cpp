@@ -88,9 +88,19 @@ bool TypeMatches(const std::string& mime, const std::string& pattern) {
   return last == '/' || last == '.' ? StringStartWith(mime, pattern) : mime == pattern;
 }
 
+// Markdown, reStructuredText and plain text files that hold a few tags look like HTML or XML
+// to libmagic; their name says they are text, read as written (a page's parser would take the
+// "<script>" in a sentence for a script and drop the rest).
+bool IsTextByName(const std::string& ext, const std::string& mime) {
+  static const char* const kNames[] = {"md", "markdown", "mdown", "mkd", "rst", "rest", "txt", "text"};
+  return (mime == "text/html" || mime == "text/xml") &&
+         std::find(std::begin(kNames), std::end(kNames), ext) != std::end(kNames);
+}
+
 // nullptr: a format with nothing to extract.
-const Kind* KindFor(const std::string& name, const std::string& mime) {
+const Kind* KindFor(const std::string& name, const std::string& sniffed) {
   const std::string ext = GetFileExtension(name, true);
+  const std::string mime = IsTextByName(ext, sniffed) ? "text/plain" : sniffed;
   for (const Kind& kind : Kinds()) {
     for (const std::string& type : kind.types) {
       if (TypeMatches(mime, type)) return &kind;

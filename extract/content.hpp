@@ -15,7 +15,8 @@ namespace orvane {
 namespace extract {
 
 // Extracted text is cut at this many bytes (at a character boundary).
-constexpr size_t kMaxTextBytes = 1024 * 1024;
+// The longest changelogs and manuals people search hold a few MiB of text, all of it wanted.
+constexpr size_t kMaxTextBytes = 8 * 1024 * 1024;
 
 // No single member of a container (an office zip, an archive, a compressed file) is read past
 // this, whatever it claims to hold; the helper may write in-memory files of at most this size.

@@ -24,7 +24,9 @@ namespace extract {
 
 struct ExtractLimits {
   int timeout_ms = 60000;               // wall-clock time for one file before the helper is killed
-  size_t max_output = 8 * 1024 * 1024;  // bytes of reply the helper may print for one file
+  // Bytes of reply the helper may print for one file: the longest text with its fields, room
+  // left for the escapes of control characters.
+  size_t max_output = 24 * 1024 * 1024;
 };
 
 // The helper program: $FILEINDEX_EXTRACT_HELPER when set, else "fileindex-extract" in the
