@@ -32,6 +32,15 @@ Maker SamplePdfAt(const std::string& name, const std::string& text) {
       [=](const test::TempDir& dir) { dir.Write(name, test::SamplePdf("Quarterly Report", text)); };
 }
 
+// A page of PostScript with two words on it, and the ghostscript command that renders it (the
+// device's name follows).
+const char kPage[] =
+    "%%!PS\\n/Helvetica findfont 40 scalefont setfont 30 40 moveto (Quokka lighthouse) show "
+    "showpage\\n";
+const char kRender[] =
+    "gs -q -dSAFER -dBATCH -dNOPAUSE -r150 -dDEVICEWIDTHPOINTS=400 -dDEVICEHEIGHTPOINTS=120 "
+    "-sDEVICE=";
+
 struct Row {
   const char* file;  // the file extracted, which `make` leaves in the corpus folder
   Maker make;
@@ -95,6 +104,76 @@ std::vector<Row> Rows() {
        Sh("echo nestedword > n.txt && zip -q in.zip n.txt && tar czf nest.tgz in.zip"),
        "nestedword",
        {}},
+      // Markup: pages give their visible text and their title and author.
+      {"page.html",
+       Sh(R"(printf '<!DOCTYPE html><html><head><title>Tide Tables</title><meta name="author" )"
+          R"(content="Ann Lee"></head><body><p>htmlword</p><script>x()</script></body></html>' > page.html)"),
+       "htmlword",
+       {{"QUIXMDTitle", "Tide Tables"}, {"QUIXMDAuthors", "Ann Lee"}}},
+      {"page.xhtml",
+       Sh(R"(printf '<?xml version="1.0" encoding="UTF-8"?>\n<html xmlns="http://www.w3.org/1999/xhtml">)"
+          R"(<head><title>X Page</title></head><body><p>xhtmlword</p></body></html>\n' > page.xhtml)"),
+       "xhtmlword",
+       {{"QUIXMDTitle", "X Page"}}},
+      {"data.xml",
+       Sh(R"(printf '<?xml version="1.0"?>\n<catalog><item sku="skuvalue">xmlword</item></catalog>\n' > data.xml)"),
+       "xmlword",
+       {}},
+      // Markdown that mentions a tag is still text, read to its end.
+      {"notes.md",
+       Sh(R"(printf '# Notes\n\nUse the `<script>` tag with care.\n\n<div>a block</div>\n\nmarkdownword\n' > notes.md)"),
+       "markdownword",
+       {}},
+      {"guide.rst", Sh(R"(printf 'Guide\n=====\n\n*rstword* here\n' > guide.rst)"), "rstword", {}},
+      // Mail written by hand: a Latin-1 body and a base64 attachment.
+      {"m.eml",
+       Sh(R"(printf 'From: Ann <ann@example.org>\nTo: bob@example.org\nSubject: Tide report\n)"
+          R"(MIME-Version: 1.0\nContent-Type: multipart/mixed; boundary=b\n\n--b\n)"
+          R"(Content-Type: text/plain; charset=iso-8859-1\nContent-Transfer-Encoding: 8bit\n\n)"
+          R"(caf\xe9 mailword\n--b\nContent-Type: application/octet-stream; name=t.txt\n)"
+          R"sh(Content-Transfer-Encoding: base64\n\n%s\n--b--\n' "$(echo attachword | base64)" > m.eml)sh"),
+       "attachword",
+       {{"QUIXMDTitle", "Tide report"}, {"QUIXMDAuthors", "Ann <ann@example.org>"}}},
+      {"inbox",
+       Sh(R"(printf 'From ann@example.org Mon Jan  1 00:00:00 2024\nFrom: ann@example.org\n)"
+          R"(Subject: one\n\nmboxword\n' > inbox)"),
+       "mboxword",
+       {}},
+      {"book.epub",
+       Sh(R"(mkdir -p META-INF OEBPS && printf 'application/epub+zip' > mimetype && )"
+          R"(printf '<container><rootfiles><rootfile full-path="OEBPS/b.opf"/></rootfiles></container>' )"
+          R"(> META-INF/container.xml && printf '<package xmlns:dc="http://purl.org/dc/elements/1.1/">)"
+          R"(<metadata><dc:title>Sea Book</dc:title></metadata><manifest><item id="c" href="c.xhtml"/>)"
+          R"(</manifest><spine><itemref idref="c"/></spine></package>' > OEBPS/b.opf && )"
+          R"(printf '<html><body><p>epubword</p></body></html>' > OEBPS/c.xhtml && )"
+          R"(zip -qX0 book.epub mimetype && zip -qr book.epub META-INF OEBPS)"),
+       "epubword",
+       {{"QUIXMDTitle", "Sea Book"}}},
+      // Formats read by Debian's converters.
+      {"a.rtf",
+       Sh(R"(printf '{\\rtf1\\ansi{\\info{\\title Plan}}\\pard rtfword\\par}' > a.rtf)"),
+       "rtfword",
+       {{"QUIXMDTitle", "Plan"}}},
+      {"tool.1",
+       Sh(R"(printf '.TH TOOL 1\n.SH NAME\ntool \\- manword\n' > tool.1)"),
+       "manword",
+       {}},
+      {"tool.1.gz",
+       Sh(R"(printf '.TH TOOL 1\n.SH NAME\ntool \\- gzmanword\n' | gzip > tool.1.gz)"),
+       "gzmanword",
+       {}},
+      {"w.ps", Sh(std::string("printf '") + kPage + "' > w.ps"), "Quokka lighthouse", {}},
+      {"w.djvu",
+       Sh(std::string("printf '") + kPage + "' | " + kRender + "pbmraw -sOutputFile=w.pbm - && " +
+          "cjb2 w.pbm w.djvu && printf '(page 0 0 833 250 (word 10 10 300 80 \"djvuword\"))' > "
+          "t.txt && djvused w.djvu -e 'select 1; set-txt t.txt' -s"),
+       "djvuword",
+       {}},
+      // Text drawn in an image is recognised (the photo switch decides whether it is read).
+      {"w.png",
+       Sh(std::string("printf '") + kPage + "' | " + kRender + "pnggray -sOutputFile=w.png -"),
+       "Quokka lighthouse",
+       {{"QUIXMDMediaTypes", "Image"}}},
   };
 }
 
