@@ -26,7 +26,8 @@ constexpr size_t kMaxPackageBytes = 4 * 1024 * 1024;
 const char* Chars(const xmlChar* s) { return reinterpret_cast<const char*>(s); }
 
 bool NameIs(const xmlNode* node, const char* name) {
-  return node->name != nullptr && xmlStrcasecmp(node->name, reinterpret_cast<const xmlChar*>(name)) == 0;
+  return node->name != nullptr &&
+         xmlStrcasecmp(node->name, reinterpret_cast<const xmlChar*>(name)) == 0;
 }
 
 bool NameIn(const xmlNode* node, std::initializer_list<const char*> names) {
@@ -40,12 +41,13 @@ bool IsHidden(const xmlNode* node) {
 
 // Elements a browser puts on a line of their own: their text must not run into the next word.
 bool IsBlock(const xmlNode* node) {
-  return NameIn(node, {"p",       "div",     "br",     "li",   "ul",         "ol",     "h1",
-                       "h2",      "h3",      "h4",     "h5",   "h6",         "tr",     "td",
-                       "th",      "table",   "section", "article", "header", "footer", "nav",
-                       "aside",   "blockquote", "pre", "dt",   "dd",         "dl",     "hr",
-                       "form",    "option",  "address", "figure", "figcaption", "main", "body",
-                       "caption", "legend",  "summary", "details"});
+  return NameIn(
+      node,
+      {"p",          "div",     "br",     "li",      "ul",     "ol",      "h1",         "h2",
+       "h3",         "h4",      "h5",     "h6",      "tr",     "td",      "th",         "table",
+       "section",    "article", "header", "footer",  "nav",    "aside",   "blockquote", "pre",
+       "dt",         "dd",      "dl",     "hr",      "form",   "option",  "address",    "figure",
+       "figcaption", "main",    "body",   "caption", "legend", "summary", "details"});
 }
 
 std::string Attribute(const xmlNode* node, const char* name) {
@@ -131,9 +133,9 @@ void WalkHtml(xmlNode* root, TextSink* sink, Json::Value& fields) {
 // value it sets, finds it. No network, no entities expanded, no DTD loaded.
 void XmlToText(const std::string& xml, TextSink* sink) {
   std::unique_ptr<xmlTextReader, void (*)(xmlTextReaderPtr)> reader(
-      xmlReaderForMemory(xml.data(), static_cast<int>(xml.size()), nullptr, nullptr,
-                         XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING |
-                             XML_PARSE_RECOVER),
+      xmlReaderForMemory(
+          xml.data(), static_cast<int>(xml.size()), nullptr, nullptr,
+          XML_PARSE_NONET | XML_PARSE_NOERROR | XML_PARSE_NOWARNING | XML_PARSE_RECOVER),
       xmlFreeTextReader);
   if (!reader) return;
   std::vector<std::string> vocabulary;
@@ -225,10 +227,9 @@ std::string PercentDecoded(const std::string& s) {
 std::string ResolveHref(const std::string& base, const std::string& href) {
   const std::string target = PercentDecoded(href.substr(0, href.find('#')));
   const size_t slash = base.rfind('/');
-  const std::string joined =
-      target.empty() || target[0] == '/' || slash == std::string::npos
-          ? target
-          : base.substr(0, slash + 1) + target;
+  const std::string joined = target.empty() || target[0] == '/' || slash == std::string::npos
+                                 ? target
+                                 : base.substr(0, slash + 1) + target;
   std::vector<std::string> parts;
   size_t start = 0;
   while (start <= joined.size()) {
@@ -267,8 +268,7 @@ Package ReadPackage(const std::string& opf_name, const std::string& opf) {
     const std::string local = Chars(xmlTextReaderConstLocalName(reader.get()));
     auto attr = [&reader](const char* name) {
       std::unique_ptr<xmlChar, void (*)(void*)> v(
-          xmlTextReaderGetAttribute(reader.get(), reinterpret_cast<const xmlChar*>(name)),
-          xmlFree);
+          xmlTextReaderGetAttribute(reader.get(), reinterpret_cast<const xmlChar*>(name)), xmlFree);
       return v ? std::string(Chars(v.get())) : std::string();
     };
     if (type == XML_READER_TYPE_ELEMENT) {
@@ -281,8 +281,7 @@ Package ReadPackage(const std::string& opf_name, const std::string& opf) {
       if (local == "itemref") idrefs.push_back(attr("idref"));
     } else if (type == XML_READER_TYPE_END_ELEMENT) {
       meta = nullptr;
-    } else if (meta != nullptr &&
-               (type == XML_READER_TYPE_TEXT || type == XML_READER_TYPE_CDATA)) {
+    } else if (meta != nullptr && (type == XML_READER_TYPE_TEXT || type == XML_READER_TYPE_CDATA)) {
       *meta += Chars(xmlTextReaderConstValue(reader.get()));
     }
   }
@@ -323,9 +322,9 @@ void HtmlToText(const std::string& html, const char* encoding, TextSink* sink,
                 Json::Value& fields) {
   const size_t size = std::min(html.size(), kMaxMarkupBytes);
   std::unique_ptr<xmlDoc, void (*)(xmlDocPtr)> doc(
-      htmlReadMemory(html.data(), static_cast<int>(size), nullptr, encoding,
-                     HTML_PARSE_RECOVER | HTML_PARSE_NONET | HTML_PARSE_NOERROR |
-                         HTML_PARSE_NOWARNING),
+      htmlReadMemory(
+          html.data(), static_cast<int>(size), nullptr, encoding,
+          HTML_PARSE_RECOVER | HTML_PARSE_NONET | HTML_PARSE_NOERROR | HTML_PARSE_NOWARNING),
       xmlFreeDoc);
   if (!doc) return;
   WalkHtml(xmlDocGetRootElement(doc.get()), sink, fields);

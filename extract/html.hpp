@@ -20,8 +20,7 @@ constexpr size_t kMaxMarkupBytes = 16 * 1024 * 1024;
 // Adds the visible text of `html` to `sink` and its title and meta fields to `fields` (those
 // already set are kept). `encoding` names the bytes' encoding when the caller knows it (nullptr:
 // the document's own declaration, else UTF-8, else Latin-1).
-void HtmlToText(const std::string& html, const char* encoding, TextSink* sink,
-                Json::Value& fields);
+void HtmlToText(const std::string& html, const char* encoding, TextSink* sink, Json::Value& fields);
 
 void ExtractHtml(const OpenedFile& file, Json::Value& fields);
 void ExtractXml(const OpenedFile& file, Json::Value& fields);

@@ -40,9 +40,10 @@ TEST_F(HtmlTest, VisibleTextTitleAndMetaFields) {
 }
 
 TEST_F(HtmlTest, DeclaredAndUndeclaredEncodings) {
-  const Json::Value latin = Run(
-      ExtractHtml, dir_.Write("l.html", "<html><head><meta charset=\"iso-8859-1\"></head>"
-                                        "<body>d\xe9j\xe0 vu</body></html>"));
+  const Json::Value latin =
+      Run(ExtractHtml, dir_.Write("l.html",
+                                  "<html><head><meta charset=\"iso-8859-1\"></head>"
+                                  "<body>d\xe9j\xe0 vu</body></html>"));
   EXPECT_EQ(latin["QUIXMDTextContent"], "d\xc3\xa9j\xc3\xa0 vu");
   const Json::Value utf8 =
       Run(ExtractHtml, dir_.Write("u.html", "<p>na\xc3\xafve \xe2\x82\xac</p>"));
@@ -62,9 +63,10 @@ TEST_F(HtmlTest, MalformedAndDeepPagesStillGiveTheirText) {
 }
 
 TEST_F(HtmlTest, XmlTextNodesAreSeparateWordsAndEntitiesStayUnexpanded) {
-  const Json::Value f = Run(
-      ExtractXml, dir_.Write("d.xml", "<?xml version=\"1.0\"?><r><a>alpha</a><b>beta<c k=\"v\">"
-                                      "gamma</c></b><![CDATA[delta]]><!-- note --><a/></r>"));
+  const Json::Value f =
+      Run(ExtractXml, dir_.Write("d.xml",
+                                 "<?xml version=\"1.0\"?><r><a>alpha</a><b>beta<c k=\"v\">"
+                                 "gamma</c></b><![CDATA[delta]]><!-- note --><a/></r>"));
   // The text first, then the names and values the file uses, each once.
   EXPECT_EQ(f["QUIXMDTextContent"], "alpha\nbeta\ngamma\ndelta\nnote\nr\na\nb\nc\nk\nv");
   const Json::Value bomb =

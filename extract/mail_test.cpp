@@ -76,20 +76,20 @@ TEST_F(MailTest, HeadersBecomeFieldsAndEveryPartItsText) {
   EXPECT_EQ(f["QUIXMDTitle"], "Quarterly r\xc3\xa9sum\xc3\xa9");
   EXPECT_EQ(f["QUIXMDContentCreationDate"].asInt64(), 1715072889);
   const std::string text = f["QUIXMDTextContent"].asString();
-  for (const char* want : {"caf\xc3\xa9 est pr\xc3\xaat, mailbodyword", "htmlpartword",
-                           "notes.txt", "attachedword inside", "report.pdf", "pdfattachmentword",
-                           "broken.pdf"}) {
+  for (const char* want :
+       {"caf\xc3\xa9 est pr\xc3\xaat, mailbodyword", "htmlpartword", "notes.txt",
+        "attachedword inside", "report.pdf", "pdfattachmentword", "broken.pdf"}) {
     EXPECT_NE(text.find(want), std::string::npos) << want << " in " << text;
   }
   EXPECT_EQ(text.find("scriptword"), std::string::npos) << text;
 }
 
 TEST_F(MailTest, MailboxGivesEveryMessage) {
-  const std::string mbox =
-      "From andre@example.org Tue May  7 09:08:09 2024\n" + std::string(kMessage) + "--b1--\n" +
-      "\nFrom dan@example.org Wed May  8 10:00:00 2024\n"
-      "From: Dan <dan@example.org>\nSubject: second note\n\n"
-      ">From the start, secondbodyword.\n";
+  const std::string mbox = "From andre@example.org Tue May  7 09:08:09 2024\n" +
+                           std::string(kMessage) + "--b1--\n" +
+                           "\nFrom dan@example.org Wed May  8 10:00:00 2024\n"
+                           "From: Dan <dan@example.org>\nSubject: second note\n\n"
+                           ">From the start, secondbodyword.\n";
   const Json::Value f = Run(ExtractMailbox, dir_.Write("inbox.mbox", mbox));
   const std::string text = f["QUIXMDTextContent"].asString();
   for (const char* want : {"mailbodyword", "attachedword", "Subject: second note",

@@ -46,8 +46,12 @@ TEST_F(OcrTest, LanguageListComesFromTheEnvironmentWhenValid) {
   const struct {
     const char* value;
     const char* want;
-  } cases[] = {{nullptr, "eng"}, {"", "eng"}, {"eng+deu", "eng+deu"},
-               {"chi_sim", "chi_sim"}, {"../../etc/passwd", "eng"}, {"eng deu", "eng"}};
+  } cases[] = {{nullptr, "eng"},
+               {"", "eng"},
+               {"eng+deu", "eng+deu"},
+               {"chi_sim", "chi_sim"},
+               {"../../etc/passwd", "eng"},
+               {"eng deu", "eng"}};
   for (const auto& c : cases) {
     if (c.value == nullptr) {
       unsetenv("FILEINDEX_OCR_LANGUAGES");

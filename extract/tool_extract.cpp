@@ -127,7 +127,8 @@ void NoteMissing(const std::string& program) {
 }
 
 // Runs a converter on the file; false when it is not installed.
-bool RunConverter(const std::vector<std::string>& argv, const OpenedFile& file, std::string* output) {
+bool RunConverter(const std::vector<std::string>& argv, const OpenedFile& file,
+                  std::string* output) {
   std::string error;
   switch (RunTool(argv, file.fd(), ToolLimits(), output, &error)) {
     case ToolOutcome::kDone:
@@ -222,8 +223,8 @@ void ExtractManPage(const OpenedFile& file, Json::Value& fields) {
   // hyphenation, so a word split at a line end is still one word; no bold or underline.
   std::string text;
   if (!RunConverter({"groff", "-k", "-t", "-Tutf8", "-mandoc", "-rHY=0", "-P-c", "-P-b", "-P-o",
-                "-P-u", kToolInput},
-               file, &text)) {
+                     "-P-u", kToolInput},
+                    file, &text)) {
     return;
   }
   SetBody(text, fields);
@@ -250,8 +251,8 @@ void ExtractPostScript(const OpenedFile& file, Json::Value& fields) {
   // -dSAFER: the document cannot open, write or delete files; text goes to standard output.
   std::string text;
   if (RunConverter({"gs", "-q", "-dSAFER", "-dBATCH", "-dNOPAUSE", "-sDEVICE=txtwrite",
-               "-sOutputFile=-", kToolInput},
-              file, &text)) {
+                    "-sOutputFile=-", kToolInput},
+                   file, &text)) {
     SetBody(text, fields);
   }
 }

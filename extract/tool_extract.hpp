@@ -20,7 +20,7 @@ namespace extract {
 constexpr char kToolInput[] = "{input}";
 
 struct ToolLimits {
-  int timeout_ms = 20000;            // wall-clock time before the tool's process group is killed
+  int timeout_ms = 20000;               // wall-clock time before the tool's process group is killed
   size_t max_output = 8 * 1024 * 1024;  // bytes of output read; the tool is stopped past this
 };
 

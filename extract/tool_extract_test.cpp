@@ -42,8 +42,7 @@ TEST_F(ToolExtractTest, RunToolOutcomes) {
   std::string out;
   std::string error;
   // The input arrives as a name the tool can open, whatever descriptor the caller holds.
-  EXPECT_EQ(RunTool({"cat", kToolInput}, fd.get(), ToolLimits(), &out, &error),
-            ToolOutcome::kDone);
+  EXPECT_EQ(RunTool({"cat", kToolInput}, fd.get(), ToolLimits(), &out, &error), ToolOutcome::kDone);
   EXPECT_EQ(out, "tool input\n");
   EXPECT_EQ(RunTool({"fileindex-no-such-tool", kToolInput}, fd.get(), ToolLimits(), &out, &error),
             ToolOutcome::kMissing);
@@ -84,9 +83,10 @@ TEST_F(ToolExtractTest, AHangingToolIsKilledWithEverythingItStarted) {
 }
 
 TEST_F(ToolExtractTest, ConvertersGiveTextAndFields) {
-  const Json::Value rtf = Run(
-      ExtractRtf, dir_.Write("a.rtf", "{\\rtf1\\ansi{\\info{\\title Plan}{\\author Grace}}"
-                                      "\\pard Hello rtfword caf\\'e9\\par second line\\par}"));
+  const Json::Value rtf =
+      Run(ExtractRtf, dir_.Write("a.rtf",
+                                 "{\\rtf1\\ansi{\\info{\\title Plan}{\\author Grace}}"
+                                 "\\pard Hello rtfword caf\\'e9\\par second line\\par}"));
   EXPECT_EQ(rtf["QUIXMDTitle"], "Plan");
   EXPECT_EQ(rtf["QUIXMDAuthors"], "Grace");
   EXPECT_EQ(rtf["QUIXMDTextContent"], "Hello rtfword caf\xc3\xa9\nsecond line");
@@ -106,11 +106,13 @@ TEST_F(ToolExtractTest, ConvertersGiveTextAndFields) {
 
   // A DjVu page with a hidden text layer, as scanning software writes it.
   const std::string d = dir_.path();
-  ASSERT_TRUE(Make("gs -q -dSAFER -dBATCH -dNOPAUSE -sDEVICE=pbmraw -r150 "
-                   "-dDEVICEWIDTHPOINTS=400 -dDEVICEHEIGHTPOINTS=120 -sOutputFile=" + d +
-                   "/w.pbm " + ps + " && cjb2 " + d + "/w.pbm " + d + "/w.djvu"));
-  dir_.Write("t.txt", "(page 0 0 833 250 (line 10 10 600 80 (word 10 10 300 80 \"Wombat\") "
-                      "(word 310 10 600 80 \"djvuword\")))\n");
+  ASSERT_TRUE(
+      Make("gs -q -dSAFER -dBATCH -dNOPAUSE -sDEVICE=pbmraw -r150 "
+           "-dDEVICEWIDTHPOINTS=400 -dDEVICEHEIGHTPOINTS=120 -sOutputFile=" +
+           d + "/w.pbm " + ps + " && cjb2 " + d + "/w.pbm " + d + "/w.djvu"));
+  dir_.Write("t.txt",
+             "(page 0 0 833 250 (line 10 10 600 80 (word 10 10 300 80 \"Wombat\") "
+             "(word 310 10 600 80 \"djvuword\")))\n");
   ASSERT_TRUE(Make("djvused " + d + "/w.djvu -e 'select 1; set-txt " + d + "/t.txt' -s"));
   EXPECT_EQ(Run(ExtractDjvu, d + "/w.djvu")["QUIXMDTextContent"], "Wombat djvuword");
 
