@@ -182,6 +182,11 @@ void ExtractArchive(const OpenedFile& file, Json::Value& fields) {
                         !(archive_entry_size_is_set(entry) &&
                           archive_entry_size(entry) > static_cast<la_int64_t>(kMaxMemberBytes));
     std::string data;
+    // Held once at its size, not grown by doubling: three levels of members must fit the
+    // helper's memory together.
+    if (wanted && archive_entry_size_is_set(entry)) {
+      data.reserve(static_cast<size_t>(std::max<la_int64_t>(archive_entry_size(entry), 0)));
+    }
     // A member not wanted is still read through, not skipped: skipping inside a compressed
     // stream expands it all the same, out of the guard's sight.
     const Read read = ReadMember(a, &guard, kMaxMemberBytes, wanted ? &data : nullptr);
