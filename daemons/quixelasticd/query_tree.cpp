@@ -1,7 +1,7 @@
 #include "daemons/quixelasticd/query_tree.hpp"
 
+#include <algorithm>
 #include <cctype>
-#include <memory>
 #include <optional>
 #include <set>
 
@@ -77,10 +77,8 @@ std::string NamesOf(const FieldColumn (&fields)[N]) {
   return out;
 }
 
-// A folder of fewer rows than this is read row by row, each pattern looked up for the row,
-// rather than from a pattern's matches: a common word over a million names has tens of
-// thousands of them, a small folder a few hundred rows.
-constexpr int64_t kFolderFirstRows = 5000;
+// The most rows of a folder counted to learn the span of their row ids (see NarrowToFolder).
+constexpr int64_t kFolderSpanRows = 5000;
 
 [[noreturn]] void Refuse(const std::string& what) {
   throw EngineError(kCodeInvalidParam, "\"query\": " + what);
@@ -131,9 +129,6 @@ std::string EscapeLikeText(const std::string& s) {
 
 class Compiler {
  public:
-  // `by_folder`: every pattern is looked up for the row at hand, nothing is joined.
-  explicit Compiler(bool by_folder) : by_folder_(by_folder) {}
-
   SqlCondition Run(const Json::Value& tree) {
     if (!tree.isObject()) Refuse("must be an object");
     SqlCondition c;
@@ -221,7 +216,7 @@ class Compiler {
     }
     if (field == "path") return PathMatch(pattern.asString());
     // A full-text MATCH may not stand under OR or NOT: only a required pattern is joined.
-    const bool joined = required && join_.empty() && field != "any" && !by_folder_;
+    const bool joined = required && join_.empty() && field != "any";
     if (joined) join_ = field == "name" ? "fts_name" : "fts_all";
     if (field == "name") return NameMatch(pattern.asString(), joined);
     if (field == "content") return ContentCondition(pattern.asString(), joined);
@@ -240,17 +235,7 @@ class Compiler {
     const std::string glob = GlobLiteral(FoldName(EncodeName(pattern)), true);
     Text(glob);
     const std::string sql = NameGlobCondition(glob);
-    return joined ? "(" + sql + ")" : Lookup("fts_name", sql);
-  }
-
-  // A pattern of a full-text table that is not joined: by the table's matches, or, reading a
-  // folder's rows, by the row at hand.
-  std::string Lookup(const char* table, const std::string& sql) const {
-    if (by_folder_) {
-      return std::string("EXISTS (SELECT 1 FROM ") + table + " WHERE " + table +
-             ".rowid = d.rowid AND " + sql + ")";
-    }
-    return std::string("d.rowid IN (SELECT rowid FROM ") + table + " WHERE " + sql + ")";
+    return joined ? "(" + sql + ")" : "d.rowid IN (SELECT rowid FROM fts_name WHERE " + sql + ")";
   }
 
   std::string ContentCondition(const std::string& pattern, bool joined) {
@@ -261,7 +246,8 @@ class Compiler {
       return "1";
     }
     Text(match);
-    return joined ? "fts_all MATCH ?" : Lookup("fts_all", "fts_all MATCH ?");
+    return joined ? "fts_all MATCH ?"
+                  : "d.rowid IN (SELECT rowid FROM fts_all WHERE fts_all MATCH ?)";
   }
 
   // A text member of the document, word by word as contents are: the word index finds the
@@ -396,7 +382,6 @@ class Compiler {
            " (d.ancestor >= ? AND d.ancestor < ?))))";
   }
 
-  const bool by_folder_;
   int nodes_ = 0;
   std::vector<SqlValue> values_;
   std::string join_;
@@ -405,20 +390,32 @@ class Compiler {
 
 }  // namespace
 
-SqlCondition CompileQueryTree(const Json::Value& tree) {
-  SqlCondition c = Compiler(false).Run(tree);
-  if (!c.folder.empty() && !c.join.empty()) {
-    c.by_folder = std::make_shared<const SqlCondition>(Compiler(true).Run(tree));
-  }
-  return c;
-}
+SqlCondition CompileQueryTree(const Json::Value& tree) { return Compiler().Run(tree); }
 
-const SqlCondition& ChooseQueryPlan(Db& db, const SqlCondition& c) {
-  if (!c.by_folder) return c;
+SqlCondition NarrowToFolder(Db& db, const SqlCondition& c) {
+  if (c.folder.empty() || c.join.empty()) return c;
   const std::string under = c.folder == "/" ? "/" : c.folder + "/";
-  Stmt count(db, "SELECT count(*) FROM (SELECT 1 FROM docs WHERE path >= ? AND path < ? LIMIT ?)");
-  count.Bind(1, under).Bind(2, *PrefixUpperBound(under)).Bind(3, kFolderFirstRows);
-  return count.Step() && count.Int(0) < kFolderFirstRows ? *c.by_folder : c;
+  Stmt span(db, "SELECT count(*), min(rowid), max(rowid) FROM"
+                " (SELECT rowid FROM docs WHERE path >= ? AND path < ? LIMIT ?)");
+  span.Bind(1, under).Bind(2, *PrefixUpperBound(under)).Bind(3, kFolderSpanRows);
+  if (!span.Step() || span.Int(0) >= kFolderSpanRows) return c;
+  SqlCondition narrowed = c;
+  SqlValue low, high;
+  low.kind = high.kind = SqlValue::Kind::kInt;
+  // An empty folder: a span no row id is in (row ids start at 1).
+  low.integer = span.Int(0) == 0 ? 0 : span.Int(1);
+  high.integer = span.Int(0) == 0 ? 0 : span.Int(2);
+  // The folder itself may lie outside its rows' span.
+  Stmt self(db, "SELECT rowid FROM docs WHERE path = ?");
+  self.Bind(1, c.folder);
+  if (self.Step()) {
+    low.integer = span.Int(0) == 0 ? self.Int(0) : std::min(low.integer, self.Int(0));
+    high.integer = std::max(high.integer, self.Int(0));
+  }
+  narrowed.sql = "(" + c.sql + " AND " + c.join + ".rowid BETWEEN ? AND ?)";
+  narrowed.values.push_back(low);
+  narrowed.values.push_back(high);
+  return narrowed;
 }
 
 }  // namespace elasticd

@@ -7,7 +7,6 @@
 #include <json/json.h>
 
 #include <cstdint>
-#include <memory>
 #include <string>
 #include <vector>
 
@@ -31,11 +30,8 @@ struct SqlCondition {
   std::string sql;
   std::vector<SqlValue> values;
   std::string join;
-  // When every hit lies at or below one folder and a pattern is joined: that folder, and the
-  // same condition read from the folder's rows, each pattern looked up for the row at hand.
-  // Which of the two is faster depends on how many rows the folder holds (see ChooseQueryPlan).
+  // The folder every hit lies at or below, when the tree has one; empty otherwise.
   std::string folder;
-  std::shared_ptr<const SqlCondition> by_folder;
 };
 
 // Limits of a tree: deeper or larger ones are refused before anything runs.
@@ -48,10 +44,11 @@ SqlCondition CompileQueryTree(const Json::Value& tree);
 
 class Db;
 
-// The form of `c` to run on `db`: the one read from its folder's rows when the folder holds
-// few of them (a common word in a small folder), else `c` itself. Costs one bounded count on
-// the path index.
-const SqlCondition& ChooseQueryPlan(Db& db, const SqlCondition& c);
+// `c` as it is best run on `db`. A joined pattern is read from all of its matches, a common
+// word's tens of thousands, though the folder the hits must lie in may hold a few hundred
+// rows: when the folder is small, the joined table is told the span of the folder's row ids,
+// which it skips to. Costs one bounded read of the path index.
+SqlCondition NarrowToFolder(Db& db, const SqlCondition& c);
 
 }  // namespace elasticd
 }  // namespace orvane

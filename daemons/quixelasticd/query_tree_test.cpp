@@ -135,6 +135,11 @@ TEST_F(QueryTreeTest, EachNodeKindFindsItsDocuments) {
        {"report draft.txt"}},
       {R"({"and": [{"match": "content", "pattern": "revenue*"}, {"match": "content",
            "pattern": "song"}]})", {"tune.flac"}},
+      // A pattern within a small folder reads only the span of the folder's rows, which the
+      // folder's own row (added before its files) widens.
+      {R"({"and": [{"match": "name", "pattern": "*h*"}, {"under": "/v/share/photos"}]})",
+       {"beach.JPG", "photos"}},
+      {R"({"and": [{"match": "content", "pattern": "song"}, {"under": "/v/none"}]})", {}},
       {R"({"or": [{"in": "ext", "values": ["pdf"]}, {"under": "/v/share/music"}]})",
        {"100%_hits.mp3", "Annual_Report.PDF", "tune.flac"}},
       {R"({"not": {"or": [{"under": "/v/share/docs"}, {"under": "/v/share/photos"}]}})",
@@ -157,8 +162,7 @@ TEST_F(QueryTreeTest, EachNodeKindFindsItsDocuments) {
       {R"({"match": "path", "pattern": "/v/share/Music/*"})", {}},
   };
   for (const Row& row : rows) {
-    // Confined to a folder that holds every document, a tree finds the same; the small folder
-    // is read row by row, each pattern looked up for the row.
+    // Confined to a folder that holds every document, a tree finds the same.
     for (const std::string& tree :
          {std::string(row.tree), R"({"and": [)" + std::string(row.tree) + R"(, {"under": "/v"}]})"}) {
       const Json::Value r = Search(R"({"size": 100, "query": )" + tree + "}");

@@ -1181,7 +1181,7 @@ SearchPage IndexStore::Search(const SearchParams& p, const VisibleFn& visible, Q
     // The guard and every statement are gone before the connection goes back to the pool.
     const ScopedQueryGuard scoped(*db, guard);
     SearchParams planned = p;
-    if (p.query) planned.query = ChooseQueryPlan(*db, *p.query);
+    if (p.query) planned.query = NarrowToFolder(*db, *p.query);
     const SearchSql q = SearchSqlOf(planned);
     if (visible) {
       ScanVisible(*db, q, p, visible, &rows);
