@@ -177,18 +177,28 @@ int main(int argc, char** argv) {
   Http http(gateway.port());
 
   std::mt19937_64 rng(7);
-  std::vector<std::string> names, scoped, contents;
+  // The file server confines every search to its share at least: the whole index here.
+  const std::string share = " AND path.real.fulltext:\\\"/volume1/share\\\"";
+  auto folder = [&] {
+    return " AND path.real.fulltext:\\\"/volume1/share/d" +
+           std::to_string(rng() % std::max<uint64_t>(total / 1000, 1)) + "\\\"";
+  };
+  std::vector<std::string> names, scoped, common, contents, common_contents;
   for (size_t i = 0; i < searches; ++i) {
-    // A name part of about 1 in 10,000 files, and the same within one folder.
+    // A name part of about 1 in 10,000 files, and the same within one folder of 1,000.
     const std::string part = "_" + std::to_string(rng() % 100000) + ".";
-    names.push_back("(name:*" + part + "*)");
-    scoped.push_back("(name:*" + part + "*) AND path.real.fulltext:\\\"/volume1/share/d" +
-                     std::to_string(rng() % (total / 1000)) + "\\\"");
-    contents.push_back("(content:" + RareWord(rng() % 50) + ")");
+    names.push_back("(name:*" + part + "*)" + share);
+    scoped.push_back("(name:*" + part + "*)" + folder());
+    // A word in one name of ten, and in one content of twenty, within one folder.
+    common.push_back("(name:*" + std::string(kWords[rng() % 20]) + "*)" + folder());
+    contents.push_back("(content:" + RareWord(rng() % 50) + ")" + share);
+    common_contents.push_back("(content:" + std::string(kWords[rng() % 20]) + ")" + folder());
   }
-  Measure("name (a part of the name), whole index", &http, names);
+  Measure("name (a part of the name), whole share", &http, names);
   Measure("name, within one folder", &http, scoped);
-  Measure("content (a rare word), whole index", &http, contents);
+  Measure("name (a common word), within one folder", &http, common);
+  Measure("content (a rare word), whole share", &http, contents);
+  Measure("content (a common word), within one folder", &http, common_contents);
   gateway.Stop();
   return 0;
 }

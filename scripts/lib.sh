@@ -4,7 +4,7 @@
 
 fi_top=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 fi_bin=$fi_top/build
-fi_daemons=(quixelasticd fileindexd quixnotifyd)
+fi_daemons=(quixelasticd fileindexd quixnotifyd searchgw)
 
 # fi_become_root SCRIPT [ARGS...]: the library saves its configuration as root, so a script run
 # by another user runs itself again through sudo (keeping ORVANE_ROOT and the scripts' own
@@ -102,7 +102,7 @@ fi_wait_socket() {
 # is still running after 10 s.
 fi_stop_daemons() {
   local status=0 d pidfile pid
-  for d in fileindexd quixnotifyd quixelasticd; do
+  for d in searchgw fileindexd quixnotifyd quixelasticd; do
     pidfile=$(fi_run_dir)/$d.pid
     [ -f "$pidfile" ] || continue
     pid=$(cat "$pidfile")

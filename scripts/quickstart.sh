@@ -1,7 +1,8 @@
 #!/usr/bin/env bash
 # Sets up and runs the whole system in a scratch folder: installs what is missing, builds,
 # writes a platform file whose one share is the sample folder, starts the three daemons, indexes
-# the folder, shows the progress and runs a few searches.
+# the folder, shows the progress and runs a few searches, then starts the search gateway and
+# prints the lines that point Samba's Spotlight service at it.
 #
 #   bash scripts/quickstart.sh [FOLDER]
 #
@@ -56,6 +57,38 @@ if [ -n "$sub" ]; then
   ctl search --folder "$sub" --size 5 || true
 fi
 
+# The search gateway answers the file server's Spotlight searches from the index.
+gw_port=${SEARCHGW_PORT:-9210}
+echo
+echo "== starting the search gateway on 127.0.0.1 port $gw_port"
+"$fi_bin/daemons/searchgw/searchgw" --foreground --port "$gw_port" \
+  >"$(fi_log_dir)/searchgw.log" 2>&1 &
+gw_pid=$!
+for _ in $(seq 100); do
+  (exec 3<>"/dev/tcp/127.0.0.1/$gw_port") 2>/dev/null && break
+  sleep 0.1
+done
+# Another program on the port answers too: the gateway must still be running.
+if ! kill -0 "$gw_pid" 2>/dev/null || ! (exec 3<>"/dev/tcp/127.0.0.1/$gw_port") 2>/dev/null; then
+  tail -n 3 "$(fi_log_dir)/searchgw.log" >&2
+  echo "quickstart: the gateway did not start; free the port or choose one with SEARCHGW_PORT=N" >&2
+  exit 1
+fi
+
+# One search as the file server sends it: names containing "read" in the share.
+gw_search() {
+  local LC_ALL=C  # the length below counts bytes
+  local body="{\"from\": 0, \"size\": 3, \"_source\": [\"path.real\"], \"query\": {\"query_string\": {\"query\": \"$1\"}}}"
+  exec 3<>"/dev/tcp/127.0.0.1/$gw_port"
+  printf 'POST /fileindex_%s/_search HTTP/1.1\r\nHost: 127.0.0.1\r\nContent-Type: application/json\r\nConnection: close\r\nContent-Length: %d\r\n\r\n%s' \
+    "$share" "${#body}" "$body" >&3
+  sed '1,/^\r$/d' <&3
+  echo
+  exec 3<&-
+}
+echo "== the gateway's answer to a Spotlight search for names containing \"read\""
+gw_search "(name:*read*) AND path.real.fulltext:\\\"$folder\\\""
+
 cat <<EOT
 
 The system is running in $ORVANE_ROOT. Try:
@@ -65,12 +98,13 @@ The system is running in $ORVANE_ROOT. Try:
   $fi_bin/tools/fileindexctl/fileindexctl search marker
   $fi_bin/tools/fileindexctl/fileindexctl status
   $fi_bin/tools/fileindexctl/fileindexctl --help
-Search the share from macOS Finder through Samba: run the search gateway
-  ORVANE_ROOT=$ORVANE_ROOT $fi_bin/daemons/searchgw/searchgw --port 9210
-and give Samba the lines below (or merge them with --write /etc/samba/smb.conf, then
-smbcontrol smbd reload-config); the share's section must have path = $folder:
+Search the share from macOS Finder through Samba: the search gateway answers on 127.0.0.1
+port $gw_port (log: $(fi_log_dir)/searchgw.log). Give Samba the lines below (or merge them
+with --write /etc/samba/smb.conf, then smbcontrol smbd reload-config); the share's section
+must have path = $folder:
 EOT
-ctl share spotlight "$share" --mappings "$fi_top/daemons/searchgw/spotlight_mappings.json"
+ctl share spotlight "$share" --port "$gw_port" \
+  --mappings "$fi_top/daemons/searchgw/spotlight_mappings.json"
 cat <<EOT
 
 Stop everything with: bash scripts/quickstop.sh

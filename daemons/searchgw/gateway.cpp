@@ -1,5 +1,6 @@
 #include "daemons/searchgw/gateway.hpp"
 
+#include <pwd.h>
 #include <syslog.h>
 
 #include <algorithm>
@@ -36,6 +37,15 @@ struct Failure {
 
 // Busy answers of the engine tried again, about half a second in all.
 constexpr int kBusyAttempts = 30;
+
+// True when `uid` is a user of this system. The file server's search service acts as the
+// signed-in user, who always is one; an owner without a name is no one the gateway answers for.
+bool IsKnownUser(uid_t uid) {
+  std::vector<char> buf(16384);
+  passwd pw;
+  passwd* found = nullptr;
+  return ::getpwuid_r(uid, &pw, buf.data(), buf.size(), &found) == 0 && found != nullptr;
+}
 
 // The text of a query for the log: long ones cut, so a client cannot fill the log.
 std::string ForLog(const std::string& text) {
@@ -98,13 +108,20 @@ httpd::Reply Gateway::Impl::Handle(const httpd::Request& req, const httpd::Peer&
                       "_search takes POST or GET, not " + std::string(req.method_string())};
   } else {
     try {
+      if (peer.local && !IsKnownUser(peer.uid)) {
+        throw RequestError("security_exception",
+                           "the connection's owner, uid " + std::to_string(peer.uid) +
+                               ", is no user of this system: searches are answered for its users");
+      }
       const std::vector<std::string> ids = ReadIndexList(target.substr(1, slash - 1));
       const SearchRequest search = ReadSearchBody(req.body());
       // Peers on other machines (only when an administrator gives another address) search as
       // the file server's own service does.
       failure = Search(peer.local ? peer.uid : 0, ids, search, &body);
     } catch (const RequestError& e) {
-      failure = Failure{http::status::bad_request, e.type(), e.what()};
+      const bool denied = e.type() == "security_exception";
+      failure = Failure{denied ? http::status::forbidden : http::status::bad_request, e.type(),
+                        e.what()};
     }
   }
   if (failure) {
@@ -185,9 +202,14 @@ std::optional<Failure> Gateway::Impl::Engine(uid_t uid, const Json::Value& query
     case kCodeMalformed:
     case kCodeInvalidParam:
       return Failure{http::status::bad_request, "query_shard_exception", msg};
+    case kCodePermissionDenied:
+      return Failure{http::status::forbidden, "security_exception", msg};
     case kCodeOutOfMemory:
     case kCodeOverloaded:
       return Failure{http::status::too_many_requests, "es_rejected_execution_exception", msg};
+    case kCodeSearchTooLong:
+      return Failure{http::status::gateway_timeout, "search_timeout_exception",
+                     msg + ": narrow the search (a longer name part, a folder)"};
     default:
       return Failure{http::status::service_unavailable, "unavailable_shards_exception",
                      "the search engine answered " + std::to_string(code) + ": " + msg};

@@ -5,11 +5,16 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 #include <sys/socket.h>
+#include <grp.h>
+#include <pwd.h>
+#include <signal.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
+#include <functional>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -255,11 +260,121 @@ TEST_F(GatewayTest, ConnectionsBeyondTheCapAreRefusedAtOnceAndIdleOnesTimeOut) {
   EXPECT_TRUE(idle.Closed());
 }
 
-TEST_F(GatewayTest, AnEngineThatIsNotRunningIsA503) {
+// What the client is told of each answer of the engine but hits: a busy engine is asked again
+// for a while before the client is told to come back.
+TEST_F(GatewayTest, EngineFailuresBecomeTheStatusesClientsActOn) {
+  const std::string busy = R"({"success":false,"error":{"code":1401,"msg":"busy"}})";
+  const std::string found = R"({"success":true,"data":{"total":0,"hits":[]}})";
+  struct Row {
+    std::vector<std::string> replies;  // the last one repeated
+    int status;
+    const char* type;
+    int asked;  // how often the engine is asked (0: not counted)
+  };
+  const Row rows[] = {
+      {{busy, busy, busy, found}, 200, nullptr, 4},
+      {{busy}, 429, "es_rejected_execution_exception", 30},
+      {{R"({"success":false,"error":{"code":1400,"msg":"out of memory"}})"}, 429,
+       "es_rejected_execution_exception", 1},
+      {{R"({"success":false,"error":{"code":1402,"msg":"too long"}})"}, 504,
+       "search_timeout_exception", 1},
+      {{R"({"success":false,"error":{"code":103,"msg":"denied"}})"}, 403, "security_exception", 1},
+      {{R"({"success":false,"error":{"code":607,"msg":"opening"}})"}, 503,
+       "unavailable_shards_exception", 1},
+      {{"not json"}, 503, "unavailable_shards_exception", 1},
+      {{}, 503, "unavailable_shards_exception", 1},  // closes without a word
+  };
+  for (const Row& row : rows) {
+    FakeDaemon engine(dir_.Path("engine.sock"), FakeDaemon::Replies(row.replies));
+    StartGateway();
+    const Response r = Client(port()).Search("fileindex_s", "{}");
+    const std::string what = row.replies.empty() ? "nothing" : row.replies.front();
+    EXPECT_EQ(r.status, row.status) << what << r.body;
+    if (row.type != nullptr) {
+      EXPECT_EQ(FakeDaemon::Parse(r.body)["error"]["type"].asString(), row.type) << what;
+    }
+    EXPECT_EQ(engine.connections(), row.asked) << what;
+    gateway_.reset();
+  }
+  // No engine at all.
   StartGateway();
   const Response r = Client(port()).Search("fileindex_s", "{}");
   EXPECT_EQ(r.status, 503);
   EXPECT_NE(r.body.find("is quixelasticd running?"), std::string::npos);
+}
+
+// Runs `fn` in a child process as `uid` with `gid`; its exit status, -1 when it died.
+int RunAsIds(uid_t uid, gid_t gid, const std::function<int()>& fn) {
+  const pid_t pid = ::fork();
+  if (pid == 0) {
+    if (::setgroups(0, nullptr) != 0 || ::setresgid(gid, gid, gid) != 0 ||
+        ::setresuid(uid, uid, uid) != 0) {
+      ::_exit(255);
+    }
+    ::_exit(fn() & 0xff);
+  }
+  int status = 0;
+  return pid > 0 && ::waitpid(pid, &status, 0) == pid && WIFEXITED(status) ? WEXITSTATUS(status)
+                                                                            : -1;
+}
+
+// A search is answered only with the rights of a user of the system: the owner of a connection
+// who has no name is refused, and so is every search the gateway cannot switch to its asker for
+// (a gateway not run as root).
+TEST_F(GatewayTest, SearchesNoUserCouldMakeAreRefused) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to act as other users";
+  FakeDaemon engine(dir_.Path("engine.sock"), Engine);
+  ASSERT_EQ(::chmod(dir_.path().c_str(), 0711), 0);
+  ASSERT_EQ(::chmod(dir_.Path("engine.sock").c_str(), 0666), 0);
+  const passwd* daemon_user = ::getpwnam("daemon");
+  const passwd* nobody = ::getpwnam("nobody");
+  ASSERT_TRUE(daemon_user != nullptr && nobody != nullptr);
+  const uid_t unnamed = 4242;
+  ASSERT_EQ(::getpwuid(unnamed), nullptr) << "uid 4242 has a name on this machine";
+
+  // 0: a 403 whose reason holds `says`; 1: another answer.
+  auto refused = [](uint16_t port, const char* says) {
+    const Response r = Client(port).Search("fileindex_s", "{}");
+    return r.status == 403 && r.body.find(says) != std::string::npos &&
+                   FakeDaemon::Parse(r.body)["error"]["type"].asString() == "security_exception"
+               ? 0
+               : 1;
+  };
+  StartGateway();
+  const uint16_t p = port();
+  EXPECT_EQ(RunAsIds(unnamed, 65534, [&] { return refused(p, "uid 4242, is no user"); }), 0);
+  EXPECT_EQ(engine.connections(), 0);
+
+  // A gateway run as nobody cannot take another user's rights.
+  int ports[2];
+  ASSERT_EQ(::pipe(ports), 0);
+  const pid_t gw = ::fork();
+  if (gw == 0) {
+    ::close(ports[0]);
+    if (::setgroups(0, nullptr) != 0 || ::setresgid(nobody->pw_gid, nobody->pw_gid, nobody->pw_gid) != 0 ||
+        ::setresuid(nobody->pw_uid, nobody->pw_uid, nobody->pw_uid) != 0) {
+      ::_exit(1);
+    }
+    GatewayOptions o;
+    o.port = 0;
+    o.engine_socket = dir_.Path("engine.sock");
+    Gateway unprivileged(o);
+    unprivileged.Start();
+    const uint16_t port = unprivileged.port();
+    if (::write(ports[1], &port, sizeof port) != sizeof port) ::_exit(1);
+    ::pause();
+    ::_exit(0);
+  }
+  ::close(ports[1]);
+  uint16_t gw_port = 0;
+  ASSERT_EQ(::read(ports[0], &gw_port, sizeof gw_port), static_cast<ssize_t>(sizeof gw_port));
+  ::close(ports[0]);
+  EXPECT_EQ(test::RunAsUser("daemon",
+                            [&] { return refused(gw_port, "cannot search as uid"); }),
+            0);
+  ::kill(gw, SIGKILL);
+  ::waitpid(gw, nullptr, 0);
+  EXPECT_EQ(engine.connections(), 0);
 }
 
 // A local user searches with their own rights: the engine is asked on a connection made with
