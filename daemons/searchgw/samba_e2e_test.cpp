@@ -29,6 +29,7 @@
 #include "fileindex/index_mgr.hpp"
 #include "fileindex/util.hpp"
 #include "test/daemon_system.hpp"
+#include "test/sample_files.hpp"
 
 namespace orvane {
 namespace searchgw {
@@ -245,6 +246,10 @@ TEST_F(SambaSpotlightTest, MdsearchListsExactlyTheMatchingFilesOfARealShare) {
   WriteFile(S("docs/deep/other_foo.md"), "nothing to see");
   WriteFile(S("docs/deep/plain.txt"), "plain words");
   WriteFile(S("old.txt"), "from long ago");
+  WriteFile(S("docs/pic.png"), test::SamplePng(40, 30));
+  // A name whose bytes are not UTF-8 beside one that is.
+  WriteFile(S("caf\xe9_qqq.txt"), "latin");
+  WriteFile(S("plain_qqq.txt"), "utf");
   const struct timeval old_times[2] = {{978307200, 0}, {978307200, 0}};  // 2001-01-01
   ASSERT_EQ(::utimes(S("old.txt").c_str(), old_times), 0);
 
@@ -289,6 +294,15 @@ TEST_F(SambaSpotlightTest, MdsearchListsExactlyTheMatchingFilesOfARealShare) {
   EXPECT_EQ(
       Mdsearch("kMDItemFSContentChangeDate<$time.iso(2010-01-01T00:00:00Z)"),
       OnDisk([](const std::string&, const struct stat& st) { return st.st_mtime < 1262304000; }));
+  // Members of the documents: an image's pixel size, a whole path.
+  EXPECT_EQ(Mdsearch("kMDItemPixelWidth==\"40\" && kMDItemPixelHeight<\"100\""),
+            (std::set<std::string>{"docs/pic.png"}));
+  EXPECT_EQ(Mdsearch("kMDItemPath==\"*/deep/*\""),
+            (std::set<std::string>{"docs/deep/other_foo.md", "docs/deep/plain.txt"}));
+  // The reply is JSON text, which cannot carry the bytes of a name that is not UTF-8: such a
+  // hit goes out in the index's written form, which the file server finds no file for and
+  // leaves out, and the search itself succeeds.
+  EXPECT_EQ(Mdsearch("kMDItemDisplayName==\"*qqq*\""), (std::set<std::string>{"plain_qqq.txt"}));
   EXPECT_EQ(Mdsearch("kMDItemDisplayName==\"*foo*\"", "docs"),
             OnDisk([](const std::string& rel, const struct stat&) {
               return rel.rfind("docs/", 0) == 0 && Basename(rel).find("foo") != std::string::npos;
