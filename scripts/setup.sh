@@ -13,6 +13,7 @@ packages=(
   groff-base
   e2fsprogs mount util-linux acl passwd
   python3
+  chromium chromium-driver python3-selenium
   gzip bzip2 xz-utils zstd lz4 zip p7zip-full cpio binutils
   samba smbclient
 )

@@ -387,6 +387,24 @@ TEST_F(WebdTest, BadRequestsAreAnsweredAndTheDaemonKeepsServing) {
   EXPECT_EQ(Raw(port_, "GET /app.js HTTP/1.1\r\n\r\n").status, 200);
 }
 
+// Headless Chromium from Debian, driven by browser_check.py; the screenshots land in the build
+// folder (webd/screenshots).
+TEST_F(WebdTest, APersonUsesThePageInABrowser) {
+  test::WriteFile(sys_.Vol("docs/public/zebrafish-habitat.md"),
+                  "Zebrafish live in rivers of South Asia; the habitat notes cover water and "
+                  "temperature.\n");
+  test::WriteFile(sys_.Vol("docs/public/feeding schedule.txt"),
+                  "Feed the zebrafish twice a day, flakes in the morning.\n");
+  test::WriteFile(sys_.Vol("docs/public/photos/zebrafish-tank.jpg"), "not really a photo");
+  test::WriteFile(sys_.Vol("docs/public/photos/reef.png"), "not really a photo");
+  const std::string out = WEBD_SCREENSHOTS;
+  const std::string command = std::string("/usr/bin/python3 ") + WEBD_BROWSER_CHECK +
+                              " http://127.0.0.1:" + std::to_string(port_) + "/ " +
+                              users_.admin + " " + users_.user + " " + ScopedUsers::kPassword +
+                              " /docs zebrafish " + out;
+  EXPECT_EQ(Shell(command), 0) << "see " << out << "/failed.png";
+}
+
 TEST_F(WebdTest, AnEngineThatIsDownIsSaidSo) {
   const Browser user = Signed(users_.user);
   engine_.reset();

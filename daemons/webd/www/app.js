@@ -42,6 +42,7 @@ const sizeUnits = ['byte', 'kilobyte', 'megabyte', 'gigabyte', 'terabyte'];
 function formatSize(bytes) {
   let v = Number(bytes) || 0, i = 0;
   while (v >= 1000 && i < sizeUnits.length - 1) { v /= 1024; ++i; }
+  if (i === 0) return v.toLocaleString() + ' B';
   try {
     return new Intl.NumberFormat(undefined, { style: 'unit', unit: sizeUnits[i], unitDisplay: 'short',
                                               maximumFractionDigits: i === 0 ? 0 : 1 }).format(v);
@@ -211,10 +212,27 @@ function openFolder(folder) {
   search(false);
 }
 
+// A folder, or a file's extension on a tile coloured by its kind.
+const EXT_KINDS = {
+  photo: ['jpg', 'jpeg', 'png', 'gif', 'webp', 'heic', 'tif', 'tiff', 'bmp', 'svg', 'raw'],
+  audio: ['mp3', 'flac', 'ogg', 'wav', 'm4a', 'aac', 'opus'],
+  video: ['mp4', 'mkv', 'mov', 'avi', 'webm', 'm4v'],
+  document: ['pdf', 'doc', 'docx', 'odt', 'txt', 'md', 'rtf', 'xls', 'xlsx', 'ods', 'csv', 'ppt',
+             'pptx', 'odp', 'html', 'htm'],
+};
+function typeIcon(hit) {
+  const ext = (hit.ext || '').toLowerCase();
+  let kind = 'other';
+  for (const [k, list] of Object.entries(EXT_KINDS)) if (list.includes(ext)) kind = k;
+  const icon = el('span', { className: 'icon ' + (hit.is_dir ? 'folder' : kind),
+                            textContent: hit.is_dir ? '' : (ext || 'file').slice(0, 4) });
+  icon.setAttribute('aria-hidden', 'true');
+  return icon;
+}
+
 function hitNode(hit) {
   const li = el('li', { className: 'hit' });
-  const icon = el('span', { className: 'icon', textContent: hit.is_dir ? '📁' : '📄' });
-  icon.setAttribute('aria-hidden', 'true');
+  const icon = typeIcon(hit);
   let name;
   if (hit.is_dir) {
     name = el('a', { href: '#search', textContent: hit.name, className: 'open-folder' });
@@ -443,7 +461,8 @@ async function browse(path) {
     const list = $('picker-list');
     list.replaceChildren();
     for (const f of res.folders) {
-      const b = el('button', { type: 'button', textContent: '📁 ' + f.substring(f.lastIndexOf('/') + 1) });
+      const b = el('button', { type: 'button' }, el('span', { className: 'icon folder' }),
+                   f.substring(f.lastIndexOf('/') + 1));
       b.addEventListener('click', () => browse(f));
       list.append(el('li', {}, b));
     }
