@@ -105,6 +105,25 @@ must have path = $folder:
 EOT
 ctl share spotlight "$share" --port "$gw_port" \
   --mappings "$fi_top/daemons/searchgw/spotlight_mappings.json"
+
+# The web page, with an account of this scratch system's administrators group to sign in with.
+web_user=fileindex-demo
+web_pass=$ORVANE_ROOT/etc/webd-demo-password
+id "$web_user" >/dev/null 2>&1 || { groupadd -f "$web_user" &&
+  useradd -M -N -g "$web_user" -s /usr/sbin/nologin "$web_user"; }
+[ -s "$web_pass" ] || (umask 077 && head -c 12 /dev/urandom | base64 | tr -d '/+=' >"$web_pass")
+echo "$web_user:$(cat "$web_pass")" | chpasswd
+sed -i "s/\"admin_group\": \"root\"/\"admin_group\": \"$web_user\"/" "$ORVANE_ROOT/etc/orvane/platform.json"
+if [ -z "$(fi_daemon_pid webd)" ]; then
+  "$fi_bin/daemons/webd/webd" --foreground --www "$fi_top/daemons/webd/www" \
+    --pam-dir "$fi_top/daemons/webd" --pam-service fileindex-web.pam >"$(fi_log_dir)/webd.log" 2>&1 &
+fi
+cat <<EOT
+
+Search and administer in a browser: http://127.0.0.1:9280/
+  sign in as $web_user with the password $(cat "$web_pass")
+  (from another machine: ssh -L 9280:127.0.0.1:9280 THIS-HOST, then open the same address)
+EOT
 cat <<EOT
 
 Stop everything with: bash scripts/quickstop.sh

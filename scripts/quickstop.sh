@@ -7,3 +7,9 @@ source "$(dirname "$0")/lib.sh"
 fi_become_root "$0" "$@"
 export ORVANE_ROOT=${ORVANE_ROOT:-/tmp/fileindex-quickstart}
 fi_stop_daemons
+# The web page's daemon and the account the quick start made for it.
+pid=$(fi_daemon_pid webd)
+[ -z "$pid" ] || kill "$pid"
+id fileindex-demo >/dev/null 2>&1 && userdel fileindex-demo
+getent group fileindex-demo >/dev/null && groupdel fileindex-demo
+true
