@@ -1,17 +1,23 @@
 #include "bench/bench_util.hpp"
 
+#include <arpa/inet.h>
+#include <netinet/in.h>
 #include <sys/resource.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <iterator>
+#include <random>
 #include <sstream>
+#include <thread>
 
 #include "common/json_util.hpp"
 #include "common/log.hpp"
@@ -89,6 +95,122 @@ Json::Value Request(const std::string& socket, const Json::Value& request) {
     std::exit(1);
   }
   return v;
+}
+
+namespace {
+
+const char* const kSyntheticWords[] = {"holiday", "report", "invoice",  "summer", "family",
+                                       "project", "draft",  "final",    "budget", "meeting",
+                                       "photo",   "scan",   "notes",    "backup", "music",
+                                       "video",   "contract", "slides", "thesis", "recipe"};
+
+}  // namespace
+
+std::string SyntheticWord(uint64_t i) { return kSyntheticWords[i % 20]; }
+
+std::string SyntheticName(uint64_t i) {
+  static const char* const kExts[] = {"jpg", "pdf", "docx", "mp3", "mp4", "txt", "xlsx", "png"};
+  std::mt19937_64 rng(i * 2654435761u + 17);
+  std::string name = SyntheticWord(rng());
+  name += "_";
+  name += SyntheticWord(rng());
+  name += "_" + std::to_string(rng() % 100000) + "." + kExts[rng() % 8];
+  return name;
+}
+
+std::string RareWord(uint64_t i) { return "zq" + std::to_string(i % 50); }
+
+void LoadSynthetic(const std::string& socket, const std::string& id, uint64_t count,
+                   const std::function<std::string(uint64_t)>& dir_of) {
+  std::atomic<uint64_t> next{0};
+  auto send = [&] {
+    for (;;) {
+      const uint64_t done = next.fetch_add(1000);
+      if (done >= count) return;
+      Json::Value req;
+      for (uint64_t i = done; i < std::min(done + 1000, count); ++i) {
+        const std::string dir = dir_of(i);
+        const std::string name = SyntheticName(i);
+        Json::Value& sub = req["compound"].append(Json::Value(Json::objectValue));
+        sub["command"] = "document_upsert_by_id";
+        Json::Value& data = sub["data"];
+        data["id"] = id;
+        data["doc_id"] = dir + "/" + name;
+        Json::Value& d = data["data"];
+        d["QUIXMDPath"] = dir + "/" + name;
+        d["QUIXMDFSName"] = name;
+        d["QUIXMDParent"] = dir;
+        d["QUIXMDSearchFileName"] = name;
+        d["QUIXMDSearchAncestor"] = dir;
+        d["QUIXMDExtension"] = name.substr(name.rfind('.') + 1);
+        d["QUIXMDIsDir"] = false;
+        d["QUIXMDFSSize"] = static_cast<Json::Int64>(i * 37 % 10000000);
+        d["QUIXMDFSContentChangeDate"] = static_cast<Json::Int64>(1600000000 + i);
+        d["QUIXMDTextContent"] = SyntheticWord(i) + " minutes of the " + SyntheticWord(i / 20) + " " +
+                                 (i % 400 == 0 ? RareWord(i / 400) : "plain");
+      }
+      if (Request(socket, req)["has_fail"].asBool()) {
+        std::fprintf(stderr, "a batch had failures\n");
+        std::exit(1);
+      }
+    }
+  };
+  std::thread other(send);
+  send();
+  other.join();
+}
+
+HttpClient::HttpClient(uint16_t port) : fd_(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
+  sockaddr_in sa{};
+  sa.sin_family = AF_INET;
+  sa.sin_port = htons(port);
+  sa.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  if (::connect(fd_.get(), reinterpret_cast<sockaddr*>(&sa), sizeof sa) != 0) {
+    std::perror("connect");
+    std::exit(1);
+  }
+}
+
+std::string HttpClient::Exchange(const std::string& request, std::string* body) {
+  if (::send(fd_.get(), request.data(), request.size(), MSG_NOSIGNAL) !=
+      static_cast<ssize_t>(request.size())) {
+    std::perror("send");
+    std::exit(1);
+  }
+  std::string in;
+  size_t head_end;
+  size_t length = 0;
+  char buf[65536];
+  for (;;) {
+    head_end = in.find("\r\n\r\n");
+    if (head_end != std::string::npos) {
+      const size_t cl = in.find("Content-Length: ");
+      length = std::strtoul(in.c_str() + cl + 16, nullptr, 10);
+      if (in.size() >= head_end + 4 + length) break;
+    }
+    const ssize_t n = ::recv(fd_.get(), buf, sizeof buf, 0);
+    if (n <= 0) {
+      std::fprintf(stderr, "the server closed the connection\n");
+      std::exit(1);
+    }
+    in.append(buf, static_cast<size_t>(n));
+  }
+  if (in.compare(0, 12, "HTTP/1.1 200") != 0) {
+    std::fprintf(stderr, "%s\n-> %s\n", request.substr(0, request.find('\r')).c_str(),
+                 in.c_str());
+    std::exit(1);
+  }
+  *body = in.substr(head_end + 4, length);
+  return in.substr(0, head_end);
+}
+
+void PrintLatency(const char* what, std::vector<double> ms, long hits) {
+  std::sort(ms.begin(), ms.end());
+  std::printf(
+      "%-44s p50 %6.1f ms  p95 %6.1f ms  max %6.1f ms  (%zu searches, %.0f hits each on"
+      " average)\n",
+      what, ms[ms.size() / 2], ms[ms.size() * 95 / 100], ms.back(), ms.size(),
+      double(hits) / double(ms.size()));
 }
 
 std::string ScratchRoot(const std::string& prefix, bool open_to_others) {

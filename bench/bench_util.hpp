@@ -10,10 +10,13 @@
 #include <json/json.h>
 
 #include <chrono>
+#include <cstdint>
+#include <functional>
 #include <memory>
 #include <string>
 #include <vector>
 
+#include "common/fd.hpp"
 #include "common/wire.hpp"
 #include "daemons/quixelasticd/engine.hpp"
 #include "daemons/quixelasticd/server.hpp"
@@ -44,6 +47,33 @@ Json::Value Request(const std::string& socket, const Json::Value& request);
 // ORVANE_ROOT (0755 when `open_to_others`, so that another user reaches sockets below it).
 // "" when the folder cannot be made.
 std::string ScratchRoot(const std::string& prefix, bool open_to_others);
+
+// The synthetic file documents of the search benchmarks: document i is named of two words, a
+// number below 100,000 and an extension, and its content holds two words and, in one document of
+// 400, the rare word RareWord(i / 400), which one document in about 20,000 holds.
+std::string SyntheticName(uint64_t i);
+std::string RareWord(uint64_t i);
+// The i-th (modulo 20) of the words names and contents are made of.
+std::string SyntheticWord(uint64_t i);
+// Loads documents 0 to count-1 into index `id` on the engine's `socket` in batches of 1,000 from
+// two threads, document i in the folder dir_of(i); any failure ends the process.
+void LoadSynthetic(const std::string& socket, const std::string& id, uint64_t count,
+                   const std::function<std::string(uint64_t)>& dir_of);
+
+// One kept-alive HTTP/1.1 connection to a loopback port; any failure ends the process.
+class HttpClient {
+ public:
+  explicit HttpClient(uint16_t port);
+  // Sends `request` (whole, with its head) and returns the reply's head; the body in *body.
+  // A reply other than 200 ends the process with the reply on stderr.
+  std::string Exchange(const std::string& request, std::string* body);
+
+ private:
+  UniqueFd fd_;
+};
+
+// Sorts `ms` and prints its p50, p95 and max under `what`, with the average of `hits`.
+void PrintLatency(const char* what, std::vector<double> ms, long hits);
 
 // The engine started on `root` (opening done), and once Serve() is called its server on the
 // daemon's sockets there. Stop() (or the destructor) stops both.
