@@ -13,6 +13,7 @@ import tempfile
 from selenium import webdriver
 from selenium.webdriver.chrome.service import Service
 from selenium.webdriver.common.by import By
+from selenium.common.exceptions import StaleElementReferenceException
 from selenium.webdriver.common.keys import Keys
 from selenium.webdriver.support import expected_conditions as ec
 from selenium.webdriver.support.ui import Select, WebDriverWait
@@ -29,7 +30,9 @@ options.add_argument("--user-data-dir=" + profile.name)
 options.binary_location = "/usr/bin/chromium"
 service = Service(executable_path="/usr/bin/chromedriver")
 driver = webdriver.Chrome(service=service, options=options)
-wait = WebDriverWait(driver, 60)
+# The results are redrawn as searches come back: an element read while it is replaced is read
+# again at the next poll.
+wait = WebDriverWait(driver, 60, ignored_exceptions=(StaleElementReferenceException,))
 step = "start"
 
 
