@@ -13,7 +13,7 @@ packages=(
   groff-base
   e2fsprogs mount util-linux acl passwd
   python3
-  chromium chromium-driver python3-selenium
+  chromium chromium-driver python3-selenium openssl curl
   gzip bzip2 xz-utils zstd lz4 zip p7zip-full cpio binutils
   samba smbclient
 )

@@ -387,6 +387,41 @@ TEST_F(WebdTest, BadRequestsAreAnsweredAndTheDaemonKeepsServing) {
   EXPECT_EQ(Raw(port_, "GET /app.js HTTP/1.1\r\n\r\n").status, 200);
 }
 
+// Beyond loopback only with a certificate; with one, HTTPS and a Secure cookie, and plain HTTP
+// on that port gets nothing.
+TEST_F(WebdTest, TlsWithTheConfiguredCertificate) {
+  test::TempDir dir;
+  const std::string pem = dir.Path("webd.pem");
+  ASSERT_EQ(Shell("openssl req -x509 -newkey rsa:2048 -nodes -days 1 -subj /CN=127.0.0.1 "
+                  "-keyout " + pem + " -out " + dir.Path("cert.pem") + " 2>/dev/null && cat " +
+                  dir.Path("cert.pem") + " >> " + pem),
+            0);
+  const std::string base = std::string(WEBD_BIN) + " --foreground --www " + WEBD_WWW +
+                           " --pam-dir " + WEBD_PAM_DIR + " --pam-service fileindex-web.pam";
+  EXPECT_EQ(Shell("ORVANE_ROOT=" + sys_.root() + " " + base +
+                  " --address 0.0.0.0 --port 0 --pid-file /var/run/webd2.pid 2>/dev/null"),
+            2);
+  EXPECT_EQ(Shell("ORVANE_ROOT=" + sys_.root() + " " + base +
+                  " --port 0 --pid-file /var/run/webd3.pid --tls-certificate " +
+                  dir.Path("missing.pem") + " 2>/dev/null"),
+            1);
+  const uint16_t port = FreePort();
+  test::ChildProcess tls(sys_.root(), {WEBD_BIN, "--foreground", "--port", std::to_string(port),
+                                       "--www", WEBD_WWW, "--pam-dir", WEBD_PAM_DIR,
+                                       "--pam-service", "fileindex-web.pam", "--pid-file",
+                                       "/var/run/webd-tls.pid", "--tls-certificate", pem});
+  const std::string curl = "curl -sk -o /dev/null -w '%{http_code}' https://127.0.0.1:" +
+                           std::to_string(port);
+  ASSERT_TRUE(test::WaitFor([&] { return Shell(curl + "/ | grep -qx 200") == 0; }, 20000));
+  EXPECT_EQ(Shell(curl + "/api/session | grep -qx 401"), 0);
+  const std::string login = "curl -sk -D - -o /dev/null -H 'Content-Type: application/json' "
+                            "-d '{\"user\":\"" + users_.user + "\",\"password\":\"" +
+                            ScopedUsers::kPassword + "\"}' https://127.0.0.1:" +
+                            std::to_string(port) + "/api/login";
+  EXPECT_EQ(Shell(login + " | grep -q '^Set-Cookie: fi_session=.*; Secure'"), 0);
+  EXPECT_EQ(Raw(port, "GET / HTTP/1.1\r\nConnection: close\r\n\r\n").status, 0);
+}
+
 // Headless Chromium from Debian, driven by browser_check.py; the screenshots land in the build
 // folder (webd/screenshots).
 TEST_F(WebdTest, APersonUsesThePageInABrowser) {
