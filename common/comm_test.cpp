@@ -24,12 +24,12 @@ class CommTest : public ::testing::Test {
  protected:
   CommTest() : root_(dir_.path()) {
     const std::string notifier = dir_.Write(
-        "usr/quix/bin/quixzrmnotify", "#!/bin/sh\necho \"$*\" >> \"$(dirname \"$0\")/notified\"\n");
+        "usr/libexec/fileindex/quixzrmnotify", "#!/bin/sh\necho \"$*\" >> \"$(dirname \"$0\")/notified\"\n");
     chmod(notifier.c_str(), 0755);
   }
 
   std::string SockPath() const { return dir_.Path("var/run/quixelasticd.sock"); }
-  std::string Notified() const { return test::ReadFile(dir_.Path("usr/quix/bin/notified")); }
+  std::string Notified() const { return test::ReadFile(dir_.Path("usr/libexec/fileindex/notified")); }
 
   // The Error SendRequestImpl throws.
   Error ImplError(const Json::Value& req) {

@@ -7,9 +7,10 @@
 // error).
 //
 // Runs under its own limits (memory, no file writes but its in-memory copies of archive members,
-// few descriptors, no core dump, and CPU time for each file), so a hostile file costs at most
-// this one process. The limit on file writes covers its output too: read it through a pipe or a
-// socket, never redirect it to a file.
+// few descriptors, no core dump, and CPU time for each file) and confined to reading files and
+// writing its replies (syscall_filter.hpp), so a hostile file costs at most this one process.
+// The limit on file writes covers its output too: read it through a pipe or a socket, never
+// redirect it to a file.
 #include <fcntl.h>
 #include <sys/resource.h>
 #include <unistd.h>
@@ -25,6 +26,7 @@
 
 #include "common/json_util.hpp"
 #include "extract/content.hpp"
+#include "extract/syscall_filter.hpp"
 
 #if defined(__SANITIZE_ADDRESS__)
 #define ORVANE_ASAN 1
@@ -71,6 +73,15 @@ bool WriteAll(int fd, const std::string& text) {
     done += static_cast<size_t>(n);
   }
   return true;
+}
+
+// Everything the helper opens before it reads files is open by now; a helper that cannot be
+// confined reads nothing.
+bool Confine() {
+  std::string error;
+  if (orvane::extract::ConfineExtractionHelper(&error)) return true;
+  std::fprintf(stderr, "%s\n", error.c_str());
+  return false;
 }
 
 // The fields of one file as a reply object.
@@ -138,6 +149,7 @@ int main(int argc, char** argv) {
   Limit(RLIMIT_AS, kMemoryBytes);
 #endif
   if (argc == 2) {
+    if (!Confine()) return 1;
     const Json::Value reply = Reply(argv[1]);
     if (reply.isMember("error")) {
       std::fprintf(stderr, "%s\n", reply["error"].asCString());
@@ -157,5 +169,6 @@ int main(int argc, char** argv) {
     return 1;
   }
   close(null);
+  if (!Confine()) return 1;
   return Serve(in, out);
 }

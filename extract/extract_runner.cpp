@@ -341,7 +341,7 @@ std::string ExtractHelperPath() {
         Dirname(std::string(self, static_cast<size_t>(n))) + "/fileindex-extract";
     if (access(beside.c_str(), X_OK) == 0) return beside;
   }
-  return RootedPath("/usr/lib/fileindex/fileindex-extract");
+  return RootedPath("/usr/libexec/fileindex/fileindex-extract");
 }
 
 bool RunExtractHelper(const std::string& path, Json::Value* fields, std::string* error,

@@ -30,7 +30,7 @@ struct ExtractLimits {
 };
 
 // The helper program: $FILEINDEX_EXTRACT_HELPER when set, else "fileindex-extract" in the
-// folder of the running program, else /usr/lib/fileindex/fileindex-extract (under ORVANE_ROOT).
+// folder of the running program, else /usr/libexec/fileindex/fileindex-extract (under ORVANE_ROOT).
 std::string ExtractHelperPath();
 
 // Extracts the contents of `path` in a helper. True with the fields in `*fields`; false with a

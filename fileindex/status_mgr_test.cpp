@@ -114,12 +114,12 @@ TEST_F(StatusMgrTest, PauseAndResumeTellTheIndexingDaemon) {
 // The memory notification's arguments are checked with the engine channel that sends it.
 TEST_F(StatusMgrTest, NoSpaceNotificationRunsTheNotifierWithItsArguments) {
   const std::string notifier = root_.Write(
-      "usr/quix/bin/quixzrmnotify",
+      "usr/libexec/fileindex/quixzrmnotify",
       "#!/bin/sh\nfor a in \"$@\"; do printf '[%s]' \"$a\"; done >> \"$(dirname \"$0\")/calls\"\n"
       "echo >> \"$(dirname \"$0\")/calls\"\n");
   ASSERT_EQ(chmod(notifier.c_str(), 0755), 0);
   SendZRMNotify();
-  EXPECT_EQ(test::ReadFile(root_.Path("usr/quix/bin/calls")),
+  EXPECT_EQ(test::ReadFile(root_.Path("usr/libexec/fileindex/calls")),
             "[-c][QUIX.Orvane.Application][-b][true][-e][false][@administrators]"
             "[app:displayname][error:index_no_space]"
             "[<a data-quix-app=\"QUIX.Orvane.Application\" data-quix-fn=\"preference\">][</a>]\n");

@@ -5,6 +5,7 @@
 #include <sys/file.h>
 #include <sys/stat.h>
 #include <syslog.h>
+#include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -31,6 +32,16 @@ std::string HolderPid(int fd) {
   std::string pid(buf, n > 0 ? static_cast<size_t>(n) : 0);
   while (!pid.empty() && (pid.back() == '\n' || pid.back() == ' ')) pid.pop_back();
   return pid.empty() ? "not written yet" : pid;
+}
+
+// Under the service manager standard error may be the journal's own stream; the lines already
+// reach the journal through the system log, so they are not written there twice.
+bool StderrIsJournal() {
+  const char* stream = std::getenv("JOURNAL_STREAM");
+  struct stat st;
+  if (stream == nullptr || fstat(2, &st) != 0) return false;
+  unsigned long long dev = 0, ino = 0;
+  return std::sscanf(stream, "%llu:%llu", &dev, &ino) == 2 && dev == st.st_dev && ino == st.st_ino;
 }
 
 bool SameFile(int fd, const std::string& path) {
@@ -186,10 +197,19 @@ void Daemonize(const char* program) {
 void BecomeDaemon(const char* program, bool foreground) {
   if (!foreground) Daemonize(program);
   ::openlog(program, LOG_PID, LOG_DAEMON);
-  SetLogSink(SyslogSink(foreground));
+  SetLogSink(SyslogSink(foreground && !StderrIsJournal()));
 }
 
-void NotifyReady() {}
+void NotifyReady() {
+  // Started by hand or by a manager that does not wait for the notice, there is no
+  // NOTIFY_SOCKET and nothing is sent. The variable stays: threads already run and may read the
+  // environment, and the helpers this daemon starts never notify.
+  const int rc = sd_notify(0, "READY=1");
+  if (rc < 0) {
+    ORVANE_LOG(LOG_WARNING, "cannot tell the service manager that the daemon is ready: %s",
+               std::strerror(-rc));
+  }
+}
 
 }  // namespace platform
 }  // namespace orvane

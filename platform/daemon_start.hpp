@@ -77,8 +77,9 @@ void Daemonize(const char* program);
 // name `program` (a literal: the log keeps the pointer), and to standard error in the foreground.
 void BecomeDaemon(const char* program, bool foreground);
 
-// Called once the daemon serves its clients: the point a service manager's readiness notice
-// hangs off. Nothing to tell yet.
+// Called once the daemon serves its clients (its sockets listen): tells a service manager that
+// started it with a notification socket (NOTIFY_SOCKET) that it is ready; nothing otherwise.
+// A failed notice is logged, never fatal.
 void NotifyReady();
 
 }  // namespace platform

@@ -4,6 +4,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -132,6 +134,32 @@ TEST(DaemonSignalsTest, StopAndReloadReachTheWaitOnlyAndSigpipeIsIgnored) {
   sigaction(SIGHUP, nullptr, &action);
   EXPECT_EQ(action.sa_handler, SIG_DFL);
   EXPECT_FALSE(Blocked(SIGHUP));
+}
+
+// The service manager's side: a datagram socket named by NOTIFY_SOCKET.
+TEST(NotifyReadyTest, TheManagerNamedByTheEnvironmentHearsReadyAndALostOneIsOnlyLogged) {
+  test::TempDir dir;
+  const std::string path = dir.Path("notify");
+  UniqueFd manager(socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+  struct sockaddr_un addr = {};
+  addr.sun_family = AF_UNIX;
+  std::snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", path.c_str());
+  ASSERT_EQ(0, bind(manager.get(), reinterpret_cast<sockaddr*>(&addr), sizeof(addr)));
+  ASSERT_EQ(0, setenv("NOTIFY_SOCKET", path.c_str(), 1));
+  NotifyReady();
+  char buf[64] = {};
+  EXPECT_EQ(recv(manager.get(), buf, sizeof(buf) - 1, MSG_DONTWAIT), 7);
+  EXPECT_STREQ(buf, "READY=1");
+
+  manager.Close();
+  unlink(path.c_str());
+  test::LogCapture log;
+  NotifyReady();
+  EXPECT_TRUE(log.Contains("cannot tell the service manager that the daemon is ready"));
+  unsetenv("NOTIFY_SOCKET");
+  log.Clear();
+  NotifyReady();
+  EXPECT_TRUE(log.Lines().empty());
 }
 
 }  // namespace

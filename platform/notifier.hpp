@@ -1,6 +1,6 @@
 // The desktop notifier of this platform: instead of a desktop it logs each notification and
 // appends it as one JSON line to the notifications file, which the command-line tool shows. The
-// program "usr/quix/bin/quixzrmnotify" (under ORVANE_ROOT) is a thin main around these
+// program "usr/libexec/fileindex/quixzrmnotify" (under ORVANE_ROOT) is a thin main around these
 // functions. Stateless; appends from several processes interleave whole lines.
 #ifndef ORVANE_PLATFORM_NOTIFIER_HPP_
 #define ORVANE_PLATFORM_NOTIFIER_HPP_
@@ -13,7 +13,7 @@
 namespace orvane {
 namespace platform {
 
-constexpr char kNotifierPath[] = "/usr/quix/bin/quixzrmnotify";
+constexpr char kNotifierPath[] = "/usr/libexec/fileindex/quixzrmnotify";
 constexpr char kNotificationsPath[] = "/var/packages/Orvane/var/notifications";
 
 // The notifier's command line as a record: the options "-c" (the sending application), "-b" and

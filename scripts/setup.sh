@@ -16,6 +16,8 @@ packages=(
   chromium chromium-driver python3-selenium openssl curl
   gzip bzip2 xz-utils zstd lz4 zip p7zip-full cpio binutils
   samba smbclient
+  libsystemd-dev libseccomp-dev
+  debhelper dpkg-dev fakeroot lintian pandoc systemd bash-completion
 )
 
 missing=()

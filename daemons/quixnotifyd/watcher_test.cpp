@@ -76,10 +76,10 @@ class WatcherTest : public ::testing::Test {
     test::WritePlatformConfig(dir_.path(),
                               R"({"shares": [{"name": "share", "path": ")" + share_ + "\"}]})");
     const std::string notifier = dir_.Write(
-        "usr/quix/bin/quixzrmnotify", "#!/bin/sh\necho \"$*\" >> \"$(dirname \"$0\")/notified\"\n");
+        "usr/libexec/fileindex/quixzrmnotify", "#!/bin/sh\necho \"$*\" >> \"$(dirname \"$0\")/notified\"\n");
     chmod(notifier.c_str(), 0755);
   }
-  std::string Notified() const { return test::ReadFile(dir_.Path("usr/quix/bin/notified")); }
+  std::string Notified() const { return test::ReadFile(dir_.Path("usr/libexec/fileindex/notified")); }
   // How many queue lines read `line`.
   long LinesOf(const std::string& line) const {
     const std::vector<std::string> lines = QueueLines(queue_, share_);
