@@ -58,14 +58,20 @@ const char* const kAllowed[] = {
     "execve", "execveat", "vfork", "wait4", "waitid", "setpgid", "getpgid", "umask",
 };
 
-// Open flags that write, create or truncate.
-constexpr unsigned long kWritingOpenFlags =
-    O_ACCMODE | O_CREAT | O_TRUNC | O_APPEND | O_TMPFILE;
+// Open flags that write, create or truncate (an unnamed file needs write access, so the access
+// mode covers it).
+constexpr uint32_t kWritingOpenFlags = O_ACCMODE | O_CREAT | O_TRUNC | O_APPEND;
 
 // Thread and process creation flags that would leave the filter's view: new namespaces.
 constexpr unsigned long kNamespaceFlags = CLONE_NEWNS | CLONE_NEWUSER | CLONE_NEWPID |
                                           CLONE_NEWNET | CLONE_NEWIPC | CLONE_NEWUTS |
                                           CLONE_NEWCGROUP;
+
+// A comparison of the low 32 bits of argument `arg` (int arguments, which the C library
+// sign-extends).
+scmp_arg_cmp Arg32(unsigned arg, scmp_compare op, uint32_t a, uint32_t b = 0) {
+  return scmp_arg_cmp{arg, op, a, b};
+}
 
 struct Release {
   void operator()(scmp_filter_ctx ctx) const { seccomp_release(ctx); }
@@ -84,17 +90,17 @@ bool Build(scmp_filter_ctx ctx, std::string* error) {
   }
   // Opening only for reading.
   if ((rc = seccomp_rule_add(ctx, SCMP_ACT_ALLOW, SCMP_SYS(openat), 1,
-                             SCMP_A2_32(SCMP_CMP_MASKED_EQ, kWritingOpenFlags, 0))) != 0) {
+                             Arg32(2, SCMP_CMP_MASKED_EQ, kWritingOpenFlags, 0))) != 0) {
     return fail("openat", rc);
   }
   if ((rc = seccomp_rule_add(ctx, SCMP_ACT_ALLOW, SCMP_SYS(open), 1,
-                             SCMP_A1_32(SCMP_CMP_MASKED_EQ, kWritingOpenFlags, 0))) != 0) {
+                             Arg32(1, SCMP_CMP_MASKED_EQ, kWritingOpenFlags, 0))) != 0) {
     return fail("open", rc);
   }
   // Threads and child programs, in this process's namespaces. The C library tries clone3 first
   // and falls back to clone on ENOSYS.
   if ((rc = seccomp_rule_add(ctx, SCMP_ACT_ALLOW, SCMP_SYS(clone), 1,
-                             SCMP_A0_64(SCMP_CMP_MASKED_EQ, kNamespaceFlags, 0))) != 0) {
+                             scmp_arg_cmp{0, SCMP_CMP_MASKED_EQ, kNamespaceFlags, 0})) != 0) {
     return fail("clone", rc);
   }
   if ((rc = seccomp_rule_add(ctx, SCMP_ACT_ERRNO(ENOSYS), SCMP_SYS(clone3), 0)) != 0 ||
@@ -105,13 +111,13 @@ bool Build(scmp_filter_ctx ctx, std::string* error) {
   // a negative pid, never -1, which means every process.
   const pid_t self = getpid();
   if ((rc = seccomp_rule_add(ctx, SCMP_ACT_ALLOW, SCMP_SYS(tgkill), 1,
-                             SCMP_A0_32(SCMP_CMP_EQ, static_cast<uint32_t>(self)))) != 0 ||
+                             Arg32(0, SCMP_CMP_EQ, static_cast<uint32_t>(self)))) != 0 ||
       (rc = seccomp_rule_add(ctx, SCMP_ACT_ALLOW, SCMP_SYS(kill), 1,
-                             SCMP_A0_32(SCMP_CMP_EQ, static_cast<uint32_t>(self)))) != 0 ||
+                             Arg32(0, SCMP_CMP_EQ, static_cast<uint32_t>(self)))) != 0 ||
       (rc = seccomp_rule_add(ctx, SCMP_ACT_ALLOW, SCMP_SYS(kill), 1,
-                             SCMP_A0_32(SCMP_CMP_GE, 0x80000000u))) != 0 ||
+                             Arg32(0, SCMP_CMP_GE, 0x80000000u))) != 0 ||
       (rc = seccomp_rule_add(ctx, SCMP_ACT_ERRNO(EACCES), SCMP_SYS(kill), 1,
-                             SCMP_A0_32(SCMP_CMP_EQ, 0xFFFFFFFFu))) != 0) {
+                             Arg32(0, SCMP_CMP_EQ, 0xFFFFFFFFu))) != 0) {
     return fail("signals", rc);
   }
   // Terminal queries the libraries make on their standard streams.
@@ -119,7 +125,7 @@ bool Build(scmp_filter_ctx ctx, std::string* error) {
                                       static_cast<unsigned long>(TIOCGWINSZ),
                                       static_cast<unsigned long>(FIONREAD)}) {
     if ((rc = seccomp_rule_add(ctx, SCMP_ACT_ALLOW, SCMP_SYS(ioctl), 1,
-                               SCMP_A1_32(SCMP_CMP_EQ, static_cast<uint32_t>(request)))) != 0) {
+                               Arg32(1, SCMP_CMP_EQ, static_cast<uint32_t>(request)))) != 0) {
       return fail("ioctl", rc);
     }
   }

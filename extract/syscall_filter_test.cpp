@@ -1,5 +1,6 @@
 #include "extract/syscall_filter.hpp"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <pwd.h>
@@ -21,6 +22,7 @@
 #include <fstream>
 #include <functional>
 #include <map>
+#include <sstream>
 #include <thread>
 
 #include "common/json_util.hpp"
@@ -181,7 +183,7 @@ TEST(SyscallFilterTest, TheConfinedHelperExtractsEveryKindAsTheUnconfinedCodeDoe
   test::TempDir dir;
   std::vector<std::string> files = {
       dir.Write("utf8.txt", "Grüße aus der Datei\n"),
-      dir.Write("latin1.txt", std::string("caf\xe9 cr\xe8me br\xfbl\xe9e ", 16) + "et encore"),
+      dir.Write("latin1.txt", std::string("caf\xe9 cr\xe8" "me br\xfb" "l\xe9" "e et encore")),
       dir.Write("page.html", "<html><head><title>T</title></head><body><p>web page</p></body></html>"),
       dir.Write("data.json", "{\"key\": \"json value\"}"),
       dir.Write("report.pdf", test::SamplePdf("Quarterly Report", "Hello searchable world")),
