@@ -28,7 +28,8 @@ deb=$(ls "$work"/fileindex_*.deb)
 step "contents against the install rules"
 dpkg-deb --fsys-tarfile "$deb" | tar -t | sed 's|^\./|/|; s|/$||' | sort >"$work/in-package"
 (cd "$work/src/debian/tmp" && find . ! -type d | sed 's|^\.||' | sort) >"$work/installed"
-missing=$(comm -23 "$work/installed" "$work/in-package")
+# Manual pages are compressed on the way in.
+missing=$(comm -23 "$work/installed" <(sed 's|^\(/usr/share/man/.*\)\.gz$|\1|' "$work/in-package" | sort))
 [ -z "$missing" ] || fail "installed by the rules but not packaged: $missing"
 expected=(
   /usr/sbin/quixelasticd /usr/sbin/fileindexd /usr/sbin/quixnotifyd /usr/sbin/searchgw
@@ -77,14 +78,16 @@ complete_words() {
   || fail "no completion of folder add --doc: $(complete_words fileindexctl folder add /x --doc)"
 
 step "lintian"
-lintian --fail-on error --no-tag-display-limit "$deb" | tee "$work/lintian.txt" \
+lintian --fail-on error --tag-display-limit 0 "$deb" | tee "$work/lintian.txt" \
   || fail "lintian found errors"
 echo "lintian: $(grep -c '^E:' "$work/lintian.txt" || true) errors, $(grep -c '^W:' "$work/lintian.txt" || true) warnings"
 
 step "systemd-analyze"
 for u in "${units[@]}"; do
-  systemd-analyze verify --root="$root" "$root/lib/systemd/system/$u.service" 2>&1 \
-    | grep -v "^$" | tee "$work/verify.txt" || true
+  # Verified against this machine's units; the daemon itself is in the unpacked root (checked
+  # above), not necessarily installed here.
+  systemd-analyze verify --man=no "$root/lib/systemd/system/$u.service" 2>&1 \
+    | grep -v "Command /usr/sbin/$u is not executable" | tee "$work/verify.txt" || true
   [ ! -s "$work/verify.txt" ] || fail "$u.service does not verify"
   # The exposure score of each unit; above 5.0 ("MEDIUM") fails.
   systemd-analyze security --offline=yes --root="$root" --threshold=50 "$u.service" \
