@@ -17,6 +17,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <exiv2/exiv2.hpp>
 #include <fstream>
@@ -219,6 +220,34 @@ TEST(SyscallFilterTest, TheConfinedHelperExtractsEveryKindAsTheUnconfinedCodeDoe
     image->setExifData(exif);
     image->writeMetadata();
   }
+  // Kinds read through the converters the helper runs, and text recognition in an image.
+  files.push_back(dir.Write("plan.rtf", "{\\rtf1\\ansi{\\info{\\title Plan}}\\pard rtfword\\par}"));
+  files.push_back(dir.Write("foo.1", ".TH FOO 1\n.SH NAME\nfoo \\- manword does things\n"));
+  const std::string ps = dir.Write(
+      "w.ps", "%!PS\n/Helvetica findfont 40 scalefont setfont\n30 40 moveto (Quokka lighthouse) "
+              "show\nshowpage\n");
+  files.push_back(ps);
+  const std::string gs = "gs -q -dSAFER -dBATCH -dNOPAUSE -r150 -dDEVICEWIDTHPOINTS=400 "
+                         "-dDEVICEHEIGHTPOINTS=120 ";
+  ASSERT_EQ(0, std::system((gs + "-sDEVICE=pnggray -sOutputFile=" + dir.Path("words.png") + " " +
+                            ps + " && " + gs + "-sDEVICE=pbmraw -sOutputFile=" +
+                            dir.Path("w.pbm") + " " + ps + " && cjb2 " + dir.Path("w.pbm") + " " +
+                            dir.Path("w.djvu"))
+                               .c_str()));
+  // The DjVu page gets the hidden text layer scanning software writes.
+  dir.Write("t.txt", "(page 0 0 833 250 (line 10 10 600 80 (word 10 10 300 80 \"Wombat\")))\n");
+  ASSERT_EQ(0, std::system(("djvused " + dir.Path("w.djvu") + " -e 'select 1; set-txt " +
+                            dir.Path("t.txt") + "' -s")
+                               .c_str()));
+  files.push_back(dir.Path("words.png"));
+  files.push_back(dir.Path("w.djvu"));
+  files.push_back(dir.Write("m.eml", "From: Bob <bob@example.org>\nSubject: Plan\n"
+                                     "Content-Type: text/plain\n\nmailbodyword\n"));
+  files.push_back(dir.Write("inbox.mbox", "From bob@example.org Tue May  7 09:08:09 2024\n"
+                                          "From: Bob <bob@example.org>\nSubject: One\n\nfirst\n\n"
+                                          "From carol@example.org Tue May  7 09:08:10 2024\n"
+                                          "From: Carol <carol@example.org>\nSubject: Two\n\nsecond\n"));
+  files.push_back(dir.Write("notes.xml", "<?xml version=\"1.0\"?><notes><n>xmlword</n></notes>"));
   // Files of the system itself, whatever kinds it has.
   for (const char* system_file : {"/usr/share/common-licenses/GPL-3", "/usr/share/common-licenses/Apache-2.0"}) {
     if (access(system_file, R_OK) == 0) files.push_back(system_file);

@@ -88,7 +88,9 @@ int Spawn(const std::vector<std::string>& argv, int input_fd, int out_w, pid_t* 
   posix_spawnattr_init(&attr);
   posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
   posix_spawn_file_actions_adddup2(&actions, out_w, 1);
-  posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_WRONLY, 0);
+  // Its complaints are not wanted. The helper may open nothing for writing, so /dev/null is
+  // opened for reading: what the tool writes there fails quietly.
+  posix_spawn_file_actions_addopen(&actions, 2, "/dev/null", O_RDONLY, 0);
   posix_spawn_file_actions_adddup2(&actions, input_fd, kChildInputFd);
   posix_spawn_file_actions_addclosefrom_np(&actions, kChildInputFd + 1);
   sigset_t none;
