@@ -35,7 +35,7 @@ expected=(
   /usr/sbin/quixelasticd /usr/sbin/fileindexd /usr/sbin/quixnotifyd /usr/sbin/searchgw
   /usr/bin/fileindexctl /usr/libexec/fileindex/fileindex-extract
   /usr/libexec/fileindex/quixzrmnotify /usr/lib/fileindex/libfileindex.so
-  /etc/default/fileindex /usr/lib/sysctl.d/60-fileindex.conf
+  /etc/default/fileindex /etc/orvane/fileindex.conf /usr/lib/sysctl.d/60-fileindex.conf
   /usr/share/bash-completion/completions/fileindexctl
   /usr/share/fileindex/spotlight_mappings.json
   /usr/share/man/man1/fileindexctl.1.gz /usr/share/man/man8/quixelasticd.8.gz
@@ -46,7 +46,9 @@ units=(quixelasticd quixnotifyd fileindexd searchgw)
 for u in "${units[@]}"; do expected+=("/lib/systemd/system/$u.service"); done
 for f in "${expected[@]}"; do grep -qx "$f" "$work/in-package" || fail "$f is not in the package"; done
 dpkg-deb -e "$deb" "$work/control"
-grep -qx /etc/default/fileindex "$work/control/conffiles" || fail "/etc/default/fileindex is no conffile"
+for f in /etc/default/fileindex /etc/orvane/fileindex.conf; do
+  grep -qx "$f" "$work/control/conffiles" || fail "$f is no conffile"
+done
 depends=$(dpkg-deb -f "$deb" Depends)
 for lib in adduser libjsoncpp libsqlite3 libsystemd0 libseccomp2 libpoppler-cpp; do
   [[ $depends == *"$lib"* ]] || fail "Depends lacks $lib: $depends"
