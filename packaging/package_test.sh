@@ -33,6 +33,7 @@ missing=$(comm -23 "$work/installed" <(sed 's|^\(/usr/share/man/.*\)\.gz$|\1|' "
 [ -z "$missing" ] || fail "installed by the rules but not packaged: $missing"
 expected=(
   /usr/sbin/quixelasticd /usr/sbin/fileindexd /usr/sbin/quixnotifyd /usr/sbin/searchgw
+  /usr/sbin/webd /usr/share/fileindex/www/index.html /etc/pam.d/fileindex-web
   /usr/bin/fileindexctl /usr/libexec/fileindex/fileindex-extract
   /usr/libexec/fileindex/quixzrmnotify /usr/lib/fileindex/libfileindex.so
   /etc/default/fileindex /etc/orvane/fileindex.conf /usr/lib/sysctl.d/60-fileindex.conf
@@ -40,13 +41,13 @@ expected=(
   /usr/share/fileindex/spotlight_mappings.json
   /usr/share/man/man1/fileindexctl.1.gz /usr/share/man/man8/quixelasticd.8.gz
   /usr/share/man/man8/fileindexd.8.gz /usr/share/man/man8/quixnotifyd.8.gz
-  /usr/share/man/man8/searchgw.8.gz
+  /usr/share/man/man8/searchgw.8.gz /usr/share/man/man8/webd.8.gz
 )
-units=(quixelasticd quixnotifyd fileindexd searchgw)
+units=(quixelasticd quixnotifyd fileindexd searchgw webd)
 for u in "${units[@]}"; do expected+=("/lib/systemd/system/$u.service"); done
 for f in "${expected[@]}"; do grep -qx "$f" "$work/in-package" || fail "$f is not in the package"; done
 dpkg-deb -e "$deb" "$work/control"
-for f in /etc/default/fileindex /etc/orvane/fileindex.conf; do
+for f in /etc/default/fileindex /etc/orvane/fileindex.conf /etc/pam.d/fileindex-web; do
   grep -qx "$f" "$work/control/conffiles" || fail "$f is no conffile"
 done
 depends=$(dpkg-deb -f "$deb" Depends)
@@ -111,8 +112,16 @@ echo "the quarterly zanzibarite figures" >"$share/reports/q3.txt"
 cat >"$root/etc/orvane/platform.json" <<JSON
 {"shares": [{"name": "docs", "path": "$share", "recycle_bin": false}], "admin_group": "root"}
 JSON
-port=$(python3 -c 'import socket; s = socket.socket(); s.bind(("127.0.0.1", 0)); print(s.getsockname()[1])')
-sed -i "s|^SEARCHGW_OPTS=.*|SEARCHGW_OPTS=\"--port $port\"|" "$root/etc/default/fileindex"
+free_port() {
+  python3 -c 'import socket; s = socket.socket(); s.bind(("127.0.0.1", 0)); print(s.getsockname()[1])'
+}
+# What an administrator would put in the options file: free ports, and for the web page the
+# unpacked root's files in place of the installed ones.
+port=$(free_port)
+web_port=$(free_port)
+sed -i -e "s|^SEARCHGW_OPTS=.*|SEARCHGW_OPTS=\"--port $port\"|" \
+  -e "s|^WEBD_OPTS=.*|WEBD_OPTS=\"--port $web_port --www $root/usr/share/fileindex/www --pam-dir $root/etc/pam.d\"|" \
+  "$root/etc/default/fileindex"
 
 # unit_command UNIT: its ExecStart line with the options file's variables put in, as systemd
 # does (EnvironmentFile=, then $VAR split on white space), and the unpacked root before it.
@@ -129,11 +138,12 @@ unit_command() {
 declare -A address=(
   [quixelasticd]=$root/var/run/quixelasticd.sock [quixnotifyd]=-
   [fileindexd]=$root/var/run/fileindexd.sock [searchgw]=127.0.0.1:$port
+  [webd]=127.0.0.1:$web_port
 )
 start_all() {
   local u cmd pid
   pids=()
-  for u in quixelasticd quixnotifyd fileindexd searchgw; do  # the units' order
+  for u in quixelasticd quixnotifyd fileindexd searchgw webd; do  # the units' order
     read -r -a cmd <<<"$(unit_command "$u")"
     pid=$(python3 "$here/start_ready.py" "$root/var/log/$u.log" "${address[$u]}" "${cmd[@]}") \
       || { cat "$root/var/log/$u.log"; fail "$u did not start as its unit does"; }
