@@ -39,8 +39,9 @@ void ParseFile(const std::string& path, const Json::Value& config, Json::Value& 
   out[QUIXMDOwnerGroupID] = std::to_string(st.stx_gid);
   out[QUIXMDExtension] = orvane::GetFileExtension(path, true);
   // Contents are read by the helper process: a hostile file costs that process, not the indexer,
-  // and a file whose contents cannot be read is still indexed by name and attributes.
-  if (S_ISREG(st.stx_mode) && config.isObject() && config[kKeyNeedMeta].isBool() &&
+  // and a file whose contents cannot be read is still indexed by name and attributes. An empty
+  // file has no contents: it costs no trip to the helper.
+  if (S_ISREG(st.stx_mode) && st.stx_size > 0 && config.isObject() && config[kKeyNeedMeta].isBool() &&
       config[kKeyNeedMeta].asBool()) {
     Json::Value fields;
     std::string error;

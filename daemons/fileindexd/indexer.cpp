@@ -2,13 +2,21 @@
 
 #include <dirent.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <syslog.h>
+
+#include <fcntl.h>
 
 #include <cerrno>
 #include <climits>
+#include <condition_variable>
 #include <cstring>
+#include <deque>
+#include <exception>
 #include <functional>
 #include <map>
+#include <mutex>
+#include <thread>
 #include <utility>
 
 #include "common/comm.hpp"
@@ -17,6 +25,7 @@
 #include "common/log.hpp"
 #include "common/util.hpp"
 #include "daemons/fileindexd/parse_pool.hpp"
+#include "daemons/quixelasticd/bulk_codec.hpp"
 #include "extract/content_extract.hpp"
 #include "fileindex/elastic_control.hpp"
 #include "fileindex/util.hpp"
@@ -68,9 +77,82 @@ Json::Value UpsertCommand(const std::string& id, ParsePool::Result& result) {
 
 }  // namespace
 
+// Sends the requests of one crawl on a thread of its own, so that the crawl reads the disk and
+// extracts while the engine writes the batch before. At most kDepth requests wait, which bounds
+// memory however fast the crawl runs. The first failure stops the sending; the crawl sees it at
+// its next Push or Drain. Destroying it drops what waits and lets the request on its way finish.
+class Indexer::Sender {
+ public:
+  static constexpr size_t kDepth = 2;
+
+  Sender() = default;
+  Sender(const Sender&) = delete;
+  Sender& operator=(const Sender&) = delete;
+  ~Sender() {
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      quit_ = true;
+      queue_.clear();
+    }
+    cv_.notify_all();
+    if (thread_.joinable()) thread_.join();
+  }
+
+  void Push(Json::Value req) {
+    std::unique_lock<std::mutex> lock(mu_);
+    if (!thread_.joinable()) thread_ = std::thread([this] { Run(); });
+    cv_.wait(lock, [this] { return failure_ || queue_.size() < kDepth; });
+    if (failure_) std::rethrow_exception(failure_);
+    queue_.push_back(std::move(req));
+    cv_.notify_all();
+  }
+  // Waits until everything pushed was taken by the engine.
+  void Drain() {
+    std::unique_lock<std::mutex> lock(mu_);
+    cv_.wait(lock, [this] { return failure_ || (queue_.empty() && !busy_); });
+    if (failure_) std::rethrow_exception(failure_);
+  }
+  bool started() const { return thread_.joinable(); }
+
+ private:
+  void Run() {
+    std::unique_lock<std::mutex> lock(mu_);
+    for (;;) {
+      cv_.wait(lock, [this] { return quit_ || !queue_.empty(); });
+      if (quit_ || failure_) return;
+      Json::Value req = std::move(queue_.front());
+      queue_.pop_front();
+      busy_ = true;
+      lock.unlock();
+      std::exception_ptr failure;
+      try {
+        el::SendRequest(req);
+      } catch (...) {
+        failure = std::current_exception();
+      }
+      lock.lock();
+      busy_ = false;
+      if (failure) {
+        failure_ = failure;
+        queue_.clear();
+      }
+      cv_.notify_all();
+    }
+  }
+
+  std::mutex mu_;
+  std::condition_variable cv_;
+  std::deque<Json::Value> queue_;
+  bool busy_ = false;
+  bool quit_ = false;
+  std::exception_ptr failure_;
+  std::thread thread_;
+};
+
 // Collects document commands and sends them as compound requests, so a crawl of many files
-// costs one engine transaction per batch rather than one connection per file. Contents are
-// extracted on a pool of threads, several files at once; a crawl names each path once, so the
+// costs one engine transaction per batch rather than one connection per file. Documents of a
+// name and attributes only go in the compact bulk form; those with contents are extracted on a
+// pool of threads, several files at once, and go as JSON. A crawl names each path once, so the
 // documents may go out in the order their extraction ends.
 class Indexer::Batch {
  public:
@@ -79,8 +161,11 @@ class Indexer::Batch {
   Batch(const Batch&) = delete;
   Batch& operator=(const Batch&) = delete;
 
-  void Upsert(const std::string& path, bool need_meta) {
-    if (need_meta) {
+  // `st`, when given, is what the crawl just read of `path` (statx, basic fields and birth
+  // time); it spares a second look.
+  void Upsert(const std::string& path, bool need_meta, const struct statx* st = nullptr) {
+    // An empty file has no contents to extract: it is described by its attributes alone.
+    if (need_meta && (st == nullptr || !S_ISREG(st->stx_mode) || st->stx_size > 0)) {
       pool_.Submit(path, true);
       // Bounded, so that memory stays bounded however large the folder: a slow file holds one
       // thread while the others go on, and what they finish is taken here.
@@ -88,6 +173,20 @@ class Indexer::Batch {
       while (pool_.Next(&result, pool_.outstanding() > kMaxInFlightPerThread * pool_.threads())) {
         Add(std::move(result), true);
       }
+      return;
+    }
+    struct statx own;
+    if (st == nullptr) {
+      if (statx(AT_FDCWD, path.c_str(), AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME,
+                &own) != 0) {
+        Log(LOG_WARNING, "fileindexd: %s not indexed: %s", path.c_str(), strerror(errno));
+        return;
+      }
+      st = &own;
+    }
+    if (bulk_.Add(path, *st)) {
+      ++owner_->documents_written_;
+      if (bulk_.count() >= kBulkBatchSize) Send();
       return;
     }
     ParsePool::Result result;
@@ -128,8 +227,9 @@ class Indexer::Batch {
     data["query"]["qsl"]["prefix"][QUIX::CONTENT_EXTRACT::QUIXMDPath] = dir + "/";
     Add(Command("document_del_by_query", std::move(data)));
   }
-  // Sends everything, waiting for the extractions still running; what is ready is sent before
-  // each wait, so the files done are searchable while a slow one is still being read.
+  // Sends everything, waiting for the extractions still running and for the engine; what is
+  // ready is sent before each wait, so the files done are searchable while a slow one is still
+  // being read.
   void Flush() {
     ParsePool::Result result;
     for (;;) {
@@ -138,6 +238,7 @@ class Indexer::Batch {
       if (!pool_.Next(&result, true)) break;
       Add(std::move(result), true);
     }
+    sender_.Drain();
   }
 
  private:
@@ -158,22 +259,34 @@ class Indexer::Batch {
     ++owner_->documents_written_;
   }
   void Add(Json::Value req) {
+    // The compact documents gathered so far go first: commands keep the order they were made.
+    CloseBulk();
     reqs_.append(std::move(req));
     if (reqs_.size() >= kCrawlBatchSize || bytes_ >= kCrawlBatchBytes) Send();
   }
+  void CloseBulk() {
+    if (bulk_.count() == 0) return;
+    Json::Value data(Json::objectValue);
+    data["id"] = id_;
+    data["docs"] = bulk_.Take();
+    reqs_.append(Command(elasticd::kBulkUpsertCommand, std::move(data)));
+  }
   void Send() {
+    CloseBulk();
     if (reqs_.empty()) return;
     Json::Value req(Json::objectValue);
     req["compound"] = std::move(reqs_);
     reqs_ = Json::Value(Json::arrayValue);
     bytes_ = 0;
-    el::SendRequest(req);
+    sender_.Push(std::move(req));
   }
 
   Indexer* owner_;
   std::string id_;
   Json::Value reqs_;
+  elasticd::BulkEncoder bulk_;
   uint64_t bytes_ = 0;
+  Sender sender_;
   // Declared last: destroyed first, before the requests its results would have joined.
   ParsePool pool_;
 };
@@ -555,19 +668,24 @@ void Indexer::CrawlDir(const std::string& dir, dev_t dev, const CrawlMode& mode,
       if (indexable || may_be_dir) NoteLongPath(path);
       continue;
     }
-    struct stat st;
-    if (lstat(path.c_str(), &st) != 0) continue;
-    if (S_ISDIR(st.st_mode)) {
-      // Other file systems mounted below are not ours to index.
-      if (st.st_dev == dev) subdirs.push_back(path);
+    // Looked up in the directory already open rather than by its whole path: one read of the
+    // attributes serves the type check and the document.
+    struct statx st;
+    if (statx(dirfd(raw), entry->d_name, AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME,
+              &st) != 0) {
       continue;
     }
-    if (!indexable || !S_ISREG(st.st_mode)) continue;
+    if (S_ISDIR(st.stx_mode)) {
+      // Other file systems mounted below are not ours to index.
+      if (makedev(st.stx_dev_major, st.stx_dev_minor) == dev) subdirs.push_back(path);
+      continue;
+    }
+    if (!indexable || !S_ISREG(st.stx_mode)) continue;
     if (fileindex::IsSystemPreservedFileName(name)) continue;
     bool missing = false;
     if (stale != nullptr) missing = stale->erase(path) == 0;
     if (mode.all || missing || KindSwitched(mode, path)) {
-      batch.Upsert(path, folders_->IsFullPathNeedMeta(path));
+      batch.Upsert(path, folders_->IsFullPathNeedMeta(path), &st);
     }
   }
   closer.reset();

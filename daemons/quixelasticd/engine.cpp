@@ -9,6 +9,7 @@
 #include "common/env.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
+#include "daemons/quixelasticd/bulk_codec.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
 #include "daemons/quixelasticd/engine_session.hpp"
 #include "daemons/quixelasticd/request_args.hpp"
@@ -35,7 +36,8 @@ std::string DocumentIndexOf(const Json::Value& sub) {
   const char* key = nullptr;
   if (name == "update_term_suggestion") {
     key = "db_name";
-  } else if (name == "document_upsert_by_id" || name == "document_set_by_id" ||
+  } else if (name == "document_upsert_by_id" || name == kBulkUpsertCommand ||
+             name == "document_set_by_id" ||
              name == "document_del_by_id" || name == "document_del_by_query" ||
              name == "document_get_by_query" || name == "document_list") {
     key = "id";
@@ -234,6 +236,7 @@ Json::Value Engine::RunCompoundPass(const Json::Value& list, const Caller& calle
 Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data,
                              const Caller& caller, Session& session) {
   const bool batched = command == "update_term_suggestion" || command == "document_upsert_by_id" ||
+                       command == kBulkUpsertCommand ||
                        command == "document_set_by_id" || command == "document_del_by_id" ||
                        command == "document_del_by_query" || command == "document_get_by_query" ||
                        command == "document_list";
@@ -278,6 +281,18 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
       throw EngineError(kCodeInvalidParam, "\"doc_id\" must be a string");
     }
     store.Upsert(doc_id.isString() ? doc_id.asString() : std::string(), doc);
+  } else if (command == kBulkUpsertCommand) {
+    int64_t upserted = 0;
+    std::string error;
+    if (!DecodeBulk(RequireString(data, "docs"),
+                    [&](const BulkDoc& doc) {
+                      store.Upsert(doc.Path(), doc.ToJson());
+                      ++upserted;
+                    },
+                    &error)) {
+      throw EngineError(kCodeInvalidParam, error);
+    }
+    result["upserted"] = static_cast<Json::Int64>(upserted);
   } else if (command == "document_set_by_id") {
     const std::string doc_id = RequireString(data, "doc_id");
     if (!data["data"].isObject()) throw EngineError(kCodeInvalidParam, "\"data\" must be an object");
