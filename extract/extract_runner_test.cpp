@@ -303,6 +303,13 @@ TEST_F(ExtractRunnerTest, ParseFileFillsFileSystemFieldsAndAddsContentOnlyWhenAs
   EXPECT_FALSE(doc.isMember("QUIXMDTextContent"));
   EXPECT_EQ(ExtractFailureCount(), failures + 1);
   EXPECT_TRUE(log.Contains("content of " + path + " not extracted: exited with status 3"));
+
+  // An empty file, whatever its kind, has no contents: the helper is not asked at all.
+  const std::string empty = dir_.Path("empty.unknownkind");
+  test::WriteFile(empty, "");
+  ce::ParseFile(empty, need_meta, doc);
+  EXPECT_EQ(doc[ce::QUIXMDFSSize].asUInt64(), 0u);
+  EXPECT_EQ(ExtractFailureCount(), failures + 1);
 }
 
 }  // namespace

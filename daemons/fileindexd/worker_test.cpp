@@ -15,8 +15,10 @@
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "common/wire.hpp"
+#include "daemons/fileindexd/indexer.hpp"
 #include "extract/extract_runner.hpp"
 #include "fileindex/elastic_control.hpp"
+#include "fileindex/folder_mgr.hpp"
 #include "fileindex/queue_file.hpp"
 #include "fileindex/status_mgr.hpp"
 #include "platform/platform_error.hpp"
@@ -131,6 +133,34 @@ TEST_F(WorkerTest, ReindexCrashAndFolderChangesSettleTheIndexWithTheDisk) {
   sys_.WriteFolders({System::Folder("/docs/b", false), System::Folder("/docs/a/sub", false)});
   EXPECT_EQ(Expect({"a/sub", "a/sub/new.txt", "b", "b/other.txt"}),
             Pass(Line(0x20000, "a/sub", true)));
+}
+
+// A crawl writes each document exactly as the library's single upsert of the same file does,
+// whatever its name holds, and a crawl larger than one request keeps every file.
+TEST_F(WorkerTest, ACrawlWritesWhatSingleUpsertsWouldWrite) {
+  const std::vector<std::string> odd = {
+      "a/plain.txt", "a/UPPER.PDF", "a/no_extension", "a/.dotfile", "a/tab\tand\nnewline.x",
+      "a/bytes\xff\xfe.bin", "a/P12:like a record", "a/sub/inner.TaR", "a/empty.unknownkind",
+      "a/text.unknownkind"};
+  for (const std::string& rel : odd) Write(rel, rel.find("empty") == std::string::npos ? rel : "");
+  constexpr int kMany = kBulkBatchSize + 100;
+  for (int i = 0; i < kMany; ++i) Write("a/many/f" + std::to_string(i));
+  EXPECT_EQ(odd.size() + kMany + 3, Pass(Line(0x10000, "a")).size());
+
+  const auto stored = [&](const std::string& path) {
+    Json::Value q(Json::objectValue);
+    q["id"] = fileindex::elastic::GetFileIndexID("docs");
+    q["query"]["qsl"]["term"]["QUIXMDPath"] = path;
+    const Json::Value hits = System::Engine("document_get_by_query", q)["data"];
+    EXPECT_EQ(1u, hits.size()) << path;
+    return JsonToString(hits[0]);
+  };
+  fileindex::FolderMgr folders;
+  for (const std::string& rel : odd) {
+    const std::string crawled = stored(V(rel));
+    fileindex::elastic::IndexUpsert("docs", V(rel), folders.IsFullPathNeedMeta(V(rel)));
+    EXPECT_EQ(stored(V(rel)), crawled) << rel;
+  }
 }
 
 // Whatever takes an indexed name without being indexable itself takes the name's document with
