@@ -311,7 +311,7 @@ TEST_F(EndToEndTest, AfterTheKernelLostEventsTheIndexEqualsTheDisk) {
 
 TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
   // Most files in one directory, so that a stop must land inside it, and a few below.
-  constexpr int kFlat = 2500;
+  constexpr int kFlat = 4 * kBulkBatchSize;
   for (int i = 0; i < kFlat + 500; ++i) {
     const std::string dir = i < kFlat ? "big" : "big/d" + std::to_string(i % 5);
     WriteFile(D(dir + "/f" + std::to_string(i) + ".txt"), "x");
@@ -321,13 +321,13 @@ TEST_F(EndToEndTest, StoppedMidCrawlItFinishesLaterWithNothingLostOrDoubled) {
   // promptly, within a request or two of being asked (the one on its way, and one more should
   // this process be slow to ask), and leaves its batch queued as it was.
   const auto stop_mid_crawl = [&](const std::function<void()>& stop) {
-    ASSERT_TRUE(WaitFor([] { return EngineCount("docs") >= int64_t(kCrawlBatchSize); }, 20000));
+    ASSERT_TRUE(WaitFor([] { return EngineCount("docs") >= int64_t(kBulkBatchSize); }, 20000));
     const std::string batch = orvane::test::ReadFile(side_file);
     const int64_t asked_at = EngineCount("docs");
     const auto start = std::chrono::steady_clock::now();
     stop();
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
-    EXPECT_LE(EngineCount("docs"), asked_at + 2 * int64_t(kCrawlBatchSize));
+    EXPECT_LE(EngineCount("docs"), asked_at + 2 * int64_t(kBulkBatchSize));
     EXPECT_FALSE(batch.empty());
     EXPECT_EQ(batch, orvane::test::ReadFile(side_file));
   };

@@ -25,7 +25,7 @@ namespace fileindexd {
 // Upserts and deletes a crawl sends per compound request.
 constexpr size_t kCrawlBatchSize = 512;
 // Documents of a name and attributes only, which are small, per compound request.
-constexpr size_t kBulkBatchSize = 8192;
+constexpr size_t kBulkBatchSize = 2048;
 // ... or fewer, once the contents extracted for a batch reach about this many bytes, so that a
 // crawl of large text files does not hold hundreds of them in memory at once.
 constexpr uint64_t kCrawlBatchBytes = 8 << 20;
