@@ -9,6 +9,7 @@
 
 #include <cerrno>
 #include <climits>
+#include <chrono>
 #include <condition_variable>
 #include <cstring>
 #include <deque>
@@ -80,12 +81,13 @@ Json::Value UpsertCommand(const std::string& id, ParsePool::Result& result) {
 // Sends the requests of one crawl on a thread of its own, so that the crawl reads the disk and
 // extracts while the engine writes the batch before. At most kDepth requests wait, which bounds
 // memory however fast the crawl runs. The first failure stops the sending; the crawl sees it at
-// its next Push or Drain. Destroying it drops what waits and lets the request on its way finish.
+// its next Push or Drain. A stop, or destroying it, drops what waits and lets the request on its
+// way finish.
 class Indexer::Sender {
  public:
   static constexpr size_t kDepth = 2;
 
-  Sender() = default;
+  explicit Sender(const std::atomic<bool>* stop) : stop_(stop) {}
   Sender(const Sender&) = delete;
   Sender& operator=(const Sender&) = delete;
   ~Sender() {
@@ -101,18 +103,17 @@ class Indexer::Sender {
   void Push(Json::Value req) {
     std::unique_lock<std::mutex> lock(mu_);
     if (!thread_.joinable()) thread_ = std::thread([this] { Run(); });
-    cv_.wait(lock, [this] { return failure_ || queue_.size() < kDepth; });
+    Wait(lock, [this] { return failure_ || queue_.size() < kDepth; });
     if (failure_) std::rethrow_exception(failure_);
-    queue_.push_back(std::move(req));
+    if (!Stopping()) queue_.push_back(std::move(req));
     cv_.notify_all();
   }
-  // Waits until everything pushed was taken by the engine.
+  // Waits until everything pushed was taken by the engine, or the crawl is stopped.
   void Drain() {
     std::unique_lock<std::mutex> lock(mu_);
-    cv_.wait(lock, [this] { return failure_ || (queue_.empty() && !busy_); });
+    Wait(lock, [this] { return failure_ || (queue_.empty() && !busy_); });
     if (failure_) std::rethrow_exception(failure_);
   }
-  bool started() const { return thread_.joinable(); }
 
  private:
   void Run() {
@@ -120,6 +121,12 @@ class Indexer::Sender {
     for (;;) {
       cv_.wait(lock, [this] { return quit_ || !queue_.empty(); });
       if (quit_ || failure_) return;
+      // A stopped crawl sends nothing more: its operation stays queued and runs again.
+      if (Stopping()) {
+        queue_.clear();
+        cv_.notify_all();
+        continue;
+      }
       Json::Value req = std::move(queue_.front());
       queue_.pop_front();
       busy_ = true;
@@ -140,6 +147,14 @@ class Indexer::Sender {
     }
   }
 
+  bool Stopping() const { return stop_ != nullptr && stop_->load(); }
+  // Waits for `done` or a stop, which nobody signals: it is looked at every few milliseconds.
+  template <typename Pred>
+  void Wait(std::unique_lock<std::mutex>& lock, Pred done) {
+    while (!done() && !Stopping()) cv_.wait_for(lock, std::chrono::milliseconds(20));
+  }
+
+  const std::atomic<bool>* stop_;
   std::mutex mu_;
   std::condition_variable cv_;
   std::deque<Json::Value> queue_;
@@ -157,7 +172,10 @@ class Indexer::Sender {
 class Indexer::Batch {
  public:
   explicit Batch(Indexer* owner)
-      : owner_(owner), id_(el::GetFileIndexID(owner->share_)), reqs_(Json::arrayValue) {}
+      : owner_(owner),
+        id_(el::GetFileIndexID(owner->share_)),
+        reqs_(Json::arrayValue),
+        sender_(owner->stop_) {}
   Batch(const Batch&) = delete;
   Batch& operator=(const Batch&) = delete;
 
