@@ -2,24 +2,14 @@
 
 #include <gtest/gtest.h>
 
+#include "extract/extractor_test_util.hpp"
 #include "test/sample_files.hpp"
-#include "test/test_util.hpp"
 
 namespace orvane {
 namespace extract {
 namespace {
 
-class HtmlTest : public ::testing::Test {
- protected:
-  template <typename F>
-  Json::Value Run(F extract, const std::string& path) {
-    Json::Value fields(Json::objectValue);
-    extract(OpenedFile(path), fields);
-    return fields;
-  }
-
-  test::TempDir dir_;
-};
+using HtmlTest = ExtractorTest;
 
 TEST_F(HtmlTest, VisibleTextTitleAndMetaFields) {
   const Json::Value f = Run(ExtractHtml, dir_.Write("p.html", R"(<!DOCTYPE html>

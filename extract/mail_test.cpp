@@ -5,8 +5,8 @@
 
 #include <memory>
 
+#include "extract/extractor_test_util.hpp"
 #include "test/sample_files.hpp"
-#include "test/test_util.hpp"
 
 namespace orvane {
 namespace extract {
@@ -49,17 +49,7 @@ std::string Base64(const std::string& data) {
   return text.get();
 }
 
-class MailTest : public ::testing::Test {
- protected:
-  template <typename F>
-  Json::Value Run(F extract, const std::string& path) {
-    Json::Value fields(Json::objectValue);
-    extract(OpenedFile(path), fields);
-    return fields;
-  }
-
-  test::TempDir dir_;
-};
+using MailTest = ExtractorTest;
 
 TEST_F(MailTest, HeadersBecomeFieldsAndEveryPartItsText) {
   // A PDF attached is read as a PDF; one that is damaged leaves its name.

@@ -4,23 +4,14 @@
 
 #include <cstdlib>
 
+#include "extract/extractor_test_util.hpp"
 #include "test/sample_files.hpp"
-#include "test/test_util.hpp"
 
 namespace orvane {
 namespace extract {
 namespace {
 
-class OcrTest : public ::testing::Test {
- protected:
-  Json::Value Run(const std::string& path) {
-    Json::Value fields(Json::objectValue);
-    ExtractImageWithText(OpenedFile(path), fields);
-    return fields;
-  }
-
-  test::TempDir dir_;
-};
+using OcrTest = ExtractorTest;
 
 TEST_F(OcrTest, WordsDrawnInAnImageAreRecognisedAndTinyImagesSkipped) {
   // Two words rendered to a greyscale PNG by ghostscript.
@@ -32,12 +23,13 @@ TEST_F(OcrTest, WordsDrawnInAnImageAreRecognisedAndTinyImagesSkipped) {
                          dir_.Path("w.png") + " " + ps)
                             .c_str()),
             0);
-  const Json::Value f = Run(dir_.Path("w.png"));
+  const Json::Value f = Run(ExtractImageWithText, dir_.Path("w.png"));
   EXPECT_EQ(f["QUIXMDMediaTypes"], "Image");
   EXPECT_NE(f["QUIXMDTextContent"].asString().find("Quokka lighthouse"), std::string::npos)
       << f["QUIXMDTextContent"];
   // An icon keeps its metadata and is not read.
-  const Json::Value icon = Run(dir_.Write("icon.png", test::SamplePng(16, 16)));
+  const Json::Value icon =
+      Run(ExtractImageWithText, dir_.Write("icon.png", test::SamplePng(16, 16)));
   EXPECT_EQ(icon["QUIXMDMediaTypes"], "Image");
   EXPECT_FALSE(icon.isMember("QUIXMDTextContent"));
 }

@@ -9,7 +9,7 @@
 #include <fstream>
 
 #include "common/fd.hpp"
-#include "test/test_util.hpp"
+#include "extract/extractor_test_util.hpp"
 
 namespace orvane {
 namespace extract {
@@ -20,19 +20,10 @@ const char kPostScript[] =
     "%!PS\n/Helvetica findfont 40 scalefont setfont\n30 40 moveto (Quokka lighthouse) show\n"
     "showpage\n";
 
-class ToolExtractTest : public ::testing::Test {
+class ToolExtractTest : public ExtractorTest {
  protected:
-  template <typename F>
-  Json::Value Run(F extract, const std::string& path) {
-    Json::Value fields(Json::objectValue);
-    extract(OpenedFile(path), fields);
-    return fields;
-  }
-
   // Runs a Debian tool to make a sample file; true when it worked.
   bool Make(const std::string& command) { return std::system(command.c_str()) == 0; }
-
-  test::TempDir dir_;
 };
 
 TEST_F(ToolExtractTest, RunToolOutcomes) {
