@@ -132,6 +132,8 @@ void WalkHtml(xmlNode* root, TextSink* sink, Json::Value& fields) {
 // and attribute name and attribute value once, so that a search for a name a file uses, or a
 // value it sets, finds it. No network, no entities expanded, no DTD loaded.
 void XmlToText(const std::string& xml, TextSink* sink) {
+  // Once asked for, the document is the caller's to free, after the reader that built it.
+  std::unique_ptr<xmlDoc, void (*)(xmlDocPtr)> doc(nullptr, xmlFreeDoc);
   std::unique_ptr<xmlTextReader, void (*)(xmlTextReaderPtr)> reader(
       xmlReaderForMemory(
           xml.data(), static_cast<int>(xml.size()), nullptr, nullptr,
@@ -150,6 +152,20 @@ void XmlToText(const std::string& xml, TextSink* sink) {
   };
   while (!sink->full() && xmlTextReaderRead(reader.get()) == 1) {
     const int type = xmlTextReaderNodeType(reader.get());
+    if (type == XML_READER_TYPE_DOCUMENT_TYPE) {
+      // The document type's public and system identifiers name what the file is.
+      if (!doc) doc.reset(xmlTextReaderCurrentDoc(reader.get()));
+      if (const xmlDtd* dtd = xmlGetIntSubset(doc.get())) {
+        remember(dtd->name);
+        if (dtd->ExternalID != nullptr) remember(reinterpret_cast<const xmlChar*>("PUBLIC"));
+        remember(dtd->ExternalID);
+        if (dtd->ExternalID == nullptr && dtd->SystemID != nullptr) {
+          remember(reinterpret_cast<const xmlChar*>("SYSTEM"));
+        }
+        remember(dtd->SystemID);
+      }
+      continue;
+    }
     if (type == XML_READER_TYPE_ELEMENT) {
       remember(xmlTextReaderConstLocalName(reader.get()));
       while (xmlTextReaderMoveToNextAttribute(reader.get()) == 1) {

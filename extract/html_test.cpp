@@ -55,10 +55,12 @@ TEST_F(HtmlTest, MalformedAndDeepPagesStillGiveTheirText) {
 TEST_F(HtmlTest, XmlTextNodesAreSeparateWordsAndEntitiesStayUnexpanded) {
   const Json::Value f =
       Run(ExtractXml, dir_.Write("d.xml",
-                                 "<?xml version=\"1.0\"?><r><a>alpha</a><b>beta<c k=\"v\">"
-                                 "gamma</c></b><![CDATA[delta]]><!-- note --><a/></r>"));
-  // The text first, then the names and values the file uses, each once.
-  EXPECT_EQ(f["QUIXMDTextContent"], "alpha\nbeta\ngamma\ndelta\nnote\nr\na\nb\nc\nk\nv");
+                                 "<?xml version=\"1.0\"?><!DOCTYPE r PUBLIC \"-//Us//DTD R//EN\" "
+                                 "\"r.dtd\"><r><a>alpha</a><b>beta<c k=\"v\">gamma</c></b>"
+                                 "<![CDATA[delta]]><!-- note --><a/></r>"));
+  // The text first, then the document type and the names and values the file uses, each once.
+  EXPECT_EQ(f["QUIXMDTextContent"],
+            "alpha\nbeta\ngamma\ndelta\nnote\nr\nPUBLIC\n-//Us//DTD R//EN\nr.dtd\na\nb\nc\nk\nv");
   const Json::Value bomb =
       Run(ExtractXml, dir_.Write("lol.xml",
                                  "<?xml version=\"1.0\"?><!DOCTYPE d [<!ENTITY a \"aaaaaaaaaa\">"
