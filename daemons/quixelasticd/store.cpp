@@ -1004,8 +1004,17 @@ struct SearchSql {
   }
 };
 
+// A required name pattern drives the search: the planner, left to itself, may prefer reading a
+// large folder's rows by path and asking the trigram index about each one, which costs a whole
+// GLOB lookup per row.
+void JoinNames(SearchSql* q) {
+  static const std::string kDocs = " FROM docs d";
+  q->from = " FROM fts_name CROSS JOIN docs d ON d.rowid = fts_name.rowid" +
+            q->from.substr(kDocs.size());
+}
+
 void AddNameFilter(const std::string& name, SearchSql* q) {
-  q->from += " JOIN fts_name ON fts_name.rowid = d.rowid";
+  JoinNames(q);
   // The trigram index answers a GLOB from the trigrams of its literal runs and checks the
   // candidates against the folded names it holds; patterns under three characters scan them.
   const std::string glob = "*" + GlobLiteral(FoldName(name)) + "*";
@@ -1078,7 +1087,11 @@ SearchSql SearchSqlOf(const SearchParams& p) {
     // The name and keyword filters above join the same tables on the same row.
     if ((p.query->join == "fts_name" && name.empty()) ||
         (p.query->join == "fts_all" && !q.has_keywords())) {
-      q.from += " JOIN " + p.query->join + " ON " + p.query->join + ".rowid = d.rowid";
+      if (p.query->join == "fts_name") {
+        JoinNames(&q);
+      } else {
+        q.from += " JOIN " + p.query->join + " ON " + p.query->join + ".rowid = d.rowid";
+      }
     }
     q.where += " AND " + p.query->sql;
     for (const SqlValue& v : p.query->values) {
