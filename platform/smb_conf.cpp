@@ -132,7 +132,12 @@ class Reader {
     }
     const std::string key = FoldKey(text.substr(0, eq));
     if (key.empty()) Fail(where, "a value without a parameter name; write \"name = value\"");
-    const std::string value = Trim(text.substr(eq + 1));
+    // Samba keeps one space of every run of spaces in a value (tabs stay as written), so
+    // "/srv/my  docs" and a value continued on an indented line read as it does.
+    std::string value;
+    for (char c : Trim(text.substr(eq + 1))) {
+      if (c != ' ' || value.empty() || value.back() != ' ') value += c;
+    }
     if (key == "include" && follow_includes_) {
       Include(value, file, where);
       return;

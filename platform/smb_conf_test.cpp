@@ -3,6 +3,8 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <sstream>
+
 #include "common/error.hpp"
 #include "platform/share.hpp"
 #include "test/test_util.hpp"
@@ -15,6 +17,11 @@ std::vector<std::string> Names(const PlatformConfig& config) {
   std::vector<std::string> names;
   for (const ShareConfig& share : config.shares) names.push_back(share.name + "=" + share.path);
   return names;
+}
+
+std::string Lower(std::string s) {
+  for (char& c : s) c = static_cast<char>(tolower(static_cast<unsigned char>(c)));
+  return s;
 }
 
 bool AnyContains(const std::vector<std::string>& lines, const std::string& text) {
@@ -139,6 +146,28 @@ TEST_F(SambaSharesTest, IncludesHomesAndSambasSpellingsBecomeShares) {
   // platform.json, once written, wins over Samba's file.
   test::WritePlatformConfig(root_.path(), R"({"shares": [{"name": "a", "path": "/v/a"}]})");
   EXPECT_EQ(Names(*LoadPlatformConfig()), std::vector<std::string>{"a=/v/a"});
+}
+
+// Samba's own reader, through testparm, sees the same sections with the same paths.
+TEST_F(SambaSharesTest, SectionsAndPathsAgreeWithTestparm) {
+  const std::string inc = etc_.Write("inc.conf", "[Music]\n  read only = no\n[jazz]\n  path = /j/jazz\n");
+  const std::string main = etc_.Write("smb.conf", "; comment\n[global]\n  include = " + inc +
+                                                      "\n[music]\n  PATH = /srv/a b/music\n"
+                                                      "[Long Name]\n  path = /srv/\\\n   long  name\n"
+                                                      "#[commented]\n[jazz]\n  path = /k/jazz\n");
+  const test::ProgramResult tp = test::RunProgram("/usr/bin/testparm", {"-s", main});
+  ASSERT_EQ(tp.status, 0) << tp.err;
+  std::map<std::string, std::string> theirs;
+  std::string section;
+  std::istringstream lines(tp.out);
+  for (std::string line; std::getline(lines, line);) {
+    if (line.size() > 2 && line[0] == '[') section = Lower(line.substr(1, line.size() - 2));
+    if (section != "global" && line.rfind("\tpath = ", 0) == 0) theirs[section] = line.substr(8);
+  }
+  std::map<std::string, std::string> ours;
+  for (const SmbSection& s : ReadSmbConf(main).sections) ours[Lower(s.name)] = s.Find("path")->text;
+  EXPECT_EQ(ours, theirs);
+  EXPECT_EQ(ours.size(), 3u);
 }
 
 TEST_F(SambaSharesTest, BrokenFilesAreErrorsNamingFileAndLine) {
