@@ -251,13 +251,15 @@ class Doctor {
           share["volume_paused"].asBool()) {
         continue;
       }
+      // An idle worker with changes waiting since its last pass ended has stopped following;
+      // one before its first pass (in a daemon just started) has nothing to judge yet.
       if (worker == nullptr) {
         stale = true;
         Add("index", "problem",
             "share " + name + ": " + std::to_string(queued) +
                 " change(s) wait but fileindexd has no worker for it",
             "fileindexctl services prepare, then look at fileindexd's log");
-      } else if ((*worker)["state"].asString() == "idle" &&
+      } else if ((*worker)["state"].asString() == "idle" && (*worker)["last_pass"].asInt64() > 0 &&
                  now - (*worker)["last_pass"].asInt64() > kStaleSeconds) {
         stale = true;
         Add("index", "problem",
