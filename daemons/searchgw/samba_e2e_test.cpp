@@ -14,6 +14,7 @@
 #include <sys/time.h>
 #include <unistd.h>
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <chrono>
@@ -250,6 +251,7 @@ TEST_F(SambaSpotlightTest, MdsearchListsExactlyTheMatchingFilesOfARealShare) {
   // A name whose bytes are not UTF-8 beside one that is.
   WriteFile(S("caf\xe9_qqq.txt"), "latin");
   WriteFile(S("plain_qqq.txt"), "utf");
+  WriteFile(S("docs/Café_menu.txt"), "menu");
   const struct timeval old_times[2] = {{978307200, 0}, {978307200, 0}};  // 2001-01-01
   ASSERT_EQ(::utimes(S("old.txt").c_str(), old_times), 0);
 
@@ -294,6 +296,11 @@ TEST_F(SambaSpotlightTest, MdsearchListsExactlyTheMatchingFilesOfARealShare) {
   EXPECT_EQ(
       Mdsearch("kMDItemFSContentChangeDate<$time.iso(2010-01-01T00:00:00Z)"),
       OnDisk([](const std::string&, const struct stat& st) { return st.st_mtime < 1262304000; }));
+  // Names in any case, with or without their accents.
+  // The client prints the name decomposed (an "e" and a combining accent).
+  EXPECT_THAT(Mdsearch("kMDItemDisplayName==\"*CAFE*\""),
+              ::testing::AnyOf(::testing::ElementsAre("docs/Café_menu.txt"),
+                               ::testing::ElementsAre("docs/Cafe\u0301_menu.txt")));
   // Members of the documents: an image's pixel size, a whole path.
   EXPECT_EQ(Mdsearch("kMDItemPixelWidth==\"40\" && kMDItemPixelHeight<\"100\""),
             (std::set<std::string>{"docs/pic.png"}));
