@@ -2,6 +2,8 @@
 
 #include <algorithm>
 #include <cctype>
+#include <cstring>
+#include <memory>
 #include <optional>
 #include <set>
 
@@ -77,6 +79,12 @@ std::string NamesOf(const FieldColumn (&fields)[N]) {
   return out;
 }
 
+// Where a path range reads the path column. A joined pattern must drive the search: offered
+// a path range too, the planner prefers it (a share's range holds every row) and looks the
+// pattern up row by row, which over a million rows takes minutes. A unary plus keeps the range
+// from being offered to the index; it is still checked on the rows the pattern finds.
+const char kPathRef[] = "{path}";
+
 // The most rows of a folder counted to learn the span of their row ids (see NarrowToFolder).
 constexpr int64_t kFolderSpanRows = 5000;
 
@@ -129,10 +137,18 @@ std::string EscapeLikeText(const std::string& s) {
 
 class Compiler {
  public:
+  // `by_folder`: for a small folder, whose rows the path index gives at once; each name is
+  // then checked on the row at hand rather than looked up by its trigrams.
+  explicit Compiler(bool by_folder) : by_folder_(by_folder) {}
+
   SqlCondition Run(const Json::Value& tree) {
     if (!tree.isObject()) Refuse("must be an object");
     SqlCondition c;
     c.sql = Node(tree, 1, true);
+    const std::string path = join_.empty() ? "d.path" : "+d.path";
+    for (size_t at = c.sql.find(kPathRef); at != std::string::npos; at = c.sql.find(kPathRef, at)) {
+      c.sql.replace(at, std::strlen(kPathRef), path);
+    }
     c.values = std::move(values_);
     c.join = join_;
     c.folder = folder_;
@@ -216,7 +232,8 @@ class Compiler {
     }
     if (field == "path") return PathMatch(pattern.asString());
     // A full-text MATCH may not stand under OR or NOT: only a required pattern is joined.
-    const bool joined = required && join_.empty() && field != "any";
+    const bool joined =
+        required && join_.empty() && field != "any" && !(by_folder_ && field == "name");
     if (joined) join_ = field == "name" ? "fts_name" : "fts_all";
     if (field == "name") return NameMatch(pattern.asString(), joined);
     if (field == "content") return ContentCondition(pattern.asString(), joined);
@@ -234,6 +251,7 @@ class Compiler {
   std::string NameMatch(const std::string& pattern, bool joined) {
     const std::string glob = GlobLiteral(FoldName(EncodeName(pattern)), true);
     Text(glob);
+    if (by_folder_) return "((SELECT name FROM fts_name WHERE fts_name.rowid = d.rowid) GLOB ?)";
     const std::string sql = NameGlobCondition(glob);
     return joined ? "(" + sql + ")" : "d.rowid IN (SELECT rowid FROM fts_name WHERE " + sql + ")";
   }
@@ -277,12 +295,12 @@ class Compiler {
         glob += c;
       }
     }
-    std::string sql = "(d.path GLOB ?";
+    std::string sql = std::string("(") + kPathRef + " GLOB ?";
     Text(glob);
     const std::string prefix = path.substr(0, path.find('*'));
     const std::optional<std::string> upper = PrefixUpperBound(prefix);
     if (!prefix.empty() && upper) {
-      sql += " AND d.path >= ? AND d.path < ?";
+      sql += std::string(" AND ") + kPathRef + " >= ? AND " + kPathRef + " < ?";
       Text(prefix);
       Text(*upper);
     }
@@ -378,10 +396,12 @@ class Compiler {
     const std::string under = folder == "/" ? "/" : folder + "/";
     const std::string upper = *PrefixUpperBound(under);
     for (const std::string& v : {folder, under, upper, folder, under, upper}) Text(v);
-    return "(d.path = ? OR (d.path >= ? AND d.path < ? AND (d.ancestor = ? OR"
+    const std::string path = kPathRef;
+    return "(" + path + " = ? OR (" + path + " >= ? AND " + path + " < ? AND (d.ancestor = ? OR"
            " (d.ancestor >= ? AND d.ancestor < ?))))";
   }
 
+  const bool by_folder_;
   int nodes_ = 0;
   std::vector<SqlValue> values_;
   std::string join_;
@@ -390,16 +410,23 @@ class Compiler {
 
 }  // namespace
 
-SqlCondition CompileQueryTree(const Json::Value& tree) { return Compiler().Run(tree); }
+SqlCondition CompileQueryTree(const Json::Value& tree) {
+  SqlCondition c = Compiler(false).Run(tree);
+  if (!c.folder.empty() && !c.join.empty()) {
+    c.by_folder = std::make_shared<const SqlCondition>(Compiler(true).Run(tree));
+  }
+  return c;
+}
 
 SqlCondition NarrowToFolder(Db& db, const SqlCondition& c) {
-  if (c.folder.empty() || c.join.empty()) return c;
+  if (!c.by_folder) return c;
   const std::string under = c.folder == "/" ? "/" : c.folder + "/";
   Stmt span(db, "SELECT count(*), min(rowid), max(rowid) FROM"
                 " (SELECT rowid FROM docs WHERE path >= ? AND path < ? LIMIT ?)");
   span.Bind(1, under).Bind(2, *PrefixUpperBound(under)).Bind(3, kFolderSpanRows);
   if (!span.Step() || span.Int(0) >= kFolderSpanRows) return c;
-  SqlCondition narrowed = c;
+  SqlCondition narrowed = *c.by_folder;
+  if (narrowed.join.empty()) return narrowed;
   SqlValue low, high;
   low.kind = high.kind = SqlValue::Kind::kInt;
   // An empty folder: a span no row id is in (row ids start at 1).
@@ -412,7 +439,7 @@ SqlCondition NarrowToFolder(Db& db, const SqlCondition& c) {
     low.integer = span.Int(0) == 0 ? self.Int(0) : std::min(low.integer, self.Int(0));
     high.integer = std::max(high.integer, self.Int(0));
   }
-  narrowed.sql = "(" + c.sql + " AND " + c.join + ".rowid BETWEEN ? AND ?)";
+  narrowed.sql = "(" + narrowed.sql + " AND " + narrowed.join + ".rowid BETWEEN ? AND ?)";
   narrowed.values.push_back(low);
   narrowed.values.push_back(high);
   return narrowed;

@@ -7,6 +7,7 @@
 #include <json/json.h>
 
 #include <cstdint>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -32,6 +33,9 @@ struct SqlCondition {
   std::string join;
   // The folder every hit lies at or below, when the tree has one; empty otherwise.
   std::string folder;
+  // With a folder and a joined pattern: the same condition for a small folder, its rows read
+  // by the path index, names checked on each row, a joined content pattern kept.
+  std::shared_ptr<const SqlCondition> by_folder;
 };
 
 // Limits of a tree: deeper or larger ones are refused before anything runs.
@@ -46,8 +50,9 @@ class Db;
 
 // `c` as it is best run on `db`. A joined pattern is read from all of its matches, a common
 // word's tens of thousands, though the folder the hits must lie in may hold a few hundred
-// rows: when the folder is small, the joined table is told the span of the folder's row ids,
-// which it skips to. Costs one bounded read of the path index.
+// rows: when the folder is small, its rows are read instead (by_folder), and a joined content
+// pattern is told the span of the folder's row ids, which it skips to. Costs one bounded read
+// of the path index.
 SqlCondition NarrowToFolder(Db& db, const SqlCondition& c);
 
 }  // namespace elasticd

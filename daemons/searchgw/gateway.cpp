@@ -208,8 +208,7 @@ std::optional<Failure> Gateway::Impl::Engine(uid_t uid, const Json::Value& query
     case kCodeOverloaded:
       return Failure{http::status::too_many_requests, "es_rejected_execution_exception", msg};
     case kCodeSearchTooLong:
-      return Failure{http::status::gateway_timeout, "search_timeout_exception",
-                     msg + ": narrow the search (a longer name part, a folder)"};
+      return Failure{http::status::gateway_timeout, "search_timeout_exception", msg};
     default:
       return Failure{http::status::service_unavailable, "unavailable_shards_exception",
                      "the search engine answered " + std::to_string(code) + ": " + msg};
