@@ -23,8 +23,8 @@ find "$tree" -type f -print0 >"$scratch/files"
 files=$(tr -cd '\0' <"$scratch/files" | wc -c)
 
 # The helper may write no file, so its replies go through a pipe and what the format libraries
-# print on its standard error goes to /dev/null.
-/usr/bin/time -f '%e %U %S %M' -o "$scratch/time" "$helper" <"$scratch/files" 2>/dev/null |
+# print on its standard error goes to /dev/null. It runs with the environment the indexer gives it.
+/usr/bin/time -f '%e %U %S %M' -o "$scratch/time" env OMP_THREAD_LIMIT=1 "$helper" <"$scratch/files" 2>/dev/null |
   cat >"$scratch/replies"
 read -r wall user sys rss <"$scratch/time"
 

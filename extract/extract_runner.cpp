@@ -18,6 +18,7 @@
 #include <memory>
 #include <mutex>
 #include <thread>
+#include <vector>
 
 #include "common/fd.hpp"
 #include "common/json_util.hpp"
@@ -131,8 +132,17 @@ std::unique_ptr<Helper> Helper::Start(const std::string& program, std::string* e
   posix_spawnattr_setflags(&attr,
                            POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF | POSIX_SPAWN_SETPGROUP);
   char* argv[] = {const_cast<char*>("fileindex-extract"), nullptr};
+  // Text recognition parallelises through OpenMP, whose idle threads spin between the small
+  // regions it runs: in a helper that reads one file at a time beside others that spin cost
+  // more CPU than all the rest of extraction, so the helper runs them on its own thread.
+  std::vector<char*> env;
+  for (char** e = environ; *e != nullptr; ++e) {
+    if (std::strncmp(*e, "OMP_THREAD_LIMIT=", 17) != 0) env.push_back(*e);
+  }
+  env.push_back(const_cast<char*>("OMP_THREAD_LIMIT=1"));
+  env.push_back(nullptr);
   pid_t pid = -1;
-  const int rc = posix_spawn(&pid, program.c_str(), &actions, &attr, argv, environ);
+  const int rc = posix_spawn(&pid, program.c_str(), &actions, &attr, argv, env.data());
   posix_spawnattr_destroy(&attr);
   posix_spawn_file_actions_destroy(&actions);
   if (rc != 0) {
