@@ -4,6 +4,7 @@
 // own file server) serves the share to the real mdsearch client as a throwaway local user.
 #include <arpa/inet.h>
 #include <dirent.h>
+#include <fcntl.h>
 #include <net/if.h>
 #include <netinet/in.h>
 #include <sched.h>
@@ -74,8 +75,13 @@ std::vector<pid_t> ProcessesNaming(const std::string& needle) {
   for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
     const std::string name = entry.path().filename();
     if (name.find_first_not_of("0123456789") != std::string::npos) continue;
-    std::ifstream in(entry.path() / "cmdline");
-    std::string cmdline((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    // Read with plain calls: a process that ends meanwhile makes the read fail (ESRCH), which
+    // a stream would throw out of the iterator.
+    std::string cmdline;
+    UniqueFd fd(::open((entry.path() / "cmdline").c_str(), O_RDONLY | O_CLOEXEC));
+    char buf[4096];
+    ssize_t n = 0;
+    while (fd.valid() && (n = ::read(fd.get(), buf, sizeof buf)) > 0) cmdline.append(buf, n);
     if (cmdline.find(needle) != std::string::npos) pids.push_back(std::stoi(name));
   }
   return pids;
