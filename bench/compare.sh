@@ -314,13 +314,13 @@ ours_run() {
   # GNU time over each daemon gives the peak of the daemon and of the helpers it started.
   daemon_time() { exec /usr/bin/time -f '%M' -o "$ORVANE_ROOT/$(basename "$1").time" "$@"; }
   fi_start_daemons daemon_time
-  for d in "${fi_daemons[@]}"; do
+  for d in "${fi_indexing_daemons[@]}"; do
     for _ in $(seq 50); do pid=$(fi_daemon_pid "$d"); [ -n "$pid" ] && break; sleep 0.1; done
     [ -n "$pid" ] || { echo "compare: $d did not start; see $(fi_log_dir)" >&2; exit 1; }
     pids[$d]=$pid
   done
   local -A ticks
-  for d in "${fi_daemons[@]}"; do ticks[$d]=$((-$(cpu_ticks "${pids[$d]}"))); done
+  for d in "${fi_indexing_daemons[@]}"; do ticks[$d]=$((-$(cpu_ticks "${pids[$d]}"))); done
 
   echo "== this system ($mode): folder add, then waiting until indexing is idle"
   local t0 t1
@@ -333,7 +333,7 @@ ours_run() {
   # child of fileindexd and is read here too.
   local -A hwm
   local helper_hwm=0 child
-  for d in "${fi_daemons[@]}"; do
+  for d in "${fi_indexing_daemons[@]}"; do
     hwm[$d]=$(vm_hwm "${pids[$d]}")
     ticks[$d]=$((ticks[$d] + $(cpu_ticks "${pids[$d]}")))
   done
@@ -369,7 +369,7 @@ ours_run() {
 
   local mem="" cpu="" all=0 hz
   hz=$(getconf CLK_TCK)
-  for d in "${fi_daemons[@]}"; do
+  for d in "${fi_indexing_daemons[@]}"; do
     mem+="${mem:+, }$d $(mib "${hwm[$d]}")"
     cpu+="${cpu:+, }$d $(awk -v t="${ticks[$d]}" -v hz="$hz" 'BEGIN { printf "%.1f", t / hz }')"
     [ "$d" = fileindexd ] && cpu+=" with its helpers"

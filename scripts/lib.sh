@@ -4,7 +4,9 @@
 
 fi_top=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 fi_bin=$fi_top/build
-fi_daemons=(quixelasticd fileindexd quixnotifyd searchgw)
+# The three that index, which fi_start_daemons starts, and every daemon the quick start may run.
+fi_indexing_daemons=(quixelasticd fileindexd quixnotifyd)
+fi_daemons=("${fi_indexing_daemons[@]}" searchgw)
 
 # fi_become_root SCRIPT [ARGS...]: the library saves its configuration as root, so a script run
 # by another user runs itself again through sudo (keeping ORVANE_ROOT and the scripts' own
