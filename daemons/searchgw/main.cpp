@@ -14,6 +14,7 @@
 #include "common/log.hpp"
 #include "common/root.hpp"
 #include "common/wire.hpp"
+#include "daemons/http/flags.hpp"
 #include "daemons/searchgw/gateway.hpp"
 #include "platform/daemon_start.hpp"
 
@@ -32,54 +33,32 @@ struct Flags {
   orvane::searchgw::GatewayOptions gateway;
 };
 
-bool ParseNumber(const char* text, long long min, long long max, long long* out) {
-  char* end = nullptr;
-  errno = 0;
-  const long long v = std::strtoll(text, &end, 10);
-  if (errno != 0 || end == text || *end != '\0' || v < min || v > max) return false;
-  *out = v;
-  return true;
-}
-
 bool ParseFlags(int argc, char** argv, Flags* f) {
   orvane::searchgw::GatewayOptions& g = f->gateway;
-  for (int i = 1; i < argc; ++i) {
-    const std::string arg = argv[i];
-    const char* next = i + 1 < argc ? argv[i + 1] : nullptr;
-    auto text = [&](std::string* out) {
-      if (next == nullptr) return false;
-      *out = next;
-      ++i;
-      return true;
-    };
-    auto number = [&](long long min, long long max, auto* out) {
-      long long v = 0;
-      if (next == nullptr || !ParseNumber(next, min, max, &v)) return false;
-      *out = static_cast<std::remove_pointer_t<decltype(out)>>(v);
-      ++i;
-      return true;
-    };
+  orvane::httpd::FlagArgs args(argc, argv);
+  for (const char* option = args.Next(); option != nullptr; option = args.Next()) {
+    const std::string arg = option;
     bool ok = true;
     if (arg == "--foreground")
       f->foreground = true;
     else if (arg == "--address")
-      ok = text(&g.address);
+      ok = args.Text(&g.address);
     else if (arg == "--port")
-      ok = number(0, 65535, &g.port);
+      ok = args.Number(0, 65535, &g.port);
     else if (arg == "--engine-socket")
-      ok = text(&f->engine_socket);
+      ok = args.Text(&f->engine_socket);
     else if (arg == "--pid-file")
-      ok = text(&f->pid_file);
+      ok = args.Text(&f->pid_file);
     else if (arg == "--threads")
-      ok = number(1, 64, &g.threads);
+      ok = args.Number(1, 64, &g.threads);
     else if (arg == "--max-connections")
-      ok = number(1, 100000, &g.max_connections);
+      ok = args.Number(1, 100000, &g.max_connections);
     else if (arg == "--max-connections-per-user")
-      ok = number(1, 100000, &g.max_connections_per_user);
+      ok = args.Number(1, 100000, &g.max_connections_per_user);
     else if (arg == "--idle-timeout-ms")
-      ok = number(1, 86400000, &g.idle_timeout_ms);
+      ok = args.Number(1, 86400000, &g.idle_timeout_ms);
     else if (arg == "--request-timeout-ms")
-      ok = number(1, 600000, &g.request_timeout_ms);
+      ok = args.Number(1, 600000, &g.request_timeout_ms);
     else
       ok = false;
     if (!ok) {

@@ -8,12 +8,12 @@
 #include <cstdlib>
 #include <iostream>
 #include <string>
-#include <type_traits>
 
 #include "common/error.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
 #include "common/wire.hpp"
+#include "daemons/http/flags.hpp"
 #include "daemons/http/server.hpp"
 #include "daemons/webd/web_app.hpp"
 #include "platform/daemon_start.hpp"
@@ -36,33 +36,11 @@ struct Flags {
   orvane::webd::WebOptions web;
 };
 
-bool ParseNumber(const char* text, long long min, long long max, long long* out) {
-  char* end = nullptr;
-  errno = 0;
-  const long long v = std::strtoll(text, &end, 10);
-  if (errno != 0 || end == text || *end != '\0' || v < min || v > max) return false;
-  *out = v;
-  return true;
-}
-
 bool ParseFlags(int argc, char** argv, Flags* f) {
   orvane::httpd::ServerOptions& s = f->server;
-  for (int i = 1; i < argc; ++i) {
-    const std::string arg = argv[i];
-    const char* next = i + 1 < argc ? argv[i + 1] : nullptr;
-    auto text = [&](std::string* out) {
-      if (next == nullptr) return false;
-      *out = next;
-      ++i;
-      return true;
-    };
-    auto number = [&](long long min, long long max, auto* out) {
-      long long v = 0;
-      if (next == nullptr || !ParseNumber(next, min, max, &v)) return false;
-      *out = static_cast<std::remove_pointer_t<decltype(out)>>(v);
-      ++i;
-      return true;
-    };
+  orvane::httpd::FlagArgs args(argc, argv);
+  for (const char* option = args.Next(); option != nullptr; option = args.Next()) {
+    const std::string arg = option;
     bool ok = true;
     long long minutes = 0;
     if (arg == "--foreground") {
@@ -70,32 +48,32 @@ bool ParseFlags(int argc, char** argv, Flags* f) {
     } else if (arg == "--plain-http-beyond-loopback") {
       f->plain_beyond_loopback = true;
     } else if (arg == "--address") {
-      ok = text(&s.address);
+      ok = args.Text(&s.address);
     } else if (arg == "--port") {
-      ok = number(0, 65535, &s.port);
+      ok = args.Number(0, 65535, &s.port);
     } else if (arg == "--tls-certificate") {
-      ok = text(&s.tls_certificate);
+      ok = args.Text(&s.tls_certificate);
     } else if (arg == "--www") {
-      ok = text(&f->web.www_dir);
+      ok = args.Text(&f->web.www_dir);
     } else if (arg == "--pam-service") {
-      ok = text(&f->web.pam.name);
+      ok = args.Text(&f->web.pam.name);
     } else if (arg == "--pam-dir") {
-      ok = text(&f->web.pam.dir);
+      ok = args.Text(&f->web.pam.dir);
     } else if (arg == "--engine-socket") {
-      ok = text(&f->engine_socket);
+      ok = args.Text(&f->engine_socket);
     } else if (arg == "--pid-file") {
-      ok = text(&f->pid_file);
+      ok = args.Text(&f->pid_file);
     } else if (arg == "--threads") {
-      ok = number(1, 64, &s.threads);
+      ok = args.Number(1, 64, &s.threads);
     } else if (arg == "--max-connections") {
-      ok = number(1, 100000, &s.max_connections);
+      ok = args.Number(1, 100000, &s.max_connections);
     } else if (arg == "--max-connections-per-user") {
-      ok = number(1, 100000, &s.max_connections_per_user);
+      ok = args.Number(1, 100000, &s.max_connections_per_user);
     } else if (arg == "--session-idle-minutes") {
-      ok = number(1, 7 * 24 * 60, &minutes);
+      ok = args.Number(1, 7 * 24 * 60, &minutes);
       f->web.session_idle_seconds = minutes * 60;
     } else if (arg == "--session-hours") {
-      ok = number(1, 24 * 365, &minutes);
+      ok = args.Number(1, 24 * 365, &minutes);
       f->web.session_life_seconds = minutes * 3600;
     } else {
       ok = false;
