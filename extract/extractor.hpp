@@ -9,6 +9,7 @@
 #include <sys/types.h>
 
 #include <cstddef>
+#include <functional>
 #include <map>
 #include <string>
 
@@ -86,6 +87,12 @@ class TextSink {
 
 // Sets `key` to `value` trimmed and cleaned, unless that leaves nothing.
 void SetText(Json::Value& fields, const std::string& key, const std::string& value);
+
+// Reads a zip's members one after the other; `visit` gets the name and the first `max_bytes`
+// bytes of each member `want` selects, and stops the walk by returning false.
+void ForEachZipMember(const OpenedFile& file, size_t max_bytes,
+                      const std::function<bool(const std::string&)>& want,
+                      const std::function<bool(const std::string&, std::string&)>& visit);
 
 // Reads the members of a zip file that `want` selects, in archive order.
 std::map<std::string, std::string> ReadZipMembers(const OpenedFile& file,

@@ -1,10 +1,7 @@
 #include "extract/html.hpp"
 
-#include <archive.h>
-#include <archive_entry.h>
 #include <libxml/HTMLparser.h>
 #include <libxml/xmlreader.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cstring>
@@ -195,34 +192,6 @@ void SetBody(TextSink& sink, Json::Value& fields) {
 }
 
 // ---- EPUB
-
-// Reads the zip's members one after the other; `visit` gets each name and, when it asks for them
-// (returns true from `want`), the member's bytes, up to `max_bytes`. Stops when `visit` returns
-// false.
-template <typename Want, typename Visit>
-void ForEachZipMember(const OpenedFile& file, size_t max_bytes, Want want, Visit visit) {
-  std::unique_ptr<struct archive, int (*)(struct archive*)> zip(archive_read_new(),
-                                                                archive_read_free);
-  archive_read_support_format_zip(zip.get());
-  if (lseek(file.fd(), 0, SEEK_SET) != 0 ||
-      archive_read_open_fd(zip.get(), file.fd(), 65536) != ARCHIVE_OK) {
-    Fail(std::string("not a readable zip: ") + archive_error_string(zip.get()));
-  }
-  struct archive_entry* entry;
-  while (archive_read_next_header(zip.get(), &entry) == ARCHIVE_OK) {
-    const char* name = archive_entry_pathname(entry);
-    if (name == nullptr || !want(std::string(name))) continue;
-    std::string data;
-    char buf[65536];
-    for (;;) {
-      const la_ssize_t n = archive_read_data(zip.get(), buf, sizeof(buf));
-      if (n < 0) Fail(std::string("damaged book member: ") + name);
-      if (n == 0 || data.size() >= max_bytes) break;
-      data.append(buf, std::min(static_cast<size_t>(n), max_bytes - data.size()));
-    }
-    if (!visit(std::string(name), data)) return;
-  }
-}
 
 std::string PercentDecoded(const std::string& s) {
   std::string out;

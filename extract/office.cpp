@@ -13,9 +13,9 @@
 namespace orvane {
 namespace extract {
 
-// Reads the members of a zip file that `want` selects, in archive order.
-std::map<std::string, std::string> ReadZipMembers(const OpenedFile& file,
-                                                  bool (*want)(const std::string&)) {
+void ForEachZipMember(const OpenedFile& file, size_t max_bytes,
+                      const std::function<bool(const std::string&)>& want,
+                      const std::function<bool(const std::string&, std::string&)>& visit) {
   std::unique_ptr<struct archive, int (*)(struct archive*)> zip(archive_read_new(),
                                                                 archive_read_free);
   archive_read_support_format_zip(zip.get());
@@ -23,7 +23,6 @@ std::map<std::string, std::string> ReadZipMembers(const OpenedFile& file,
       archive_read_open_fd(zip.get(), file.fd(), 65536) != ARCHIVE_OK) {
     Fail(std::string("not a readable zip: ") + archive_error_string(zip.get()));
   }
-  std::map<std::string, std::string> members;
   struct archive_entry* entry;
   while (archive_read_next_header(zip.get(), &entry) == ARCHIVE_OK) {
     const char* name = archive_entry_pathname(entry);
@@ -33,11 +32,21 @@ std::map<std::string, std::string> ReadZipMembers(const OpenedFile& file,
     for (;;) {
       const la_ssize_t n = archive_read_data(zip.get(), buf, sizeof(buf));
       if (n < 0) Fail(std::string("damaged zip member: ") + name);
-      if (n == 0 || data.size() >= kMaxMemberBytes) break;
-      data.append(buf, static_cast<size_t>(n));
+      if (n == 0 || data.size() >= max_bytes) break;
+      data.append(buf, std::min(static_cast<size_t>(n), max_bytes - data.size()));
     }
-    members[name] = std::move(data);
+    if (!visit(name, data)) return;
   }
+}
+
+std::map<std::string, std::string> ReadZipMembers(const OpenedFile& file,
+                                                  bool (*want)(const std::string&)) {
+  std::map<std::string, std::string> members;
+  ForEachZipMember(file, kMaxMemberBytes, want,
+                   [&members](const std::string& name, std::string& data) {
+                     members[name] = std::move(data);
+                     return true;
+                   });
   return members;
 }
 
