@@ -17,6 +17,7 @@ packages=(
   gzip bzip2 xz-utils zstd lz4 zip p7zip-full cpio binutils
   samba smbclient
   libsystemd-dev libseccomp-dev
+  postgresql-15 postgresql-contrib libpq-dev
   debhelper dpkg-dev fakeroot lintian pandoc systemd bash-completion
 )
 

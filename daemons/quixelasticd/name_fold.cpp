@@ -52,6 +52,19 @@ class Folder {
     return std::move(out.folded);
   }
 
+  std::vector<std::string> Words(const std::string& text) {
+    std::vector<std::string> words;
+    std::lock_guard<std::mutex> lock(mu_);
+    module_.xTokenize(tok_, &words, FTS5_TOKENIZE_DOCUMENT, text.data(),
+                      static_cast<int>(text.size()),
+                      [](void* ctx, int, const char* token, int n, int, int) {
+                        static_cast<std::vector<std::string>*>(ctx)->emplace_back(
+                            token, static_cast<size_t>(n));
+                        return SQLITE_OK;
+                      });
+    return words;
+  }
+
  private:
   struct Out {
     const std::string* text;
@@ -87,12 +100,16 @@ class Folder {
   std::mutex mu_;
 };
 
+Folder& TheFolder() {
+  static Folder folder;
+  return folder;
+}
+
 }  // namespace
 
-std::string FoldName(const std::string& text) {
-  static Folder folder;
-  return folder.Fold(text);
-}
+std::string FoldName(const std::string& text) { return TheFolder().Fold(text); }
+
+std::vector<std::string> FoldWords(const std::string& text) { return TheFolder().Words(text); }
 
 std::string GlobLiteral(const std::string& text, bool stars) {
   std::string out;

@@ -6,6 +6,7 @@
 #define ORVANE_DAEMONS_QUIXELASTICD_NAME_FOLD_HPP_
 
 #include <string>
+#include <vector>
 
 namespace orvane {
 namespace elasticd {
@@ -13,6 +14,9 @@ namespace elasticd {
 // `text` is UTF-8 (names in their written form). Throws StoreError when SQLite's tokenizer
 // cannot be had, which only a broken SQLite build causes.
 std::string FoldName(const std::string& text);
+
+// The words of `text` (UTF-8) in order, folded as the word index folds them.
+std::vector<std::string> FoldWords(const std::string& text);
 
 // `text` as a GLOB pattern that matches it literally ('?' and '[' in brackets, and '*' too
 // unless `stars` keeps them as wildcards).

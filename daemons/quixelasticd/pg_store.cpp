@@ -1,0 +1,815 @@
+#include "daemons/quixelasticd/pg_store.hpp"
+
+#include <syslog.h>
+
+#include <algorithm>
+#include <cctype>
+#include <unordered_map>
+
+#include "common/json_util.hpp"
+#include "common/log.hpp"
+#include "common/name_codec.hpp"
+#include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/name_fold.hpp"
+#include "daemons/quixelasticd/snippet.hpp"
+
+namespace orvane {
+namespace elasticd {
+
+namespace {
+
+// The shared tables. `fi_docs` is partitioned by the index's number: each index is a
+// partition of its own, made and dropped with the index, so a whole index goes at once and a
+// search of one index reads one partition. Paths are kept as bytes (file names need not be
+// UTF-8) and ordered as the disk's bytes; `fname` holds the folded names in their written
+// form, `words` the folded words of the catch-all text with their positions.
+const char kSchemaSql[] =
+    "CREATE EXTENSION IF NOT EXISTS pg_trgm;"
+    "CREATE TABLE IF NOT EXISTS fi_indexes(part serial PRIMARY KEY, server text NOT NULL,"
+    " id text NOT NULL, UNIQUE(server, id));"
+    "CREATE TABLE IF NOT EXISTS fi_meta(part int NOT NULL REFERENCES fi_indexes ON DELETE"
+    " CASCADE, key text NOT NULL, value text NOT NULL, PRIMARY KEY(part, key));"
+    "CREATE TABLE IF NOT EXISTS fi_docs(part int NOT NULL, path bytea NOT NULL,"
+    " fname text NOT NULL, ext text NOT NULL, size bigint NOT NULL, mtime bigint NOT NULL,"
+    " is_dir boolean NOT NULL, anc bytea NOT NULL, words tsvector, doc bytea NOT NULL,"
+    " PRIMARY KEY(part, path)) PARTITION BY LIST (part);"
+    "CREATE INDEX IF NOT EXISTS fi_docs_fname ON fi_docs USING gin (fname gin_trgm_ops);"
+    "CREATE INDEX IF NOT EXISTS fi_docs_words ON fi_docs USING gin (words);";
+
+// Held while the shared tables are made or an index is added or dropped, so that daemons
+// sharing the database do not trip over each other's DDL.
+const char kSchemaLock[] = "SELECT pg_advisory_xact_lock(7415011)";
+
+// The columns a write sets, in the order WriteRows binds them.
+const char kRowColumns[] = "part, path, fname, ext, size, mtime, is_dir, anc, words, doc";
+constexpr int kRowParams = 9;  // all but the partition number, which is part of the statement
+// Rows of one INSERT: PostgreSQL takes at most 65535 parameters in a statement.
+constexpr size_t kRowsPerStatement = 1000;
+
+// Limits of a word vector: longer words are refused by the server, more positions are dropped.
+constexpr size_t kMaxWordBytes = 2046;
+constexpr size_t kMaxPositions = 256;
+constexpr int kMaxPosition = 16383;
+constexpr size_t kMaxVectorBytes = 900 * 1024;
+
+// Rows a search with a permission filter fetches at a time.
+constexpr int kFetchRows = 500;
+// Documents holding a prefix whose words are counted for suggestions.
+constexpr int kSuggestSampleDocs = 5000;
+
+std::string EscapeLike(const std::string& s) {
+  std::string out;
+  for (char c : s) {
+    if (c == '%' || c == '_' || c == '\\') out += '\\';
+    out += c;
+  }
+  return out;
+}
+
+// A lexeme quoted for the text form of a word vector or a query.
+std::string Lexeme(const std::string& word) {
+  std::string out = "'";
+  for (char c : word) {
+    if (c == '\'' || c == '\\') out += c;
+    out += c;
+  }
+  return out + "'";
+}
+
+// The text form of the word vector of `text` (UTF-8): every folded word with its positions;
+// empty when there are none.
+std::string WordVector(const std::string& text) {
+  std::unordered_map<std::string, std::vector<int>> positions;
+  std::vector<const std::string*> order;
+  int pos = 0;
+  size_t bytes = 0;
+  for (std::string& w : FoldWords(text)) {
+    pos = std::min(pos + 1, kMaxPosition);
+    if (w.size() > kMaxWordBytes) continue;
+    auto it = positions.find(w);
+    if (it == positions.end()) {
+      if (bytes + w.size() > kMaxVectorBytes) continue;
+      bytes += w.size() + 8;
+      it = positions.emplace(std::move(w), std::vector<int>()).first;
+      order.push_back(&it->first);
+    }
+    if (it->second.size() < kMaxPositions) it->second.push_back(pos);
+  }
+  std::string out;
+  for (const std::string* w : order) {
+    if (!out.empty()) out += ' ';
+    out += Lexeme(*w);
+    char sep = ':';
+    for (int p : positions[*w]) {
+      out += sep;
+      out += std::to_string(p);
+      sep = ',';
+    }
+  }
+  return out;
+}
+
+// The keywords of a search, split on white space; a keyword's trailing '*' makes it a prefix.
+struct Keyword {
+  std::string text;
+  bool prefix;
+};
+
+std::vector<Keyword> KeywordsOf(const std::string& keywords) {
+  std::vector<Keyword> out;
+  size_t i = 0;
+  while (i < keywords.size()) {
+    while (i < keywords.size() && std::isspace(static_cast<unsigned char>(keywords[i]))) ++i;
+    size_t j = i;
+    while (j < keywords.size() && !std::isspace(static_cast<unsigned char>(keywords[j]))) ++j;
+    std::string word = keywords.substr(i, j - i);
+    i = j;
+    bool prefix = false;
+    while (!word.empty() && word.back() == '*') {
+      word.pop_back();
+      prefix = true;
+    }
+    if (!word.empty()) out.push_back({std::move(word), prefix});
+  }
+  return out;
+}
+
+// The same keywords for the in-memory word index snippets are made with.
+std::string SnippetMatch(const std::string& keywords) {
+  std::string out;
+  for (const Keyword& k : KeywordsOf(keywords)) {
+    std::string quoted = "\"";
+    for (char c : k.text) {
+      if (c == '"') quoted += '"';
+      quoted += c;
+    }
+    if (!out.empty()) out += ' ';
+    out += quoted + (k.prefix ? "\"*" : "\"");
+  }
+  return out;
+}
+
+Json::Value ParseDoc(const std::string& text) {
+  JsonValue v;
+  if (!v.fromString(text) || !v.isObject()) {
+    throw StoreError(SQLITE_CORRUPT, "stored document is not a JSON object");
+  }
+  return v;
+}
+
+// A field's value as the document queries compare it: the text of a string or a number, 1 or
+// 0 for a flag, the JSON text of anything else; false when the document has no such field.
+bool QueryText(const Json::Value& doc, const std::string& field, std::string* text) {
+  const Json::Value* v = doc.find(field.data(), field.data() + field.size());
+  if (v == nullptr || v->isNull()) return false;
+  if (v->isString()) {
+    *text = v->asString();
+  } else if (v->isBool()) {
+    *text = v->asBool() ? "1" : "0";
+  } else if (v->type() == Json::intValue || v->type() == Json::uintValue) {
+    *text = v->type() == Json::intValue ? std::to_string(v->asInt64())
+                                        : std::to_string(v->asUInt64());
+  } else {
+    *text = JsonToString(*v);
+  }
+  return true;
+}
+
+// A statement being built: its conditions and the values of its $n marks.
+struct Sql {
+  std::string where;
+  PgParams params;
+
+  std::string Next() { return "$" + std::to_string(params.size()); }
+  std::string Text(const std::string& v) {
+    params.Text(v);
+    return Next();
+  }
+  std::string Bytes(const std::string& v) {
+    params.Bytes(v);
+    return Next();
+  }
+  std::string Int(int64_t v) {
+    params.Int(v);
+    return Next();
+  }
+  void And(const std::string& cond) { where += " AND " + cond; }
+};
+
+// The condition of a document query; `scan` when it tests a field without a column, which is
+// then read from every document.
+struct DocWhere {
+  bool scan = false;
+  const DocQuery* query = nullptr;
+
+  bool Matches(const Json::Value& doc) const {
+    std::string text;
+    if (!QueryText(doc, query->field, &text)) return false;
+    if (query->kind == DocQuery::Kind::kTerm) {
+      const std::string& f = query->field;
+      return doc.find(f.data(), f.data() + f.size())->isString() && text == query->value;
+    }
+    return text.compare(0, query->value.size(), query->value) == 0;
+  }
+};
+
+// A folder and everything below it, on the ancestor column.
+std::string UnderFolder(std::string folder, Sql* q) {
+  while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
+  const std::string under = folder == "/" ? "/" : folder + "/";
+  return "(anc = " + q->Bytes(folder) + " OR (anc >= " + q->Bytes(under) +
+         " AND anc < " + q->Bytes(*PrefixUpperBound(under)) + "))";
+}
+
+DocWhere WhereOf(const Schema& schema, const DocQuery& q, Sql* sql) {
+  DocWhere w;
+  w.query = &q;
+  const bool id_field = q.field == schema.property_id();
+  if (q.kind == DocQuery::Kind::kAll) return w;
+  if (q.kind == DocQuery::Kind::kTerm && !q.field.empty() && q.field == schema.ancestor_field()) {
+    sql->And(UnderFolder(q.value, sql));
+  } else if (!id_field) {
+    w.scan = true;
+  } else if (q.kind == DocQuery::Kind::kTerm) {
+    sql->And("path = " + sql->Bytes(q.value));
+  } else {
+    sql->And("path >= " + sql->Bytes(q.value));
+    const std::optional<std::string> upper = PrefixUpperBound(q.value);
+    if (upper) sql->And("path < " + sql->Bytes(*upper));
+  }
+  return w;
+}
+
+// The snippets of a page, made by the same snippet function as the embedded store's, over an
+// in-memory word index holding the page's texts only.
+void AddSnippets(const Schema& schema, const std::string& keywords, int64_t snippet_from,
+                 const std::vector<Json::Value>& docs, std::vector<Json::Value>* hits) {
+  const std::string match = SnippetMatch(keywords);
+  if (hits->empty() || match.empty()) return;
+  Db mem;
+  mem.Open(":memory:", true, false);
+  mem.Exec("CREATE VIRTUAL TABLE fts_all USING fts5(text, tokenize='unicode61"
+           " remove_diacritics 2')");
+  RegisterSnippetFunction(mem.get());
+  Stmt put(mem, "INSERT INTO fts_all(rowid, text) VALUES(?, ?)");
+  Stmt snip(mem, std::string("SELECT ") + kSnippetFunction +
+                     "(fts_all, '<b>', '</b>', '...', 12) FROM fts_all"
+                     " WHERE fts_all MATCH ? AND rowid = ?");
+  for (size_t i = static_cast<size_t>(std::max<int64_t>(snippet_from, 0)); i < hits->size();
+       ++i) {
+    const int64_t rowid = static_cast<int64_t>(i) + 1;
+    put.Reset();
+    put.Bind(1, rowid).Bind(2, EncodeName(schema.Derive(docs[i]).all_text)).Run();
+    snip.Reset();
+    snip.Bind(1, match).Bind(2, rowid);
+    (*hits)[i]["snippet"] = snip.Step() ? DecodeName(snip.Text(0)) : std::string();
+  }
+}
+
+}  // namespace
+
+std::string PgKeywordQuery(const std::string& keywords) {
+  std::string out;
+  for (const Keyword& k : KeywordsOf(EncodeName(keywords))) {
+    const std::vector<std::string> words = FoldWords(k.text);
+    if (words.empty()) continue;
+    std::string phrase;
+    for (size_t i = 0; i < words.size(); ++i) {
+      if (i > 0) phrase += " <-> ";
+      phrase += Lexeme(words[i]);
+      if (k.prefix && i + 1 == words.size()) phrase += ":*";
+    }
+    if (!out.empty()) out += " & ";
+    out += words.size() > 1 ? "(" + phrase + ")" : phrase;
+  }
+  return out;
+}
+
+void PgStore::PrepareDatabase(PgPool& pool) {
+  PgPool::Lease conn(pool);
+  PgTxn txn(*conn);
+  conn->Exec(kSchemaLock);
+  conn->Script(kSchemaSql);
+  txn.Commit();
+}
+
+PgStore::PgStore(std::shared_ptr<PgPool> pool, std::string server, std::string id, int part)
+    : pool_(std::move(pool)), server_(std::move(server)), id_(std::move(id)), part_(part) {}
+
+std::shared_ptr<PgStore> PgStore::Create(std::shared_ptr<PgPool> pool, const std::string& server,
+                                         const std::string& id, const Json::Value& mappings,
+                                         const Json::Value& settings,
+                                         const Json::Value& event_handler) {
+  Schema::Parse(mappings);  // refuse a bad schema before anything is written
+  PrepareDatabase(*pool);
+  int part = 0;
+  {
+    PgPool::Lease conn(*pool);
+    PgTxn txn(*conn);
+    conn->Exec(kSchemaLock);
+    PgResult r = conn->Exec(
+        "INSERT INTO fi_indexes(server, id) VALUES($1, $2) ON CONFLICT DO NOTHING RETURNING part",
+        PgParams().Text(server).Text(id));
+    if (r.rows() == 0) {
+      throw EngineError(kCodeIndexExists,
+                        "index " + id + " of server " + server + " already exists in the database");
+    }
+    part = static_cast<int>(r.Int(0, 0));
+    // The partition's name and bounds are our own number, never a value from outside.
+    const std::string n = std::to_string(part);
+    conn->Script("CREATE TABLE fi_docs_" + n + " PARTITION OF fi_docs FOR VALUES IN (" + n + ")");
+    const std::string put = "INSERT INTO fi_meta(part, key, value) VALUES(" + n + ", $1, $2)";
+    auto set = [&](const char* key, const std::string& value) {
+      conn->Exec(put, PgParams().Text(key).Text(value));
+    };
+    set("mappings", JsonToString(mappings));
+    set("settings", JsonToString(settings));
+    set("event_handler", JsonToString(event_handler));
+    set("term_sugg", "ready");
+    txn.Commit();
+  }
+  std::shared_ptr<PgStore> s(new PgStore(std::move(pool), server, id, part));
+  s->LoadSchema();
+  return s;
+}
+
+std::shared_ptr<PgStore> PgStore::Open(std::shared_ptr<PgPool> pool, const std::string& server,
+                                       const std::string& id) {
+  PrepareDatabase(*pool);
+  int part = 0;
+  {
+    PgPool::Lease conn(*pool);
+    PgResult r = conn->Exec("SELECT part FROM fi_indexes WHERE server = $1 AND id = $2",
+                            PgParams().Text(server).Text(id));
+    if (r.rows() == 0) {
+      throw EngineError(kCodeIndexNotFound,
+                        "no index " + id + " of server " + server + " in the database");
+    }
+    part = static_cast<int>(r.Int(0, 0));
+  }
+  std::shared_ptr<PgStore> s(new PgStore(std::move(pool), server, id, part));
+  s->LoadSchema();
+  return s;
+}
+
+bool PgStore::Exists(PgPool& pool, const std::string& server, const std::string& id) {
+  PrepareDatabase(pool);
+  PgPool::Lease conn(pool);
+  return conn->Exec("SELECT 1 FROM fi_indexes WHERE server = $1 AND id = $2",
+                    PgParams().Text(server).Text(id)).rows() > 0;
+}
+
+bool PgStore::Drop(PgPool& pool, const std::string& server, const std::string& id) {
+  PrepareDatabase(pool);
+  PgPool::Lease conn(pool);
+  PgTxn txn(*conn);
+  conn->Exec(kSchemaLock);
+  PgResult r = conn->Exec("DELETE FROM fi_indexes WHERE server = $1 AND id = $2 RETURNING part",
+                          PgParams().Text(server).Text(id));
+  if (r.rows() == 0) return false;
+  conn->Script("DROP TABLE IF EXISTS fi_docs_" + std::to_string(r.Int(0, 0)));
+  txn.Commit();
+  return true;
+}
+
+void PgStore::LoadSchema() {
+  JsonValue mappings;
+  if (!mappings.fromString(Meta("mappings"))) {
+    throw StoreError(SQLITE_CORRUPT, "stored mappings of index " + id_ + " are not JSON");
+  }
+  schema_ = Schema::Parse(mappings);
+}
+
+PgConn& PgStore::Writer() {
+  // A connection the server dropped is replaced here, at the start of the next request; the
+  // request it failed in was answered as unavailable and is sent again by its owner.
+  if (!writer_ || !writer_->Healthy()) {
+    writer_.reset();
+    std::unique_ptr<PgConn> conn = pool_->Take();
+    // Commits do not wait for the server's log to reach its disk: a finished request still
+    // survives this daemon and the server's crash recovery; Sync() waits for all of them.
+    conn->Script("SET synchronous_commit = off");
+    writer_ = std::move(conn);
+  }
+  return *writer_;
+}
+
+std::string PgStore::Meta(const std::string& key) {
+  PgResult r = Writer().Exec("SELECT value FROM fi_meta WHERE part = $1 AND key = $2",
+                             PgParams().Int(part_).Text(key));
+  return r.rows() > 0 ? r.Text(0, 0) : std::string();
+}
+
+void PgStore::SetMeta(const std::string& key, const std::string& value) {
+  Writer().Exec("INSERT INTO fi_meta(part, key, value) VALUES($1, $2, $3)"
+                " ON CONFLICT (part, key) DO UPDATE SET value = excluded.value",
+                PgParams().Int(part_).Text(key).Text(value));
+}
+
+void PgStore::Rename(const std::string& new_id) {
+  PgResult r = Writer().Exec(
+      "UPDATE fi_indexes SET id = $1 WHERE part = $2 AND NOT EXISTS"
+      " (SELECT 1 FROM fi_indexes WHERE server = $3 AND id = $1)",
+      PgParams().Text(new_id).Int(part_).Text(server_));
+  if (r.Changed() == 0) {
+    throw EngineError(kCodeIndexExists, "index " + new_id + " of server " + server_ +
+                                            " already exists in the database");
+  }
+  id_ = new_id;
+}
+
+Json::Value PgStore::ReadDoc(const PgResult& r, int row, int path_col, int doc_col) const {
+  Json::Value doc = ParseDoc(r.Bytes(row, doc_col));
+  doc[schema_.property_id()] = r.Bytes(row, path_col);
+  return doc;
+}
+
+void PgStore::WriteRows(const std::vector<const Json::Value*>& docs) {
+  std::string sql = std::string("INSERT INTO ") + Table() + " AS d(" + kRowColumns + ") VALUES";
+  PgParams params;
+  int n = 0;
+  for (size_t i = 0; i < docs.size(); ++i) {
+    const Json::Value& doc = *docs[i];
+    const DerivedDoc d = schema_.Derive(doc);
+    // The path is its own column; the rest of the document is kept as its compact JSON.
+    Json::Value rest = doc;
+    rest.removeMember(schema_.property_id());
+    const std::string words = WordVector(EncodeName(d.all_text));
+    params.Bytes(d.path)
+        .Text(FoldName(EncodeName(d.name_text)))
+        .Text(EncodeName(d.ext))
+        .Int(d.size)
+        .Int(d.mtime)
+        .Bool(d.is_dir)
+        .Bytes(d.ancestor);
+    if (words.empty()) {
+      params.Null();
+    } else {
+      params.Text(words);
+    }
+    params.Bytes(JsonToString(rest));
+    sql += i == 0 ? "(" : ",(";
+    sql += std::to_string(part_);
+    for (int c = 0; c < kRowParams; ++c) {
+      sql += ",$" + std::to_string(++n);
+      if (c == 7) sql += "::tsvector";
+    }
+    sql += ")";
+  }
+  sql += " ON CONFLICT (part, path) DO UPDATE SET fname = excluded.fname, ext = excluded.ext,"
+         " size = excluded.size, mtime = excluded.mtime, is_dir = excluded.is_dir,"
+         " anc = excluded.anc, words = excluded.words, doc = excluded.doc";
+  Writer().Exec(sql, params);
+}
+
+void PgStore::Upsert(const std::string& doc_id, const Json::Value& given) {
+  if (!given.isObject()) throw EngineError(kCodeDocInvalid, "document is not an object");
+  const std::string& pid = schema_.property_id();
+  Json::Value doc = given;
+  if (!doc.isMember(pid) && !doc_id.empty()) doc[pid] = doc_id;
+  schema_.Validate(doc);
+  const std::string path = doc[pid].asString();
+  if (!doc_id.empty() && doc_id != path) Delete(doc_id);
+  WriteRows({&doc});
+}
+
+size_t PgStore::UpsertMany(const std::vector<Json::Value>& docs,
+                           std::vector<std::pair<size_t, std::string>>* refused) {
+  // One statement per run of documents; a path given twice keeps its last document, as
+  // upserting them one by one would.
+  std::vector<const Json::Value*> run;
+  std::unordered_map<std::string, size_t> at;
+  size_t written = 0;
+  auto flush = [&] {
+    if (run.empty()) return;
+    std::vector<const Json::Value*> rows;
+    for (const Json::Value* d : run) {
+      if (d != nullptr) rows.push_back(d);
+    }
+    WriteRows(rows);
+    run.clear();
+    at.clear();
+  };
+  for (size_t i = 0; i < docs.size(); ++i) {
+    try {
+      if (!docs[i].isObject()) throw EngineError(kCodeDocInvalid, "document is not an object");
+      schema_.Validate(docs[i]);
+    } catch (const EngineError& e) {
+      if (refused != nullptr) refused->emplace_back(i, e.what());
+      continue;
+    }
+    const std::string path = docs[i][schema_.property_id()].asString();
+    auto it = at.find(path);
+    if (it != at.end()) run[it->second] = nullptr;
+    at[path] = run.size();
+    run.push_back(&docs[i]);
+    ++written;
+    if (run.size() >= kRowsPerStatement) flush();
+  }
+  flush();
+  return written;
+}
+
+void PgStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
+  if (!fields.isObject()) throw EngineError(kCodeDocInvalid, "fields are not an object");
+  PgConn& w = Writer();
+  PgResult r = w.Exec("SELECT path, doc FROM " + Table() + " WHERE part = $1 AND path = $2",
+                      PgParams().Int(part_).Bytes(doc_id));
+  if (r.rows() == 0) throw EngineError(kCodeDocNotFound, "no document " + doc_id);
+  Json::Value doc = ReadDoc(r, 0, 0, 1);
+  for (const std::string& k : fields.getMemberNames()) {
+    if (fields[k].isNull()) {
+      doc.removeMember(k);
+    } else {
+      doc[k] = fields[k];
+    }
+  }
+  schema_.Validate(doc);
+  const std::string path = doc[schema_.property_id()].asString();
+  // A re-keyed document replaces whatever was at its new path.
+  if (path != doc_id) Delete(doc_id);
+  WriteRows({&doc});
+}
+
+bool PgStore::Delete(const std::string& doc_id) {
+  return Writer()
+             .Exec("DELETE FROM " + Table() + " WHERE part = $1 AND path = $2",
+                   PgParams().Int(part_).Bytes(doc_id))
+             .Changed() > 0;
+}
+
+int64_t PgStore::DeleteByQuery(const DocQuery& q) {
+  Sql sql;
+  sql.Int(part_);
+  const DocWhere w = WhereOf(schema_, q, &sql);
+  if (!w.scan) {
+    return Writer().Exec("DELETE FROM " + Table() + " WHERE part = $1" + sql.where, sql.params)
+        .Changed();
+  }
+  PgResult r = Writer().Exec("SELECT path, doc FROM " + Table() + " WHERE part = $1", sql.params);
+  int64_t deleted = 0;
+  for (int i = 0; i < r.rows(); ++i) {
+    if (w.Matches(ReadDoc(r, i, 0, 1)) && Delete(r.Bytes(i, 0))) ++deleted;
+  }
+  return deleted;
+}
+
+Json::Value PgStore::GetByQuery(const DocQuery& q, const std::vector<std::string>& load,
+                                int64_t from, int64_t size) {
+  Sql sql;
+  sql.Int(part_);
+  const DocWhere w = WhereOf(schema_, q, &sql);
+  std::string text = "SELECT path, doc FROM " + Table() + " WHERE part = $1" + sql.where +
+                     " ORDER BY path";
+  if (!w.scan) {
+    text += " LIMIT " + sql.Int(size);
+    text += " OFFSET " + sql.Int(from);
+  }
+  PgResult r = Writer().Exec(text, sql.params);
+  Json::Value hits(Json::arrayValue);
+  int64_t matched = 0;
+  for (int i = 0; i < r.rows() && static_cast<int64_t>(hits.size()) < size; ++i) {
+    const Json::Value doc = ReadDoc(r, i, 0, 1);
+    if (w.scan && (!w.Matches(doc) || matched++ < from)) continue;
+    hits.append(schema_.Load(doc, load));
+  }
+  return hits;
+}
+
+Json::Value PgStore::List(const std::string& dir, const std::string& after,
+                          const std::vector<std::string>& extra, int64_t size) {
+  // One range of the path index: from the folder (or past the previous page) to the end of its
+  // subtree; names that only begin like the folder ("dir.txt") are left out.
+  const std::string under = dir + "/";
+  const std::optional<std::string> upper = PrefixUpperBound(under);
+  const bool resume = !after.empty() && after >= dir;
+  Sql sql;
+  sql.Int(part_);
+  sql.And(std::string("path ") + (resume ? "> " : ">= ") + sql.Bytes(resume ? after : dir));
+  if (upper) sql.And("path < " + sql.Bytes(*upper));
+  sql.And("(path = " + sql.Bytes(dir) + " OR path >= " + sql.Bytes(under) + ")");
+  const std::string text = std::string("SELECT path, size, mtime, is_dir") +
+                           (extra.empty() ? "" : ", doc") + " FROM " + Table() +
+                           " WHERE part = $1" + sql.where + " ORDER BY path LIMIT " +
+                           sql.Int(size);
+  PgResult r = Writer().Exec(text, sql.params);
+  Json::Value hits(Json::arrayValue);
+  for (int i = 0; i < r.rows(); ++i) {
+    Json::Value hit(Json::arrayValue);
+    hit.append(r.Bytes(i, 0));
+    hit.append(Json::Int64(r.Int(i, 1)));
+    hit.append(Json::Int64(r.Int(i, 2)));
+    hit.append(r.Bool(i, 3));
+    if (!extra.empty()) {
+      // Each loaded field as the embedded store gives it: whole numbers and flags as numbers,
+      // strings as they are, anything else as its JSON text.
+      const Json::Value doc = ReadDoc(r, i, 0, 4);
+      for (const std::string& field : extra) {
+        const Json::Value* v = doc.find(field.data(), field.data() + field.size());
+        if (v == nullptr || v->isNull()) {
+          hit.append(Json::Value());
+        } else if (v->isBool()) {
+          hit.append(Json::Int64(v->asBool() ? 1 : 0));
+        } else if (v->type() == Json::intValue ||
+                   (v->type() == Json::uintValue && v->asUInt64() <= INT64_MAX)) {
+          hit.append(Json::Int64(v->asInt64()));
+        } else if (v->isString()) {
+          hit.append(*v);
+        } else {
+          hit.append(JsonToString(*v));
+        }
+      }
+    }
+    hits.append(std::move(hit));
+  }
+  return hits;
+}
+
+bool PgStore::UpdateTermSuggestion(const std::string& doc_id) {
+  // Suggestions are read from the documents' word vectors: there is nothing to recompute.
+  return Writer().Exec("SELECT 1 FROM " + Table() + " WHERE part = $1 AND path = $2",
+                       PgParams().Int(part_).Bytes(doc_id)).rows() > 0;
+}
+
+int64_t PgStore::DocCount() {
+  return Writer().Exec("SELECT count(*) FROM " + Table()).Int(0, 0);
+}
+
+void PgStore::Sync() {
+  // Writes commit without waiting for the server's log to reach its disk (a finished request
+  // survives this daemon, and the server's own crash recovery keeps what it flushed); this one
+  // commits with a wait, which flushes the log up to it and so every commit before it.
+  PgConn& w = Writer();
+  PgTxn txn(w);
+  w.Script("SET LOCAL synchronous_commit = on");
+  w.Exec("INSERT INTO fi_meta(part, key, value) VALUES($1, 'synced', now()::text)"
+         " ON CONFLICT (part, key) DO UPDATE SET value = excluded.value",
+         PgParams().Int(part_));
+  txn.Commit();
+}
+
+bool PgStore::QuickCheck(std::string* detail) {
+  try {
+    DocCount();
+    return true;
+  } catch (const StoreError& e) {
+    *detail = e.what();
+    return false;
+  }
+}
+
+SearchPage PgStore::Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard) {
+  Sql sql;
+  sql.Int(part_);
+  std::string select = "SELECT d.path, d.doc";
+  std::string order;
+  const std::string tsquery = PgKeywordQuery(p.keywords);
+  if (!p.keywords.empty() && tsquery.empty()) {
+    // Keywords without a single word (only punctuation) match nothing, as in the word index.
+    sql.And("FALSE");
+  } else if (!tsquery.empty()) {
+    const std::string q = sql.Text(tsquery) + "::tsquery";
+    sql.And("d.words @@ " + q);
+    select += ", ts_rank(d.words, " + q + ")";
+    if (p.sort == SearchParams::Sort::kRelevance) {
+      order = std::string(" ORDER BY ts_rank(d.words, ") + q + ")" + (p.desc ? "" : " DESC") +
+              ", d.path";
+    }
+  }
+  const std::string name = EncodeName(p.name);
+  if (!name.empty()) sql.And("d.fname LIKE " + sql.Text("%" + EscapeLike(FoldName(name)) + "%"));
+  if (!p.folder.empty()) {
+    std::string folder = p.folder;
+    while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
+    const std::string under = folder == "/" ? "/" : folder + "/";
+    sql.And("d.path >= " + sql.Bytes(under) + " AND d.path < " +
+            sql.Bytes(*PrefixUpperBound(under)));
+    sql.And(UnderFolder(folder, &sql));
+  }
+  if (!p.exts.empty()) {
+    std::string list = "{";
+    for (size_t i = 0; i < p.exts.size(); ++i) {
+      list += (i == 0 ? "" : ",") + PgArrayElement(EncodeName(AsciiLower(p.exts[i])));
+    }
+    sql.And("d.ext = ANY(" + sql.Text(list + "}") + "::text[])");
+  }
+  auto bound = [&](const std::optional<int64_t>& v, const char* cond) {
+    if (v) sql.And(cond + sql.Int(*v));
+  };
+  bound(p.size_min, "d.size >= ");
+  bound(p.size_max, "d.size <= ");
+  bound(p.mtime_min, "d.mtime >= ");
+  bound(p.mtime_max, "d.mtime <= ");
+  if (p.is_dir) sql.And(*p.is_dir ? "d.is_dir" : "NOT d.is_dir");
+  const char* dir = p.desc ? " DESC" : " ASC";
+  switch (p.sort) {
+    case SearchParams::Sort::kRelevance:
+      break;
+    case SearchParams::Sort::kName:
+      order = std::string(" ORDER BY d.fname COLLATE \"C\"") + dir + ", d.path";
+      break;
+    case SearchParams::Sort::kSize:
+      order = std::string(" ORDER BY d.size") + dir + ", d.path";
+      break;
+    case SearchParams::Sort::kMtime:
+      order = std::string(" ORDER BY d.mtime") + dir + ", d.path";
+      break;
+  }
+  const std::string from = " FROM " + Table() + " d WHERE d.part = $1" + sql.where;
+  const bool ranked = !tsquery.empty();
+
+  SearchPage page;
+  std::vector<Json::Value> docs;
+  PgPool::Lease conn(*pool_);
+  auto add = [&](const PgResult& r, int i) {
+    Json::Value doc = ReadDoc(r, i, 0, 1);
+    const DerivedDoc d = schema_.Derive(doc);
+    Json::Value hit;
+    hit["path"] = d.path;
+    hit["name"] = d.name;
+    hit["size"] = static_cast<Json::Int64>(d.size);
+    hit["mtime"] = static_cast<Json::Int64>(d.mtime);
+    hit["is_dir"] = d.is_dir;
+    hit["ext"] = d.ext;
+    if (ranked) hit["score"] = r.Real(i, 2);
+    page.hits.push_back(std::move(hit));
+    docs.push_back(std::move(doc));
+  };
+  if (!visible) {
+    PgResult count = conn->Exec("SELECT count(*) FROM (SELECT 1" + from + " LIMIT " +
+                                    std::to_string(IndexStore::kCountLimit + 1) + ") s",
+                                sql.params);
+    page.total = count.Int(0, 0);
+    if (page.total > IndexStore::kCountLimit) {
+      page.total = IndexStore::kCountLimit;
+      page.total_exact = false;
+    }
+    const std::string limits = " LIMIT " + sql.Int(p.size) + " OFFSET " + sql.Int(p.from);
+    PgResult r = conn->Exec(select + from + order + limits, sql.params);
+    for (int i = 0; i < r.rows(); ++i) add(r, i);
+  } else {
+    // Hidden hits are skipped before paging: rows come from a cursor a batch at a time, and
+    // counting goes on for a bounded number of rows past the page.
+    PgTxn txn(*conn);
+    conn->Exec("DECLARE hits NO SCROLL CURSOR FOR " + select + from + order, sql.params);
+    int64_t seen = 0;
+    int64_t inspected = 0;
+    bool done = false;
+    while (!done) {
+      if (guard != nullptr && guard->ShouldStop()) guard->Throw();
+      PgResult r = conn->Exec("FETCH " + std::to_string(kFetchRows) + " FROM hits");
+      if (r.rows() == 0) break;
+      for (int i = 0; i < r.rows(); ++i) {
+        ++inspected;
+        if (seen >= p.from + p.size &&
+            inspected > p.from + p.size + IndexStore::kFilteredScanLimit) {
+          page.total_exact = false;
+          done = true;
+          break;
+        }
+        if (!visible(r.Bytes(i, 0))) continue;
+        ++seen;
+        if (seen > p.from && seen <= p.from + p.size) add(r, i);
+      }
+    }
+    page.total = seen;
+  }
+  if (ranked) AddSnippets(schema_, EncodeName(p.keywords), p.snippet_from, docs, &page.hits);
+  return page;
+}
+
+std::vector<std::string> PgStore::Suggest(const std::string& prefix, size_t limit,
+                                          const VisibleFn& visible, QueryGuard* guard) {
+  std::vector<std::string> out;
+  const std::vector<std::string> folded = FoldWords(EncodeName(prefix));
+  if (folded.size() != 1) return out;
+  const std::string& low = folded[0];
+  PgPool::Lease conn(*pool_);
+  // The words of a bounded sample of the documents holding one that starts with the prefix,
+  // counted over that sample: the most used come first without a vocabulary kept up to date
+  // on every write.
+  PgResult r = conn->Exec(
+      "SELECT w.lexeme, count(*) FROM (SELECT words FROM " + Table() +
+          " WHERE part = $1 AND words @@ $2::tsquery LIMIT " +
+          std::to_string(kSuggestSampleDocs) +
+          ") s, unnest(s.words) w WHERE starts_with(w.lexeme, $3)"
+          " GROUP BY w.lexeme ORDER BY count(*) DESC, w.lexeme LIMIT 200",
+      PgParams().Int(part_).Text(Lexeme(low) + ":*").Text(low));
+  for (int i = 0; i < r.rows() && out.size() < limit; ++i) {
+    if (guard != nullptr && guard->ShouldStop()) guard->Throw();
+    const std::string term = r.Text(i, 0);
+    if (!IsSuggestible(term)) continue;
+    bool shown = !visible;
+    if (!shown) {
+      PgResult docs = conn->Exec("SELECT path FROM " + Table() +
+                                     " WHERE part = $1 AND words @@ $2::tsquery LIMIT 64",
+                                 PgParams().Int(part_).Text(Lexeme(term)));
+      for (int j = 0; !shown && j < docs.rows(); ++j) shown = visible(docs.Bytes(j, 0));
+    }
+    if (shown) out.push_back(DecodeName(term));
+  }
+  return out;
+}
+
+}  // namespace elasticd
+}  // namespace orvane

@@ -1,0 +1,113 @@
+// PgStore: the documents of one index in a PostgreSQL database that several file servers may
+// share. One table of documents is partitioned by index (each index its own partition, listed
+// with its server's name in `fi_indexes`); names are found through a trigram index over their
+// folded form, words through a word vector (`tsvector`) of the catch-all text.
+// Writes go through the store's one writer connection and must be serialised by the owner (the
+// daemon holds the index's write lock and a PgWriteTxn); searches take pooled connections and
+// may run from any thread at the same time as a writer.
+#ifndef ORVANE_DAEMONS_QUIXELASTICD_PG_STORE_HPP_
+#define ORVANE_DAEMONS_QUIXELASTICD_PG_STORE_HPP_
+
+#include <json/json.h>
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "daemons/quixelasticd/pg_util.hpp"
+#include "daemons/quixelasticd/schema.hpp"
+#include "daemons/quixelasticd/store.hpp"
+
+namespace orvane {
+namespace elasticd {
+
+class PgStore {
+ public:
+  // Makes the shared tables when the database has none (several daemons may race to do it).
+  // Throws StoreError.
+  static void PrepareDatabase(PgPool& pool);
+  // A new, empty index `id` of `server`; EngineError(kCodeIndexExists) when it exists.
+  static std::shared_ptr<PgStore> Create(std::shared_ptr<PgPool> pool, const std::string& server,
+                                         const std::string& id, const Json::Value& mappings,
+                                         const Json::Value& settings,
+                                         const Json::Value& event_handler);
+  // The existing index; EngineError(kCodeIndexNotFound) when there is none.
+  static std::shared_ptr<PgStore> Open(std::shared_ptr<PgPool> pool, const std::string& server,
+                                       const std::string& id);
+  static bool Exists(PgPool& pool, const std::string& server, const std::string& id);
+  // Removes the index and its documents; false when there was none.
+  static bool Drop(PgPool& pool, const std::string& server, const std::string& id);
+
+  PgStore(const PgStore&) = delete;
+  PgStore& operator=(const PgStore&) = delete;
+
+  const std::string& server() const { return server_; }
+  const std::string& id() const { return id_; }
+  const Schema& schema() const { return schema_; }
+  std::string Meta(const std::string& key);
+  void SetMeta(const std::string& key, const std::string& value);
+  // Re-keys the index to `new_id` of the same server; EngineError(kCodeIndexExists) when taken.
+  void Rename(const std::string& new_id);
+
+  // --- writer side: call only with the index's write lock held and a PgWriteTxn open.
+  PgConn& Writer();
+  void Upsert(const std::string& doc_id, const Json::Value& doc);
+  size_t UpsertMany(const std::vector<Json::Value>& docs,
+                    std::vector<std::pair<size_t, std::string>>* refused);
+  void SetFields(const std::string& doc_id, const Json::Value& fields);
+  bool Delete(const std::string& doc_id);
+  int64_t DeleteByQuery(const DocQuery& q);
+  Json::Value GetByQuery(const DocQuery& q, const std::vector<std::string>& load, int64_t from,
+                         int64_t size);
+  Json::Value List(const std::string& dir, const std::string& after,
+                   const std::vector<std::string>& extra, int64_t size);
+  bool UpdateTermSuggestion(const std::string& doc_id);
+  int64_t DocCount();
+
+  // Makes every committed transaction durable: commits one more with the server's synchronous
+  // commit, which flushes the log up to it. No PgWriteTxn open.
+  void Sync();
+  bool QuickCheck(std::string* detail);
+
+  // --- reader side: any thread. The guard is consulted between rows.
+  SearchPage Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard = nullptr);
+  std::vector<std::string> Suggest(const std::string& prefix, size_t limit,
+                                   const VisibleFn& visible, QueryGuard* guard = nullptr);
+
+ private:
+  PgStore(std::shared_ptr<PgPool> pool, std::string server, std::string id, int part);
+  void LoadSchema();
+  std::string Table() const { return "fi_docs_" + std::to_string(part_); }
+  // Writes `docs` (validated, deduplicated by path) in one statement.
+  void WriteRows(const std::vector<const Json::Value*>& docs);
+  Json::Value ReadDoc(const PgResult& r, int row, int path_col, int doc_col) const;
+
+  std::shared_ptr<PgPool> pool_;
+  std::string server_;
+  std::string id_;
+  int part_;
+  Schema schema_;
+  std::unique_ptr<PgConn> writer_;
+};
+
+// RAII write transaction on a store's writer connection: BEGIN, COMMIT on Commit(), ROLLBACK
+// otherwise.
+class PgWriteTxn {
+ public:
+  explicit PgWriteTxn(PgStore& store) : txn_(store.Writer()) {}
+  void Commit() { txn_.Commit(); }
+
+ private:
+  PgTxn txn_;
+};
+
+// A user's keywords as a word-vector query: each word folded and required, the words of one
+// keyword as a phrase, a trailing '*' a prefix. Empty when no keyword holds a word.
+std::string PgKeywordQuery(const std::string& keywords);
+
+}  // namespace elasticd
+}  // namespace orvane
+
+#endif  // ORVANE_DAEMONS_QUIXELASTICD_PG_STORE_HPP_

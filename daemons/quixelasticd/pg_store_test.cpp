@@ -1,0 +1,401 @@
+#include "daemons/quixelasticd/pg_store.hpp"
+
+#include <fcntl.h>
+#include <grp.h>
+#include <pwd.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <cerrno>
+#include <string>
+#include <vector>
+
+#include "common/json_util.hpp"
+#include "daemons/quixelasticd/engine_error.hpp"
+#include "test/engine_client.hpp"
+#include "test/test_util.hpp"
+
+namespace orvane {
+namespace elasticd {
+namespace {
+
+const char kPgBin[] = "/usr/lib/postgresql/15/bin/";
+
+// A PostgreSQL server of the test's own: a cluster made by initdb in a scratch folder and run
+// as `nobody` (the server refuses root), reachable only on a Unix socket in that folder.
+// Stopped by its pid at scope end.
+class TestServer {
+ public:
+  TestServer() {
+    const passwd* pw = getpwnam("nobody");
+    if (pw == nullptr) throw std::runtime_error("no user nobody");
+    uid_ = pw->pw_uid;
+    gid_ = pw->pw_gid;
+    // The scratch folder is root's 0700: the cluster lives in a folder of nobody's below it.
+    chmod(dir_.path().c_str(), 0755);
+    home_ = dir_.Path("pg");
+    mkdir(home_.c_str(), 0700);
+    if (chown(home_.c_str(), uid_, gid_) != 0) throw std::runtime_error("chown " + home_);
+    const int rc = RunAs({std::string(kPgBin) + "initdb", "-D", home_ + "/data", "-A", "trust",
+                          "-U", "fileindex", "-E", "UTF8", "--locale=C", "--no-sync"});
+    if (rc != 0) throw std::runtime_error("initdb failed: " + test::ReadFile(home_ + "/log"));
+    Start();
+  }
+  ~TestServer() { Stop(SIGINT); }
+
+  std::string conninfo() const {
+    return "host=" + home_ + " port=5432 dbname=postgres user=fileindex connect_timeout=5";
+  }
+
+  // `sig`: SIGINT stops cleanly, SIGQUIT as a crash would (recovery at the next start).
+  void Stop(int sig) {
+    if (pid_ <= 0) return;
+    kill(pid_, sig);
+    int status = 0;
+    waitpid(pid_, &status, 0);
+    pid_ = -1;
+  }
+
+  void Start() {
+    pid_ = fork();
+    if (pid_ == 0) {
+      BecomeNobody();
+      execl((std::string(kPgBin) + "postgres").c_str(), "postgres", "-D",
+            (home_ + "/data").c_str(), "-k", home_.c_str(), "-c", "listen_addresses=",
+            "-c", "shared_buffers=16MB", static_cast<char*>(nullptr));
+      _exit(127);
+    }
+    const bool up = test::WaitFor(
+        [&] { return PQping(conninfo().c_str()) == PQPING_OK; }, 60000);
+    if (!up) throw std::runtime_error("server did not start: " + test::ReadFile(home_ + "/log"));
+  }
+
+ private:
+  void BecomeNobody() {
+    const int log = open((home_ + "/log").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0600);
+    if (log >= 0) {
+      if (fchown(log, uid_, gid_) != 0) _exit(126);
+      dup2(log, 1);
+      dup2(log, 2);
+    }
+    if (setgroups(0, nullptr) != 0 || setgid(gid_) != 0 || setuid(uid_) != 0) _exit(126);
+  }
+
+  int RunAs(const std::vector<std::string>& argv) {
+    const pid_t pid = fork();
+    if (pid == 0) {
+      BecomeNobody();
+      std::vector<char*> args;
+      for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
+      args.push_back(nullptr);
+      execv(args[0], args.data());
+      _exit(127);
+    }
+    int status = 0;
+    waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  }
+
+  test::TempDir dir_;
+  std::string home_;
+  uid_t uid_ = 0;
+  gid_t gid_ = 0;
+  pid_t pid_ = -1;
+};
+
+using tc::Parse;
+
+// A file document of the library's form; `title` adds words to its catch-all text.
+Json::Value FileDoc(const std::string& path, int64_t size = 10, const std::string& title = "") {
+  Json::Value d = tc::FileDoc(path, size, 1700000000 + size);
+  d["QUIXMDIsDir"] = false;
+  if (!title.empty()) d["QUIXMDTitle"] = title;
+  return d;
+}
+
+std::vector<std::string> Paths(const SearchPage& page) {
+  std::vector<std::string> out;
+  for (const Json::Value& h : page.hits) out.push_back(h["path"].asString());
+  return out;
+}
+
+class PgStoreTest : public ::testing::Test {
+ protected:
+  PgStoreTest() : pool_(std::make_shared<PgPool>(server_.conninfo(), 4)) {}
+
+  std::shared_ptr<PgStore> Make(const std::string& server = "s1",
+                                const std::string& id = "docs") {
+    return PgStore::Create(pool_, server, id, tc::FileMappings(), Json::Value(Json::objectValue),
+                           Json::Value(Json::objectValue));
+  }
+
+  void Put(PgStore& s, const std::vector<Json::Value>& docs) {
+    PgWriteTxn txn(s);
+    for (const Json::Value& d : docs) s.Upsert(d["QUIXMDPath"].asString(), d);
+    txn.Commit();
+  }
+
+  SearchPage Find(PgStore& s, SearchParams p, const VisibleFn& visible = nullptr) {
+    return s.Search(p, visible);
+  }
+
+  TestServer server_;
+  std::shared_ptr<PgPool> pool_;
+};
+
+TEST_F(PgStoreTest, IndexesAreKeptPerServerAndSurviveReopening) {
+  auto a = Make("s1", "docs");
+  auto b = Make("s2", "docs");  // the same id of another server is another index
+  EXPECT_THROW(Make("s1", "docs"), EngineError);
+  Put(*a, {FileDoc("/v/a.txt")});
+  EXPECT_EQ(a->DocCount(), 1);
+  EXPECT_EQ(b->DocCount(), 0);
+
+  a = PgStore::Open(pool_, "s1", "docs");
+  EXPECT_EQ(a->DocCount(), 1);
+  EXPECT_EQ(a->schema().property_id(), "QUIXMDPath");
+  EXPECT_EQ(a->Meta("term_sugg"), "ready");
+
+  a->Rename("docs2");
+  EXPECT_EQ(PgStore::Open(pool_, "s1", "docs2")->DocCount(), 1);
+  EXPECT_THROW(Make("s1", "docs2"), EngineError);
+  b->Rename("docs2");  // a name taken on another server only
+  b = Make("s2", "docs");
+  EXPECT_THROW(b->Rename("docs2"), EngineError);
+}
+
+TEST_F(PgStoreTest, LifecycleErrors) {
+  try {
+    PgStore::Open(pool_, "s1", "nope");
+    FAIL();
+  } catch (const EngineError& e) {
+    EXPECT_EQ(e.code, kCodeIndexNotFound);
+  }
+  auto a = Make();
+  Put(*a, {FileDoc("/v/a.txt")});
+  EXPECT_TRUE(PgStore::Exists(*pool_, "s1", "docs"));
+  EXPECT_TRUE(PgStore::Drop(*pool_, "s1", "docs"));
+  EXPECT_FALSE(PgStore::Drop(*pool_, "s1", "docs"));
+  EXPECT_FALSE(PgStore::Exists(*pool_, "s1", "docs"));
+  // Made again, it starts empty.
+  EXPECT_EQ(Make()->DocCount(), 0);
+  EXPECT_THROW(PgStore::Create(pool_, "s1", "bad", Parse(R"({"property_id": 3})"),
+                               Json::Value(), Json::Value()),
+               EngineError);
+}
+
+TEST_F(PgStoreTest, DocumentCommands) {
+  auto s = Make();
+  const std::string raw = std::string("/v/d/bad\xff\xfe name.txt");
+  {
+    PgWriteTxn txn(*s);
+    // The identifying field is filled from the id when missing.
+    Json::Value no_id = FileDoc("/v/d/a.txt", 5);
+    no_id.removeMember("QUIXMDPath");
+    s->Upsert("/v/d/a.txt", no_id);
+    s->Upsert(raw, FileDoc(raw, 6));
+    s->Upsert("", FileDoc("/v/d/sub/b.txt", 7));
+    s->Upsert("", FileDoc("/v/d.txt", 8));
+    s->Upsert("", FileDoc("/v/e/c.txt", 9));
+    // Writes of the open transaction are read back through the same connection.
+    EXPECT_EQ(s->DocCount(), 5);
+    txn.Commit();
+  }
+  auto get = [&](const std::string& qsl, int64_t from = 0, int64_t size = 100) {
+    Json::Value hits = s->GetByQuery(DocQuery::Parse(Parse(qsl)), {"QUIXMDPath"}, from, size);
+    std::vector<std::string> out;
+    for (const Json::Value& h : hits) out.push_back(h["QUIXMDPath"].asString());
+    return out;
+  };
+  EXPECT_EQ(get(R"({"qsl": {"term": {"QUIXMDPath": "/v/d/a.txt"}}})"),
+            std::vector<std::string>{"/v/d/a.txt"});
+  EXPECT_EQ(get(R"({"qsl": {"prefix": {"QUIXMDPath": "/v/d/"}}})"),
+            (std::vector<std::string>{"/v/d/a.txt", raw, "/v/d/sub/b.txt"}));
+  EXPECT_EQ(get(R"({"qsl": {"match_all": {}}})", 1, 2),
+            (std::vector<std::string>{"/v/d/a.txt", raw}));
+  // The ancestor field stands for every folder above the document.
+  EXPECT_EQ(get(R"({"qsl": {"term": {"QUIXMDSearchAncestor": "/v/d"}}})").size(), 3u);
+  // A field without a column is read from the documents.
+  EXPECT_EQ(get(R"({"qsl": {"term": {"QUIXMDFSSize": 9}}})"), std::vector<std::string>());
+  EXPECT_EQ(get(R"({"qsl": {"prefix": {"QUIXMDFSName": "c."}}})"),
+            std::vector<std::string>{"/v/e/c.txt"});
+  const Json::Value whole = s->GetByQuery(
+      DocQuery::Parse(Parse(R"({"qsl": {"term": {"QUIXMDPath": "/v/d/a.txt"}}})")), {}, 0, 1);
+  EXPECT_EQ(whole[0], FileDoc("/v/d/a.txt", 5)) << "the document comes back member for member";
+
+  // The folder and its subtree, in path order, paged; "d.txt" only begins like the folder.
+  const Json::Value page1 = s->List("/v/d", "", {"QUIXMDTitle", "QUIXMDIsDir"}, 2);
+  ASSERT_EQ(page1.size(), 2u);
+  EXPECT_EQ(page1[0], Parse(R"(["/v/d/a.txt", 5, 1700000005, false, null, 0])"));
+  const Json::Value page2 = s->List("/v/d", page1[1][0].asString(), {}, 10);
+  ASSERT_EQ(page2.size(), 1u);
+  EXPECT_EQ(page2[0][0], "/v/d/sub/b.txt");
+
+  {
+    PgWriteTxn txn(*s);
+    // Re-keying onto an existing document replaces it; fields set to null go.
+    Json::Value change = FileDoc("/v/e/c.txt", 5);
+    change["QUIXMDTitle"] = Json::Value();
+    s->SetFields("/v/d/a.txt", change);
+    EXPECT_THROW(s->SetFields("/v/nope", change), EngineError);
+    EXPECT_TRUE(s->Delete(raw));
+    EXPECT_FALSE(s->Delete(raw));
+    EXPECT_EQ(s->DeleteByQuery(DocQuery::Parse(Parse(R"({"qsl": {"prefix": {"QUIXMDPath":
+              "/v/d/"}}})"))), 1);
+    txn.Commit();
+  }
+  EXPECT_EQ(get(R"({"qsl": {"match_all": {}}})"),
+            (std::vector<std::string>{"/v/d.txt", "/v/e/c.txt"}));
+  EXPECT_EQ(s->GetByQuery(DocQuery::Parse(Parse(R"({"qsl": {"match_all": {}}})")), {}, 1, 1)[0]
+                ["QUIXMDFSSize"], 5);
+
+  // A transaction not committed leaves nothing behind.
+  {
+    PgWriteTxn txn(*s);
+    s->Upsert("", FileDoc("/v/lost.txt"));
+  }
+  EXPECT_EQ(s->DocCount(), 2);
+}
+
+TEST_F(PgStoreTest, BulkUpsertSkipsRefusedAndKeepsTheLastOfAPath) {
+  auto s = Make();
+  std::vector<Json::Value> docs;
+  for (int i = 0; i < 2500; ++i) docs.push_back(FileDoc("/v/bulk/f" + std::to_string(i), i));
+  docs.push_back(FileDoc("/v/bulk/f7", 99999));
+  Json::Value bad = FileDoc("/v/bulk/bad");
+  bad["QUIXMDFSSize"] = "big";
+  docs.insert(docs.begin() + 3, bad);
+  std::vector<std::pair<size_t, std::string>> refused;
+  {
+    PgWriteTxn txn(*s);
+    EXPECT_EQ(s->UpsertMany(docs, &refused), 2501u);
+    txn.Commit();
+  }
+  ASSERT_EQ(refused.size(), 1u);
+  EXPECT_EQ(refused[0].first, 3u);
+  EXPECT_EQ(s->DocCount(), 2500);
+  SearchParams p;
+  p.size_min = 99999;
+  EXPECT_EQ(Paths(Find(*s, p)), std::vector<std::string>{"/v/bulk/f7"});
+}
+
+TEST_F(PgStoreTest, SearchesByNameFolderAndFilters) {
+  auto s = Make();
+  Put(*s, {FileDoc("/v/docs/Café Report.PDF", 300), FileDoc("/v/docs/cafe notes.txt", 200),
+           FileDoc("/v/docs/old/report 2023.pdf", 100), FileDoc("/v/docsx/report.pdf", 50),
+           FileDoc("/v/other/ab.txt", 10), FileDoc("/v/other/100%_done.txt", 20)});
+  auto names = [&](SearchParams p) { return Paths(Find(*s, p)); };
+  SearchParams p;
+  p.name = "CAFÉ";  // any case, with or without accents
+  p.sort = SearchParams::Sort::kSize;
+  EXPECT_EQ(names(p),
+            (std::vector<std::string>{"/v/docs/cafe notes.txt", "/v/docs/Café Report.PDF"}));
+  p = SearchParams();
+  p.name = "%_";  // wildcards of the server's pattern language are plain characters
+  EXPECT_EQ(names(p), std::vector<std::string>{"/v/other/100%_done.txt"});
+  p.name = "b";  // under three characters the names are scanned
+  EXPECT_EQ(names(p), std::vector<std::string>{"/v/other/ab.txt"});
+
+  p = SearchParams();
+  p.name = "report";
+  p.folder = "/v/docs/";
+  p.sort = SearchParams::Sort::kSize;
+  p.desc = true;
+  EXPECT_EQ(names(p), (std::vector<std::string>{"/v/docs/Café Report.PDF",
+                                                "/v/docs/old/report 2023.pdf"}));
+  p.exts = {"PDF"};
+  p.size_max = 150;
+  EXPECT_EQ(names(p), std::vector<std::string>{"/v/docs/old/report 2023.pdf"});
+
+  // Paging and totals, without and with a permission filter.
+  p = SearchParams();
+  p.name = "t";
+  p.sort = SearchParams::Sort::kName;
+  p.size = 2;
+  p.from = 1;
+  SearchPage all = Find(*s, p);
+  EXPECT_EQ(all.total, 6);
+  EXPECT_EQ(all.hits.size(), 2u);
+  SearchPage mine = Find(*s, p, [](const std::string& path) {
+    return path.find("/v/docs/") == 0;
+  });
+  EXPECT_EQ(mine.total, 3);
+  ASSERT_EQ(mine.hits.size(), 2u);
+  EXPECT_EQ(mine.hits[0]["name"], "Café Report.PDF");
+  EXPECT_EQ(mine.hits[1]["ext"], "pdf");
+  EXPECT_EQ(mine.hits[1]["size"], 100);
+}
+
+TEST_F(PgStoreTest, SearchesWordsAndSuggests) {
+  auto s = Make();
+  Put(*s, {FileDoc("/v/a.txt", 1, "Quarterly revenue of the holiday season"),
+           FileDoc("/v/b.txt", 2, "holiday photos holiday"),
+           FileDoc("/v/secret/c.txt", 3, "holistic holiday plans 2024"),
+           FileDoc("/v/d.txt", 4, "Crème brûlée recipe")});
+  SearchParams p;
+  p.keywords = "HOLIDAY";
+  SearchPage page = Find(*s, p);
+  EXPECT_EQ(page.total, 3);
+  ASSERT_EQ(page.hits.size(), 3u);
+  EXPECT_EQ(page.hits[0]["path"], "/v/b.txt") << "the document with the word twice ranks first";
+  EXPECT_NE(page.hits[0]["snippet"].asString().find("<b>holiday</b>"), std::string::npos);
+  EXPECT_GT(page.hits[0]["score"].asDouble(), page.hits[2]["score"].asDouble());
+
+  p.keywords = "creme brul*";
+  EXPECT_EQ(Paths(Find(*s, p)), std::vector<std::string>{"/v/d.txt"});
+  p.keywords = "revenue-quarterly";  // the words of one keyword as a phrase, in order
+  EXPECT_TRUE(Find(*s, p).hits.empty());
+  p.keywords = "quarterly-revenue";
+  EXPECT_EQ(Find(*s, p).hits.size(), 1u);
+  p.keywords = "--";
+  EXPECT_TRUE(Find(*s, p).hits.empty());
+
+  // Most used first; digits-only words are never offered; hidden documents lend no words.
+  EXPECT_EQ(s->Suggest("Hol", 10, nullptr),
+            (std::vector<std::string>{"holiday", "holistic"}));
+  EXPECT_EQ(s->Suggest("hol", 10,
+                       [](const std::string& path) { return path.find("/v/secret") != 0; }),
+            std::vector<std::string>{"holiday"});
+  EXPECT_TRUE(s->Suggest("20", 10, nullptr).empty());
+}
+
+TEST_F(PgStoreTest, ServerGoingAwayFailsRequestsUntilItIsBack) {
+  auto s = Make();
+  Put(*s, {FileDoc("/v/kept.txt")});
+  s->Sync();
+  // Stopped as by a crash: what was synced is there after recovery.
+  server_.Stop(SIGQUIT);
+  EXPECT_THROW(
+      {
+        PgWriteTxn txn(*s);
+        s->Upsert("", FileDoc("/v/lost.txt"));
+        txn.Commit();
+      },
+      StoreUnavailableError);
+  // Until the back-off has passed, nobody waits on a dead server.
+  EXPECT_THROW(s->DocCount(), StoreUnavailableError);
+  SearchParams p;
+  p.name = "txt";
+  EXPECT_THROW(s->Search(p, nullptr), StoreUnavailableError);
+
+  server_.Start();
+  ASSERT_TRUE(test::WaitFor(
+      [&] {
+        try {
+          return s->DocCount() == 1;
+        } catch (const StoreUnavailableError&) {
+          return false;
+        }
+      },
+      30000));
+  Put(*s, {FileDoc("/v/again.txt")});
+  EXPECT_EQ(Find(*s, p).total, 2);
+}
+
+}  // namespace
+}  // namespace elasticd
+}  // namespace orvane
