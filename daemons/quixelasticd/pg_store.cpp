@@ -22,7 +22,8 @@ namespace {
 // partition of its own, made and dropped with the index, so a whole index goes at once and a
 // search of one index reads one partition. Paths are kept as bytes (file names need not be
 // UTF-8) and ordered as the disk's bytes; `fname` holds the folded names in their written
-// form, `words` the folded words of the catch-all text with their positions.
+// form, `words` the folded words of the catch-all text with their positions, `doc` the rest of
+// the document as JSON in its written form (so the server can read members of it).
 const char kSchemaSql[] =
     "CREATE EXTENSION IF NOT EXISTS pg_trgm;"
     "CREATE TABLE IF NOT EXISTS fi_indexes(part serial PRIMARY KEY, server text NOT NULL,"
@@ -31,7 +32,7 @@ const char kSchemaSql[] =
     " CASCADE, key text NOT NULL, value text NOT NULL, PRIMARY KEY(part, key));"
     "CREATE TABLE IF NOT EXISTS fi_docs(part int NOT NULL, path bytea NOT NULL,"
     " fname text NOT NULL, ext text NOT NULL, size bigint NOT NULL, mtime bigint NOT NULL,"
-    " is_dir boolean NOT NULL, anc bytea NOT NULL, words tsvector, doc bytea NOT NULL,"
+    " is_dir smallint NOT NULL, anc bytea NOT NULL, words tsvector, doc text NOT NULL,"
     " PRIMARY KEY(part, path)) PARTITION BY LIST (part);"
     "CREATE INDEX IF NOT EXISTS fi_docs_fname ON fi_docs USING gin (fname gin_trgm_ops);"
     "CREATE INDEX IF NOT EXISTS fi_docs_words ON fi_docs USING gin (words);";
@@ -66,16 +67,6 @@ std::string EscapeLike(const std::string& s) {
   return out;
 }
 
-// A lexeme quoted for the text form of a word vector or a query.
-std::string Lexeme(const std::string& word) {
-  std::string out = "'";
-  for (char c : word) {
-    if (c == '\'' || c == '\\') out += c;
-    out += c;
-  }
-  return out + "'";
-}
-
 // The text form of the word vector of `text` (UTF-8): every folded word with its positions;
 // empty when there are none.
 std::string WordVector(const std::string& text) {
@@ -98,7 +89,7 @@ std::string WordVector(const std::string& text) {
   std::string out;
   for (const std::string* w : order) {
     if (!out.empty()) out += ' ';
-    out += Lexeme(*w);
+    out += PgLexeme(*w);
     char sep = ':';
     for (int p : positions[*w]) {
       out += sep;
@@ -109,35 +100,10 @@ std::string WordVector(const std::string& text) {
   return out;
 }
 
-// The keywords of a search, split on white space; a keyword's trailing '*' makes it a prefix.
-struct Keyword {
-  std::string text;
-  bool prefix;
-};
-
-std::vector<Keyword> KeywordsOf(const std::string& keywords) {
-  std::vector<Keyword> out;
-  size_t i = 0;
-  while (i < keywords.size()) {
-    while (i < keywords.size() && std::isspace(static_cast<unsigned char>(keywords[i]))) ++i;
-    size_t j = i;
-    while (j < keywords.size() && !std::isspace(static_cast<unsigned char>(keywords[j]))) ++j;
-    std::string word = keywords.substr(i, j - i);
-    i = j;
-    bool prefix = false;
-    while (!word.empty() && word.back() == '*') {
-      word.pop_back();
-      prefix = true;
-    }
-    if (!word.empty()) out.push_back({std::move(word), prefix});
-  }
-  return out;
-}
-
 // The same keywords for the in-memory word index snippets are made with.
 std::string SnippetMatch(const std::string& keywords) {
   std::string out;
-  for (const Keyword& k : KeywordsOf(keywords)) {
+  for (const Keyword& k : SplitKeywords(keywords)) {
     std::string quoted = "\"";
     for (char c : k.text) {
       if (c == '"') quoted += '"';
@@ -195,6 +161,34 @@ struct Sql {
   }
   void And(const std::string& cond) { where += " AND " + cond; }
 };
+
+// `c` with its marks numbered after the values already in `q`, its values added to them. Texts
+// go in binary form, which is their bytes both where the server reads them as text and where
+// it reads them as bytes (paths).
+std::string Numbered(const SqlCondition& c, Sql* q) {
+  std::string out;
+  size_t next = 0;
+  for (char ch : c.sql) {
+    if (ch != '?') {
+      out += ch;
+      continue;
+    }
+    const SqlValue& v = c.values.at(next++);
+    switch (v.kind) {
+      case SqlValue::Kind::kText:
+        out += q->Bytes(v.text);
+        break;
+      case SqlValue::Kind::kInt:
+        out += q->Int(v.integer);
+        break;
+      case SqlValue::Kind::kReal:
+        q->params.Real(v.real);
+        out += q->Next();
+        break;
+    }
+  }
+  return "(" + out + ")";
+}
 
 // The condition of a document query; `scan` when it tests a field without a column, which is
 // then read from every document.
@@ -267,23 +261,6 @@ void AddSnippets(const Schema& schema, const std::string& keywords, int64_t snip
 }
 
 }  // namespace
-
-std::string PgKeywordQuery(const std::string& keywords) {
-  std::string out;
-  for (const Keyword& k : KeywordsOf(EncodeName(keywords))) {
-    const std::vector<std::string> words = FoldWords(k.text);
-    if (words.empty()) continue;
-    std::string phrase;
-    for (size_t i = 0; i < words.size(); ++i) {
-      if (i > 0) phrase += " <-> ";
-      phrase += Lexeme(words[i]);
-      if (k.prefix && i + 1 == words.size()) phrase += ":*";
-    }
-    if (!out.empty()) out += " & ";
-    out += words.size() > 1 ? "(" + phrase + ")" : phrase;
-  }
-  return out;
-}
 
 void PgStore::PrepareDatabase(PgPool& pool) {
   PgPool::Lease conn(pool);
@@ -419,7 +396,7 @@ void PgStore::Rename(const std::string& new_id) {
 }
 
 Json::Value PgStore::ReadDoc(const PgResult& r, int row, int path_col, int doc_col) const {
-  Json::Value doc = ParseDoc(r.Bytes(row, doc_col));
+  Json::Value doc = ParseDoc(DecodeName(r.Text(row, doc_col)));
   doc[schema_.property_id()] = r.Bytes(row, path_col);
   return doc;
 }
@@ -440,14 +417,14 @@ void PgStore::WriteRows(const std::vector<const Json::Value*>& docs) {
         .Text(EncodeName(d.ext))
         .Int(d.size)
         .Int(d.mtime)
-        .Bool(d.is_dir)
+        .Int(d.is_dir ? 1 : 0)
         .Bytes(d.ancestor);
     if (words.empty()) {
       params.Null();
     } else {
       params.Text(words);
     }
-    params.Bytes(JsonToString(rest));
+    params.Text(EncodeName(JsonToString(rest)));
     sql += i == 0 ? "(" : ",(";
     sql += std::to_string(part_);
     for (int c = 0; c < kRowParams; ++c) {
@@ -599,7 +576,7 @@ Json::Value PgStore::List(const std::string& dir, const std::string& after,
     hit.append(r.Bytes(i, 0));
     hit.append(Json::Int64(r.Int(i, 1)));
     hit.append(Json::Int64(r.Int(i, 2)));
-    hit.append(r.Bool(i, 3));
+    hit.append(r.Int(i, 3) != 0);
     if (!extra.empty()) {
       // Each loaded field as the embedded store gives it: whole numbers and flags as numbers,
       // strings as they are, anything else as its JSON text.
@@ -700,7 +677,8 @@ SearchPage PgStore::Search(const SearchParams& p, const VisibleFn& visible, Quer
   bound(p.size_max, "d.size <= ");
   bound(p.mtime_min, "d.mtime >= ");
   bound(p.mtime_max, "d.mtime <= ");
-  if (p.is_dir) sql.And(*p.is_dir ? "d.is_dir" : "NOT d.is_dir");
+  if (p.is_dir) sql.And(*p.is_dir ? "d.is_dir = 1" : "d.is_dir = 0");
+  if (p.server_query) sql.And(Numbered(*p.server_query, &sql));
   const char* dir = p.desc ? " DESC" : " ASC";
   switch (p.sort) {
     case SearchParams::Sort::kRelevance:
@@ -794,7 +772,7 @@ std::vector<std::string> PgStore::Suggest(const std::string& prefix, size_t limi
           std::to_string(kSuggestSampleDocs) +
           ") s, unnest(s.words) w WHERE starts_with(w.lexeme, $3)"
           " GROUP BY w.lexeme ORDER BY count(*) DESC, w.lexeme LIMIT 200",
-      PgParams().Int(part_).Text(Lexeme(low) + ":*").Text(low));
+      PgParams().Int(part_).Text(PgLexeme(low) + ":*").Text(low));
   for (int i = 0; i < r.rows() && out.size() < limit; ++i) {
     if (guard != nullptr && guard->ShouldStop()) guard->Throw();
     const std::string term = r.Text(i, 0);
@@ -803,7 +781,7 @@ std::vector<std::string> PgStore::Suggest(const std::string& prefix, size_t limi
     if (!shown) {
       PgResult docs = conn->Exec("SELECT path FROM " + Table() +
                                      " WHERE part = $1 AND words @@ $2::tsquery LIMIT 64",
-                                 PgParams().Int(part_).Text(Lexeme(term)));
+                                 PgParams().Int(part_).Text(PgLexeme(term)));
       for (int j = 0; !shown && j < docs.rows(); ++j) shown = visible(docs.Bytes(j, 0));
     }
     if (shown) out.push_back(DecodeName(term));

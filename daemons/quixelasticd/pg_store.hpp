@@ -103,10 +103,6 @@ class PgWriteTxn {
   PgTxn txn_;
 };
 
-// A user's keywords as a word-vector query: each word folded and required, the words of one
-// keyword as a phrase, a trailing '*' a prefix. Empty when no keyword holds a word.
-std::string PgKeywordQuery(const std::string& keywords);
-
 }  // namespace elasticd
 }  // namespace orvane
 

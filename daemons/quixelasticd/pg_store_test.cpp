@@ -10,6 +10,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <string>
 #include <vector>
@@ -361,6 +362,85 @@ TEST_F(PgStoreTest, SearchesWordsAndSuggests) {
                        [](const std::string& path) { return path.find("/v/secret") != 0; }),
             std::vector<std::string>{"holiday"});
   EXPECT_TRUE(s->Suggest("20", 10, nullptr).empty());
+}
+
+// Both stores hold the same documents and must find the same ones, whatever the search.
+TEST_F(PgStoreTest, FindsWhatTheEmbeddedStoreFinds) {
+  test::TempDir dir;
+  auto lite = IndexStore::Create(dir.Path("idx"), "docs", tc::FileMappings(),
+                                 Json::Value(Json::objectValue), Json::Value(Json::objectValue));
+  auto pg = Make();
+  std::vector<Json::Value> docs = {
+      FileDoc("/v/Music/Été 2024.mp3", 4000000, "summer holiday mix"),
+      FileDoc("/v/Music/old/track01.flac", 30000000),
+      FileDoc("/v/Docs/Quarterly Report.docx", 20000, "quarterly revenue report"),
+      FileDoc("/v/Docs/report-draft.txt", 300, "draft of the quarterly report"),
+      FileDoc("/v/Docs.txt", 10),
+      FileDoc("/v/Photos/IMG_0001.JPG", 2000000),
+      FileDoc("/v/Photos/100%[x]?.png", 500),
+      FileDoc(std::string("/v/raw/ÿþ.bin"), 7),
+  };
+  Json::Value folder = FileDoc("/v/Docs", 0);
+  folder["QUIXMDIsDir"] = true;
+  docs.push_back(folder);
+  docs[5]["QUIXMDTitle"] = "beach";
+  docs[5]["QUIXMDAttributeChangeDate"] = 1600000000;
+  {
+    WriteTxn txn(*lite);
+    for (const Json::Value& d : docs) lite->Upsert("", d);
+    txn.Commit();
+  }
+  Put(*pg, docs);
+
+  const char* trees[] = {
+      R"({"match": "name", "pattern": "*report*"})",
+      R"({"match": "name", "pattern": "REPORT*"})",
+      R"({"match": "name", "pattern": "*ete*"})",
+      R"({"match": "name", "pattern": "*%[x]?*"})",
+      R"({"match": "name", "pattern": "*"})",
+      R"({"match": "content", "pattern": "quarterly report"})",
+      R"({"match": "content", "pattern": "*quart*"})",
+      R"({"match": "content", "pattern": "holi*"})",
+      R"({"match": "any", "pattern": "draft"})",
+      R"({"match": "title", "pattern": "revenue"})",
+      R"({"match": "path", "pattern": "/v/Docs/*"})",
+      R"({"range": "size", "gte": 1000, "lt": 5000000})",
+      R"({"range": "ctime", "gt": 0})",
+      R"({"not": {"range": "ctime", "gt": 0}})",
+      R"({"in": "ext", "values": ["JPG", "png"]})",
+      R"({"in": "kind", "values": ["audio", "folder"]})",
+      R"({"in": "kind", "values": ["other"]})",
+      R"({"under": "/v/Docs"})",
+      R"({"or": [{"under": "/v/Music/"}, {"not": {"match": "content", "pattern": "report"}}]})",
+      R"({"and": [{"under": "/v"}, {"match": "name", "pattern": "*.t*"}, {"all": true}]})",
+  };
+  auto sorted = [](SearchPage page) {
+    std::vector<std::string> paths = Paths(page);
+    std::sort(paths.begin(), paths.end());
+    return paths;
+  };
+  for (const char* tree : trees) {
+    SearchParams p;
+    p.size = 100;
+    p.query = CompileQueryTree(Parse(tree));
+    p.server_query = CompileQueryTreeForServer(Parse(tree));
+    const std::vector<std::string> want = sorted(lite->Search(p, nullptr));
+    EXPECT_EQ(sorted(pg->Search(p, nullptr)), want) << tree;
+    EXPECT_FALSE(want.empty() && std::string(tree).find("not") == std::string::npos &&
+                 std::string(tree).find("other") == std::string::npos)
+        << tree << " finds nothing: the case proves little";
+  }
+  for (const char* keywords : {"report", "REPORT quarterly", "holi*", "ete", "revenue-report",
+                               "img_0001"}) {
+    SearchParams p;
+    p.keywords = keywords;
+    EXPECT_EQ(sorted(pg->Search(p, nullptr)), sorted(lite->Search(p, nullptr))) << keywords;
+  }
+  for (const char* name : {"rep", "é", "0001.j", "s.t"}) {
+    SearchParams p;
+    p.name = name;
+    EXPECT_EQ(sorted(pg->Search(p, nullptr)), sorted(lite->Search(p, nullptr))) << name;
+  }
 }
 
 TEST_F(PgStoreTest, ServerGoingAwayFailsRequestsUntilItIsBack) {

@@ -135,22 +135,57 @@ std::string EscapeLikeText(const std::string& s) {
   return out;
 }
 
+// A glob of '*' wildcards as a LIKE pattern: '*' any run, everything else literal.
+std::string LikeOfGlob(const std::string& glob) {
+  std::string out;
+  for (char c : glob) {
+    if (c == '*') {
+      out += '%';
+      continue;
+    }
+    if (c == '%' || c == '_' || c == '\\') out += '\\';
+    out += c;
+  }
+  return out;
+}
+
+// A column of the embedded store's table as the server's table gives it: the document's
+// members are read from its JSON (numbers only for ranges, text for matches).
+std::string ServerColumn(const std::string& column, bool number) {
+  std::string member;
+  if (column == "d.ctime") {
+    member = kFieldCtime;
+  } else if (column == "d.crtime") {
+    member = kFieldCrtime;
+  } else if (column.compare(0, 24, "json_extract(d.rest, '$.") == 0) {
+    member = column.substr(24, column.size() - 26);
+  } else {
+    return column;
+  }
+  const std::string value = "(d.doc::jsonb -> '" + member + "')";
+  return number ? "(CASE WHEN jsonb_typeof" + value + " = 'number' THEN (" + value +
+                      " #>> '{}')::float8 END)"
+                : "(" + value + " #>> '{}')";
+}
+
 class Compiler {
  public:
   // `by_folder`: for a small folder, whose rows the path index gives at once; each name is
-  // then checked on the row at hand rather than looked up by its trigrams.
-  explicit Compiler(bool by_folder) : by_folder_(by_folder) {}
+  // then checked on the row at hand rather than looked up by its trigrams. `server`: rendered
+  // for the PostgreSQL store, whose table holds the folded name (`fname`) and the word vector
+  // (`words`) on the row itself, so nothing is joined.
+  Compiler(bool by_folder, bool server) : by_folder_(by_folder), server_(server) {}
 
   SqlCondition Run(const Json::Value& tree) {
     if (!tree.isObject()) Refuse("must be an object");
     SqlCondition c;
     c.sql = Node(tree, 1, true);
-    const std::string path = join_.empty() ? "d.path" : "+d.path";
+    const std::string path = join_.empty() || server_ ? "d.path" : "+d.path";
     for (size_t at = c.sql.find(kPathRef); at != std::string::npos; at = c.sql.find(kPathRef, at)) {
       c.sql.replace(at, std::strlen(kPathRef), path);
     }
     c.values = std::move(values_);
-    c.join = join_;
+    c.join = server_ ? std::string() : join_;
     c.folder = folder_;
     return c;
   }
@@ -212,7 +247,7 @@ class Compiler {
     if (op == "in") return In(q);
     if (op == "under") return Under(arg, required);
     if (!arg.isBool() || !arg.asBool()) Refuse("\"all\" must be true");
-    return "1";
+    return True();
   }
 
   std::string Match(const Json::Value& q, bool required) {
@@ -228,7 +263,7 @@ class Compiler {
       Refuse("\"pattern\" of a match must be a non-empty string");
     }
     if (pattern.asString().find_first_not_of('*') == std::string::npos) {
-      return text_column == nullptr ? "1" : std::string("(") + text_column + " IS NOT NULL)";
+      return text_column == nullptr ? True() : "(" + Column(text_column, false) + " IS NOT NULL)";
     }
     if (field == "path") return PathMatch(pattern.asString());
     // A full-text MATCH may not stand under OR or NOT: only a required pattern is joined.
@@ -250,6 +285,10 @@ class Compiler {
   // finds; a pattern without such a run scans the names.
   std::string NameMatch(const std::string& pattern, bool joined) {
     const std::string glob = GlobLiteral(FoldName(EncodeName(pattern)), true);
+    if (server_) {
+      Text(LikeOfGlob(FoldName(EncodeName(pattern))));
+      return "(d.fname LIKE ?)";
+    }
     Text(glob);
     if (by_folder_) return "((SELECT name FROM fts_name WHERE fts_name.rowid = d.rowid) GLOB ?)";
     const std::string sql = NameGlobCondition(glob);
@@ -258,6 +297,12 @@ class Compiler {
 
   std::string ContentCondition(const std::string& pattern, bool joined) {
     // The word index holds the written form of names, as the catch-all text does.
+    if (server_) {
+      const std::string query = PgContentQuery(pattern);
+      if (query.empty()) return True();
+      Text(query);
+      return "(d.words @@ ?::text::tsquery)";
+    }
     const std::string match = ContentMatch(EncodeName(pattern));
     if (match.empty()) {
       if (joined) join_.clear();
@@ -277,7 +322,8 @@ class Compiler {
       const size_t start = pattern.find_first_not_of(" \t\n*", i);
       if (start == std::string::npos) break;
       i = pattern.find_first_of(" \t\n*", start);
-      sql += std::string(" AND IFNULL(") + column + " LIKE ? ESCAPE '\\', 0)";
+      sql += server_ ? " AND COALESCE(" + Column(column, false) + " LIKE ?, FALSE)"
+                     : std::string(" AND IFNULL(") + column + " LIKE ? ESCAPE '\\', 0)";
       Text("%" + EscapeLikeText(pattern.substr(start, i - start)) + "%");
     }
     return "(" + sql + ")";
@@ -287,6 +333,19 @@ class Compiler {
   // of the pattern is a range of the path index.
   std::string PathMatch(const std::string& pattern) {
     const std::string path = EncodeName(pattern);
+    if (server_) {
+      // The server keeps paths as their bytes.
+      std::string sql = "(d.path LIKE ?";
+      Text(LikeOfGlob(pattern));
+      const std::string prefix = pattern.substr(0, pattern.find('*'));
+      const std::optional<std::string> upper = PrefixUpperBound(prefix);
+      if (!prefix.empty() && upper) {
+        sql += " AND d.path >= ? AND d.path < ?";
+        Text(prefix);
+        Text(*upper);
+      }
+      return sql + ")";
+    }
     std::string glob;
     for (char c : path) {
       if (c == '[' || c == '?') {
@@ -329,9 +388,10 @@ class Compiler {
         n.real = v.asDouble();
       }
       values_.push_back(n);
-      sql += (sql.empty() ? "" : " AND ") + std::string(column) + cmp;
+      sql += (sql.empty() ? "" : " AND ") + Column(column, true) + cmp;
     }
     if (sql.empty()) Refuse("a range needs \"gte\", \"gt\", \"lte\" or \"lt\"");
+    if (server_) return "COALESCE(" + sql + ", FALSE)";
     // A document without the value is outside every range, and inside its negation.
     return "IFNULL(" + sql + ", 0)";
   }
@@ -397,11 +457,18 @@ class Compiler {
     const std::string upper = *PrefixUpperBound(under);
     for (const std::string& v : {folder, under, upper, folder, under, upper}) Text(v);
     const std::string path = kPathRef;
-    return "(" + path + " = ? OR (" + path + " >= ? AND " + path + " < ? AND (d.ancestor = ? OR"
-           " (d.ancestor >= ? AND d.ancestor < ?))))";
+    const std::string anc = server_ ? "d.anc" : "d.ancestor";
+    return "(" + path + " = ? OR (" + path + " >= ? AND " + path + " < ? AND (" + anc +
+           " = ? OR (" + anc + " >= ? AND " + anc + " < ?))))";
+  }
+
+  std::string True() const { return server_ ? "TRUE" : "1"; }
+  std::string Column(const char* column, bool number) const {
+    return server_ ? ServerColumn(column, number) : std::string(column);
   }
 
   const bool by_folder_;
+  const bool server_;
   int nodes_ = 0;
   std::vector<SqlValue> values_;
   std::string join_;
@@ -411,11 +478,77 @@ class Compiler {
 }  // namespace
 
 SqlCondition CompileQueryTree(const Json::Value& tree) {
-  SqlCondition c = Compiler(false).Run(tree);
+  SqlCondition c = Compiler(false, false).Run(tree);
   if (!c.folder.empty() && !c.join.empty()) {
-    c.by_folder = std::make_shared<const SqlCondition>(Compiler(true).Run(tree));
+    c.by_folder = std::make_shared<const SqlCondition>(Compiler(true, false).Run(tree));
   }
   return c;
+}
+
+std::vector<Keyword> SplitKeywords(const std::string& keywords) {
+  std::vector<Keyword> out;
+  size_t i = 0;
+  while (i < keywords.size()) {
+    while (i < keywords.size() && std::isspace(static_cast<unsigned char>(keywords[i]))) ++i;
+    size_t j = i;
+    while (j < keywords.size() && !std::isspace(static_cast<unsigned char>(keywords[j]))) ++j;
+    std::string word = keywords.substr(i, j - i);
+    i = j;
+    bool prefix = false;
+    while (!word.empty() && word.back() == '*') {
+      word.pop_back();
+      prefix = true;
+    }
+    if (!word.empty()) out.push_back({std::move(word), prefix});
+  }
+  return out;
+}
+
+std::string PgLexeme(const std::string& word) {
+  std::string out = "'";
+  for (char c : word) {
+    if (c == '\'' || c == '\\') out += c;
+    out += c;
+  }
+  return out + "'";
+}
+
+std::string PgKeywordQuery(const std::string& keywords) {
+  std::string out;
+  for (const Keyword& k : SplitKeywords(EncodeName(keywords))) {
+    const std::vector<std::string> words = FoldWords(k.text);
+    if (words.empty()) continue;
+    std::string phrase;
+    for (size_t i = 0; i < words.size(); ++i) {
+      if (i > 0) phrase += " <-> ";
+      phrase += PgLexeme(words[i]);
+      if (k.prefix && i + 1 == words.size()) phrase += ":*";
+    }
+    if (!out.empty()) out += " & ";
+    out += words.size() > 1 ? "(" + phrase + ")" : phrase;
+  }
+  return out;
+}
+
+SqlCondition CompileQueryTreeForServer(const Json::Value& tree) {
+  return Compiler(false, true).Run(tree);
+}
+
+std::string PgContentQuery(const std::string& pattern) {
+  // Leading stars are dropped and a star ends its word as a prefix, as in the word index.
+  std::string words;
+  size_t i = 0;
+  while (i < pattern.size()) {
+    const size_t start = pattern.find_first_not_of(" \t\n*", i);
+    if (start == std::string::npos) break;
+    i = pattern.find_first_of(" \t\n", start);
+    std::string word = pattern.substr(start, i == std::string::npos ? i : i - start);
+    const size_t star = word.find('*');
+    const bool prefix = star != std::string::npos;
+    if (prefix) word.erase(star);
+    words += (words.empty() ? "" : " ") + word + (prefix ? "*" : "");
+  }
+  return PgKeywordQuery(words);
 }
 
 SqlCondition NarrowToFolder(Db& db, const SqlCondition& c) {

@@ -46,6 +46,28 @@ constexpr int kMaxQueryNodes = 256;
 // (unknown operator or field, a value of the wrong type, too deep, too many nodes).
 SqlCondition CompileQueryTree(const Json::Value& tree);
 
+// The same tree for the PostgreSQL store's table `d`: its marks are '?' as well (the store
+// numbers them), texts are compared as bytes or text as their column is, content patterns are
+// word-vector queries and names are LIKE patterns over the folded names. Never joined.
+SqlCondition CompileQueryTreeForServer(const Json::Value& tree);
+
+// A content pattern as a word-vector query (see PgKeywordQuery); empty when it holds no word.
+std::string PgContentQuery(const std::string& pattern);
+
+// The keywords of a search, split on white space; a keyword's trailing '*' makes it a prefix.
+struct Keyword {
+  std::string text;
+  bool prefix;
+};
+std::vector<Keyword> SplitKeywords(const std::string& keywords);
+
+// A lexeme quoted for the text form of a word vector or a word-vector query.
+std::string PgLexeme(const std::string& word);
+
+// A user's keywords as a word-vector query: each word folded and required, the words of one
+// keyword as a phrase, a trailing '*' a prefix. Empty when no keyword holds a word.
+std::string PgKeywordQuery(const std::string& keywords);
+
 class Db;
 
 // `c` as it is best run on `db`. A joined pattern is read from all of its matches, a common

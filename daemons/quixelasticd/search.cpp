@@ -129,7 +129,10 @@ SearchParams ParseSearch(const Json::Value& d) {
     p.exts = ExtensionsOfKind(type, p.exts);
     p.is_dir = false;
   }
-  if (!d["query"].isNull()) p.query = CompileQueryTree(d["query"]);
+  if (!d["query"].isNull()) {
+    p.query = CompileQueryTree(d["query"]);
+    p.server_query = CompileQueryTreeForServer(d["query"]);
+  }
   ReadRange(d, "size_range", &p.size_min, &p.size_max);
   ReadRange(d, "mtime_range", &p.mtime_min, &p.mtime_max);
   p.sort = ReadSort(OptionalString(d, "sort"));

@@ -49,6 +49,8 @@ struct SearchParams {
   std::string folder;
   // A structured query, ANDed with the members above.
   std::optional<SqlCondition> query;
+  // The same query rendered for the PostgreSQL store.
+  std::optional<SqlCondition> server_query;
   Sort sort = Sort::kRelevance;
   bool desc = false;
   int64_t from = 0;
