@@ -636,9 +636,20 @@ bool PgStore::QuickCheck(std::string* detail) {
 }
 
 SearchPage PgStore::Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard) {
+  return Run(p, visible, guard, false);
+}
+
+SearchPage PgStore::SearchEverywhere(const SearchParams& p, const VisibleFn& visible,
+                                     QueryGuard* guard) {
+  return Run(p, visible, guard, true);
+}
+
+SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard,
+                        bool everywhere) {
   Sql sql;
-  sql.Int(part_);
-  std::string select = "SELECT d.path, d.doc";
+  if (!everywhere) sql.Int(part_);
+  // The server's name comes last, after the score.
+  std::string select = "SELECT d.path, d.doc, " + std::string(everywhere ? "0, i.server" : "0");
   std::string order;
   const std::string tsquery = PgKeywordQuery(p.keywords);
   if (!p.keywords.empty() && tsquery.empty()) {
@@ -647,7 +658,8 @@ SearchPage PgStore::Search(const SearchParams& p, const VisibleFn& visible, Quer
   } else if (!tsquery.empty()) {
     const std::string q = sql.Text(tsquery) + "::tsquery";
     sql.And("d.words @@ " + q);
-    select += ", ts_rank(d.words, " + q + ")";
+    select = "SELECT d.path, d.doc, ts_rank(d.words, " + q + ")" +
+             (everywhere ? ", i.server" : "");
     if (p.sort == SearchParams::Sort::kRelevance) {
       order = std::string(" ORDER BY ts_rank(d.words, ") + q + ")" + (p.desc ? "" : " DESC") +
               ", d.path";
@@ -693,7 +705,9 @@ SearchPage PgStore::Search(const SearchParams& p, const VisibleFn& visible, Quer
       order = std::string(" ORDER BY d.mtime") + dir + ", d.path";
       break;
   }
-  const std::string from = " FROM " + Table() + " d WHERE d.part = $1" + sql.where;
+  const std::string from =
+      everywhere ? " FROM fi_docs d JOIN fi_indexes i ON i.part = d.part WHERE TRUE" + sql.where
+                 : " FROM " + Table() + " d WHERE d.part = $1" + sql.where;
   const bool ranked = !tsquery.empty();
 
   SearchPage page;
@@ -710,6 +724,7 @@ SearchPage PgStore::Search(const SearchParams& p, const VisibleFn& visible, Quer
     hit["is_dir"] = d.is_dir;
     hit["ext"] = d.ext;
     if (ranked) hit["score"] = r.Real(i, 2);
+    if (everywhere) hit["server"] = r.Text(i, 3);
     page.hits.push_back(std::move(hit));
     docs.push_back(std::move(doc));
   };
@@ -745,6 +760,8 @@ SearchPage PgStore::Search(const SearchParams& p, const VisibleFn& visible, Quer
           done = true;
           break;
         }
+        // Another server's files cannot be checked here: they are shown to root only.
+        if (everywhere && r.Text(i, 3) != server_) continue;
         if (!visible(r.Bytes(i, 0))) continue;
         ++seen;
         if (seen > p.from && seen <= p.from + p.size) add(r, i);

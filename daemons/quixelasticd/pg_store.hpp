@@ -73,12 +73,19 @@ class PgStore {
 
   // --- reader side: any thread. The guard is consulted between rows.
   SearchPage Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard = nullptr);
+  // The search over every index of every server in the database. Each hit names its server
+  // ("server"); a caller with a permission filter sees only this server's files, which the
+  // filter can check.
+  SearchPage SearchEverywhere(const SearchParams& p, const VisibleFn& visible,
+                              QueryGuard* guard = nullptr);
   std::vector<std::string> Suggest(const std::string& prefix, size_t limit,
                                    const VisibleFn& visible, QueryGuard* guard = nullptr);
 
  private:
   PgStore(std::shared_ptr<PgPool> pool, std::string server, std::string id, int part);
   void LoadSchema();
+  SearchPage Run(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard,
+                 bool everywhere);
   std::string Table() const { return "fi_docs_" + std::to_string(part_); }
   // Writes `docs` (validated, deduplicated by path) in one statement.
   void WriteRows(const std::vector<const Json::Value*>& docs);

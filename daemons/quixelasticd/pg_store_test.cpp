@@ -161,6 +161,21 @@ TEST_F(PgStoreTest, IndexesAreKeptPerServerAndSurviveReopening) {
   EXPECT_EQ(a->schema().property_id(), "QUIXMDPath");
   EXPECT_EQ(a->Meta("term_sugg"), "ready");
 
+  // One search over both servers: each hit names its server; a caller with a permission
+  // filter only gets this server's files, which the filter can check.
+  Put(*b, {FileDoc("/w/a.txt"), FileDoc("/w/b.txt")});
+  SearchParams p;
+  p.name = "a.txt";
+  p.sort = SearchParams::Sort::kName;
+  SearchPage all = b->SearchEverywhere(p, nullptr);
+  ASSERT_EQ(all.hits.size(), 2u);
+  EXPECT_EQ(all.hits[0]["server"], "s1");
+  EXPECT_EQ(all.hits[0]["path"], "/v/a.txt");
+  EXPECT_EQ(all.hits[1]["server"], "s2");
+  EXPECT_EQ(Paths(b->SearchEverywhere(p, [](const std::string&) { return true; })),
+            std::vector<std::string>{"/w/a.txt"});
+  EXPECT_EQ(Paths(b->Search(p, nullptr)), std::vector<std::string>{"/w/a.txt"});
+
   a->Rename("docs2");
   EXPECT_EQ(PgStore::Open(pool_, "s1", "docs2")->DocCount(), 1);
   EXPECT_THROW(Make("s1", "docs2"), EngineError);
