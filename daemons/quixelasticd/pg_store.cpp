@@ -22,8 +22,10 @@ namespace {
 // partition of its own, made and dropped with the index, so a whole index goes at once and a
 // search of one index reads one partition. Paths are kept as bytes (file names need not be
 // UTF-8) and ordered as the disk's bytes; `fname` holds the folded names in their written
-// form, `words` the folded words of the catch-all text with their positions, `doc` the rest of
-// the document as JSON in its written form (so the server can read members of it).
+// form, `words` the folded words of the catch-all text with their positions. A document is
+// kept once: the columns, and in `doc` (JSON in its written form, so the server can read
+// members of it; null when empty) the members no column gives back; `kept` says which members
+// the columns stand for (see CompactOf).
 const char kSchemaSql[] =
     "CREATE EXTENSION IF NOT EXISTS pg_trgm;"
     "CREATE TABLE IF NOT EXISTS fi_indexes(part serial PRIMARY KEY, server text NOT NULL,"
@@ -32,7 +34,8 @@ const char kSchemaSql[] =
     " CASCADE, key text NOT NULL, value text NOT NULL, PRIMARY KEY(part, key));"
     "CREATE TABLE IF NOT EXISTS fi_docs(part int NOT NULL, path bytea NOT NULL,"
     " fname text NOT NULL, ext text NOT NULL, size bigint NOT NULL, mtime bigint NOT NULL,"
-    " is_dir smallint NOT NULL, anc bytea NOT NULL, words tsvector, doc text NOT NULL,"
+    " is_dir smallint NOT NULL, ctime bigint, crtime bigint, owner text, grp text,"
+    " anc bytea NOT NULL, kept int NOT NULL, words tsvector, doc text,"
     " PRIMARY KEY(part, path)) PARTITION BY LIST (part);"
     "CREATE INDEX IF NOT EXISTS fi_docs_fname ON fi_docs USING gin (fname gin_trgm_ops);"
     "CREATE INDEX IF NOT EXISTS fi_docs_words ON fi_docs USING gin (words);";
@@ -42,8 +45,15 @@ const char kSchemaSql[] =
 const char kSchemaLock[] = "SELECT pg_advisory_xact_lock(7415011)";
 
 // The columns a write sets, in the order WriteRows binds them.
-const char kRowColumns[] = "part, path, fname, ext, size, mtime, is_dir, anc, words, doc";
-constexpr int kRowParams = 9;  // all but the partition number, which is part of the statement
+const char kRowColumns[] =
+    "part, path, fname, ext, size, mtime, is_dir, ctime, crtime, owner, grp, anc, kept, words,"
+    " doc";
+constexpr int kRowParams = 14;  // all but the partition number, which is part of the statement
+constexpr int kWordsParam = 12;
+// The columns a document is read back from, in the order ReadDoc takes them.
+const char kDocColumns[] =
+    "d.path, d.doc, d.anc, d.ext, d.size, d.mtime, d.is_dir, d.ctime, d.crtime, d.owner, d.grp,"
+    " d.kept";
 // Rows of one INSERT: PostgreSQL takes at most 65535 parameters in a statement.
 constexpr size_t kRowsPerStatement = 1000;
 
@@ -121,6 +131,90 @@ Json::Value ParseDoc(const std::string& text) {
     throw StoreError(SQLITE_CORRUPT, "stored document is not a JSON object");
   }
   return v;
+}
+
+// Bits of `kept`: the members of the document the columns give back, each only when the
+// column gives back the very value it had, type included.
+enum Kept : int {
+  kName = 1 << 0,         // the file name: the path's last part
+  kDisplayName = 1 << 1,  // the same as the file name
+  kSearchName = 1 << 2,   // the same as the file name
+  kParent = 1 << 3,       // the path's folder part
+  kAncestor = 1 << 4,     // the ancestor field: the `anc` column
+  kExtension = 1 << 5,    // the `ext` column (already lower case)
+  kKind = 1 << 6,         // the `ext` column
+  kIsDir = 1 << 7,        // a flag
+  kSize = 1 << 8,         // whole numbers
+  kMtime = 1 << 9,
+  kCtime = 1 << 10,
+  kCrtime = 1 << 11,
+  kOwner = 1 << 12,  // texts
+  kGroup = 1 << 13,
+};
+
+// The path's last part and its folder part.
+std::pair<std::string, std::string> SplitPath(const std::string& path) {
+  const size_t slash = path.rfind('/');
+  if (slash == std::string::npos) return {path, std::string()};
+  return {path.substr(slash + 1), path.substr(0, slash)};
+}
+
+// A document as the row keeps it: the members no column gives back, and which ones they do.
+struct Compact {
+  int kept = 0;
+  std::optional<int64_t> ctime, crtime;
+  std::optional<std::string> owner, grp;
+  Json::Value rest{Json::objectValue};
+};
+
+Compact CompactOf(const Schema& schema, const Json::Value& doc, const DerivedDoc& d) {
+  Compact c;
+  const auto [base, folder] = SplitPath(d.path);
+  const Json::Value* fs_name = doc.find(kFieldFSName, kFieldFSName + std::strlen(kFieldFSName));
+  for (auto it = doc.begin(); it != doc.end(); ++it) {
+    const std::string field = it.name();
+    const Json::Value& v = *it;
+    if (field == schema.property_id()) continue;
+    const bool text = v.isString();
+    const bool whole = v.type() == Json::intValue;
+    int bit = 0;
+    if (field == schema.ancestor_field()) {
+      if (text && v.asString() == d.ancestor) bit = kAncestor;
+    } else if (field == kFieldFSName) {
+      if (text && v.asString() == base) bit = kName;
+    } else if (field == kFieldDisplayName || field == kFieldSearchName) {
+      if (text && fs_name != nullptr && fs_name->isString() && v == *fs_name &&
+          fs_name->asString() == base) {
+        bit = field == kFieldDisplayName ? kDisplayName : kSearchName;
+      }
+    } else if (field == kFieldParent) {
+      if (text && v.asString() == folder && d.path.find('/') != std::string::npos) bit = kParent;
+    } else if (field == kFieldExtension || field == kFieldKind) {
+      if (text && v.asString() == d.ext) bit = field == kFieldExtension ? kExtension : kKind;
+    } else if (field == kFieldIsDir) {
+      if (v.isBool()) bit = kIsDir;
+    } else if (field == kFieldSize || field == kFieldMtime) {
+      if (whole && v.asInt64() == (field == kFieldSize ? d.size : d.mtime)) {
+        bit = field == kFieldSize ? kSize : kMtime;
+      }
+    } else if (field == kFieldCtime || field == kFieldCrtime) {
+      if (whole) {
+        bit = field == kFieldCtime ? kCtime : kCrtime;
+        (bit == kCtime ? c.ctime : c.crtime) = v.asInt64();
+      }
+    } else if (field == kFieldOwner || field == kFieldGroup) {
+      if (text) {
+        bit = field == kFieldOwner ? kOwner : kGroup;
+        (bit == kOwner ? c.owner : c.grp) = v.asString();
+      }
+    }
+    if (bit != 0) {
+      c.kept |= bit;
+    } else {
+      c.rest[field] = v;
+    }
+  }
+  return c;
 }
 
 // A field's value as the document queries compare it: the text of a string or a number, 1 or
@@ -395,48 +489,97 @@ void PgStore::Rename(const std::string& new_id) {
   id_ = new_id;
 }
 
-Json::Value PgStore::ReadDoc(const PgResult& r, int row, int path_col, int doc_col) const {
-  Json::Value doc = ParseDoc(DecodeName(r.Text(row, doc_col)));
-  doc[schema_.property_id()] = r.Bytes(row, path_col);
+Json::Value PgStore::ReadDoc(const PgResult& r, int row, int first) const {
+  Json::Value doc = r.IsNull(row, first + 1) ? Json::Value(Json::objectValue)
+                                             : ParseDoc(DecodeName(r.Text(row, first + 1)));
+  const std::string path = r.Bytes(row, first);
+  const int kept = static_cast<int>(r.Int(row, first + 11));
+  const auto [base, folder] = SplitPath(path);
+  auto put = [&](int bit, const char* field, Json::Value v) {
+    if (kept & bit) doc[field] = std::move(v);
+  };
+  put(kName, kFieldFSName, base);
+  put(kDisplayName, kFieldDisplayName, base);
+  put(kSearchName, kFieldSearchName, base);
+  put(kParent, kFieldParent, folder);
+  if (kept & kAncestor) doc[schema_.ancestor_field()] = r.Bytes(row, first + 2);
+  const std::string ext = (kept & (kExtension | kKind)) ? DecodeName(r.Text(row, first + 3)) : "";
+  put(kExtension, kFieldExtension, ext);
+  put(kKind, kFieldKind, ext);
+  put(kSize, kFieldSize, Json::Int64(r.Int(row, first + 4)));
+  put(kMtime, kFieldMtime, Json::Int64(r.Int(row, first + 5)));
+  put(kIsDir, kFieldIsDir, r.Int(row, first + 6) != 0);
+  put(kCtime, kFieldCtime, Json::Int64(r.Int(row, first + 7)));
+  put(kCrtime, kFieldCrtime, Json::Int64(r.Int(row, first + 8)));
+  put(kOwner, kFieldOwner, DecodeName(r.Text(row, first + 9)));
+  put(kGroup, kFieldGroup, DecodeName(r.Text(row, first + 10)));
+  doc[schema_.property_id()] = path;
   return doc;
 }
 
-void PgStore::WriteRows(const std::vector<const Json::Value*>& docs) {
-  std::string sql = std::string("INSERT INTO ") + Table() + " AS d(" + kRowColumns + ") VALUES";
+void PgStore::WriteRows(const std::vector<const Json::Value*>& docs, const std::string* gone) {
+  std::string sql;
   PgParams params;
   int n = 0;
+  if (gone != nullptr) {
+    // In the same statement, so that a re-keyed document costs one round trip: the insert
+    // does not see the deleted row, and its key is another.
+    params.Bytes(*gone);
+    sql = "WITH gone AS (DELETE FROM " + Table() + " WHERE part = " + std::to_string(part_) +
+          " AND path = $" + std::to_string(++n) + ") ";
+  }
+  sql += std::string("INSERT INTO ") + Table() + " AS d(" + kRowColumns + ") VALUES";
   for (size_t i = 0; i < docs.size(); ++i) {
     const Json::Value& doc = *docs[i];
     const DerivedDoc d = schema_.Derive(doc);
-    // The path is its own column; the rest of the document is kept as its compact JSON.
-    Json::Value rest = doc;
-    rest.removeMember(schema_.property_id());
+    const Compact c = CompactOf(schema_, doc, d);
     const std::string words = WordVector(EncodeName(d.all_text));
+    auto int_or_null = [&](const std::optional<int64_t>& v) {
+      if (v) {
+        params.Int(*v);
+      } else {
+        params.Null();
+      }
+    };
+    auto text_or_null = [&](const std::optional<std::string>& v) {
+      if (v) {
+        params.Text(EncodeName(*v));
+      } else {
+        params.Null();
+      }
+    };
     params.Bytes(d.path)
         .Text(FoldName(EncodeName(d.name_text)))
         .Text(EncodeName(d.ext))
         .Int(d.size)
         .Int(d.mtime)
-        .Int(d.is_dir ? 1 : 0)
-        .Bytes(d.ancestor);
+        .Int(d.is_dir ? 1 : 0);
+    int_or_null(c.ctime);
+    int_or_null(c.crtime);
+    text_or_null(c.owner);
+    text_or_null(c.grp);
+    params.Bytes(d.ancestor).Int(c.kept);
     if (words.empty()) {
       params.Null();
     } else {
-      params.Text(words);
+      params.Text(words);  // in written form already
     }
-    params.Text(EncodeName(JsonToString(rest)));
+    text_or_null(c.rest.empty() ? std::nullopt
+                                : std::optional<std::string>(JsonToString(c.rest)));
     sql += i == 0 ? "(" : ",(";
     sql += std::to_string(part_);
     for (int c = 0; c < kRowParams; ++c) {
       sql += ",$" + std::to_string(++n);
-      if (c == 7) sql += "::tsvector";
+      if (c == kWordsParam) sql += "::tsvector";
     }
     sql += ")";
   }
   sql += " ON CONFLICT (part, path) DO UPDATE SET fname = excluded.fname, ext = excluded.ext,"
          " size = excluded.size, mtime = excluded.mtime, is_dir = excluded.is_dir,"
-         " anc = excluded.anc, words = excluded.words, doc = excluded.doc";
-  Writer().Exec(sql, params);
+         " ctime = excluded.ctime, crtime = excluded.crtime, owner = excluded.owner,"
+         " grp = excluded.grp, anc = excluded.anc, kept = excluded.kept,"
+         " words = excluded.words, doc = excluded.doc";
+  Writer().ExecCached(sql, params);
 }
 
 void PgStore::Upsert(const std::string& doc_id, const Json::Value& given) {
@@ -446,8 +589,7 @@ void PgStore::Upsert(const std::string& doc_id, const Json::Value& given) {
   if (!doc.isMember(pid) && !doc_id.empty()) doc[pid] = doc_id;
   schema_.Validate(doc);
   const std::string path = doc[pid].asString();
-  if (!doc_id.empty() && doc_id != path) Delete(doc_id);
-  WriteRows({&doc});
+  WriteRows({&doc}, !doc_id.empty() && doc_id != path ? &doc_id : nullptr);
 }
 
 size_t PgStore::UpsertMany(const std::vector<Json::Value>& docs,
@@ -490,10 +632,11 @@ size_t PgStore::UpsertMany(const std::vector<Json::Value>& docs,
 void PgStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
   if (!fields.isObject()) throw EngineError(kCodeDocInvalid, "fields are not an object");
   PgConn& w = Writer();
-  PgResult r = w.Exec("SELECT path, doc FROM " + Table() + " WHERE part = $1 AND path = $2",
-                      PgParams().Int(part_).Bytes(doc_id));
+  PgResult r = w.ExecCached(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
+                                " d WHERE part = $1 AND path = $2",
+                            PgParams().Int(part_).Bytes(doc_id));
   if (r.rows() == 0) throw EngineError(kCodeDocNotFound, "no document " + doc_id);
-  Json::Value doc = ReadDoc(r, 0, 0, 1);
+  Json::Value doc = ReadDoc(r, 0, 0);
   for (const std::string& k : fields.getMemberNames()) {
     if (fields[k].isNull()) {
       doc.removeMember(k);
@@ -504,8 +647,7 @@ void PgStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
   schema_.Validate(doc);
   const std::string path = doc[schema_.property_id()].asString();
   // A re-keyed document replaces whatever was at its new path.
-  if (path != doc_id) Delete(doc_id);
-  WriteRows({&doc});
+  WriteRows({&doc}, path != doc_id ? &doc_id : nullptr);
 }
 
 bool PgStore::Delete(const std::string& doc_id) {
@@ -523,10 +665,12 @@ int64_t PgStore::DeleteByQuery(const DocQuery& q) {
     return Writer().Exec("DELETE FROM " + Table() + " WHERE part = $1" + sql.where, sql.params)
         .Changed();
   }
-  PgResult r = Writer().Exec("SELECT path, doc FROM " + Table() + " WHERE part = $1", sql.params);
+  PgResult r = Writer().Exec(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
+                                 " d WHERE part = $1",
+                             sql.params);
   int64_t deleted = 0;
   for (int i = 0; i < r.rows(); ++i) {
-    if (w.Matches(ReadDoc(r, i, 0, 1)) && Delete(r.Bytes(i, 0))) ++deleted;
+    if (w.Matches(ReadDoc(r, i, 0)) && Delete(r.Bytes(i, 0))) ++deleted;
   }
   return deleted;
 }
@@ -536,8 +680,8 @@ Json::Value PgStore::GetByQuery(const DocQuery& q, const std::vector<std::string
   Sql sql;
   sql.Int(part_);
   const DocWhere w = WhereOf(schema_, q, &sql);
-  std::string text = "SELECT path, doc FROM " + Table() + " WHERE part = $1" + sql.where +
-                     " ORDER BY path";
+  std::string text = std::string("SELECT ") + kDocColumns + " FROM " + Table() +
+                     " d WHERE part = $1" + sql.where + " ORDER BY path";
   if (!w.scan) {
     text += " LIMIT " + sql.Int(size);
     text += " OFFSET " + sql.Int(from);
@@ -546,7 +690,7 @@ Json::Value PgStore::GetByQuery(const DocQuery& q, const std::vector<std::string
   Json::Value hits(Json::arrayValue);
   int64_t matched = 0;
   for (int i = 0; i < r.rows() && static_cast<int64_t>(hits.size()) < size; ++i) {
-    const Json::Value doc = ReadDoc(r, i, 0, 1);
+    const Json::Value doc = ReadDoc(r, i, 0);
     if (w.scan && (!w.Matches(doc) || matched++ < from)) continue;
     hits.append(schema_.Load(doc, load));
   }
@@ -565,9 +709,9 @@ Json::Value PgStore::List(const std::string& dir, const std::string& after,
   sql.And(std::string("path ") + (resume ? "> " : ">= ") + sql.Bytes(resume ? after : dir));
   if (upper) sql.And("path < " + sql.Bytes(*upper));
   sql.And("(path = " + sql.Bytes(dir) + " OR path >= " + sql.Bytes(under) + ")");
-  const std::string text = std::string("SELECT path, size, mtime, is_dir") +
-                           (extra.empty() ? "" : ", doc") + " FROM " + Table() +
-                           " WHERE part = $1" + sql.where + " ORDER BY path LIMIT " +
+  const std::string text = std::string("SELECT d.path, d.size, d.mtime, d.is_dir") +
+                           (extra.empty() ? "" : std::string(", ") + kDocColumns) + " FROM " +
+                           Table() + " d WHERE part = $1" + sql.where + " ORDER BY path LIMIT " +
                            sql.Int(size);
   PgResult r = Writer().Exec(text, sql.params);
   Json::Value hits(Json::arrayValue);
@@ -580,7 +724,7 @@ Json::Value PgStore::List(const std::string& dir, const std::string& after,
     if (!extra.empty()) {
       // Each loaded field as the embedded store gives it: whole numbers and flags as numbers,
       // strings as they are, anything else as its JSON text.
-      const Json::Value doc = ReadDoc(r, i, 0, 4);
+      const Json::Value doc = ReadDoc(r, i, 4);
       for (const std::string& field : extra) {
         const Json::Value* v = doc.find(field.data(), field.data() + field.size());
         if (v == nullptr || v->isNull()) {
@@ -610,6 +754,11 @@ bool PgStore::UpdateTermSuggestion(const std::string& doc_id) {
 
 int64_t PgStore::DocCount() {
   return Writer().Exec("SELECT count(*) FROM " + Table()).Int(0, 0);
+}
+
+int64_t PgStore::DiskBytes() {
+  return Writer().Exec("SELECT pg_total_relation_size($1::regclass)", PgParams().Text(Table()))
+      .Int(0, 0);
 }
 
 void PgStore::Sync() {
@@ -649,7 +798,7 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
   Sql sql;
   if (!everywhere) sql.Int(part_);
   // The server's name comes last, after the score.
-  std::string select = "SELECT d.path, d.doc, " + std::string(everywhere ? "0, i.server" : "0");
+  std::string score = "0";
   std::string order;
   const std::string tsquery = PgKeywordQuery(p.keywords);
   if (!p.keywords.empty() && tsquery.empty()) {
@@ -658,8 +807,7 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
   } else if (!tsquery.empty()) {
     const std::string q = sql.Text(tsquery) + "::tsquery";
     sql.And("d.words @@ " + q);
-    select = "SELECT d.path, d.doc, ts_rank(d.words, " + q + ")" +
-             (everywhere ? ", i.server" : "");
+    score = "ts_rank(d.words, " + q + ")";
     if (p.sort == SearchParams::Sort::kRelevance) {
       order = std::string(" ORDER BY ts_rank(d.words, ") + q + ")" + (p.desc ? "" : " DESC") +
               ", d.path";
@@ -709,12 +857,15 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
       everywhere ? " FROM fi_docs d JOIN fi_indexes i ON i.part = d.part WHERE TRUE" + sql.where
                  : " FROM " + Table() + " d WHERE d.part = $1" + sql.where;
   const bool ranked = !tsquery.empty();
+  // The score and the server's name first, then the document.
+  const std::string select = "SELECT " + score + (everywhere ? ", i.server, " : ", NULL, ") +
+                             kDocColumns;
 
   SearchPage page;
   std::vector<Json::Value> docs;
   PgPool::Lease conn(*pool_);
   auto add = [&](const PgResult& r, int i) {
-    Json::Value doc = ReadDoc(r, i, 0, 1);
+    Json::Value doc = ReadDoc(r, i, 2);
     const DerivedDoc d = schema_.Derive(doc);
     Json::Value hit;
     hit["path"] = d.path;
@@ -723,8 +874,8 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
     hit["mtime"] = static_cast<Json::Int64>(d.mtime);
     hit["is_dir"] = d.is_dir;
     hit["ext"] = d.ext;
-    if (ranked) hit["score"] = r.Real(i, 2);
-    if (everywhere) hit["server"] = r.Text(i, 3);
+    if (ranked) hit["score"] = r.Real(i, 0);
+    if (everywhere) hit["server"] = r.Text(i, 1);
     page.hits.push_back(std::move(hit));
     docs.push_back(std::move(doc));
   };
@@ -761,8 +912,8 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
           break;
         }
         // Another server's files cannot be checked here: they are shown to root only.
-        if (everywhere && r.Text(i, 3) != server_) continue;
-        if (!visible(r.Bytes(i, 0))) continue;
+        if (everywhere && r.Text(i, 1) != server_) continue;
+        if (!visible(r.Bytes(i, 2))) continue;
         ++seen;
         if (seen > p.from && seen <= p.from + p.size) add(r, i);
       }

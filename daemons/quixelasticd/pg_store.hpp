@@ -65,6 +65,8 @@ class PgStore {
                    const std::vector<std::string>& extra, int64_t size);
   bool UpdateTermSuggestion(const std::string& doc_id);
   int64_t DocCount();
+  // The bytes the index's partition takes with its indexes and out-of-line values.
+  int64_t DiskBytes();
 
   // Makes every committed transaction durable: commits one more with the server's synchronous
   // commit, which flushes the log up to it. No PgWriteTxn open.
@@ -87,9 +89,11 @@ class PgStore {
   SearchPage Run(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard,
                  bool everywhere);
   std::string Table() const { return "fi_docs_" + std::to_string(part_); }
-  // Writes `docs` (validated, deduplicated by path) in one statement.
-  void WriteRows(const std::vector<const Json::Value*>& docs);
-  Json::Value ReadDoc(const PgResult& r, int row, int path_col, int doc_col) const;
+  // Writes `docs` (validated, deduplicated by path) in one statement, deleting the document
+  // at `gone` (when given, a path none of them has) in the same statement.
+  void WriteRows(const std::vector<const Json::Value*>& docs, const std::string* gone = nullptr);
+  // The document of a row read with the store's document columns from column `first` on.
+  Json::Value ReadDoc(const PgResult& r, int row, int first) const;
 
   std::shared_ptr<PgPool> pool_;
   std::string server_;

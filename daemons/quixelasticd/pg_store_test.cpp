@@ -242,6 +242,22 @@ TEST_F(PgStoreTest, DocumentCommands) {
   const Json::Value whole = s->GetByQuery(
       DocQuery::Parse(Parse(R"({"qsl": {"term": {"QUIXMDPath": "/v/d/a.txt"}}})")), {}, 0, 1);
   EXPECT_EQ(whole[0], FileDoc("/v/d/a.txt", 5)) << "the document comes back member for member";
+  // Members a column could stand for but whose values differ from it stay as they were.
+  Json::Value odd = FileDoc("/v/e/Odd.TXT", 3);
+  odd["QUIXMDFSName"] = "other name";
+  odd["QUIXMDDisplayName"] = "Odd.TXT";
+  odd["QUIXMDExtension"] = "TXT";
+  odd["QUIXMDKind"] = "txt";
+  odd["QUIXMDParent"] = "/elsewhere";
+  odd["QUIXMDIsDir"] = 0;
+  odd["QUIXMDAttributeChangeDate"] = 1.5;
+  odd["QUIXMDFSCreationDate"] = 7;
+  odd["QUIXMDOwnerUserID"] = "1026";
+  odd["QUIXMDOwnerGroupID"] = 100;
+  Put(*s, {odd});
+  EXPECT_EQ(s->GetByQuery(DocQuery::Parse(Parse(R"({"qsl": {"term": {"QUIXMDPath":
+            "/v/e/Odd.TXT"}}})")), {}, 0, 1)[0], odd);
+  EXPECT_TRUE(s->Delete("/v/e/Odd.TXT"));
 
   // The folder and its subtree, in path order, paged; "d.txt" only begins like the folder.
   const Json::Value page1 = s->List("/v/d", "", {"QUIXMDTitle", "QUIXMDIsDir"}, 2);

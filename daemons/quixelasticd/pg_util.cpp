@@ -117,7 +117,24 @@ void PgConn::Fail(const std::string& context, PGresult* r) {
   throw StoreError(SQLITE_ERROR, msg + " (" + context + ")");
 }
 
+PgResult PgConn::ExecCached(const std::string& sql, const PgParams& params) {
+  auto it = prepared_.find(sql);
+  if (it == prepared_.end()) {
+    if (prepared_.size() >= kMaxPrepared) return Exec(sql, params);
+    const std::string name = "s" + std::to_string(prepared_.size());
+    PGresult* r = PQprepare(conn_.get(), name.c_str(), sql.c_str(), 0, nullptr);
+    if (r == nullptr || PQresultStatus(r) != PGRES_COMMAND_OK) Fail(sql.substr(0, 80), r);
+    PQclear(r);
+    it = prepared_.emplace(sql, name).first;
+  }
+  return Run(it->second.c_str(), sql, params);
+}
+
 PgResult PgConn::Exec(const std::string& sql, const PgParams& params) {
+  return Run(nullptr, sql, params);
+}
+
+PgResult PgConn::Run(const char* prepared, const std::string& sql, const PgParams& params) {
   std::vector<const char*> values;
   std::vector<int> lengths;
   values.reserve(params.size());
@@ -126,8 +143,12 @@ PgResult PgConn::Exec(const std::string& sql, const PgParams& params) {
     values.push_back(v ? v->data() : nullptr);
     lengths.push_back(v ? static_cast<int>(v->size()) : 0);
   }
-  PGresult* r = PQexecParams(conn_.get(), sql.c_str(), static_cast<int>(params.size()), nullptr,
-                             values.data(), lengths.data(), params.binary_.data(), 0);
+  const int n = static_cast<int>(params.size());
+  PGresult* r = prepared != nullptr
+                    ? PQexecPrepared(conn_.get(), prepared, n, values.data(), lengths.data(),
+                                     params.binary_.data(), 0)
+                    : PQexecParams(conn_.get(), sql.c_str(), n, nullptr, values.data(),
+                                   lengths.data(), params.binary_.data(), 0);
   const ExecStatusType st = r != nullptr ? PQresultStatus(r) : PGRES_FATAL_ERROR;
   if (st != PGRES_COMMAND_OK && st != PGRES_TUPLES_OK) Fail(sql.substr(0, 80), r);
   return PgResult(r);

@@ -9,6 +9,7 @@
 #include <libpq-fe.h>
 
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -75,6 +76,9 @@ class PgConn {
   // Runs one statement. Throws StoreUnavailableError when the connection is lost,
   // StoreError(SQLITE_INTERRUPT) when it was cancelled, StoreError otherwise.
   PgResult Exec(const std::string& sql, const PgParams& params = PgParams());
+  // Exec() of a statement run often (writes), prepared once per connection. Not for searches:
+  // a prepared statement's plan does not see the values of its patterns.
+  PgResult ExecCached(const std::string& sql, const PgParams& params);
   // Runs statements without parameters (schema scripts).
   void Script(const std::string& sql);
   bool Healthy() const { return PQstatus(conn_.get()) == CONNECTION_OK; }
@@ -84,7 +88,10 @@ class PgConn {
   PGconn* get() const { return conn_.get(); }
 
  private:
+  static constexpr size_t kMaxPrepared = 64;
+  PgResult Run(const char* prepared, const std::string& sql, const PgParams& params);
   [[noreturn]] void Fail(const std::string& context, PGresult* r);
+  std::map<std::string, std::string> prepared_;  // statement text -> its name
   std::unique_ptr<PGconn, void (*)(PGconn*)> conn_{nullptr, &PQfinish};
   std::unique_ptr<PGcancel, void (*)(PGcancel*)> cancel_{nullptr, &PQfreeCancel};
   std::mutex cancel_mu_;

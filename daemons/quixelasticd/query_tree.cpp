@@ -163,9 +163,13 @@ std::string ServerColumn(const std::string& column, bool number) {
     return column;
   }
   const std::string value = "(d.doc::jsonb -> '" + member + "')";
-  return number ? "(CASE WHEN jsonb_typeof" + value + " = 'number' THEN (" + value +
-                      " #>> '{}')::float8 END)"
-                : "(" + value + " #>> '{}')";
+  const std::string json = number ? "(CASE WHEN jsonb_typeof" + value + " = 'number' THEN (" +
+                                        value + " #>> '{}')::float8 END)"
+                                  : "(" + value + " #>> '{}')";
+  // Whole change and creation times have columns of their own; other values stay in the JSON.
+  return member == kFieldCtime || member == kFieldCrtime
+             ? "COALESCE(" + column + "::float8, " + json + ")"
+             : json;
 }
 
 class Compiler {
