@@ -451,6 +451,47 @@ void PgStore::LoadSchema() {
   schema_ = Schema::Parse(mappings);
 }
 
+PgConn& PgStore::Settled() {
+  Flush();
+  return Writer();
+}
+
+void PgStore::Flush() {
+  if (pending_.empty()) return;
+  std::vector<const Json::Value*> docs;
+  std::string gone;
+  PgParams params;
+  auto drop = [&] {
+    if (params.size() == 0) return;
+    Writer().ExecCached("DELETE FROM " + Table() + " WHERE part = " + std::to_string(part_) +
+                            " AND path IN (" + gone + ")",
+                        params);
+    gone.clear();
+    params = PgParams();
+  };
+  for (const auto& [path, doc] : pending_) {
+    if (doc) {
+      docs.push_back(&*doc);
+      if (docs.size() == kRowsPerStatement) {
+        WriteRows(docs);
+        docs.clear();
+      }
+    } else {
+      params.Bytes(path);
+      gone += (gone.empty() ? "$" : ",$") + std::to_string(params.size());
+      if (params.size() == kRowsPerStatement) drop();
+    }
+  }
+  drop();
+  if (!docs.empty()) WriteRows(docs);
+  pending_.clear();
+}
+
+void PgStore::Put(const std::string& path, std::optional<Json::Value> doc) {
+  pending_[path] = std::move(doc);
+  if (pending_.size() >= kRowsPerStatement) Flush();
+}
+
 PgConn& PgStore::Writer() {
   // A connection the server dropped is replaced here, at the start of the next request; the
   // request it failed in was answered as unavailable and is sent again by its owner.
@@ -466,19 +507,19 @@ PgConn& PgStore::Writer() {
 }
 
 std::string PgStore::Meta(const std::string& key) {
-  PgResult r = Writer().Exec("SELECT value FROM fi_meta WHERE part = $1 AND key = $2",
+  PgResult r = Settled().Exec("SELECT value FROM fi_meta WHERE part = $1 AND key = $2",
                              PgParams().Int(part_).Text(key));
   return r.rows() > 0 ? r.Text(0, 0) : std::string();
 }
 
 void PgStore::SetMeta(const std::string& key, const std::string& value) {
-  Writer().Exec("INSERT INTO fi_meta(part, key, value) VALUES($1, $2, $3)"
+  Settled().Exec("INSERT INTO fi_meta(part, key, value) VALUES($1, $2, $3)"
                 " ON CONFLICT (part, key) DO UPDATE SET value = excluded.value",
                 PgParams().Int(part_).Text(key).Text(value));
 }
 
 void PgStore::Rename(const std::string& new_id) {
-  PgResult r = Writer().Exec(
+  PgResult r = Settled().Exec(
       "UPDATE fi_indexes SET id = $1 WHERE part = $2 AND NOT EXISTS"
       " (SELECT 1 FROM fi_indexes WHERE server = $3 AND id = $1)",
       PgParams().Text(new_id).Int(part_).Text(server_));
@@ -589,13 +630,19 @@ void PgStore::Upsert(const std::string& doc_id, const Json::Value& given) {
   if (!doc.isMember(pid) && !doc_id.empty()) doc[pid] = doc_id;
   schema_.Validate(doc);
   const std::string path = doc[pid].asString();
-  WriteRows({&doc}, !doc_id.empty() && doc_id != path ? &doc_id : nullptr);
+  if (!buffering_) {
+    WriteRows({&doc}, !doc_id.empty() && doc_id != path ? &doc_id : nullptr);
+    return;
+  }
+  if (!doc_id.empty() && doc_id != path) Put(doc_id, std::nullopt);
+  Put(path, std::move(doc));
 }
 
 size_t PgStore::UpsertMany(const std::vector<Json::Value>& docs,
                            std::vector<std::pair<size_t, std::string>>* refused) {
   // One statement per run of documents; a path given twice keeps its last document, as
   // upserting them one by one would.
+  Flush();
   std::vector<const Json::Value*> run;
   std::unordered_map<std::string, size_t> at;
   size_t written = 0;
@@ -631,12 +678,20 @@ size_t PgStore::UpsertMany(const std::vector<Json::Value>& docs,
 
 void PgStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
   if (!fields.isObject()) throw EngineError(kCodeDocInvalid, "fields are not an object");
-  PgConn& w = Writer();
-  PgResult r = w.ExecCached(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
-                                " d WHERE part = $1 AND path = $2",
-                            PgParams().Int(part_).Bytes(doc_id));
-  if (r.rows() == 0) throw EngineError(kCodeDocNotFound, "no document " + doc_id);
-  Json::Value doc = ReadDoc(r, 0, 0);
+  // A document written earlier in this transaction is still here; any other is read from the
+  // server, where nothing waiting here can have changed it.
+  Json::Value doc;
+  auto it = pending_.find(doc_id);
+  if (it != pending_.end()) {
+    if (!it->second) throw EngineError(kCodeDocNotFound, "no document " + doc_id);
+    doc = *it->second;
+  } else {
+    PgResult r = Writer().ExecCached(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
+                                         " d WHERE part = $1 AND path = $2",
+                                     PgParams().Int(part_).Bytes(doc_id));
+    if (r.rows() == 0) throw EngineError(kCodeDocNotFound, "no document " + doc_id);
+    doc = ReadDoc(r, 0, 0);
+  }
   for (const std::string& k : fields.getMemberNames()) {
     if (fields[k].isNull()) {
       doc.removeMember(k);
@@ -647,11 +702,16 @@ void PgStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
   schema_.Validate(doc);
   const std::string path = doc[schema_.property_id()].asString();
   // A re-keyed document replaces whatever was at its new path.
-  WriteRows({&doc}, path != doc_id ? &doc_id : nullptr);
+  if (!buffering_) {
+    WriteRows({&doc}, path != doc_id ? &doc_id : nullptr);
+    return;
+  }
+  if (path != doc_id) Put(doc_id, std::nullopt);
+  Put(path, std::move(doc));
 }
 
 bool PgStore::Delete(const std::string& doc_id) {
-  return Writer()
+  return Settled()
              .Exec("DELETE FROM " + Table() + " WHERE part = $1 AND path = $2",
                    PgParams().Int(part_).Bytes(doc_id))
              .Changed() > 0;
@@ -662,10 +722,10 @@ int64_t PgStore::DeleteByQuery(const DocQuery& q) {
   sql.Int(part_);
   const DocWhere w = WhereOf(schema_, q, &sql);
   if (!w.scan) {
-    return Writer().Exec("DELETE FROM " + Table() + " WHERE part = $1" + sql.where, sql.params)
+    return Settled().Exec("DELETE FROM " + Table() + " WHERE part = $1" + sql.where, sql.params)
         .Changed();
   }
-  PgResult r = Writer().Exec(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
+  PgResult r = Settled().Exec(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
                                  " d WHERE part = $1",
                              sql.params);
   int64_t deleted = 0;
@@ -686,7 +746,7 @@ Json::Value PgStore::GetByQuery(const DocQuery& q, const std::vector<std::string
     text += " LIMIT " + sql.Int(size);
     text += " OFFSET " + sql.Int(from);
   }
-  PgResult r = Writer().Exec(text, sql.params);
+  PgResult r = Settled().Exec(text, sql.params);
   Json::Value hits(Json::arrayValue);
   int64_t matched = 0;
   for (int i = 0; i < r.rows() && static_cast<int64_t>(hits.size()) < size; ++i) {
@@ -713,7 +773,7 @@ Json::Value PgStore::List(const std::string& dir, const std::string& after,
                            (extra.empty() ? "" : std::string(", ") + kDocColumns) + " FROM " +
                            Table() + " d WHERE part = $1" + sql.where + " ORDER BY path LIMIT " +
                            sql.Int(size);
-  PgResult r = Writer().Exec(text, sql.params);
+  PgResult r = Settled().Exec(text, sql.params);
   Json::Value hits(Json::arrayValue);
   for (int i = 0; i < r.rows(); ++i) {
     Json::Value hit(Json::arrayValue);
@@ -748,16 +808,30 @@ Json::Value PgStore::List(const std::string& dir, const std::string& after,
 
 bool PgStore::UpdateTermSuggestion(const std::string& doc_id) {
   // Suggestions are read from the documents' word vectors: there is nothing to recompute.
-  return Writer().Exec("SELECT 1 FROM " + Table() + " WHERE part = $1 AND path = $2",
+  return Settled().Exec("SELECT 1 FROM " + Table() + " WHERE part = $1 AND path = $2",
                        PgParams().Int(part_).Bytes(doc_id)).rows() > 0;
 }
 
 int64_t PgStore::DocCount() {
-  return Writer().Exec("SELECT count(*) FROM " + Table()).Int(0, 0);
+  return Settled().Exec("SELECT count(*) FROM " + Table()).Int(0, 0);
+}
+
+PgWriteTxn::PgWriteTxn(PgStore& store) : store_(store), txn_(store.Writer()) {
+  store_.buffering_ = true;
+}
+
+PgWriteTxn::~PgWriteTxn() {
+  store_.buffering_ = false;
+  store_.pending_.clear();
+}
+
+void PgWriteTxn::Commit() {
+  store_.Flush();
+  txn_.Commit();
 }
 
 int64_t PgStore::DiskBytes() {
-  return Writer().Exec("SELECT pg_total_relation_size($1::regclass)", PgParams().Text(Table()))
+  return Settled().Exec("SELECT pg_total_relation_size($1::regclass)", PgParams().Text(Table()))
       .Int(0, 0);
 }
 
@@ -765,7 +839,7 @@ void PgStore::Sync() {
   // Writes commit without waiting for the server's log to reach its disk (a finished request
   // survives this daemon, and the server's own crash recovery keeps what it flushed); this one
   // commits with a wait, which flushes the log up to it and so every commit before it.
-  PgConn& w = Writer();
+  PgConn& w = Settled();
   PgTxn txn(w);
   w.Script("SET LOCAL synchronous_commit = on");
   w.Exec("INSERT INTO fi_meta(part, key, value) VALUES($1, 'synced', now()::text)"

@@ -11,6 +11,7 @@
 #include <json/json.h>
 
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
@@ -84,7 +85,13 @@ class PgStore {
                                    const VisibleFn& visible, QueryGuard* guard = nullptr);
 
  private:
+  friend class PgWriteTxn;
   PgStore(std::shared_ptr<PgPool> pool, std::string server, std::string id, int part);
+  // The writer, once the writes waiting here are on the server.
+  PgConn& Settled();
+  void Flush();
+  // Keeps a write of `path` (a document, or its deletion) for the next Flush().
+  void Put(const std::string& path, std::optional<Json::Value> doc);
   void LoadSchema();
   SearchPage Run(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard,
                  bool everywhere);
@@ -101,16 +108,25 @@ class PgStore {
   int part_;
   Schema schema_;
   std::unique_ptr<PgConn> writer_;
+  // Writes of the open transaction not yet sent: the last document of each path, or nullopt
+  // for a deletion.
+  bool buffering_ = false;
+  std::map<std::string, std::optional<Json::Value>> pending_;
 };
 
 // RAII write transaction on a store's writer connection: BEGIN, COMMIT on Commit(), ROLLBACK
-// otherwise.
+// otherwise. While it is open, single writes wait in the store and go to the server many rows
+// to a statement, before anything is read and at the commit.
 class PgWriteTxn {
  public:
-  explicit PgWriteTxn(PgStore& store) : txn_(store.Writer()) {}
-  void Commit() { txn_.Commit(); }
+  explicit PgWriteTxn(PgStore& store);
+  ~PgWriteTxn();
+  PgWriteTxn(const PgWriteTxn&) = delete;
+  PgWriteTxn& operator=(const PgWriteTxn&) = delete;
+  void Commit();
 
  private:
+  PgStore& store_;
   PgTxn txn_;
 };
 

@@ -313,6 +313,26 @@ TEST_F(PgStoreTest, BulkUpsertSkipsRefusedAndKeepsTheLastOfAPath) {
   SearchParams p;
   p.size_min = 99999;
   EXPECT_EQ(Paths(Find(*s, p)), std::vector<std::string>{"/v/bulk/f7"});
+
+  // Writes of one transaction wait in the store: later ones see earlier ones, and a re-keyed
+  // document leaves nothing at its old path.
+  {
+    PgWriteTxn txn(*s);
+    s->Upsert("", FileDoc("/v/chain/a"));
+    s->SetFields("/v/chain/a", Parse(R"({"QUIXMDPath": "/v/chain/b"})"));
+    s->SetFields("/v/chain/b", Parse(R"({"QUIXMDPath": "/v/chain/c", "QUIXMDFSSize": 5})"));
+    EXPECT_THROW(s->SetFields("/v/chain/a", Json::Value(Json::objectValue)), EngineError);
+    s->Upsert("/v/bulk/f1", FileDoc("/v/chain/a"));
+    s->SetFields("/v/bulk/f2", Parse(R"({"QUIXMDPath": "/v/chain/d"})"));
+    txn.Commit();
+  }
+  const Json::Value chain = s->GetByQuery(
+      DocQuery::Parse(Parse(R"({"qsl": {"prefix": {"QUIXMDPath": "/v/chain/"}}})")), {}, 0, 10);
+  ASSERT_EQ(chain.size(), 3u);
+  EXPECT_EQ(chain[1]["QUIXMDPath"], "/v/chain/c");
+  EXPECT_EQ(chain[1]["QUIXMDFSSize"], 5);
+  EXPECT_EQ(chain[2]["QUIXMDFSSize"], 2) << "the document of f2, re-keyed";
+  EXPECT_EQ(s->DocCount(), 2501);  // c added; f1 and f2 moved to a and d
 }
 
 TEST_F(PgStoreTest, SearchesByNameFolderAndFilters) {
