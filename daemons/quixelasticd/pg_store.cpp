@@ -63,6 +63,10 @@ constexpr size_t kMaxPositions = 256;
 constexpr int kMaxPosition = 16383;
 constexpr size_t kMaxVectorBytes = 900 * 1024;
 
+// Rows written after which Sync() refreshes the planner's figures of the partition.
+constexpr int64_t kAnalyzeAfterRows = 50000;
+// Documents read with the one a change asks for (see ReadAhead).
+constexpr int kReadAheadRows = 256;
 // Rows a search with a permission filter fetches at a time.
 constexpr int kFetchRows = 500;
 // Documents holding a prefix whose words are counted for suggestions.
@@ -453,11 +457,13 @@ void PgStore::LoadSchema() {
 
 PgConn& PgStore::Settled() {
   Flush();
+  read_ahead_.clear();
   return Writer();
 }
 
 void PgStore::Flush() {
   if (pending_.empty()) return;
+  read_ahead_.clear();
   std::vector<const Json::Value*> docs;
   std::string gone;
   PgParams params;
@@ -559,6 +565,7 @@ Json::Value PgStore::ReadDoc(const PgResult& r, int row, int first) const {
 }
 
 void PgStore::WriteRows(const std::vector<const Json::Value*>& docs, const std::string* gone) {
+  read_ahead_.clear();
   std::string sql;
   PgParams params;
   int n = 0;
@@ -621,6 +628,7 @@ void PgStore::WriteRows(const std::vector<const Json::Value*>& docs, const std::
          " grp = excluded.grp, anc = excluded.anc, kept = excluded.kept,"
          " words = excluded.words, doc = excluded.doc";
   Writer().ExecCached(sql, params);
+  written_ += static_cast<int64_t>(docs.size());
 }
 
 void PgStore::Upsert(const std::string& doc_id, const Json::Value& given) {
@@ -676,6 +684,25 @@ size_t PgStore::UpsertMany(const std::vector<Json::Value>& docs,
   return written;
 }
 
+Json::Value PgStore::ReadAhead(const std::string& path) {
+  auto it = read_ahead_.find(path);
+  if (it == read_ahead_.end()) {
+    // A folder's documents are changed one after the other in path order (a rename): the
+    // ones after this are read with it, so that each does not cost a round trip of its own.
+    read_ahead_.clear();
+    PgResult r = Writer().ExecCached(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
+                                         " d WHERE part = $1 AND path >= $2 ORDER BY path"
+                                         " LIMIT " + std::to_string(kReadAheadRows),
+                                     PgParams().Int(part_).Bytes(path));
+    for (int i = 0; i < r.rows(); ++i) read_ahead_.emplace(r.Bytes(i, 0), ReadDoc(r, i, 0));
+    it = read_ahead_.find(path);
+    if (it == read_ahead_.end()) throw EngineError(kCodeDocNotFound, "no document " + path);
+  }
+  Json::Value doc = std::move(it->second);
+  read_ahead_.erase(it);
+  return doc;
+}
+
 void PgStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
   if (!fields.isObject()) throw EngineError(kCodeDocInvalid, "fields are not an object");
   // A document written earlier in this transaction is still here; any other is read from the
@@ -686,11 +713,7 @@ void PgStore::SetFields(const std::string& doc_id, const Json::Value& fields) {
     if (!it->second) throw EngineError(kCodeDocNotFound, "no document " + doc_id);
     doc = *it->second;
   } else {
-    PgResult r = Writer().ExecCached(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
-                                         " d WHERE part = $1 AND path = $2",
-                                     PgParams().Int(part_).Bytes(doc_id));
-    if (r.rows() == 0) throw EngineError(kCodeDocNotFound, "no document " + doc_id);
-    doc = ReadDoc(r, 0, 0);
+    doc = ReadAhead(doc_id);
   }
   for (const std::string& k : fields.getMemberNames()) {
     if (fields[k].isNull()) {
@@ -823,6 +846,7 @@ PgWriteTxn::PgWriteTxn(PgStore& store) : store_(store), txn_(store.Writer()) {
 PgWriteTxn::~PgWriteTxn() {
   store_.buffering_ = false;
   store_.pending_.clear();
+  store_.read_ahead_.clear();
 }
 
 void PgWriteTxn::Commit() {
@@ -840,6 +864,12 @@ void PgStore::Sync() {
   // survives this daemon, and the server's own crash recovery keeps what it flushed); this one
   // commits with a wait, which flushes the log up to it and so every commit before it.
   PgConn& w = Settled();
+  if (written_ >= kAnalyzeAfterRows) {
+    // The planner's figures of a partition that grew by a bulk load come from the server's
+    // background analysis, minutes later; until then name searches may scan the table.
+    w.Script("ANALYZE " + Table());
+    written_ = 0;
+  }
   PgTxn txn(w);
   w.Script("SET LOCAL synchronous_commit = on");
   w.Exec("INSERT INTO fi_meta(part, key, value) VALUES($1, 'synced', now()::text)"

@@ -90,6 +90,9 @@ class PgStore {
   // The writer, once the writes waiting here are on the server.
   PgConn& Settled();
   void Flush();
+  // The stored document at `path`, read with the next ones; EngineError(kCodeDocNotFound).
+  // Only for paths with no write waiting.
+  Json::Value ReadAhead(const std::string& path);
   // Keeps a write of `path` (a document, or its deletion) for the next Flush().
   void Put(const std::string& path, std::optional<Json::Value> doc);
   void LoadSchema();
@@ -110,8 +113,12 @@ class PgStore {
   std::unique_ptr<PgConn> writer_;
   // Writes of the open transaction not yet sent: the last document of each path, or nullopt
   // for a deletion.
+  int64_t written_ = 0;  // rows written since the partition was last analysed
   bool buffering_ = false;
   std::map<std::string, std::optional<Json::Value>> pending_;
+  // Documents read ahead of a change, as the server has them; dropped before anything else
+  // runs and whenever the waiting writes are sent.
+  std::map<std::string, Json::Value> read_ahead_;
 };
 
 // RAII write transaction on a store's writer connection: BEGIN, COMMIT on Commit(), ROLLBACK
