@@ -1,12 +1,6 @@
 #include "daemons/quixelasticd/pg_store.hpp"
 
-#include <fcntl.h>
-#include <grp.h>
-#include <pwd.h>
 #include <signal.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <gtest/gtest.h>
 
@@ -18,95 +12,12 @@
 #include "common/json_util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
 #include "test/engine_client.hpp"
+#include "test/pg_server.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
 namespace elasticd {
 namespace {
-
-const char kPgBin[] = "/usr/lib/postgresql/15/bin/";
-
-// A PostgreSQL server of the test's own: a cluster made by initdb in a scratch folder and run
-// as `nobody` (the server refuses root), reachable only on a Unix socket in that folder.
-// Stopped by its pid at scope end.
-class TestServer {
- public:
-  TestServer() {
-    const passwd* pw = getpwnam("nobody");
-    if (pw == nullptr) throw std::runtime_error("no user nobody");
-    uid_ = pw->pw_uid;
-    gid_ = pw->pw_gid;
-    // The scratch folder is root's 0700: the cluster lives in a folder of nobody's below it.
-    chmod(dir_.path().c_str(), 0755);
-    home_ = dir_.Path("pg");
-    mkdir(home_.c_str(), 0700);
-    if (chown(home_.c_str(), uid_, gid_) != 0) throw std::runtime_error("chown " + home_);
-    const int rc = RunAs({std::string(kPgBin) + "initdb", "-D", home_ + "/data", "-A", "trust",
-                          "-U", "fileindex", "-E", "UTF8", "--locale=C", "--no-sync"});
-    if (rc != 0) throw std::runtime_error("initdb failed: " + test::ReadFile(home_ + "/log"));
-    Start();
-  }
-  ~TestServer() { Stop(SIGINT); }
-
-  std::string conninfo() const {
-    return "host=" + home_ + " port=5432 dbname=postgres user=fileindex connect_timeout=5";
-  }
-
-  // `sig`: SIGINT stops cleanly, SIGQUIT as a crash would (recovery at the next start).
-  void Stop(int sig) {
-    if (pid_ <= 0) return;
-    kill(pid_, sig);
-    int status = 0;
-    waitpid(pid_, &status, 0);
-    pid_ = -1;
-  }
-
-  void Start() {
-    pid_ = fork();
-    if (pid_ == 0) {
-      BecomeNobody();
-      execl((std::string(kPgBin) + "postgres").c_str(), "postgres", "-D",
-            (home_ + "/data").c_str(), "-k", home_.c_str(), "-c", "listen_addresses=",
-            "-c", "shared_buffers=16MB", static_cast<char*>(nullptr));
-      _exit(127);
-    }
-    const bool up = test::WaitFor(
-        [&] { return PQping(conninfo().c_str()) == PQPING_OK; }, 60000);
-    if (!up) throw std::runtime_error("server did not start: " + test::ReadFile(home_ + "/log"));
-  }
-
- private:
-  void BecomeNobody() {
-    const int log = open((home_ + "/log").c_str(), O_WRONLY | O_CREAT | O_APPEND, 0600);
-    if (log >= 0) {
-      if (fchown(log, uid_, gid_) != 0) _exit(126);
-      dup2(log, 1);
-      dup2(log, 2);
-    }
-    if (setgroups(0, nullptr) != 0 || setgid(gid_) != 0 || setuid(uid_) != 0) _exit(126);
-  }
-
-  int RunAs(const std::vector<std::string>& argv) {
-    const pid_t pid = fork();
-    if (pid == 0) {
-      BecomeNobody();
-      std::vector<char*> args;
-      for (const std::string& a : argv) args.push_back(const_cast<char*>(a.c_str()));
-      args.push_back(nullptr);
-      execv(args[0], args.data());
-      _exit(127);
-    }
-    int status = 0;
-    waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-  }
-
-  test::TempDir dir_;
-  std::string home_;
-  uid_t uid_ = 0;
-  gid_t gid_ = 0;
-  pid_t pid_ = -1;
-};
 
 using tc::Parse;
 
@@ -144,7 +55,7 @@ class PgStoreTest : public ::testing::Test {
     return s.Search(p, visible);
   }
 
-  TestServer server_;
+  test::PgServer server_;
   std::shared_ptr<PgPool> pool_;
 };
 
