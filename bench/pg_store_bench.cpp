@@ -180,7 +180,7 @@ int main(int argc, char** argv) {
       },
       [&](const std::vector<std::pair<std::string, Json::Value>>& moves) {
         WriteTxn txn(*lite);
-        for (const auto& [id, fields] : moves) Moved([&] { lite->SetFields(id, fields); });
+        for (const auto& move : moves) Moved([&] { lite->SetFields(move.first, move.second); });
         txn.Commit();
       },
       [&](const SearchParams& p) { return lite->Search(p, nullptr); },
@@ -200,7 +200,7 @@ int main(int argc, char** argv) {
       },
       [&](const std::vector<std::pair<std::string, Json::Value>>& moves) {
         PgWriteTxn txn(*pg);
-        for (const auto& [id, fields] : moves) Moved([&] { pg->SetFields(id, fields); });
+        for (const auto& move : moves) Moved([&] { pg->SetFields(move.first, move.second); });
         txn.Commit();
       },
       [&](const SearchParams& p) { return pg->Search(p, nullptr); },

@@ -6,6 +6,7 @@
 #include <cctype>
 #include <unordered_map>
 
+#include "common/env.hpp"
 #include "common/json_util.hpp"
 #include "common/log.hpp"
 #include "common/name_codec.hpp"
@@ -504,9 +505,10 @@ PgConn& PgStore::Writer() {
   if (!writer_ || !writer_->Healthy()) {
     writer_.reset();
     std::unique_ptr<PgConn> conn = pool_->Take();
-    // Commits do not wait for the server's log to reach its disk: a finished request still
-    // survives this daemon and the server's crash recovery; Sync() waits for all of them.
-    conn->Script("SET synchronous_commit = off");
+    // A commit the server did not flush is lost when the server crashes, though its request
+    // was answered as done and its batch dropped by the indexer: every commit waits for the
+    // flush, whatever the server's default (a batch of a thousand documents pays it once).
+    conn->Script("SET synchronous_commit = on");
     writer_ = std::move(conn);
   }
   return *writer_;
@@ -860,9 +862,8 @@ int64_t PgStore::DiskBytes() {
 }
 
 void PgStore::Sync() {
-  // Writes commit without waiting for the server's log to reach its disk (a finished request
-  // survives this daemon, and the server's own crash recovery keeps what it flushed); this one
-  // commits with a wait, which flushes the log up to it and so every commit before it.
+  // Every commit has waited for the server's log to reach its disk already: what is left is
+  // to send what waits here.
   PgConn& w = Settled();
   if (written_ >= kAnalyzeAfterRows) {
     // The planner's figures of a partition that grew by a bulk load come from the server's
@@ -870,12 +871,6 @@ void PgStore::Sync() {
     w.Script("ANALYZE " + Table());
     written_ = 0;
   }
-  PgTxn txn(w);
-  w.Script("SET LOCAL synchronous_commit = on");
-  w.Exec("INSERT INTO fi_meta(part, key, value) VALUES($1, 'synced', now()::text)"
-         " ON CONFLICT (part, key) DO UPDATE SET value = excluded.value",
-         PgParams().Int(part_));
-  txn.Commit();
 }
 
 bool PgStore::QuickCheck(std::string* detail) {
@@ -965,9 +960,34 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
   const std::string select = "SELECT " + score + (everywhere ? ", i.server, " : ", NULL, ") +
                              kDocColumns;
 
+  PgPool::Lease conn(*pool_);
+  try {
+    PgTxn txn(*conn);
+    Budget(*conn, guard);
+    return Page(*conn, p, visible, guard, everywhere, sql.params, select, from, order, ranked);
+  } catch (const StoreError& e) {
+    if (e.sqlite_code == SQLITE_INTERRUPT && guard != nullptr && guard->ShouldStop()) {
+      guard->Throw();
+    }
+    throw;
+  }
+}
+
+void PgStore::Budget(PgConn& conn, QueryGuard* guard) {
+  if (guard == nullptr || guard->deadline_micros() == 0) return;
+  // The server stops a statement past the request's budget; what is left of it is the
+  // statements' time limit for this transaction.
+  const int64_t left = guard->deadline_micros() - Env::Current()->NowMicros();
+  if (left <= 0 && guard->ShouldStop()) guard->Throw();
+  conn.Script("SET LOCAL statement_timeout = " + std::to_string(std::max<int64_t>(left / 1000, 1)));
+}
+
+SearchPage PgStore::Page(PgConn& conn, const SearchParams& p, const VisibleFn& visible,
+                         QueryGuard* guard, bool everywhere, const PgParams& params,
+                         const std::string& select, const std::string& from,
+                         const std::string& order, bool ranked) {
   SearchPage page;
   std::vector<Json::Value> docs;
-  PgPool::Lease conn(*pool_);
   auto add = [&](const PgResult& r, int i) {
     Json::Value doc = ReadDoc(r, i, 2);
     const DerivedDoc d = schema_.Derive(doc);
@@ -984,28 +1004,39 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
     docs.push_back(std::move(doc));
   };
   if (!visible) {
-    PgResult count = conn->Exec("SELECT count(*) FROM (SELECT 1" + from + " LIMIT " +
-                                    std::to_string(IndexStore::kCountLimit + 1) + ") s",
-                                sql.params);
-    page.total = count.Int(0, 0);
+    // An ordered page reads every match anyway: it counts them in the same pass. An unordered
+    // one stops at the page, and is counted apart only when the page does not say the total.
+    const bool ordered = !order.empty();
+    // Numbers of our own, written out so that the count below can run with the same values.
+    const std::string limits =
+        " LIMIT " + std::to_string(p.size) + " OFFSET " + std::to_string(p.from);
+    PgResult r = conn.Exec(select + (ordered ? ", count(*) OVER ()" : "") + from + order + limits,
+                            params);
+    for (int i = 0; i < r.rows(); ++i) add(r, i);
+    if (ordered && r.rows() > 0) {
+      page.total = r.Int(0, 14);
+    } else if (!ordered && p.from == 0 && r.rows() < p.size) {
+      page.total = r.rows();
+    } else {
+      page.total = conn.Exec("SELECT count(*) FROM (SELECT 1" + from + " LIMIT " +
+                                  std::to_string(IndexStore::kCountLimit + 1) + ") s",
+                              params)
+                       .Int(0, 0);
+    }
     if (page.total > IndexStore::kCountLimit) {
       page.total = IndexStore::kCountLimit;
       page.total_exact = false;
     }
-    const std::string limits = " LIMIT " + sql.Int(p.size) + " OFFSET " + sql.Int(p.from);
-    PgResult r = conn->Exec(select + from + order + limits, sql.params);
-    for (int i = 0; i < r.rows(); ++i) add(r, i);
   } else {
     // Hidden hits are skipped before paging: rows come from a cursor a batch at a time, and
     // counting goes on for a bounded number of rows past the page.
-    PgTxn txn(*conn);
-    conn->Exec("DECLARE hits NO SCROLL CURSOR FOR " + select + from + order, sql.params);
+    conn.Exec("DECLARE hits NO SCROLL CURSOR FOR " + select + from + order, params);
     int64_t seen = 0;
     int64_t inspected = 0;
     bool done = false;
     while (!done) {
       if (guard != nullptr && guard->ShouldStop()) guard->Throw();
-      PgResult r = conn->Exec("FETCH " + std::to_string(kFetchRows) + " FROM hits");
+      PgResult r = conn.Exec("FETCH " + std::to_string(kFetchRows) + " FROM hits");
       if (r.rows() == 0) break;
       for (int i = 0; i < r.rows(); ++i) {
         ++inspected;
@@ -1035,6 +1066,8 @@ std::vector<std::string> PgStore::Suggest(const std::string& prefix, size_t limi
   if (folded.size() != 1) return out;
   const std::string& low = folded[0];
   PgPool::Lease conn(*pool_);
+  PgTxn txn(*conn);
+  Budget(*conn, guard);
   // The words of a bounded sample of the documents holding one that starts with the prefix,
   // counted over that sample: the most used come first without a vocabulary kept up to date
   // on every write.

@@ -69,8 +69,8 @@ class PgStore {
   // The bytes the index's partition takes with its indexes and out-of-line values.
   int64_t DiskBytes();
 
-  // Makes every committed transaction durable: commits one more with the server's synchronous
-  // commit, which flushes the log up to it. No PgWriteTxn open.
+  // Sends the writes waiting in the store (every commit is synchronous, so what is committed is
+  // on the server's disk) and refreshes the planner's figures after a bulk load.
   void Sync();
   bool QuickCheck(std::string* detail);
 
@@ -98,6 +98,13 @@ class PgStore {
   void LoadSchema();
   SearchPage Run(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard,
                  bool everywhere);
+  // Gives the statements of the open transaction on `conn` what is left of the request's time.
+  static void Budget(PgConn& conn, QueryGuard* guard);
+  // The page of a search whose statement parts Run() has made.
+  SearchPage Page(PgConn& conn, const SearchParams& p, const VisibleFn& visible,
+                  QueryGuard* guard, bool everywhere, const PgParams& params,
+                  const std::string& select, const std::string& from, const std::string& order,
+                  bool ranked);
   std::string Table() const { return "fi_docs_" + std::to_string(part_); }
   // Writes `docs` (validated, deduplicated by path) in one statement, deleting the document
   // at `gone` (when given, a path none of them has) in the same statement.

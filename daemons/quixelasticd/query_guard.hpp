@@ -22,6 +22,8 @@ class QueryGuard {
   // Whether the work must stop now; remembers why.
   bool ShouldStop();
   Stop stopped() const { return stopped_; }
+  // The deadline on the Env clock; 0 when there is none.
+  int64_t deadline_micros() const { return deadline_micros_; }
   // The engine error (code and message) for a stop; call only when stopped() is not kNone.
   [[noreturn]] void Throw() const;
 
