@@ -440,6 +440,76 @@ TEST_F(PgStoreTest, ServerGoingAwayFailsRequestsUntilItIsBack) {
   EXPECT_EQ(Find(*s, p).total, 2);
 }
 
+std::string CoordConninfo(const test::PgServer& server) {
+  return "host=" + server.socket_dir() + " port=5432 dbname=coord user=fileindex";
+}
+
+// The coordinator of a database spread over several servers: its documents table has no rows
+// of its own, each partition is an index's partition on one of the servers (`shards`: a
+// server's socket folder and its indexes' numbers), reached through postgres_fdw; the index
+// list and their settings are the servers' own, read through views.
+std::string CoordinatorSql(const std::vector<std::pair<std::string, std::vector<int>>>& shards) {
+  std::string sql =
+      "CREATE EXTENSION postgres_fdw; CREATE EXTENSION pg_trgm;"
+      "CREATE TABLE fi_docs(part int NOT NULL, path bytea NOT NULL, fname text NOT NULL,"
+      " ext text NOT NULL, size bigint NOT NULL, mtime bigint NOT NULL, is_dir smallint NOT NULL,"
+      " ctime bigint, crtime bigint, owner text, grp text, anc bytea NOT NULL, kept int NOT NULL,"
+      " words tsvector, doc text) PARTITION BY LIST (part);";
+  std::string indexes, meta;
+  for (size_t i = 0; i < shards.size(); ++i) {
+    const std::string n = std::to_string(i + 1);
+    sql += "CREATE SERVER shard" + n + " FOREIGN DATA WRAPPER postgres_fdw OPTIONS (host '" +
+           shards[i].first + "', port '5432', dbname 'postgres');"
+           "CREATE USER MAPPING FOR CURRENT_USER SERVER shard" + n +
+           " OPTIONS (user 'fileindex');"
+           "CREATE FOREIGN TABLE fi_indexes_" + n + "(part int, server text, id text) SERVER"
+           " shard" + n + " OPTIONS (table_name 'fi_indexes');"
+           "CREATE FOREIGN TABLE fi_meta_" + n + "(part int, key text, value text) SERVER"
+           " shard" + n + " OPTIONS (table_name 'fi_meta');";
+    for (int part : shards[i].second) {
+      const std::string p = std::to_string(part);
+      sql += "CREATE FOREIGN TABLE fi_docs_" + p + " PARTITION OF fi_docs FOR VALUES IN (" + p +
+             ") SERVER shard" + n + " OPTIONS (table_name 'fi_docs_" + p + "');";
+    }
+    indexes += (i == 0 ? "" : " UNION ALL ") + std::string("SELECT * FROM fi_indexes_") + n;
+    meta += (i == 0 ? "" : " UNION ALL ") + std::string("SELECT * FROM fi_meta_") + n;
+  }
+  return sql + "CREATE VIEW fi_indexes AS " + indexes + "; CREATE VIEW fi_meta AS " + meta + ";";
+}
+
+TEST_F(PgStoreTest, ACoordinatorSearchesIndexesOnTwoServersAsOne) {
+  test::PgServer second;
+  auto pool2 = std::make_shared<PgPool>(second.conninfo(), 2);
+  PgStore::PrepareDatabase(*pool2);
+  // Index numbers of servers that meet in a coordinator must not overlap.
+  PgConn(second.conninfo()).Script("ALTER SEQUENCE fi_indexes_part_seq RESTART WITH 1001");
+  auto a = Make("s1", "docs");
+  auto b = PgStore::Create(pool2, "s2", "docs", tc::FileMappings(),
+                           Json::Value(Json::objectValue), Json::Value(Json::objectValue));
+  Put(*a, {FileDoc("/v/one/report.txt", 1, "quarterly figures"), FileDoc("/v/one/x.txt")});
+  Put(*b, {FileDoc("/w/two/Report.pdf", 2, "quarterly plans"), FileDoc("/w/two/y.pdf")});
+
+  PgConn(server_.conninfo()).Script("CREATE DATABASE coord");
+  PgConn(CoordConninfo(server_))
+      .Script(CoordinatorSql({{server_.socket_dir(), {1}}, {second.socket_dir(), {1001}}}));
+  auto coord = PgStore::Open(std::make_shared<PgPool>(CoordConninfo(server_), 2), "s1",
+                             "docs");
+  SearchParams p;
+  p.keywords = "quarterly";
+  p.sort = SearchParams::Sort::kName;
+  SearchPage page = coord->SearchEverywhere(p, nullptr);
+  EXPECT_EQ(page.total, 2);
+  ASSERT_EQ(page.hits.size(), 2u);
+  EXPECT_EQ(page.hits[0]["path"], "/w/two/Report.pdf");  // names in folded order
+  EXPECT_EQ(page.hits[0]["server"], "s2");
+  EXPECT_EQ(page.hits[1]["path"], "/v/one/report.txt");
+  EXPECT_EQ(page.hits[1]["server"], "s1");
+  EXPECT_NE(page.hits[0]["snippet"].asString().find("<b>quarterly</b>"), std::string::npos);
+  p = SearchParams();
+  p.name = "repo";
+  EXPECT_EQ(coord->SearchEverywhere(p, nullptr).total, 2);
+}
+
 // The indexer's way with a batch the store could not take: it keeps it and sends it again. A
 // server crashing and coming back in the middle of a bulk load then loses nothing and doubles
 // nothing.
