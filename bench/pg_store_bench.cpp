@@ -3,7 +3,7 @@
 // 25,000 descendants (one re-keying per descendant, as the library's loop does) and the size
 // on disk. The PostgreSQL server is one the caller runs; its CPU time is not counted here.
 //
-//   pg_store_bench CONNINFO [documents]
+//   pg_store_bench CONNINFO [documents [pg]]
 #include <sys/stat.h>
 
 #include <algorithm>
@@ -27,9 +27,9 @@ using orvane::bench::CpuSeconds;
 using orvane::bench::Seconds;
 using namespace orvane::elasticd;
 
-const char* kWords[] = {"holiday", "report", "invoice", "summer", "family", "project", "draft",
-                        "final", "budget", "meeting", "photo", "scan", "notes", "backup",
-                        "music", "video", "contract", "slides", "thesis", "recipe"};
+const char* kWords[] = {"holiday", "report", "invoice",  "summer", "family", "project", "draft",
+                        "final",   "budget", "meeting",  "photo",  "scan",   "notes",   "backup",
+                        "music",   "video",  "contract", "slides", "thesis", "recipe"};
 const char* kExts[] = {"jpg", "pdf", "docx", "mp3", "mp4", "txt", "xlsx", "png"};
 constexpr uint64_t kBatch = 1000;
 constexpr uint64_t kRenamed = 25000;
@@ -170,7 +170,8 @@ int main(int argc, char** argv) {
   const std::string root = orvane::bench::ScratchRoot("pg_store_bench", false);
   const Json::Value none(Json::objectValue);
 
-  auto lite = IndexStore::Create(root + "/idx", "bench", orvane::fileindex::elastic::GetFileIndexMappings(), none, none);
+  auto lite = IndexStore::Create(root + "/idx", "bench",
+                                 orvane::fileindex::elastic::GetFileIndexMappings(), none, none);
   Target sqlite{
       "SQLite",
       [&](const std::vector<Json::Value>& docs) {
@@ -186,26 +187,28 @@ int main(int argc, char** argv) {
       [&](const SearchParams& p) { return lite->Search(p, nullptr); },
       [&] { lite->Sync(); },
       [&] { return FileMiB(root + "/idx/index.db") + FileMiB(root + "/idx/index.db-wal"); }};
-  Measure(sqlite, count);
+  // "pg" as a third argument measures the PostgreSQL store alone.
+  if (argc < 4 || std::string(argv[3]) != "pg") Measure(sqlite, count);
 
   auto pool = std::make_shared<PgPool>(argv[1], 4);
   PgStore::Drop(*pool, "bench", "bench");
-  auto pg = PgStore::Create(pool, "bench", "bench", orvane::fileindex::elastic::GetFileIndexMappings(), none, none);
-  Target postgres{
-      "PostgreSQL",
-      [&](const std::vector<Json::Value>& docs) {
-        PgWriteTxn txn(*pg);
-        pg->UpsertMany(docs, nullptr);
-        txn.Commit();
-      },
-      [&](const std::vector<std::pair<std::string, Json::Value>>& moves) {
-        PgWriteTxn txn(*pg);
-        for (const auto& move : moves) Moved([&] { pg->SetFields(move.first, move.second); });
-        txn.Commit();
-      },
-      [&](const SearchParams& p) { return pg->Search(p, nullptr); },
-      [&] { pg->Sync(); },
-      [&] { return pg->DiskBytes() / 1048576.0; }};
+  auto pg = PgStore::Create(pool, "bench", "bench",
+                            orvane::fileindex::elastic::GetFileIndexMappings(), none, none);
+  Target postgres{"PostgreSQL",
+                  [&](const std::vector<Json::Value>& docs) {
+                    PgWriteTxn txn(*pg);
+                    pg->UpsertMany(docs, nullptr);
+                    txn.Commit();
+                  },
+                  [&](const std::vector<std::pair<std::string, Json::Value>>& moves) {
+                    PgWriteTxn txn(*pg);
+                    for (const auto& move : moves)
+                      Moved([&] { pg->SetFields(move.first, move.second); });
+                    txn.Commit();
+                  },
+                  [&](const SearchParams& p) { return pg->Search(p, nullptr); },
+                  [&] { pg->Sync(); },
+                  [&] { return pg->DiskBytes() / 1048576.0; }};
   Measure(postgres, count);
   return 0;
 }

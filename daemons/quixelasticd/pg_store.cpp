@@ -232,8 +232,8 @@ bool QueryText(const Json::Value& doc, const std::string& field, std::string* te
   } else if (v->isBool()) {
     *text = v->asBool() ? "1" : "0";
   } else if (v->type() == Json::intValue || v->type() == Json::uintValue) {
-    *text = v->type() == Json::intValue ? std::to_string(v->asInt64())
-                                        : std::to_string(v->asUInt64());
+    *text =
+        v->type() == Json::intValue ? std::to_string(v->asInt64()) : std::to_string(v->asUInt64());
   } else {
     *text = JsonToString(*v);
   }
@@ -289,6 +289,32 @@ std::string Numbered(const SqlCondition& c, Sql* q) {
   return "(" + out + ")";
 }
 
+// Runs `fn`, turning a statement the server stopped at the request's time budget into the
+// guard's own answer.
+template <typename F>
+auto WithinBudget(QueryGuard* guard, F&& fn) -> decltype(fn()) {
+  try {
+    return fn();
+  } catch (const StoreError& e) {
+    if (e.sqlite_code == SQLITE_INTERRUPT && guard != nullptr && guard->ShouldStop()) {
+      guard->Throw();
+    }
+    throw;
+  }
+}
+
+// Whether the trigram index can look `folded` up: it holds a run of three letters or digits
+// (any character beyond ASCII counts as a letter).
+bool HasTrigram(const std::string& folded) {
+  int run = 0;
+  for (unsigned char c : folded) {
+    if ((c & 0xC0) == 0x80) continue;  // the rest of a character already counted
+    run = std::isalnum(c) || c >= 0x80 ? run + 1 : 0;
+    if (run >= 3) return true;
+  }
+  return false;
+}
+
 // The condition of a document query; `scan` when it tests a field without a column, which is
 // then read from every document.
 struct DocWhere {
@@ -310,8 +336,8 @@ struct DocWhere {
 std::string UnderFolder(std::string folder, Sql* q) {
   while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
   const std::string under = folder == "/" ? "/" : folder + "/";
-  return "(anc = " + q->Bytes(folder) + " OR (anc >= " + q->Bytes(under) +
-         " AND anc < " + q->Bytes(*PrefixUpperBound(under)) + "))";
+  return "(anc = " + q->Bytes(folder) + " OR (anc >= " + q->Bytes(under) + " AND anc < " +
+         q->Bytes(*PrefixUpperBound(under)) + "))";
 }
 
 DocWhere WhereOf(const Schema& schema, const DocQuery& q, Sql* sql) {
@@ -341,15 +367,15 @@ void AddSnippets(const Schema& schema, const std::string& keywords, int64_t snip
   if (hits->empty() || match.empty()) return;
   Db mem;
   mem.Open(":memory:", true, false);
-  mem.Exec("CREATE VIRTUAL TABLE fts_all USING fts5(text, tokenize='unicode61"
-           " remove_diacritics 2')");
+  mem.Exec(
+      "CREATE VIRTUAL TABLE fts_all USING fts5(text, tokenize='unicode61"
+      " remove_diacritics 2')");
   RegisterSnippetFunction(mem.get());
   Stmt put(mem, "INSERT INTO fts_all(rowid, text) VALUES(?, ?)");
   Stmt snip(mem, std::string("SELECT ") + kSnippetFunction +
                      "(fts_all, '<b>', '</b>', '...', 12) FROM fts_all"
                      " WHERE fts_all MATCH ? AND rowid = ?");
-  for (size_t i = static_cast<size_t>(std::max<int64_t>(snippet_from, 0)); i < hits->size();
-       ++i) {
+  for (size_t i = static_cast<size_t>(std::max<int64_t>(snippet_from, 0)); i < hits->size(); ++i) {
     const int64_t rowid = static_cast<int64_t>(i) + 1;
     put.Reset();
     put.Bind(1, rowid).Bind(2, EncodeName(schema.Derive(docs[i]).all_text)).Run();
@@ -432,7 +458,8 @@ bool PgStore::Exists(PgPool& pool, const std::string& server, const std::string&
   PrepareDatabase(pool);
   PgPool::Lease conn(pool);
   return conn->Exec("SELECT 1 FROM fi_indexes WHERE server = $1 AND id = $2",
-                    PgParams().Text(server).Text(id)).rows() > 0;
+                    PgParams().Text(server).Text(id))
+             .rows() > 0;
 }
 
 bool PgStore::Drop(PgPool& pool, const std::string& server, const std::string& id) {
@@ -516,14 +543,15 @@ PgConn& PgStore::Writer() {
 
 std::string PgStore::Meta(const std::string& key) {
   PgResult r = Settled().Exec("SELECT value FROM fi_meta WHERE part = $1 AND key = $2",
-                             PgParams().Int(part_).Text(key));
+                              PgParams().Int(part_).Text(key));
   return r.rows() > 0 ? r.Text(0, 0) : std::string();
 }
 
 void PgStore::SetMeta(const std::string& key, const std::string& value) {
-  Settled().Exec("INSERT INTO fi_meta(part, key, value) VALUES($1, $2, $3)"
-                " ON CONFLICT (part, key) DO UPDATE SET value = excluded.value",
-                PgParams().Int(part_).Text(key).Text(value));
+  Settled().Exec(
+      "INSERT INTO fi_meta(part, key, value) VALUES($1, $2, $3)"
+      " ON CONFLICT (part, key) DO UPDATE SET value = excluded.value",
+      PgParams().Int(part_).Text(key).Text(value));
 }
 
 void PgStore::Rename(const std::string& new_id) {
@@ -614,8 +642,7 @@ void PgStore::WriteRows(const std::vector<const Json::Value*>& docs, const std::
     } else {
       params.Text(words);  // in written form already
     }
-    text_or_null(c.rest.empty() ? std::nullopt
-                                : std::optional<std::string>(JsonToString(c.rest)));
+    text_or_null(c.rest.empty() ? std::nullopt : std::optional<std::string>(JsonToString(c.rest)));
     sql += i == 0 ? "(" : ",(";
     sql += std::to_string(part_);
     for (int c = 0; c < kRowParams; ++c) {
@@ -624,11 +651,12 @@ void PgStore::WriteRows(const std::vector<const Json::Value*>& docs, const std::
     }
     sql += ")";
   }
-  sql += " ON CONFLICT (part, path) DO UPDATE SET fname = excluded.fname, ext = excluded.ext,"
-         " size = excluded.size, mtime = excluded.mtime, is_dir = excluded.is_dir,"
-         " ctime = excluded.ctime, crtime = excluded.crtime, owner = excluded.owner,"
-         " grp = excluded.grp, anc = excluded.anc, kept = excluded.kept,"
-         " words = excluded.words, doc = excluded.doc";
+  sql +=
+      " ON CONFLICT (part, path) DO UPDATE SET fname = excluded.fname, ext = excluded.ext,"
+      " size = excluded.size, mtime = excluded.mtime, is_dir = excluded.is_dir,"
+      " ctime = excluded.ctime, crtime = excluded.crtime, owner = excluded.owner,"
+      " grp = excluded.grp, anc = excluded.anc, kept = excluded.kept,"
+      " words = excluded.words, doc = excluded.doc";
   Writer().ExecCached(sql, params);
   written_ += static_cast<int64_t>(docs.size());
 }
@@ -694,7 +722,8 @@ Json::Value PgStore::ReadAhead(const std::string& path) {
     read_ahead_.clear();
     PgResult r = Writer().ExecCached(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
                                          " d WHERE part = $1 AND path >= $2 ORDER BY path"
-                                         " LIMIT " + std::to_string(kReadAheadRows),
+                                         " LIMIT " +
+                                         std::to_string(kReadAheadRows),
                                      PgParams().Int(part_).Bytes(path));
     for (int i = 0; i < r.rows(); ++i) read_ahead_.emplace(r.Bytes(i, 0), ReadDoc(r, i, 0));
     it = read_ahead_.find(path);
@@ -747,12 +776,12 @@ int64_t PgStore::DeleteByQuery(const DocQuery& q) {
   sql.Int(part_);
   const DocWhere w = WhereOf(schema_, q, &sql);
   if (!w.scan) {
-    return Settled().Exec("DELETE FROM " + Table() + " WHERE part = $1" + sql.where, sql.params)
+    return Settled()
+        .Exec("DELETE FROM " + Table() + " WHERE part = $1" + sql.where, sql.params)
         .Changed();
   }
-  PgResult r = Settled().Exec(std::string("SELECT ") + kDocColumns + " FROM " + Table() +
-                                 " d WHERE part = $1",
-                             sql.params);
+  PgResult r = Settled().Exec(
+      std::string("SELECT ") + kDocColumns + " FROM " + Table() + " d WHERE part = $1", sql.params);
   int64_t deleted = 0;
   for (int i = 0; i < r.rows(); ++i) {
     if (w.Matches(ReadDoc(r, i, 0)) && Delete(r.Bytes(i, 0))) ++deleted;
@@ -833,13 +862,13 @@ Json::Value PgStore::List(const std::string& dir, const std::string& after,
 
 bool PgStore::UpdateTermSuggestion(const std::string& doc_id) {
   // Suggestions are read from the documents' word vectors: there is nothing to recompute.
-  return Settled().Exec("SELECT 1 FROM " + Table() + " WHERE part = $1 AND path = $2",
-                       PgParams().Int(part_).Bytes(doc_id)).rows() > 0;
+  return Settled()
+             .Exec("SELECT 1 FROM " + Table() + " WHERE part = $1 AND path = $2",
+                   PgParams().Int(part_).Bytes(doc_id))
+             .rows() > 0;
 }
 
-int64_t PgStore::DocCount() {
-  return Settled().Exec("SELECT count(*) FROM " + Table()).Int(0, 0);
-}
+int64_t PgStore::DocCount() { return Settled().Exec("SELECT count(*) FROM " + Table()).Int(0, 0); }
 
 PgWriteTxn::PgWriteTxn(PgStore& store) : store_(store), txn_(store.Writer()) {
   store_.buffering_ = true;
@@ -857,7 +886,8 @@ void PgWriteTxn::Commit() {
 }
 
 int64_t PgStore::DiskBytes() {
-  return Settled().Exec("SELECT pg_total_relation_size($1::regclass)", PgParams().Text(Table()))
+  return Settled()
+      .Exec("SELECT pg_total_relation_size($1::regclass)", PgParams().Text(Table()))
       .Int(0, 0);
 }
 
@@ -957,20 +987,21 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
                  : " FROM " + Table() + " d WHERE d.part = $1" + sql.where;
   const bool ranked = !tsquery.empty();
   // The score and the server's name first, then the document.
-  const std::string select = "SELECT " + score + (everywhere ? ", i.server, " : ", NULL, ") +
-                             kDocColumns;
+  const std::string select =
+      "SELECT " + score + (everywhere ? ", i.server, " : ", NULL, ") + kDocColumns;
 
   PgPool::Lease conn(*pool_);
-  try {
+  return WithinBudget(guard, [&] {
     PgTxn txn(*conn);
     Budget(*conn, guard);
-    return Page(*conn, p, visible, guard, everywhere, sql.params, select, from, order, ranked);
-  } catch (const StoreError& e) {
-    if (e.sqlite_code == SQLITE_INTERRUPT && guard != nullptr && guard->ShouldStop()) {
-      guard->Throw();
+    if (HasTrigram(FoldName(name))) {
+      // The planner guesses how many names hold a substring; guessing many, it reads the
+      // table in order until the page is full, which for a rare one means the whole table.
+      // The trigram index answers any substring with a run of three letters or digits.
+      conn->Script("SET LOCAL enable_seqscan = off");
     }
-    throw;
-  }
+    return Page(*conn, p, visible, guard, everywhere, sql.params, select, from, order, ranked);
+  });
 }
 
 void PgStore::Budget(PgConn& conn, QueryGuard* guard) {
@@ -1010,8 +1041,8 @@ SearchPage PgStore::Page(PgConn& conn, const SearchParams& p, const VisibleFn& v
     // Numbers of our own, written out so that the count below can run with the same values.
     const std::string limits =
         " LIMIT " + std::to_string(p.size) + " OFFSET " + std::to_string(p.from);
-    PgResult r = conn.Exec(select + (ordered ? ", count(*) OVER ()" : "") + from + order + limits,
-                            params);
+    PgResult r =
+        conn.Exec(select + (ordered ? ", count(*) OVER ()" : "") + from + order + limits, params);
     for (int i = 0; i < r.rows(); ++i) add(r, i);
     if (ordered && r.rows() > 0) {
       page.total = r.Int(0, 14);
@@ -1019,8 +1050,8 @@ SearchPage PgStore::Page(PgConn& conn, const SearchParams& p, const VisibleFn& v
       page.total = r.rows();
     } else {
       page.total = conn.Exec("SELECT count(*) FROM (SELECT 1" + from + " LIMIT " +
-                                  std::to_string(IndexStore::kCountLimit + 1) + ") s",
-                              params)
+                                 std::to_string(IndexStore::kCountLimit + 1) + ") s",
+                             params)
                        .Int(0, 0);
     }
     if (page.total > IndexStore::kCountLimit) {
@@ -1066,32 +1097,33 @@ std::vector<std::string> PgStore::Suggest(const std::string& prefix, size_t limi
   if (folded.size() != 1) return out;
   const std::string& low = folded[0];
   PgPool::Lease conn(*pool_);
-  PgTxn txn(*conn);
-  Budget(*conn, guard);
-  // The words of a bounded sample of the documents holding one that starts with the prefix,
-  // counted over that sample: the most used come first without a vocabulary kept up to date
-  // on every write.
-  PgResult r = conn->Exec(
-      "SELECT w.lexeme, count(*) FROM (SELECT words FROM " + Table() +
-          " WHERE part = $1 AND words @@ $2::tsquery LIMIT " +
-          std::to_string(kSuggestSampleDocs) +
-          ") s, unnest(s.words) w WHERE starts_with(w.lexeme, $3)"
-          " GROUP BY w.lexeme ORDER BY count(*) DESC, w.lexeme LIMIT 200",
-      PgParams().Int(part_).Text(PgLexeme(low) + ":*").Text(low));
-  for (int i = 0; i < r.rows() && out.size() < limit; ++i) {
-    if (guard != nullptr && guard->ShouldStop()) guard->Throw();
-    const std::string term = r.Text(i, 0);
-    if (!IsSuggestible(term)) continue;
-    bool shown = !visible;
-    if (!shown) {
-      PgResult docs = conn->Exec("SELECT path FROM " + Table() +
-                                     " WHERE part = $1 AND words @@ $2::tsquery LIMIT 64",
-                                 PgParams().Int(part_).Text(PgLexeme(term)));
-      for (int j = 0; !shown && j < docs.rows(); ++j) shown = visible(docs.Bytes(j, 0));
+  return WithinBudget(guard, [&] {
+    PgTxn txn(*conn);
+    Budget(*conn, guard);
+    // The words of a bounded sample of the documents holding one that starts with the prefix,
+    // counted over that sample: the most used come first without a vocabulary kept up to date
+    // on every write.
+    PgResult r = conn->Exec("SELECT w.lexeme, count(*) FROM (SELECT words FROM " + Table() +
+                                " WHERE part = $1 AND words @@ $2::tsquery LIMIT " +
+                                std::to_string(kSuggestSampleDocs) +
+                                ") s, unnest(s.words) w WHERE starts_with(w.lexeme, $3)"
+                                " GROUP BY w.lexeme ORDER BY count(*) DESC, w.lexeme LIMIT 200",
+                            PgParams().Int(part_).Text(PgLexeme(low) + ":*").Text(low));
+    for (int i = 0; i < r.rows() && out.size() < limit; ++i) {
+      if (guard != nullptr && guard->ShouldStop()) guard->Throw();
+      const std::string term = r.Text(i, 0);
+      if (!IsSuggestible(term)) continue;
+      bool shown = !visible;
+      if (!shown) {
+        PgResult docs = conn->Exec(
+            "SELECT path FROM " + Table() + " WHERE part = $1 AND words @@ $2::tsquery LIMIT 64",
+            PgParams().Int(part_).Text(PgLexeme(term)));
+        for (int j = 0; !shown && j < docs.rows(); ++j) shown = visible(docs.Bytes(j, 0));
+      }
+      if (shown) out.push_back(DecodeName(term));
     }
-    if (shown) out.push_back(DecodeName(term));
-  }
-  return out;
+    return out;
+  });
 }
 
 }  // namespace elasticd

@@ -101,10 +101,9 @@ class PgStore {
   // Gives the statements of the open transaction on `conn` what is left of the request's time.
   static void Budget(PgConn& conn, QueryGuard* guard);
   // The page of a search whose statement parts Run() has made.
-  SearchPage Page(PgConn& conn, const SearchParams& p, const VisibleFn& visible,
-                  QueryGuard* guard, bool everywhere, const PgParams& params,
-                  const std::string& select, const std::string& from, const std::string& order,
-                  bool ranked);
+  SearchPage Page(PgConn& conn, const SearchParams& p, const VisibleFn& visible, QueryGuard* guard,
+                  bool everywhere, const PgParams& params, const std::string& select,
+                  const std::string& from, const std::string& order, bool ranked);
   std::string Table() const { return "fi_docs_" + std::to_string(part_); }
   // Writes `docs` (validated, deduplicated by path) in one statement, deleting the document
   // at `gone` (when given, a path none of them has) in the same statement.

@@ -7,8 +7,8 @@
 #include <algorithm>
 #include <cerrno>
 #include <chrono>
-#include <thread>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "common/json_util.hpp"
@@ -41,8 +41,7 @@ class PgStoreTest : public ::testing::Test {
  protected:
   PgStoreTest() : pool_(std::make_shared<PgPool>(server_.conninfo(), 4)) {}
 
-  std::shared_ptr<PgStore> Make(const std::string& server = "s1",
-                                const std::string& id = "docs") {
+  std::shared_ptr<PgStore> Make(const std::string& server = "s1", const std::string& id = "docs") {
     return PgStore::Create(pool_, server, id, tc::FileMappings(), Json::Value(Json::objectValue),
                            Json::Value(Json::objectValue));
   }
@@ -112,8 +111,8 @@ TEST_F(PgStoreTest, LifecycleErrors) {
   EXPECT_FALSE(PgStore::Exists(*pool_, "s1", "docs"));
   // Made again, it starts empty.
   EXPECT_EQ(Make()->DocCount(), 0);
-  EXPECT_THROW(PgStore::Create(pool_, "s1", "bad", Parse(R"({"property_id": 3})"),
-                               Json::Value(), Json::Value()),
+  EXPECT_THROW(PgStore::Create(pool_, "s1", "bad", Parse(R"({"property_id": 3})"), Json::Value(),
+                               Json::Value()),
                EngineError);
 }
 
@@ -169,7 +168,9 @@ TEST_F(PgStoreTest, DocumentCommands) {
   odd["QUIXMDOwnerGroupID"] = 100;
   Put(*s, {odd});
   EXPECT_EQ(s->GetByQuery(DocQuery::Parse(Parse(R"({"qsl": {"term": {"QUIXMDPath":
-            "/v/e/Odd.TXT"}}})")), {}, 0, 1)[0], odd);
+            "/v/e/Odd.TXT"}}})")),
+                          {}, 0, 1)[0],
+            odd);
   EXPECT_TRUE(s->Delete("/v/e/Odd.TXT"));
 
   // The folder and its subtree, in path order, paged; "d.txt" only begins like the folder.
@@ -190,13 +191,15 @@ TEST_F(PgStoreTest, DocumentCommands) {
     EXPECT_TRUE(s->Delete(raw));
     EXPECT_FALSE(s->Delete(raw));
     EXPECT_EQ(s->DeleteByQuery(DocQuery::Parse(Parse(R"({"qsl": {"prefix": {"QUIXMDPath":
-              "/v/d/"}}})"))), 1);
+              "/v/d/"}}})"))),
+              1);
     txn.Commit();
   }
   EXPECT_EQ(get(R"({"qsl": {"match_all": {}}})"),
             (std::vector<std::string>{"/v/d.txt", "/v/e/c.txt"}));
-  EXPECT_EQ(s->GetByQuery(DocQuery::Parse(Parse(R"({"qsl": {"match_all": {}}})")), {}, 1, 1)[0]
-                ["QUIXMDFSSize"], 5);
+  EXPECT_EQ(s->GetByQuery(DocQuery::Parse(Parse(R"({"qsl": {"match_all": {}}})")), {}, 1,
+                          1)[0]["QUIXMDFSSize"],
+            5);
 
   // A transaction not committed leaves nothing behind.
   {
@@ -270,8 +273,8 @@ TEST_F(PgStoreTest, SearchesByNameFolderAndFilters) {
   p.folder = "/v/docs/";
   p.sort = SearchParams::Sort::kSize;
   p.desc = true;
-  EXPECT_EQ(names(p), (std::vector<std::string>{"/v/docs/Café Report.PDF",
-                                                "/v/docs/old/report 2023.pdf"}));
+  EXPECT_EQ(names(p),
+            (std::vector<std::string>{"/v/docs/Café Report.PDF", "/v/docs/old/report 2023.pdf"}));
   p.exts = {"PDF"};
   p.size_max = 150;
   EXPECT_EQ(names(p), std::vector<std::string>{"/v/docs/old/report 2023.pdf"});
@@ -285,9 +288,7 @@ TEST_F(PgStoreTest, SearchesByNameFolderAndFilters) {
   SearchPage all = Find(*s, p);
   EXPECT_EQ(all.total, 6);
   EXPECT_EQ(all.hits.size(), 2u);
-  SearchPage mine = Find(*s, p, [](const std::string& path) {
-    return path.find("/v/docs/") == 0;
-  });
+  SearchPage mine = Find(*s, p, [](const std::string& path) { return path.find("/v/docs/") == 0; });
   EXPECT_EQ(mine.total, 3);
   ASSERT_EQ(mine.hits.size(), 2u);
   EXPECT_EQ(mine.hits[0]["name"], "Café Report.PDF");
@@ -320,11 +321,10 @@ TEST_F(PgStoreTest, SearchesWordsAndSuggests) {
   EXPECT_TRUE(Find(*s, p).hits.empty());
 
   // Most used first; digits-only words are never offered; hidden documents lend no words.
-  EXPECT_EQ(s->Suggest("Hol", 10, nullptr),
-            (std::vector<std::string>{"holiday", "holistic"}));
-  EXPECT_EQ(s->Suggest("hol", 10,
-                       [](const std::string& path) { return path.find("/v/secret") != 0; }),
-            std::vector<std::string>{"holiday"});
+  EXPECT_EQ(s->Suggest("Hol", 10, nullptr), (std::vector<std::string>{"holiday", "holistic"}));
+  EXPECT_EQ(
+      s->Suggest("hol", 10, [](const std::string& path) { return path.find("/v/secret") != 0; }),
+      std::vector<std::string>{"holiday"});
   EXPECT_TRUE(s->Suggest("20", 10, nullptr).empty());
 }
 
@@ -394,8 +394,8 @@ TEST_F(PgStoreTest, FindsWhatTheEmbeddedStoreFinds) {
                  std::string(tree).find("other") == std::string::npos)
         << tree << " finds nothing: the case proves little";
   }
-  for (const char* keywords : {"report", "REPORT quarterly", "holi*", "ete", "revenue-report",
-                               "img_0001"}) {
+  for (const char* keywords :
+       {"report", "REPORT quarterly", "holi*", "ete", "revenue-report", "img_0001"}) {
     SearchParams p;
     p.keywords = keywords;
     EXPECT_EQ(sorted(pg->Search(p, nullptr)), sorted(lite->Search(p, nullptr))) << keywords;
@@ -459,13 +459,22 @@ std::string CoordinatorSql(const std::vector<std::pair<std::string, std::vector<
   for (size_t i = 0; i < shards.size(); ++i) {
     const std::string n = std::to_string(i + 1);
     sql += "CREATE SERVER shard" + n + " FOREIGN DATA WRAPPER postgres_fdw OPTIONS (host '" +
-           shards[i].first + "', port '5432', dbname 'postgres');"
-           "CREATE USER MAPPING FOR CURRENT_USER SERVER shard" + n +
+           shards[i].first +
+           "', port '5432', dbname 'postgres');"
+           "CREATE USER MAPPING FOR CURRENT_USER SERVER shard" +
+           n +
            " OPTIONS (user 'fileindex');"
-           "CREATE FOREIGN TABLE fi_indexes_" + n + "(part int, server text, id text) SERVER"
-           " shard" + n + " OPTIONS (table_name 'fi_indexes');"
-           "CREATE FOREIGN TABLE fi_meta_" + n + "(part int, key text, value text) SERVER"
-           " shard" + n + " OPTIONS (table_name 'fi_meta');";
+           "CREATE FOREIGN TABLE fi_indexes_" +
+           n +
+           "(part int, server text, id text) SERVER"
+           " shard" +
+           n +
+           " OPTIONS (table_name 'fi_indexes');"
+           "CREATE FOREIGN TABLE fi_meta_" +
+           n +
+           "(part int, key text, value text) SERVER"
+           " shard" +
+           n + " OPTIONS (table_name 'fi_meta');";
     for (int part : shards[i].second) {
       const std::string p = std::to_string(part);
       sql += "CREATE FOREIGN TABLE fi_docs_" + p + " PARTITION OF fi_docs FOR VALUES IN (" + p +
@@ -484,16 +493,15 @@ TEST_F(PgStoreTest, ACoordinatorSearchesIndexesOnTwoServersAsOne) {
   // Index numbers of servers that meet in a coordinator must not overlap.
   PgConn(second.conninfo()).Script("ALTER SEQUENCE fi_indexes_part_seq RESTART WITH 1001");
   auto a = Make("s1", "docs");
-  auto b = PgStore::Create(pool2, "s2", "docs", tc::FileMappings(),
-                           Json::Value(Json::objectValue), Json::Value(Json::objectValue));
+  auto b = PgStore::Create(pool2, "s2", "docs", tc::FileMappings(), Json::Value(Json::objectValue),
+                           Json::Value(Json::objectValue));
   Put(*a, {FileDoc("/v/one/report.txt", 1, "quarterly figures"), FileDoc("/v/one/x.txt")});
   Put(*b, {FileDoc("/w/two/Report.pdf", 2, "quarterly plans"), FileDoc("/w/two/y.pdf")});
 
   PgConn(server_.conninfo()).Script("CREATE DATABASE coord");
   PgConn(CoordConninfo(server_))
       .Script(CoordinatorSql({{server_.socket_dir(), {1}}, {second.socket_dir(), {1001}}}));
-  auto coord = PgStore::Open(std::make_shared<PgPool>(CoordConninfo(server_), 2), "s1",
-                             "docs");
+  auto coord = PgStore::Open(std::make_shared<PgPool>(CoordConninfo(server_), 2), "s1", "docs");
   SearchParams p;
   p.keywords = "quarterly";
   p.sort = SearchParams::Sort::kName;
@@ -546,8 +554,7 @@ TEST_F(PgStoreTest, BulkLoadThroughACrashOfTheServer) {
   crash.join();
   EXPECT_GT(failures, 0) << "the crash came after the load: the test proves little";
   s->Sync();
-  const Json::Value all =
-      s->List("/v/load", "", {}, 100000);
+  const Json::Value all = s->List("/v/load", "", {}, 100000);
   ASSERT_EQ(all.size(), static_cast<size_t>(kBatches * 251));
   for (int b = 0; b < kBatches; ++b) {
     SearchParams p;

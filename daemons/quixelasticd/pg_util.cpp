@@ -16,12 +16,12 @@ namespace {
 
 // SQLSTATE classes of a server that went away or is going: the statement may be sent again.
 bool IsUnavailable(const char* state) {
-  if (state == nullptr) return true;  // no answer at all
-  return std::strncmp(state, "08", 2) == 0 ||   // connection exception
-         std::strcmp(state, "57P01") == 0 ||    // admin shutdown
-         std::strcmp(state, "57P02") == 0 ||    // crash shutdown
-         std::strcmp(state, "57P03") == 0 ||    // cannot connect now (starting up)
-         std::strcmp(state, "53300") == 0;      // too many connections
+  if (state == nullptr) return true;           // no answer at all
+  return std::strncmp(state, "08", 2) == 0 ||  // connection exception
+         std::strcmp(state, "57P01") == 0 ||   // admin shutdown
+         std::strcmp(state, "57P02") == 0 ||   // crash shutdown
+         std::strcmp(state, "57P03") == 0 ||   // cannot connect now (starting up)
+         std::strcmp(state, "53300") == 0;     // too many connections
 }
 
 std::string FirstLine(const char* text) {
@@ -67,8 +67,8 @@ std::string PgResult::Text(int row, int col) const {
 
 std::string PgResult::Bytes(int row, int col) const {
   size_t n = 0;
-  unsigned char* raw = PQunescapeBytea(
-      reinterpret_cast<const unsigned char*>(PQgetvalue(r_.get(), row, col)), &n);
+  unsigned char* raw =
+      PQunescapeBytea(reinterpret_cast<const unsigned char*>(PQgetvalue(r_.get(), row, col)), &n);
   if (raw == nullptr) throw StoreError(SQLITE_NOMEM, "out of memory reading a result");
   std::string out(reinterpret_cast<const char*>(raw), n);
   PQfreemem(raw);
