@@ -65,6 +65,7 @@ Engine::Engine(EngineOptions options) : options_(std::move(options)) {
   // SQLite gives back cached pages as it nears half the limit, so that caches never push the
   // daemon into refusing requests for memory; the other half is for requests in flight.
   sqlite3_soft_heap_limit64(options_.memory_limit_bytes / 2);
+  if (!options_.stores) options_.stores = SqliteBackend();
 }
 
 Engine::~Engine() { Shutdown(); }
@@ -258,9 +259,9 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
   if (command == "update_term_suggestion") {
     const std::string db = RequireString(data, "db_name");
     const std::string doc_id = RequireString(data, "doc_id_field");
-    IndexStore& store = session.Acquire(db);
-    std::optional<Savepoint> sp;
-    if (session.savepoints()) sp.emplace(store.writer());
+    Store& store = session.Acquire(db);
+    std::unique_ptr<StoreSavepoint> sp;
+    if (session.savepoints()) sp = store.BeginSavepoint();
     if (!store.UpdateTermSuggestion(doc_id)) {
       throw EngineError(kCodeDocNotFound, "no document " + doc_id);
     }
@@ -270,9 +271,9 @@ Json::Value Engine::Dispatch(const std::string& command, const Json::Value& data
   }
   if (!batched) throw EngineError(kCodeUnknownCommand, "unknown command: " + command);
   const std::string id = RequireString(data, "id");
-  IndexStore& store = session.Acquire(id);
-  std::optional<Savepoint> sp;
-  if (session.savepoints()) sp.emplace(store.writer());
+  Store& store = session.Acquire(id);
+  std::unique_ptr<StoreSavepoint> sp;
+  if (session.savepoints()) sp = store.BeginSavepoint();
   if (command == "document_upsert_by_id") {
     const Json::Value& doc = data["data"];
     if (!doc.isObject()) throw EngineError(kCodeInvalidParam, "\"data\" must be an object");

@@ -55,6 +55,8 @@ struct EngineOptions {
   // Time a request's searches and suggestions may take together before they are stopped and
   // answered kCodeSearchTooLong; 0: no limit.
   int64_t search_budget_micros = 10 * 1000000LL;
+  // Where the indexes' documents live; null: an SQLite database in each index's folder.
+  std::shared_ptr<StoreBackend> stores;
 };
 
 class Engine {
@@ -93,12 +95,12 @@ class Engine {
     State state = State::kOpening;
     bool removed = false;
     std::string refusal;  // why the index is refused: the entry's path and what to do
-    std::shared_ptr<IndexStore> store;
+    std::shared_ptr<Store> store;
     std::mutex mu;  // guards everything above; held by a writer for its whole run
     // A copy of state and store for searches, which must not wait for a writer's run.
     std::mutex view_mu;
     State view_state = State::kOpening;
-    std::shared_ptr<IndexStore> view_store;
+    std::shared_ptr<Store> view_store;
   };
   class Session;
   // Holds an index's lock and publishes its state to searches when released.
@@ -148,7 +150,7 @@ class Engine {
   void HandleStoreFailure(Entry& e, const StoreError& err);
   void SaveRegistry();  // with registry_mu_ held
   void OpenAll(bool after_crash);
-  std::vector<std::shared_ptr<IndexStore>> SearchTargets(const Json::Value& data);
+  std::vector<std::shared_ptr<Store>> SearchTargets(const Json::Value& data);
 
   EngineOptions options_;
   std::mutex registry_mu_;

@@ -41,7 +41,7 @@ class Engine::Session {
   void SetQueryGuard(QueryGuard* guard) { guard_ = guard; }
   QueryGuard* query_guard() const { return guard_; }
 
-  IndexStore& Acquire(const std::string& id) {
+  Store& Acquire(const std::string& id) {
     if (entry_ && entry_->id == id && txn_) return *entry_->store;
     FinishQuietly();
     std::shared_ptr<Entry> e = engine_.Find(id);
@@ -49,7 +49,7 @@ class Engine::Session {
     if (e->removed) throw EngineError(kCodeIndexNotFound, "no index " + id);
     RequireReady(*e);
     try {
-      txn_ = std::make_unique<WriteTxn>(*e->store);
+      txn_ = e->store->Begin();
     } catch (const StoreError& err) {
       engine_.HandleStoreFailure(*e, err);
       throw;
@@ -94,7 +94,7 @@ class Engine::Session {
   // own, everything written in it is gone and the results that said otherwise are corrected.
   void AfterStoreFailure(const StoreError& err) {
     if (!txn_) return;
-    const bool lost = sqlite3_get_autocommit(entry_->store->writer().get()) != 0;
+    const bool lost = entry_->store->TransactionLost();
     if (!lost && !err.IsCorruption()) return;
     txn_.reset();
     engine_.HandleStoreFailure(*entry_, err);
@@ -126,7 +126,7 @@ class Engine::Session {
   Engine& engine_;
   std::shared_ptr<Entry> entry_;
   std::unique_lock<std::mutex> lock_;
-  std::unique_ptr<WriteTxn> txn_;
+  std::unique_ptr<StoreTxn> txn_;
   std::vector<size_t> pending_;
   LostFn lost_;
   bool savepoints_ = true;

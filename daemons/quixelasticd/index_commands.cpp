@@ -9,7 +9,6 @@
 #include "daemons/quixelasticd/engine_session.hpp"
 #include "daemons/quixelasticd/request_args.hpp"
 #include "daemons/quixelasticd/schema.hpp"
-#include "daemons/quixelasticd/store_files.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -42,10 +41,10 @@ Json::Value Engine::IndexCreate(const Json::Value& data) {
       EntryGuard entry_lock(old);
       if (old.state == State::kRefused) {
         try {
-          old.store = IndexStore::ExistsIn(path)
-                          ? IndexStore::Open(path)
-                          : IndexStore::Create(path, id, mappings, data["settings"],
-                                               data["event_handler"]);
+          old.store = options_.stores->Exists(path, id)
+                          ? options_.stores->Open(path, id)
+                          : options_.stores->Create(path, id, mappings, data["settings"],
+                                                    data["event_handler"]);
         } catch (const UnsafeStoreError& err) {
           old.refusal = err.what();
           throw;
@@ -64,16 +63,14 @@ Json::Value Engine::IndexCreate(const Json::Value& data) {
   e->id = id;
   e->path = path;
   try {
-    if (IndexStore::ExistsIn(path)) {
+    if (options_.stores->Exists(path, id)) {
       // A store left in the folder (an index re-keyed or a registry lost) is adopted, not
       // overwritten: its documents are the index's.
-      e->store = IndexStore::Open(path);
-      WriteTxn txn(*e->store);
-      e->store->SetMeta("id", id);
-      txn.Commit();
+      e->store = options_.stores->Open(path, id);
+      e->store->Rekey(id);
       ORVANE_LOG(LOG_INFO, "index %s adopts the store in %s", id.c_str(), path.c_str());
     } else {
-      e->store = IndexStore::Create(path, id, mappings, data["settings"], data["event_handler"]);
+      e->store = options_.stores->Create(path, id, mappings, data["settings"], data["event_handler"]);
     }
     e->state = State::kReady;
   } catch (const UnsafeStoreError& err) {
@@ -114,16 +111,7 @@ Json::Value Engine::IndexDelete(const Json::Value& data) {
   EntryGuard lock(*e);
   e->removed = true;
   e->store.reset();
-  try {
-    const platform::SafeDir folder = OpenStoreDir(e->path, false);
-    if (folder.valid()) {
-      for (const std::string& suffix : kStoreFiles) folder.Unlink(IndexStore::kDbFile + suffix);
-    }
-    RemoveStoreDir(e->path);
-  } catch (const StoreError& err) {
-    // The index is forgotten either way; what stands in its folder's place is not touched.
-    ORVANE_LOG(LOG_ERR, "%s", err.what());
-  }
+  options_.stores->Remove(e->path, e->id);
   Json::Value result;
   result["deleted"] = true;
   return result;
@@ -143,7 +131,7 @@ Json::Value Engine::IndexPause(const Json::Value& data, bool pause) {
     } else {
       if (e->state != State::kPaused) return Json::Value(Json::objectValue);
       try {
-        e->store = IndexStore::Open(e->path);
+        e->store = options_.stores->Open(e->path, e->id);
         e->state = State::kReady;
       } catch (const UnsafeStoreError& err) {
         Refuse(*e, err.what());
@@ -191,11 +179,7 @@ Json::Value Engine::IndexConfigSet(const Json::Value& data) {
     }
     if (new_id != id) {
       std::lock_guard<std::mutex> entry_lock(e->mu);
-      if (e->store) {
-        WriteTxn txn(*e->store);
-        e->store->SetMeta("id", new_id);
-        txn.Commit();
-      }
+      if (e->store) e->store->Rekey(new_id);
       e->id = new_id;
       indexes_.erase(it);
       indexes_[new_id] = e;
@@ -209,7 +193,7 @@ Json::Value Engine::IndexConfigSet(const Json::Value& data) {
   {
     EntryGuard lock(*e);
     if (e->state != State::kReady && e->state != State::kPaused) RequireReady(*e);
-    if (IndexStore::ExistsIn(new_path)) {
+    if (options_.stores->Exists(new_path, e->id)) {
       throw EngineError(kCodeIndexExists, "a store already exists in " + new_path);
     }
     before = e->state;
@@ -221,7 +205,7 @@ Json::Value Engine::IndexConfigSet(const Json::Value& data) {
   }
   std::string failure;
   try {
-    MoveStoreFiles(old_path, new_path);
+    options_.stores->Move(old_path, new_path, e->id);
   } catch (const EngineError& err) {
     failure = err.what();
   } catch (const StoreError& err) {
@@ -233,7 +217,7 @@ Json::Value Engine::IndexConfigSet(const Json::Value& data) {
     e->state = before;
     if (before == State::kReady) {
       try {
-        e->store = IndexStore::Open(e->path);
+        e->store = options_.stores->Open(e->path, e->id);
       } catch (const UnsafeStoreError& err) {
         Refuse(*e, err.what());
         failure = err.what();
@@ -262,9 +246,9 @@ Json::Value Engine::Commit(const Json::Value& data, Session& session) {
   try {
     const std::string sugg = e->store->Meta("term_sugg");
     if (sugg == "rebuilding" || (sugg != "ready" && e->store->DocCount() == 0)) {
-      WriteTxn txn(*e->store);
+      std::unique_ptr<StoreTxn> txn = e->store->Begin();
       e->store->SetMeta("term_sugg", "ready");
-      txn.Commit();
+      txn->Commit();
     }
     e->store->Sync();
   } catch (const StoreError& err) {

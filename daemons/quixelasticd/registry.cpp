@@ -13,7 +13,6 @@
 #include "common/root.hpp"
 #include "common/util.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
-#include "daemons/quixelasticd/store_files.hpp"
 
 namespace orvane {
 namespace elasticd {
@@ -78,15 +77,15 @@ void Engine::OpenAll(bool after_crash) {
     }
     // Opening and checking run without the index's lock, so that its requests are answered
     // kCodeIndexOpening or kCodeIndexRecovering meanwhile instead of waiting.
-    std::shared_ptr<IndexStore> store;
+    std::shared_ptr<Store> store;
     std::string failure;
     bool damaged = false;
     bool refused = false;
     try {
-      if (!IndexStore::ExistsIn(path)) {
+      if (!options_.stores->Exists(path, e->id)) {
         failure = "no store in " + path;
       } else {
-        store = IndexStore::Open(path);
+        store = options_.stores->Open(path, e->id);
         if (after_crash && !store->QuickCheck(&failure)) damaged = true;
       }
     } catch (const UnsafeStoreError& err) {
@@ -177,16 +176,7 @@ void Engine::Refuse(Entry& e, const std::string& why) {
 void Engine::SetAside(Entry& e, const std::string& why) {
   e.store.reset();
   e.state = State::kDamaged;
-  const std::string stamp = ".damaged-" + std::to_string(Env::Current()->Now());
-  try {
-    const platform::SafeDir folder = OpenStoreDir(e.path, false);
-    for (const std::string& suffix : kStoreFiles) {
-      const std::string name = IndexStore::kDbFile + suffix;
-      if (folder.valid() && folder.Exists(name)) folder.Rename(name, name + stamp);
-    }
-  } catch (const StoreError& err) {
-    ORVANE_LOG(LOG_ERR, "%s", err.what());
-  }
+  options_.stores->SetAside(e.path, e.id, ".damaged-" + std::to_string(Env::Current()->Now()));
   ORVANE_LOG(LOG_ERR,
              "index %s in %s is damaged (%s); its files are set aside and it needs a "
              "rebuild",

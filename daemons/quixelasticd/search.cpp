@@ -40,7 +40,7 @@ std::shared_ptr<AccessChecker> CheckerFor(const Caller& caller) {
 }
 
 // The check for the hits of one index: symlinks are followed only down to its share's root.
-VisibleFn VisibleIn(const std::shared_ptr<AccessChecker>& checker, const IndexStore& store) {
+VisibleFn VisibleIn(const std::shared_ptr<AccessChecker>& checker, const Store& store) {
   if (!checker) return VisibleFn();
   return [checker, root = AccessChecker::ShareRootOf(store.dir())](const std::string& path) {
     return checker->CanOpen(path, root);
@@ -154,7 +154,7 @@ SearchParams ParseSearch(const Json::Value& d) {
 }
 
 // The hits of every index, each index giving its best from + size, with their totals summed.
-SearchPage SearchEach(const std::vector<std::shared_ptr<IndexStore>>& stores,
+SearchPage SearchEach(const std::vector<std::shared_ptr<Store>>& stores,
                       const SearchParams& p, const Caller& caller, QueryGuard* guard) {
   const std::shared_ptr<AccessChecker> checker = CheckerFor(caller);
   SearchParams each = p;
@@ -212,7 +212,7 @@ Json::Value SearchReply(const SearchPage& all, const SearchParams& p) {
 
 }  // namespace
 
-std::vector<std::shared_ptr<IndexStore>> Engine::SearchTargets(const Json::Value& data) {
+std::vector<std::shared_ptr<Store>> Engine::SearchTargets(const Json::Value& data) {
   std::vector<std::string> ids;
   const Json::Value& id = data["id"];
   if (id.isString()) {
@@ -238,7 +238,7 @@ std::vector<std::shared_ptr<IndexStore>> Engine::SearchTargets(const Json::Value
       }
     }
   }
-  std::vector<std::shared_ptr<IndexStore>> stores;
+  std::vector<std::shared_ptr<Store>> stores;
   for (auto& [name, e] : entries) {
     std::lock_guard<std::mutex> lock(e->view_mu);
     if (e->view_store) {
@@ -257,7 +257,7 @@ std::vector<std::shared_ptr<IndexStore>> Engine::SearchTargets(const Json::Value
 Json::Value Engine::Search(const Json::Value& data, const Caller& caller, QueryGuard* guard) {
   const Json::Value& d = data.isObject() ? data : Json::Value(Json::objectValue);
   const SearchParams p = ParseSearch(d);
-  const std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
+  const std::vector<std::shared_ptr<Store>> stores = SearchTargets(d);
   SearchPage all = SearchEach(stores, p, caller, guard);
   if (stores.size() > 1) MergeOrder(p, &all.hits);
   return SearchReply(all, p);
@@ -267,7 +267,7 @@ Json::Value Engine::Suggest(const Json::Value& data, const Caller& caller, Query
   const Json::Value& d = data.isObject() ? data : Json::Value(Json::objectValue);
   const std::string prefix = RequireString(d, "prefix");
   const int64_t size = std::min<int64_t>(OptionalInt(d, "size", 10), 100);
-  std::vector<std::shared_ptr<IndexStore>> stores = SearchTargets(d);
+  std::vector<std::shared_ptr<Store>> stores = SearchTargets(d);
   const std::shared_ptr<AccessChecker> checker = CheckerFor(caller);
   std::vector<std::string> terms;
   for (auto& store : stores) {

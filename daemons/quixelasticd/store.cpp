@@ -1243,5 +1243,43 @@ std::vector<std::string> IndexStore::Suggest(const std::string& prefix, size_t l
   return out;
 }
 
+namespace {
+
+class SqliteTxn : public StoreTxn {
+ public:
+  explicit SqliteTxn(Db& db) : txn_(db) {}
+  void Commit() override { txn_.Commit(); }
+
+ private:
+  Transaction txn_;
+};
+
+class SqliteSavepoint : public StoreSavepoint {
+ public:
+  explicit SqliteSavepoint(Db& db) : sp_(db) {}
+  void Release() override { sp_.Release(); }
+
+ private:
+  elasticd::Savepoint sp_;
+};
+
+}  // namespace
+
+std::unique_ptr<StoreTxn> IndexStore::Begin() { return std::make_unique<SqliteTxn>(writer_); }
+
+std::unique_ptr<StoreSavepoint> IndexStore::BeginSavepoint() {
+  return std::make_unique<SqliteSavepoint>(writer_);
+}
+
+// SQLite rolls a transaction back on its own after some failures (a full disk, an I/O error):
+// the connection is then in autocommit mode again.
+bool IndexStore::TransactionLost() { return sqlite3_get_autocommit(writer_.get()) != 0; }
+
+void IndexStore::Rekey(const std::string& new_id) {
+  Transaction txn(writer_);
+  SetMeta("id", new_id);
+  txn.Commit();
+}
+
 }  // namespace elasticd
 }  // namespace orvane

@@ -22,48 +22,12 @@
 #include "daemons/quixelasticd/query_guard.hpp"
 #include "daemons/quixelasticd/query_tree.hpp"
 #include "daemons/quixelasticd/schema.hpp"
+#include "daemons/quixelasticd/store_api.hpp"
 #include "daemons/quixelasticd/sqlite_util.hpp"
 #include "platform/safe_dir.hpp"
 
 namespace orvane {
 namespace elasticd {
-
-// A document query of the library's forms: a whole value or a prefix of one field.
-struct DocQuery {
-  enum class Kind { kAll, kTerm, kPrefix };
-  Kind kind = Kind::kAll;
-  std::string field;
-  std::string value;
-  // Reads {"qsl": {"term"|"prefix": {field: value}}} or {"qsl": {"match_all": {}}};
-  // throws EngineError(kCodeInvalidParam).
-  static DocQuery Parse(const Json::Value& query);
-};
-
-struct SearchParams {
-  enum class Sort { kRelevance, kName, kSize, kMtime };
-  std::string keywords;
-  std::string name;
-  std::vector<std::string> exts;  // lower case
-  std::optional<bool> is_dir;
-  std::optional<int64_t> size_min, size_max, mtime_min, mtime_max;
-  std::string folder;
-  // A structured query, ANDed with the members above.
-  std::optional<SqlCondition> query;
-  // The same query rendered for the PostgreSQL store.
-  std::optional<SqlCondition> server_query;
-  Sort sort = Sort::kRelevance;
-  bool desc = false;
-  int64_t from = 0;
-  int64_t size = 20;
-  // Hits before this position of the page get no snippet (the caller drops them).
-  int64_t snippet_from = 0;
-};
-
-struct SearchPage {
-  int64_t total = 0;
-  bool total_exact = true;
-  std::vector<Json::Value> hits;
-};
 
 // An index folder or file that is not the system's own (a planted link, a foreign owner): the
 // store is refused rather than damaged. The text names the path and what to do.
@@ -76,10 +40,7 @@ class UnsafeStoreError : public StoreError {
 // 0700 when `create`; invalid when missing. Throws UnsafeStoreError or StoreError.
 platform::SafeDir OpenStoreDir(const std::string& dir, bool create);
 
-// Decides whether the asking user may see the file at a full path.
-using VisibleFn = std::function<bool(const std::string& path)>;
-
-class IndexStore {
+class IndexStore : public Store {
  public:
   static constexpr const char* kDbFile = "index.db";
   // Rows a filtered search inspects beyond the requested page before it stops counting.
@@ -100,55 +61,61 @@ class IndexStore {
   // Throws UnsafeStoreError when a planted entry stands in the way.
   static bool ExistsIn(const std::string& dir);
 
-  ~IndexStore();
+  ~IndexStore() override;
   IndexStore(const IndexStore&) = delete;
   IndexStore& operator=(const IndexStore&) = delete;
 
-  const std::string& dir() const { return dir_; }
+  const std::string& dir() const override { return dir_; }
   const Schema& schema() const { return schema_; }
-  std::string Meta(const std::string& key);
-  void SetMeta(const std::string& key, const std::string& value);  // inside a WriteTxn
+  std::string Meta(const std::string& key) override;
+  void SetMeta(const std::string& key, const std::string& value) override;  // inside a WriteTxn
+
+  std::unique_ptr<StoreTxn> Begin() override;
+  std::unique_ptr<StoreSavepoint> BeginSavepoint() override;
+  bool TransactionLost() override;
+  void Rekey(const std::string& new_id) override;
 
   // --- writer side: call only with the index's write lock held and a WriteTxn open.
   Db& writer() { return writer_; }
   // Adds or replaces a whole document. `doc_id` names the document it replaces; the document's
   // identity is its property_id field (filled from `doc_id` when absent).
-  void Upsert(const std::string& doc_id, const Json::Value& doc);
+  void Upsert(const std::string& doc_id, const Json::Value& doc) override;
   // Upserts documents already decoded (the indexer's bulk form), each identified by its own
   // property_id field. A document the schema refuses is skipped and listed in `refused` (its
   // position and why); the others are written. Returns how many were written; throws
   // StoreError when the store fails, leaving the caller's transaction to roll back.
   size_t UpsertMany(const std::vector<Json::Value>& docs,
-                    std::vector<std::pair<size_t, std::string>>* refused);
+                    std::vector<std::pair<size_t, std::string>>* refused) override;
   // Merges `fields` into the existing document `doc_id`; throws EngineError(kCodeDocNotFound).
   // Changing the identifying field re-keys it, replacing any document already under the new key.
-  void SetFields(const std::string& doc_id, const Json::Value& fields);
-  bool Delete(const std::string& doc_id);
-  int64_t DeleteByQuery(const DocQuery& q);
+  void SetFields(const std::string& doc_id, const Json::Value& fields) override;
+  bool Delete(const std::string& doc_id) override;
+  int64_t DeleteByQuery(const DocQuery& q) override;
   // Hits in identifier order, each the loaded stored fields.
   Json::Value GetByQuery(const DocQuery& q, const std::vector<std::string>& load, int64_t from,
-                         int64_t size);
+                         int64_t size) override;
   // The documents whose identifier is `dir` or lies below `dir` + "/", after `after` (all
   // when empty), in identifier order, at most `size`: each [identifier, size, modification
   // time, is a directory, then the stored fields `extra` in order], null where a document has
   // no value. Reads only the derived columns unless `extra` asks for more.
   Json::Value List(const std::string& dir, const std::string& after,
-                   const std::vector<std::string>& extra, int64_t size);
+                   const std::vector<std::string>& extra, int64_t size) override;
   // (Re)computes the suggestion terms of one document; false when it does not exist.
-  bool UpdateTermSuggestion(const std::string& doc_id);
-  int64_t DocCount();
+  bool UpdateTermSuggestion(const std::string& doc_id) override;
+  int64_t DocCount() override;
 
   // Makes every committed transaction durable against power loss. No WriteTxn open.
-  void Sync();
+  void Sync() override;
   // Checks the database structure; false with a detail when damaged.
-  bool QuickCheck(std::string* detail);
+  bool QuickCheck(std::string* detail) override;
 
   // --- reader side: any thread. A `guard` (may be null) stops the work early: its statement
   // then fails with a StoreError of SQLITE_INTERRUPT and the guard says why.
-  SearchPage Search(const SearchParams& p, const VisibleFn& visible, QueryGuard* guard = nullptr);
+  SearchPage Search(const SearchParams& p, const VisibleFn& visible,
+                    QueryGuard* guard = nullptr) override;
   // Completions of `prefix` (lower case), most used first.
   std::vector<std::string> Suggest(const std::string& prefix, size_t limit,
-                                   const VisibleFn& visible, QueryGuard* guard = nullptr);
+                                   const VisibleFn& visible, QueryGuard* guard = nullptr) override;
 
  private:
   IndexStore(std::string dir, platform::SafeDir folder);

@@ -67,5 +67,53 @@ void MoveStoreFiles(const std::string& from_dir, const std::string& to_dir) {
   RemoveStoreDir(from_dir);
 }
 
+namespace {
+
+class SqliteStores : public StoreBackend {
+ public:
+  bool Exists(const std::string& dir, const std::string&) override {
+    return IndexStore::ExistsIn(dir);
+  }
+  std::shared_ptr<Store> Create(const std::string& dir, const std::string& id,
+                                const Json::Value& mappings, const Json::Value& settings,
+                                const Json::Value& event_handler) override {
+    return IndexStore::Create(dir, id, mappings, settings, event_handler);
+  }
+  std::shared_ptr<Store> Open(const std::string& dir, const std::string&) override {
+    return IndexStore::Open(dir);
+  }
+  void Remove(const std::string& dir, const std::string&) override {
+    try {
+      const platform::SafeDir folder = OpenStoreDir(dir, false);
+      if (folder.valid()) {
+        for (const std::string& suffix : kStoreFiles) folder.Unlink(IndexStore::kDbFile + suffix);
+      }
+      RemoveStoreDir(dir);
+    } catch (const StoreError& err) {
+      // The index is forgotten either way; what stands in its folder's place is not touched.
+      ORVANE_LOG(LOG_ERR, "%s", err.what());
+    }
+  }
+  void Move(const std::string& from_dir, const std::string& to_dir,
+            const std::string&) override {
+    MoveStoreFiles(from_dir, to_dir);
+  }
+  void SetAside(const std::string& dir, const std::string&, const std::string& stamp) override {
+    try {
+      const platform::SafeDir folder = OpenStoreDir(dir, false);
+      for (const std::string& suffix : kStoreFiles) {
+        const std::string name = IndexStore::kDbFile + suffix;
+        if (folder.valid() && folder.Exists(name)) folder.Rename(name, name + stamp);
+      }
+    } catch (const StoreError& err) {
+      ORVANE_LOG(LOG_ERR, "%s", err.what());
+    }
+  }
+};
+
+}  // namespace
+
+std::shared_ptr<StoreBackend> SqliteBackend() { return std::make_shared<SqliteStores>(); }
+
 }  // namespace elasticd
 }  // namespace orvane
