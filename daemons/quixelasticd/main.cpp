@@ -7,13 +7,18 @@
 #include <cstdlib>
 #include <cstring>
 #include <iostream>
+#include <memory>
+#include <stdexcept>
 #include <string>
 
+#include "common/env.hpp"
 #include "common/error.hpp"
 #include "common/log.hpp"
 #include "common/root.hpp"
 #include "common/wire.hpp"
 #include "daemons/quixelasticd/engine.hpp"
+#include "daemons/quixelasticd/pg_backend.hpp"
+#include "daemons/quixelasticd/pg_util.hpp"
 #include "daemons/quixelasticd/server.hpp"
 #include "platform/daemon_start.hpp"
 
@@ -29,7 +34,7 @@ const char kUsage[] =
     "                    [--max-connections N] [--io-timeout-s N] [--index-root DIR]\n"
     "                    [--max-public-connections N] [--max-public-connections-per-user N]\n"
     "                    [--max-public-requests-per-user N] [--public-timeout-ms N]\n"
-    "                    [--search-budget-ms N]\n";
+    "                    [--search-budget-ms N] [--postgres CONNINFO [--server-name NAME]]\n";
 
 struct Flags {
   bool foreground = false;
@@ -49,7 +54,13 @@ struct Flags {
   long long public_requests_per_user = 4;
   long long public_timeout_ms = orvane::wire::kEnginePublicRequestTimeoutMicros / 1000;
   long long search_budget_ms = 10000;
+  // A libpq connection string: the indexes live in that database instead of SQLite files.
+  std::string postgres;
+  std::string server_name;  // this server's name in a shared database; the host name if empty
 };
+
+// Connection attempts, two seconds apart, before a daemon whose database is away gives up.
+constexpr int kConnectAttempts = 30;
 
 bool ParseNumber(const char* text, long long min, long long* out) {
   char* end = nullptr;
@@ -93,6 +104,8 @@ bool ParseFlags(int argc, char** argv, Flags* f) {
     else if (arg == "--max-public-requests-per-user") ok = number(1, &f->public_requests_per_user);
     else if (arg == "--public-timeout-ms") ok = number(1, &f->public_timeout_ms);
     else if (arg == "--search-budget-ms") ok = number(0, &f->search_budget_ms);
+    else if (arg == "--postgres") ok = text(&f->postgres) && !f->postgres.empty();
+    else if (arg == "--server-name") ok = text(&f->server_name) && !f->server_name.empty();
     else ok = false;
     if (!ok) {
       std::cerr << "quixelasticd: bad or incomplete option " << arg << "\n" << kUsage;
@@ -134,10 +147,40 @@ void ToOptions(const Flags& flags, orvane::elasticd::EngineOptions* engine_optio
 }
 
 // Serves until a stop signal; 1 when the engine or the server could not start.
+// The shared database's stores. A database that is starting too (the whole machine booting)
+// is waited for a while before the daemon gives up and its service manager starts it again.
+std::shared_ptr<orvane::elasticd::StoreBackend> ConnectPostgres(const Flags& flags) {
+  std::string server = flags.server_name;
+  if (server.empty()) {
+    char host[256] = {};
+    if (::gethostname(host, sizeof(host) - 1) != 0 || host[0] == '\0') {
+      throw std::runtime_error("no host name to name this server by; give --server-name");
+    }
+    server = host;
+  }
+  for (int attempt = 1;; ++attempt) {
+    try {
+      return orvane::elasticd::PgBackend(flags.postgres, server);
+    } catch (const orvane::elasticd::StoreUnavailableError& e) {
+      if (attempt == kConnectAttempts) throw;
+      ORVANE_LOG(LOG_WARNING, "the database is not reachable yet (%s); trying again", e.what());
+      orvane::Env::Current()->SleepMicros(2 * 1000000LL);
+    }
+  }
+}
+
 int Serve(const Flags& flags, orvane::platform::DaemonSignals* signals) {
   orvane::elasticd::EngineOptions engine_options;
   orvane::elasticd::ServerOptions server_options;
   ToOptions(flags, &engine_options, &server_options);
+  if (!flags.postgres.empty()) {
+    try {
+      engine_options.stores = ConnectPostgres(flags);
+    } catch (const std::exception& e) {
+      ORVANE_LOG(LOG_ERR, "cannot start: the index database: %s", e.what());
+      return 1;
+    }
+  }
   int status = 0;
   orvane::elasticd::Engine engine(engine_options);
   orvane::elasticd::Server server(engine, server_options);

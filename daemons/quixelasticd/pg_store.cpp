@@ -541,6 +541,20 @@ PgConn& PgStore::Writer() {
   return *writer_;
 }
 
+void PgStore::SetSavepoint() { Settled().Script("SAVEPOINT fi_command"); }
+
+void PgStore::ReleaseSavepoint() { Settled().Script("RELEASE SAVEPOINT fi_command"); }
+
+void PgStore::RollbackToSavepoint() {
+  pending_.clear();
+  read_ahead_.clear();
+  Writer().Script("ROLLBACK TO SAVEPOINT fi_command; RELEASE SAVEPOINT fi_command");
+}
+
+bool PgStore::InTransaction() const {
+  return writer_ && writer_->Healthy() && writer_->InTransaction();
+}
+
 std::string PgStore::Meta(const std::string& key) {
   PgResult r = Settled().Exec("SELECT value FROM fi_meta WHERE part = $1 AND key = $2",
                               PgParams().Int(part_).Text(key));

@@ -54,6 +54,13 @@ class PgStore {
 
   // --- writer side: call only with the index's write lock held and a PgWriteTxn open.
   PgConn& Writer();
+  // A savepoint of the open transaction. The writes waiting in the store go to the server
+  // first, so that rolling back drops exactly the writes made after the savepoint.
+  void SetSavepoint();
+  void ReleaseSavepoint();
+  void RollbackToSavepoint();
+  // Whether the writer's transaction is still open (false once the server dropped it).
+  bool InTransaction() const;
   void Upsert(const std::string& doc_id, const Json::Value& doc);
   size_t UpsertMany(const std::vector<Json::Value>& docs,
                     std::vector<std::pair<size_t, std::string>>* refused);

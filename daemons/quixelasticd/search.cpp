@@ -153,6 +153,37 @@ SearchParams ParseSearch(const Json::Value& d) {
   return p;
 }
 
+// The check for hits of any of this server's indexes: each path is checked against the share of
+// the index whose share holds it.
+VisibleFn VisibleInAny(const std::shared_ptr<AccessChecker>& checker,
+                       const std::vector<std::shared_ptr<Store>>& stores) {
+  if (!checker) return VisibleFn();
+  std::vector<std::string> roots;
+  for (const auto& store : stores) {
+    const std::string root = AccessChecker::ShareRootOf(store->dir());
+    if (!root.empty()) roots.push_back(root);
+  }
+  return [checker, roots](const std::string& path) {
+    std::string best;
+    for (const std::string& root : roots) {
+      if (root.size() > best.size() && path.compare(0, root.size(), root) == 0 &&
+          (path.size() == root.size() || path[root.size()] == '/')) {
+        best = root;
+      }
+    }
+    return checker->CanOpen(path, best);
+  };
+}
+
+// Whether the search asks for the indexes of every file server sharing the database
+// ("servers": "all") rather than this server's ("this", the default).
+bool AllServers(const Json::Value& d) {
+  const std::string servers = OptionalString(d, "servers");
+  if (servers.empty() || servers == "this") return false;
+  if (servers == "all") return true;
+  throw EngineError(kCodeInvalidParam, "\"servers\" must be \"this\" or \"all\"");
+}
+
 // The hits of every index, each index giving its best from + size, with their totals summed.
 SearchPage SearchEach(const std::vector<std::shared_ptr<Store>>& stores,
                       const SearchParams& p, const Caller& caller, QueryGuard* guard) {
@@ -258,6 +289,16 @@ Json::Value Engine::Search(const Json::Value& data, const Caller& caller, QueryG
   const Json::Value& d = data.isObject() ? data : Json::Value(Json::objectValue);
   const SearchParams p = ParseSearch(d);
   const std::vector<std::shared_ptr<Store>> stores = SearchTargets(d);
+  if (AllServers(d) && options_.stores->Shared() && !stores.empty()) {
+    // One search of the shared database covers every index of every server.
+    SearchParams each = p;
+    each.from = 0;
+    each.size = p.from + p.size;
+    each.snippet_from = p.from;
+    const VisibleFn visible = VisibleInAny(CheckerFor(caller), stores);
+    return SearchReply(
+        Guarded(guard, [&] { return stores[0]->SearchAllServers(each, visible, guard); }), p);
+  }
   SearchPage all = SearchEach(stores, p, caller, guard);
   if (stores.size() > 1) MergeOrder(p, &all.hits);
   return SearchReply(all, p);

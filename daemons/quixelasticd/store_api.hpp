@@ -79,11 +79,10 @@ class Store {
                                            const VisibleFn& visible,
                                            QueryGuard* guard = nullptr) = 0;
   // The search over the indexes of every file server sharing the store's database, each hit
-  // naming its server ("server"); `visible` decides this server's hits and `others` whether
-  // the caller sees other servers' at all. Stores of one server only search themselves.
+  // naming its server ("server"). A caller with a permission filter (`visible`) sees only this
+  // server's files, which the filter can check. A store of one server searches itself.
   virtual SearchPage SearchAllServers(const SearchParams& p, const VisibleFn& visible,
-                                      bool others, QueryGuard* guard) {
-    (void)others;
+                                      QueryGuard* guard) {
     return Search(p, visible, guard);
   }
 };
@@ -104,6 +103,8 @@ class StoreBackend {
   // Moves a closed store from one folder to another.
   virtual void Move(const std::string& from_dir, const std::string& to_dir,
                     const std::string& id) = 0;
+  // Whether several file servers share the stores' database, so that a search may span them.
+  virtual bool Shared() const { return false; }
   // Sets a damaged store's files aside (kept for inspection) so that a rebuild starts afresh.
   virtual void SetAside(const std::string& dir, const std::string& id,
                         const std::string& stamp) = 0;
