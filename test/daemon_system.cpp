@@ -56,9 +56,10 @@ Json::Value System::Folder(const std::string& share_path, bool meta) {
   return f;
 }
 
-std::unique_ptr<ChildProcess> System::StartEngine() const {
-  auto p = std::make_unique<ChildProcess>(
-      root(), std::vector<std::string>{QUIXELASTICD_BIN, "--foreground"});
+std::unique_ptr<ChildProcess> System::StartEngine(const std::vector<std::string>& options) const {
+  std::vector<std::string> argv = {QUIXELASTICD_BIN, "--foreground"};
+  argv.insert(argv.end(), options.begin(), options.end());
+  auto p = std::make_unique<ChildProcess>(root(), argv);
   WaitFor(
       [] {
         try {

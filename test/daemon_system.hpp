@@ -40,8 +40,8 @@ class System {
   void WriteFolders(std::initializer_list<Json::Value> folders) const;
   static Json::Value Folder(const std::string& share_path, bool meta);
 
-  // The search engine (waits until it answers) and the two other daemons.
-  std::unique_ptr<ChildProcess> StartEngine() const;
+  // The search engine (waits until it answers), with these options, and the two other daemons.
+  std::unique_ptr<ChildProcess> StartEngine(const std::vector<std::string>& options = {}) const;
   std::unique_ptr<ChildProcess> StartNotifyd() const;
   // Waits until the daemon's socket answers "status".
   std::unique_ptr<ChildProcess> StartIndexd() const;
