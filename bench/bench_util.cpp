@@ -108,6 +108,51 @@ const char* const kSyntheticWords[] = {"holiday", "report", "invoice",  "summer"
 
 std::string SyntheticWord(uint64_t i) { return kSyntheticWords[i % 20]; }
 
+namespace {
+
+const char* const kNameWords[] = {"holiday", "report", "invoice", "summer", "family", "project", "draft",
+                        "final", "budget", "meeting", "photo", "scan", "notes", "backup",
+                        "music", "video", "contract", "slides", "thesis", "recipe"};
+const char* const kNameExts[] = {"jpg", "pdf", "docx", "mp3", "mp4", "txt", "xlsx", "png"};
+
+}  // namespace
+
+std::string NameWord(uint64_t i) { return kNameWords[i % 20]; }
+
+std::string NameOf(uint64_t i) {
+  std::mt19937_64 rng(i * 2654435761u + 17);
+  std::string name = kNameWords[rng() % 20];
+  name += rng() % 2 ? "_" : " ";
+  name += kNameWords[rng() % 20];
+  name += "_" + std::to_string(rng() % 100000);
+  name += ".";
+  name += kNameExts[rng() % 8];
+  return name;
+}
+
+// A name-and-attributes document, as the library sends for a file without extracted content.
+Json::Value FileDoc(const std::string& parent, const std::string& name, uint64_t i) {
+  const std::string path = parent + "/" + name;
+  const std::string ext = name.substr(name.find_last_of('.') + 1);
+  Json::Value d;
+  d["QUIXMDPath"] = path;
+  d["QUIXMDFSName"] = name;
+  d["QUIXMDParent"] = parent;
+  d["QUIXMDDisplayName"] = name;
+  d["QUIXMDKind"] = ext;
+  d["QUIXMDExtension"] = ext;
+  d["QUIXMDSearchFileName"] = name;
+  d["QUIXMDSearchAncestor"] = parent;
+  d["QUIXMDIsDir"] = false;
+  d["QUIXMDFSSize"] = static_cast<Json::Int64>(i * 37 % 10000000);
+  d["QUIXMDFSContentChangeDate"] = static_cast<Json::Int64>(1600000000 + i);
+  d["QUIXMDFSCreationDate"] = static_cast<Json::Int64>(1600000000 + i);
+  d["QUIXMDAttributeChangeDate"] = static_cast<Json::Int64>(1600000000 + i);
+  d["QUIXMDOwnerUserID"] = "1026";
+  d["QUIXMDOwnerGroupID"] = "100";
+  return d;
+}
+
 std::string SyntheticName(uint64_t i) {
   static const char* const kExts[] = {"jpg", "pdf", "docx", "mp3", "mp4", "txt", "xlsx", "png"};
   std::mt19937_64 rng(i * 2654435761u + 17);

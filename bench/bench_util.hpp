@@ -60,6 +60,13 @@ std::string SyntheticWord(uint64_t i);
 void LoadSynthetic(const std::string& socket, const std::string& id, uint64_t count,
                    const std::function<std::string(uint64_t)>& dir_of);
 
+// The name-only file documents of the engine's benchmarks: document i is named of two of the
+// twenty words NameWord(0..19), a number below 100,000 and one of eight extensions; FileDoc is
+// the document the library sends for such a file in folder `parent`.
+std::string NameWord(uint64_t i);
+std::string NameOf(uint64_t i);
+Json::Value FileDoc(const std::string& parent, const std::string& name, uint64_t i);
+
 // One kept-alive HTTP/1.1 connection to a loopback port; any failure ends the process.
 class HttpClient {
  public:

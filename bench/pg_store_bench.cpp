@@ -27,42 +27,14 @@ using orvane::bench::CpuSeconds;
 using orvane::bench::Seconds;
 using namespace orvane::elasticd;
 
-const char* kWords[] = {"holiday", "report", "invoice",  "summer", "family", "project", "draft",
-                        "final",   "budget", "meeting",  "photo",  "scan",   "notes",   "backup",
-                        "music",   "video",  "contract", "slides", "thesis", "recipe"};
-const char* kExts[] = {"jpg", "pdf", "docx", "mp3", "mp4", "txt", "xlsx", "png"};
+using orvane::bench::NameOf;
+using orvane::bench::NameWord;
+
 constexpr uint64_t kBatch = 1000;
 constexpr uint64_t kRenamed = 25000;
 
-std::string NameOf(uint64_t i) {
-  std::mt19937_64 rng(i * 2654435761u + 17);
-  std::string name = kWords[rng() % 20];
-  name += rng() % 2 ? "_" : " ";
-  name += kWords[rng() % 20];
-  name += "_" + std::to_string(rng() % 100000) + "." + kExts[rng() % 8];
-  return name;
-}
-
 Json::Value FileDoc(const std::string& parent, uint64_t i) {
-  const std::string name = NameOf(i);
-  const std::string ext = name.substr(name.find_last_of('.') + 1);
-  Json::Value d;
-  d["QUIXMDPath"] = parent + "/" + name;
-  d["QUIXMDFSName"] = name;
-  d["QUIXMDParent"] = parent;
-  d["QUIXMDDisplayName"] = name;
-  d["QUIXMDKind"] = ext;
-  d["QUIXMDExtension"] = ext;
-  d["QUIXMDSearchFileName"] = name;
-  d["QUIXMDSearchAncestor"] = parent;
-  d["QUIXMDIsDir"] = false;
-  d["QUIXMDFSSize"] = static_cast<Json::Int64>(i * 37 % 10000000);
-  d["QUIXMDFSContentChangeDate"] = static_cast<Json::Int64>(1600000000 + i);
-  d["QUIXMDFSCreationDate"] = static_cast<Json::Int64>(1600000000 + i);
-  d["QUIXMDAttributeChangeDate"] = static_cast<Json::Int64>(1600000000 + i);
-  d["QUIXMDOwnerUserID"] = "1026";
-  d["QUIXMDOwnerGroupID"] = "100";
-  return d;
+  return orvane::bench::FileDoc(parent, NameOf(i), i);
 }
 
 // The operations the figures are taken of, for either store.
@@ -111,7 +83,7 @@ void Measure(Target& t, uint64_t count) {
   for (int k = 0; k < 200; ++k) {
     SearchParams p;
     // A number of a name is a rare word, a name word a common one (one document in ten).
-    p.keywords = k % 2 ? std::to_string(rng() % 100000) : kWords[rng() % 20];
+    p.keywords = k % 2 ? std::to_string(rng() % 100000) : NameWord(rng());
     const Clock::time_point s = Clock::now();
     hits += t.search(p).total;
     ms.push_back(Seconds(s) * 1000);

@@ -39,44 +39,9 @@ Json::Value Request(const Json::Value& req) { return orvane::bench::Request(g_so
 
 const char kShare[] = "bench";
 const char kId[] = "fileindex_bench";
-const char* kWords[] = {"holiday", "report", "invoice", "summer", "family", "project", "draft",
-                        "final", "budget", "meeting", "photo", "scan", "notes", "backup",
-                        "music", "video", "contract", "slides", "thesis", "recipe"};
-const char* kExts[] = {"jpg", "pdf", "docx", "mp3", "mp4", "txt", "xlsx", "png"};
-
-std::string NameOf(uint64_t i) {
-  std::mt19937_64 rng(i * 2654435761u + 17);
-  std::string name = kWords[rng() % 20];
-  name += rng() % 2 ? "_" : " ";
-  name += kWords[rng() % 20];
-  name += "_" + std::to_string(rng() % 100000);
-  name += ".";
-  name += kExts[rng() % 8];
-  return name;
-}
-
-// A name-and-attributes document, as the library sends for a file without extracted content.
-Json::Value FileDoc(const std::string& parent, const std::string& name, uint64_t i) {
-  const std::string path = parent + "/" + name;
-  const std::string ext = name.substr(name.find_last_of('.') + 1);
-  Json::Value d;
-  d["QUIXMDPath"] = path;
-  d["QUIXMDFSName"] = name;
-  d["QUIXMDParent"] = parent;
-  d["QUIXMDDisplayName"] = name;
-  d["QUIXMDKind"] = ext;
-  d["QUIXMDExtension"] = ext;
-  d["QUIXMDSearchFileName"] = name;
-  d["QUIXMDSearchAncestor"] = parent;
-  d["QUIXMDIsDir"] = false;
-  d["QUIXMDFSSize"] = static_cast<Json::Int64>(i * 37 % 10000000);
-  d["QUIXMDFSContentChangeDate"] = static_cast<Json::Int64>(1600000000 + i);
-  d["QUIXMDFSCreationDate"] = static_cast<Json::Int64>(1600000000 + i);
-  d["QUIXMDAttributeChangeDate"] = static_cast<Json::Int64>(1600000000 + i);
-  d["QUIXMDOwnerUserID"] = "1026";
-  d["QUIXMDOwnerGroupID"] = "100";
-  return d;
-}
+using orvane::bench::FileDoc;
+using orvane::bench::NameOf;
+using orvane::bench::NameWord;
 
 // Upserts `count` documents under `parent` in compound batches of `batch`, from `g_senders`
 // connections at once: each builds its next batch while the daemon writes another's.
@@ -248,7 +213,7 @@ int main(int argc, char** argv) {
                                 name.substr(under + 1, name.rfind('.') - under - 1));
   });
   tree_search("content, one word as a prefix (about a tenth of the documents)", [&](uint64_t i) {
-    return match("content", std::string(kWords[i % 20]).substr(0, 4) + "*");
+    return match("content", NameWord(i).substr(0, 4) + "*");
   });
   tree_search("name *substring* under the share's root, as the gateway scopes it", [&](uint64_t i) {
     const std::string name = NameOf(i);
@@ -260,7 +225,7 @@ int main(int argc, char** argv) {
   });
   tree_search("a common name word in a folder of 1000, size range", [&](uint64_t i) {
     Json::Value tree;
-    tree["and"].append(match("name", "*" + std::string(kWords[i % 20]) + "*"));
+    tree["and"].append(match("name", "*" + NameWord(i) + "*"));
     tree["and"].append(Json::Value(Json::objectValue))["under"] =
         "/volume1/share/bulk/d" + std::to_string(i % (bulk / 1000));
     Json::Value& range = tree["and"].append(Json::Value(Json::objectValue));

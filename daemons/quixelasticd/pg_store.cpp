@@ -73,15 +73,6 @@ constexpr int kFetchRows = 500;
 // Documents holding a prefix whose words are counted for suggestions.
 constexpr int kSuggestSampleDocs = 5000;
 
-std::string EscapeLike(const std::string& s) {
-  std::string out;
-  for (char c : s) {
-    if (c == '%' || c == '_' || c == '\\') out += '\\';
-    out += c;
-  }
-  return out;
-}
-
 // The text form of the word vector of `text` (UTF-8): every folded word with its positions;
 // empty when there are none.
 std::string WordVector(const std::string& text) {
@@ -850,23 +841,9 @@ Json::Value PgStore::List(const std::string& dir, const std::string& after,
     hit.append(Json::Int64(r.Int(i, 2)));
     hit.append(r.Int(i, 3) != 0);
     if (!extra.empty()) {
-      // Each loaded field as the embedded store gives it: whole numbers and flags as numbers,
-      // strings as they are, anything else as its JSON text.
       const Json::Value doc = ReadDoc(r, i, 4);
       for (const std::string& field : extra) {
-        const Json::Value* v = doc.find(field.data(), field.data() + field.size());
-        if (v == nullptr || v->isNull()) {
-          hit.append(Json::Value());
-        } else if (v->isBool()) {
-          hit.append(Json::Int64(v->asBool() ? 1 : 0));
-        } else if (v->type() == Json::intValue ||
-                   (v->type() == Json::uintValue && v->asUInt64() <= INT64_MAX)) {
-          hit.append(Json::Int64(v->asInt64()));
-        } else if (v->isString()) {
-          hit.append(*v);
-        } else {
-          hit.append(JsonToString(*v));
-        }
+        hit.append(ListedValue(doc.find(field.data(), field.data() + field.size())));
       }
     }
     hits.append(std::move(hit));
@@ -957,7 +934,7 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
     }
   }
   const std::string name = EncodeName(p.name);
-  if (!name.empty()) sql.And("d.fname LIKE " + sql.Text("%" + EscapeLike(FoldName(name)) + "%"));
+  if (!name.empty()) sql.And("d.fname LIKE " + sql.Text("%" + LikeLiteral(FoldName(name)) + "%"));
   if (!p.folder.empty()) {
     std::string folder = p.folder;
     while (folder.size() > 1 && folder.back() == '/') folder.pop_back();

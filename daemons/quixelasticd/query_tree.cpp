@@ -126,27 +126,16 @@ std::string ContentMatch(const std::string& pattern) {
   return out;
 }
 
-std::string EscapeLikeText(const std::string& s) {
-  std::string out;
-  for (char c : s) {
-    if (c == '%' || c == '_' || c == '\\') out += '\\';
-    out += c;
-  }
-  return out;
-}
 
 // A glob of '*' wildcards as a LIKE pattern: '*' any run, everything else literal.
 std::string LikeOfGlob(const std::string& glob) {
   std::string out;
-  for (char c : glob) {
-    if (c == '*') {
-      out += '%';
-      continue;
-    }
-    if (c == '%' || c == '_' || c == '\\') out += '\\';
-    out += c;
+  size_t from = 0;
+  for (size_t star = glob.find('*'); star != std::string::npos; star = glob.find('*', from)) {
+    out += LikeLiteral(glob.substr(from, star - from)) + "%";
+    from = star + 1;
   }
-  return out;
+  return out + LikeLiteral(glob.substr(from));
 }
 
 // A column of the embedded store's table as the server's table gives it: the document's
@@ -328,7 +317,7 @@ class Compiler {
       i = pattern.find_first_of(" \t\n*", start);
       sql += server_ ? " AND COALESCE(" + Column(column, false) + " LIKE ?, FALSE)"
                      : std::string(" AND IFNULL(") + column + " LIKE ? ESCAPE '\\', 0)";
-      Text("%" + EscapeLikeText(pattern.substr(start, i - start)) + "%");
+      Text("%" + LikeLiteral(pattern.substr(start, i - start)) + "%");
     }
     return "(" + sql + ")";
   }
@@ -480,6 +469,15 @@ class Compiler {
 };
 
 }  // namespace
+
+std::string LikeLiteral(const std::string& text) {
+  std::string out;
+  for (char c : text) {
+    if (c == '%' || c == '_' || c == '\\') out += '\\';
+    out += c;
+  }
+  return out;
+}
 
 SqlCondition CompileQueryTree(const Json::Value& tree) {
   SqlCondition c = Compiler(false, false).Run(tree);

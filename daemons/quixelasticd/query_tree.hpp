@@ -54,6 +54,9 @@ SqlCondition CompileQueryTreeForServer(const Json::Value& tree);
 // A content pattern as a word-vector query (see PgKeywordQuery); empty when it holds no word.
 std::string PgContentQuery(const std::string& pattern);
 
+// `text` as a LIKE pattern that matches it literally (backslash the escape).
+std::string LikeLiteral(const std::string& text);
+
 // The keywords of a search, split on white space; a keyword's trailing '*' makes it a prefix.
 struct Keyword {
   std::string text;

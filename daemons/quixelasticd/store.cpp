@@ -464,6 +464,17 @@ DocQuery DocQuery::Parse(const Json::Value& query) {
   return q;
 }
 
+Json::Value ListedValue(const Json::Value* v) {
+  if (v == nullptr || v->isNull()) return Json::Value();
+  if (v->isBool()) return Json::Int64(v->asBool() ? 1 : 0);
+  if (v->type() == Json::intValue ||
+      (v->type() == Json::uintValue && v->asUInt64() <= INT64_MAX)) {
+    return Json::Int64(v->asInt64());
+  }
+  if (v->isString()) return *v;
+  return JsonToString(*v);
+}
+
 std::optional<std::string> PrefixUpperBound(const std::string& prefix) {
   std::string upper = prefix;
   while (!upper.empty()) {
@@ -867,19 +878,7 @@ Json::Value IndexStore::List(const std::string& dir, const std::string& after,
       // strings as they are, anything else as its JSON text.
       const Json::Value doc = ReadDoc(schema_, st, 4);
       for (const std::string& field : extra) {
-        const Json::Value* v = doc.find(field.data(), field.data() + field.size());
-        if (v == nullptr || v->isNull()) {
-          hit.append(Json::Value());
-        } else if (v->isBool()) {
-          hit.append(Json::Int64(v->asBool() ? 1 : 0));
-        } else if (v->type() == Json::intValue ||
-                   (v->type() == Json::uintValue && v->asUInt64() <= INT64_MAX)) {
-          hit.append(Json::Int64(v->asInt64()));
-        } else if (v->isString()) {
-          hit.append(*v);
-        } else {
-          hit.append(JsonToString(*v));
-        }
+        hit.append(ListedValue(doc.find(field.data(), field.data() + field.size())));
       }
     }
     hits.append(std::move(hit));

@@ -161,6 +161,10 @@ class WriteTxn {
 // digits.
 bool IsSuggestible(const std::string& term);
 
+// A loaded field of a document list as a value of SQL would give it: whole numbers and flags
+// as numbers, strings as they are, anything else as its JSON text; null when missing.
+Json::Value ListedValue(const Json::Value* v);
+
 // The smallest string greater than every string that starts with `prefix`; nullopt when there
 // is none (empty prefix or all bytes 0xFF).
 std::optional<std::string> PrefixUpperBound(const std::string& prefix);
