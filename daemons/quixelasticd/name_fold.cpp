@@ -3,6 +3,8 @@
 #include <sqlite3.h>
 
 #include <algorithm>
+#include <cctype>
+#include <cstdint>
 #include <mutex>
 
 #include "daemons/quixelasticd/sqlite_util.hpp"
@@ -110,6 +112,28 @@ Folder& TheFolder() {
 std::string FoldName(const std::string& text) { return TheFolder().Fold(text); }
 
 std::vector<std::string> FoldWords(const std::string& text) { return TheFolder().Words(text); }
+
+std::string NameKey(const std::string& folded) {
+  std::string key;
+  key.reserve(folded.size());
+  for (size_t i = 0; i < folded.size();) {
+    const unsigned char c = static_cast<unsigned char>(folded[i]);
+    size_t end = i + 1;
+    while (end < folded.size() && (static_cast<unsigned char>(folded[end]) & 0xC0) == 0x80) {
+      ++end;
+    }
+    if (std::isalnum(c)) {
+      key += static_cast<char>(std::tolower(c));
+    } else {
+      uint32_t h = 2166136261u;
+      for (size_t k = i; k < end; ++k) h = (h ^ static_cast<unsigned char>(folded[k])) * 16777619u;
+      key += '9';
+      key += static_cast<char>('a' + h % 26);
+    }
+    i = end;
+  }
+  return key;
+}
 
 std::string GlobLiteral(const std::string& text, bool stars) {
   std::string out;

@@ -15,6 +15,12 @@ namespace elasticd {
 // cannot be had, which only a broken SQLite build causes.
 std::string FoldName(const std::string& text);
 
+// A folded name (or a literal run of a name pattern) as the PostgreSQL store's trigram index
+// keys it: ASCII letters and digits as they are, every other character as '9' and a letter
+// chosen by its bytes. That index keeps only letters and digits in its trigrams; keyed so, it
+// sees every character. Characters may share a key: the folded name itself is checked after.
+std::string NameKey(const std::string& folded);
+
 // The words of `text` (UTF-8) in order, folded as the word index folds them.
 std::vector<std::string> FoldWords(const std::string& text);
 

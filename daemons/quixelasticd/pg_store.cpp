@@ -34,11 +34,11 @@ const char kSchemaSql[] =
     "CREATE TABLE IF NOT EXISTS fi_meta(part int NOT NULL REFERENCES fi_indexes ON DELETE"
     " CASCADE, key text NOT NULL, value text NOT NULL, PRIMARY KEY(part, key));"
     "CREATE TABLE IF NOT EXISTS fi_docs(part int NOT NULL, path bytea NOT NULL,"
-    " fname text NOT NULL, ext text NOT NULL, size bigint NOT NULL, mtime bigint NOT NULL,"
+    " fname text NOT NULL, nkey text NOT NULL, ext text NOT NULL, size bigint NOT NULL, mtime bigint NOT NULL,"
     " is_dir smallint NOT NULL, ctime bigint, crtime bigint, owner text, grp text,"
     " anc bytea NOT NULL, kept int NOT NULL, words tsvector, doc text,"
     " PRIMARY KEY(part, path)) PARTITION BY LIST (part);"
-    "CREATE INDEX IF NOT EXISTS fi_docs_fname ON fi_docs USING gin (fname gin_trgm_ops);"
+    "CREATE INDEX IF NOT EXISTS fi_docs_nkey ON fi_docs USING gin (nkey gin_trgm_ops);"
     "CREATE INDEX IF NOT EXISTS fi_docs_words ON fi_docs USING gin (words);";
 
 // Held while the shared tables are made or an index is added or dropped, so that daemons
@@ -47,10 +47,10 @@ const char kSchemaLock[] = "SELECT pg_advisory_xact_lock(7415011)";
 
 // The columns a write sets, in the order WriteRows binds them.
 const char kRowColumns[] =
-    "part, path, fname, ext, size, mtime, is_dir, ctime, crtime, owner, grp, anc, kept, words,"
+    "part, path, fname, nkey, ext, size, mtime, is_dir, ctime, crtime, owner, grp, anc, kept, words,"
     " doc";
-constexpr int kRowParams = 14;  // all but the partition number, which is part of the statement
-constexpr int kWordsParam = 12;
+constexpr int kRowParams = 15;  // all but the partition number, which is part of the statement
+constexpr int kWordsParam = 13;
 // The columns a document is read back from, in the order ReadDoc takes them.
 const char kDocColumns[] =
     "d.path, d.doc, d.anc, d.ext, d.size, d.mtime, d.is_dir, d.ctime, d.crtime, d.owner, d.grp,"
@@ -292,18 +292,6 @@ auto WithinBudget(QueryGuard* guard, F&& fn) -> decltype(fn()) {
     }
     throw;
   }
-}
-
-// Whether the trigram index can look `folded` up: it holds a run of three letters or digits
-// (any character beyond ASCII counts as a letter).
-bool HasTrigram(const std::string& folded) {
-  int run = 0;
-  for (unsigned char c : folded) {
-    if ((c & 0xC0) == 0x80) continue;  // the rest of a character already counted
-    run = std::isalnum(c) || c >= 0x80 ? run + 1 : 0;
-    if (run >= 3) return true;
-  }
-  return false;
 }
 
 // The condition of a document query; `scan` when it tests a field without a column, which is
@@ -616,6 +604,7 @@ void PgStore::WriteRows(const std::vector<const Json::Value*>& docs, const std::
     const Json::Value& doc = *docs[i];
     const DerivedDoc d = schema_.Derive(doc);
     const Compact c = CompactOf(schema_, doc, d);
+    const std::string folded = FoldName(EncodeName(d.name_text));
     const std::string words = WordVector(EncodeName(d.all_text));
     auto int_or_null = [&](const std::optional<int64_t>& v) {
       if (v) {
@@ -632,7 +621,8 @@ void PgStore::WriteRows(const std::vector<const Json::Value*>& docs, const std::
       }
     };
     params.Bytes(d.path)
-        .Text(FoldName(EncodeName(d.name_text)))
+        .Text(folded)
+        .Text(NameKey(folded))
         .Text(EncodeName(d.ext))
         .Int(d.size)
         .Int(d.mtime)
@@ -657,7 +647,8 @@ void PgStore::WriteRows(const std::vector<const Json::Value*>& docs, const std::
     sql += ")";
   }
   sql +=
-      " ON CONFLICT (part, path) DO UPDATE SET fname = excluded.fname, ext = excluded.ext,"
+      " ON CONFLICT (part, path) DO UPDATE SET fname = excluded.fname, nkey = excluded.nkey,"
+         " ext = excluded.ext,"
       " size = excluded.size, mtime = excluded.mtime, is_dir = excluded.is_dir,"
       " ctime = excluded.ctime, crtime = excluded.crtime, owner = excluded.owner,"
       " grp = excluded.grp, anc = excluded.anc, kept = excluded.kept,"
@@ -934,7 +925,12 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
     }
   }
   const std::string name = EncodeName(p.name);
-  if (!name.empty()) sql.And("d.fname LIKE " + sql.Text("%" + LikeLiteral(FoldName(name)) + "%"));
+  const std::string folded_name = FoldName(name);
+  if (!name.empty()) {
+    // The key finds the candidates by their trigrams; the folded name decides.
+    sql.And("d.nkey LIKE " + sql.Text("%" + NameKey(folded_name) + "%"));
+    sql.And("d.fname LIKE " + sql.Text("%" + LikeLiteral(folded_name) + "%"));
+  }
   if (!p.folder.empty()) {
     std::string folder = p.folder;
     while (folder.size() > 1 && folder.back() == '/') folder.pop_back();
@@ -985,10 +981,10 @@ SearchPage PgStore::Run(const SearchParams& p, const VisibleFn& visible, QueryGu
   return WithinBudget(guard, [&] {
     PgTxn txn(*conn);
     Budget(*conn, guard);
-    if (HasTrigram(FoldName(name))) {
+    if (NameKey(folded_name).size() >= 3) {
       // The planner guesses how many names hold a substring; guessing many, it reads the
       // table in order until the page is full, which for a rare one means the whole table.
-      // The trigram index answers any substring with a run of three letters or digits.
+      // The trigram index answers any substring whose key has a trigram.
       conn->Script("SET LOCAL enable_seqscan = off");
     }
     return Page(*conn, p, visible, guard, everywhere, sql.params, select, from, order, ranked);

@@ -362,6 +362,7 @@ TEST_F(PgStoreTest, FindsWhatTheEmbeddedStoreFinds) {
       R"({"match": "name", "pattern": "*ete*"})",
       R"({"match": "name", "pattern": "*%[x]?*"})",
       R"({"match": "name", "pattern": "*"})",
+      R"({"match": "name", "pattern": "*y r*.do*"})",
       R"({"match": "content", "pattern": "quarterly report"})",
       R"({"match": "content", "pattern": "*quart*"})",
       R"({"match": "content", "pattern": "holi*"})",
@@ -400,7 +401,7 @@ TEST_F(PgStoreTest, FindsWhatTheEmbeddedStoreFinds) {
     p.keywords = keywords;
     EXPECT_EQ(sorted(pg->Search(p, nullptr)), sorted(lite->Search(p, nullptr))) << keywords;
   }
-  for (const char* name : {"rep", "é", "0001.j", "s.t"}) {
+  for (const char* name : {"rep", "é", "0001.j", "s.t", "é 2", "g_0", "t.d", "%["}) {
     SearchParams p;
     p.name = name;
     EXPECT_EQ(sorted(pg->Search(p, nullptr)), sorted(lite->Search(p, nullptr))) << name;
@@ -452,6 +453,7 @@ std::string CoordinatorSql(const std::vector<std::pair<std::string, std::vector<
   std::string sql =
       "CREATE EXTENSION postgres_fdw; CREATE EXTENSION pg_trgm;"
       "CREATE TABLE fi_docs(part int NOT NULL, path bytea NOT NULL, fname text NOT NULL,"
+      " nkey text NOT NULL,"
       " ext text NOT NULL, size bigint NOT NULL, mtime bigint NOT NULL, is_dir smallint NOT NULL,"
       " ctime bigint, crtime bigint, owner text, grp text, anc bytea NOT NULL, kept int NOT NULL,"
       " words tsvector, doc text) PARTITION BY LIST (part);";

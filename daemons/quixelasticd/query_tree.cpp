@@ -279,8 +279,18 @@ class Compiler {
   std::string NameMatch(const std::string& pattern, bool joined) {
     const std::string glob = GlobLiteral(FoldName(EncodeName(pattern)), true);
     if (server_) {
-      Text(LikeOfGlob(FoldName(EncodeName(pattern))));
-      return "(d.fname LIKE ?)";
+      // The key's pattern finds the candidates by their trigrams; the folded name decides.
+      const std::string folded = FoldName(EncodeName(pattern));
+      std::string key;
+      size_t from = 0;
+      for (size_t star = folded.find('*'); star != std::string::npos;
+           star = folded.find('*', from)) {
+        key += NameKey(folded.substr(from, star - from)) + "%";
+        from = star + 1;
+      }
+      Text(key + NameKey(folded.substr(from)));
+      Text(LikeOfGlob(folded));
+      return "(d.nkey LIKE ? AND d.fname LIKE ?)";
     }
     Text(glob);
     if (by_folder_) return "((SELECT name FROM fts_name WHERE fts_name.rowid = d.rowid) GLOB ?)";
