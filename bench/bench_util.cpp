@@ -270,8 +270,11 @@ std::string ScratchRoot(const std::string& prefix, bool open_to_others) {
   return tmpl;
 }
 
-InProcessEngine::InProcessEngine(const std::string& root) : root_(root) {
+InProcessEngine::InProcessEngine(const std::string& root,
+                                 std::shared_ptr<elasticd::StoreBackend> stores)
+    : root_(root) {
   elasticd::EngineOptions options;
+  options.stores = std::move(stores);
   options.registry_file = root + "/state/indexes.json";
   options.running_marker = root + "/state/running";
   engine_.reset(new elasticd::Engine(options));

@@ -86,7 +86,9 @@ void PrintLatency(const char* what, std::vector<double> ms, long hits);
 // daemon's sockets there. Stop() (or the destructor) stops both.
 class InProcessEngine {
  public:
-  explicit InProcessEngine(const std::string& root);
+  // `stores`: where the indexes live; null for SQLite files below `root`.
+  explicit InProcessEngine(const std::string& root,
+                           std::shared_ptr<elasticd::StoreBackend> stores = nullptr);
   ~InProcessEngine();
   InProcessEngine(const InProcessEngine&) = delete;
   InProcessEngine& operator=(const InProcessEngine&) = delete;

@@ -4,11 +4,16 @@
 // folder of 100,000 documents, re-pathing a folder with 25,000 descendants the way the library
 // does it, and the store size per name-only document.
 //
-//   quixelasticd_bench [documents=1000000 [batch=1000 [connections=2 [renamed=25000]]]]
+//   quixelasticd_bench [documents=1000000 [batch=1000 [connections=2 [renamed=25000
+//                      [CONNINFO]]]]]
+//
+// With a libpq connection string the engine keeps the index in that PostgreSQL database
+// instead of an SQLite file; the server is one the caller runs, its CPU time not counted.
 //
 // The engine and server run in this process on the daemon's socket path below a scratch
 // ORVANE_ROOT; the bulk load and the searches are framed requests on that socket, the delete
 // and the rename are the library's own IndexDelDir and IndexRename.
+#include <libpq-fe.h>
 #include <sqlite3.h>
 #include <unistd.h>
 
@@ -24,6 +29,7 @@
 #include <vector>
 
 #include "bench/bench_util.hpp"
+#include "daemons/quixelasticd/pg_backend.hpp"
 #include "fileindex/elastic_control.hpp"
 
 namespace {
@@ -95,16 +101,22 @@ int main(int argc, char** argv) {
   }
   const std::string dir = orvane::bench::ScratchRoot("quixelasticd-bench", false);
   if (dir.empty()) return 1;
-  orvane::bench::InProcessEngine engine(dir);
+  const std::string conninfo = argc > 5 ? argv[5] : "";
+  orvane::bench::InProcessEngine engine(
+      dir, conninfo.empty() ? nullptr : orvane::elasticd::PgBackend(conninfo, "bench"));
   engine.Serve(false);
   g_socket = engine.socket();
 
   // The library's own schema and settings, as ShareIndexCreate sends them.
   Request(orvane::bench::FileIndexCreate(kId, dir + "/db"));
 
-  std::printf("SQLite %s; WAL, synchronous=NORMAL (commit syncs the log), cache_size=64 MiB,"
-              " temp_store=MEMORY, mmap_size=2 GiB, page size 4096; FTS5 unicode61 (catch-all)"
-              " and trigram without positions over folded names\n", sqlite3_libversion());
+  if (conninfo.empty()) {
+    std::printf("SQLite %s; WAL, synchronous=NORMAL (commit syncs the log), cache_size=64 MiB,"
+                " temp_store=MEMORY, mmap_size=2 GiB, page size 4096; FTS5 unicode61 (catch-all)"
+                " and trigram without positions over folded names\n", sqlite3_libversion());
+  } else {
+    std::printf("PostgreSQL store (%s)\n", conninfo.c_str());
+  }
   const uint64_t batch = argc > 2 ? std::strtoull(argv[2], nullptr, 10) : 1000;
   if (argc > 3) g_senders = static_cast<unsigned>(std::strtoul(argv[3], nullptr, 10));
   const uint64_t renamed = argc > 4 ? std::strtoull(argv[4], nullptr, 10) : 25000;
@@ -128,7 +140,20 @@ int main(int argc, char** argv) {
   Load("/volume1/share/ren", bulk + 100000, renamed, batch);
   Commit();
 
-  {
+  if (!conninfo.empty()) {
+    // The index's partition with its indexes and out-of-line values.
+    PGconn* conn = PQconnectdb(conninfo.c_str());
+    PGresult* r = PQexec(conn,
+                         "SELECT sum(pg_total_relation_size(inhrelid)) FROM pg_inherits"
+                         " WHERE inhparent = 'fi_docs'::regclass");
+    if (PQresultStatus(r) == PGRES_TUPLES_OK && PQntuples(r) == 1) {
+      const double bytes = std::strtod(PQgetvalue(r, 0, 0), nullptr);
+      std::printf("store size after the load: %.1f MiB, %.0f bytes per name-only document\n",
+                  bytes / 1048576.0, bytes / total);
+    }
+    PQclear(r);
+    PQfinish(conn);
+  } else {
     // Pages in use, free pages excluded, per document after the load.
     sqlite3* db = nullptr;
     if (sqlite3_open_v2((dir + "/db/index.db").c_str(), &db, SQLITE_OPEN_READONLY, nullptr) ==
