@@ -6,7 +6,9 @@
 #include "common/json_util.hpp"
 #include "common/name_codec.hpp"
 #include "daemons/quixelasticd/engine_error.hpp"
+#include "daemons/quixelasticd/pg_backend.hpp"
 #include "test/engine_client.hpp"
+#include "test/pg_server.hpp"
 #include "test/test_util.hpp"
 
 namespace orvane {
@@ -59,15 +61,34 @@ TEST(SchemaTest, RefusesUnknownMappingsAndValidatesDocuments) {
   }
 }
 
-class StoreTest : public ::testing::Test {
+// The store's behaviour that both kinds of store share: the SQLite file of each index, and a
+// PostgreSQL database of the test's own (one server for the whole suite, an index per test).
+class StoreTest : public ::testing::TestWithParam<std::string> {
  protected:
+  static void TearDownTestSuite() { pg_.reset(); }
+
   void SetUp() override {
-    store_ = IndexStore::Create(dir_.Path("db"), "fileindex_s", tc::FileMappings(), {}, {});
+    if (GetParam() == "postgres") {
+      if (!pg_) pg_ = std::make_unique<orvane::test::PgServer>();
+      backend_ = PgBackend(pg_->conninfo(), "s1");
+    } else {
+      backend_ = SqliteBackend();
+    }
+    id_ = "fileindex_" + std::string(::testing::UnitTest::GetInstance()->current_test_info()->name())
+                             .substr(0, 40);
+    for (char& c : id_) {
+      if (!isalnum(static_cast<unsigned char>(c))) c = '_';
+    }
+    store_ = backend_->Create(dir_.Path("db"), id_, tc::FileMappings(), {}, {});
+  }
+  void TearDown() override {
+    store_.reset();
+    backend_->Remove(dir_.Path("db"), id_);
   }
   void Put(const Json::Value& doc) {
-    WriteTxn txn(*store_);
+    std::unique_ptr<StoreTxn> txn = store_->Begin();
     store_->Upsert(doc["QUIXMDPath"].asString(), doc);
-    txn.Commit();
+    txn->Commit();
   }
   std::vector<std::string> Paths(const DocQuery& q) {
     std::vector<std::string> out;
@@ -87,11 +108,46 @@ class StoreTest : public ::testing::Test {
     return out;
   }
 
+  static std::unique_ptr<orvane::test::PgServer> pg_;
+  orvane::test::TempDir dir_;
+  std::shared_ptr<StoreBackend> backend_;
+  std::string id_;
+  std::shared_ptr<Store> store_;
+};
+
+std::unique_ptr<orvane::test::PgServer> StoreTest::pg_;
+
+INSTANTIATE_TEST_SUITE_P(BothStores, StoreTest, ::testing::Values("sqlite", "postgres"),
+                         [](const ::testing::TestParamInfo<std::string>& info) {
+                           return info.param;
+                         });
+
+// What only the SQLite file shows: its tables' contents and a full disk.
+class SqliteStoreTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    store_ = IndexStore::Create(dir_.Path("db"), "fileindex_s", tc::FileMappings(), {}, {});
+  }
+  void Put(const Json::Value& doc) {
+    WriteTxn txn(*store_);
+    store_->Upsert(doc["QUIXMDPath"].asString(), doc);
+    txn.Commit();
+  }
+  std::vector<std::string> NamesLike(const std::string& name) {
+    SearchParams p;
+    p.name = name;
+    std::vector<std::string> out;
+    for (const Json::Value& hit : store_->Search(p, nullptr).hits) {
+      out.push_back(hit["name"].asString());
+    }
+    return out;
+  }
+
   orvane::test::TempDir dir_;
   std::shared_ptr<IndexStore> store_;
 };
 
-TEST_F(StoreTest, PrefixQueriesStopAtTheFolderBoundary) {
+TEST_P(StoreTest, PrefixQueriesStopAtTheFolderBoundary) {
   for (const char* p : {"/v/s/a", "/v/s/a/x.txt", "/v/s/a/y/z.txt", "/v/s/ab", "/v/s/ab/c.txt"}) {
     Put(FileDoc(p));
   }
@@ -104,16 +160,16 @@ TEST_F(StoreTest, PrefixQueriesStopAtTheFolderBoundary) {
   EXPECT_THAT(Paths({K::kTerm, "QUIXMDSearchAncestor", "/v/s/a"}),
               ElementsAre("/v/s/a/x.txt", "/v/s/a/y/z.txt"));
 
-  WriteTxn txn(*store_);
+  std::unique_ptr<StoreTxn> txn = store_->Begin();
   EXPECT_EQ(store_->DeleteByQuery({K::kPrefix, "QUIXMDPath", "/v/s/a/"}), 2);
-  txn.Commit();
+  txn->Commit();
   EXPECT_THAT(Paths(DocQuery()), ElementsAre("/v/s/a", "/v/s/ab", "/v/s/ab/c.txt"));
   // Deleted documents leave nothing behind in the name index or the suggestions.
   EXPECT_TRUE(NamesLike("z.t").empty());
   EXPECT_TRUE(store_->Suggest("x", 10, nullptr).empty());
 }
 
-TEST_F(StoreTest, ListingPagesThroughOneFolderInIdentifierOrder) {
+TEST_P(StoreTest, ListingPagesThroughOneFolderInIdentifierOrder) {
   for (const char* p : {"/v/s/a", "/v/s/a.txt", "/v/s/a/x.txt", "/v/s/a/y", "/v/s/a/y/z.txt",
                         "/v/s/a0", "/v/s/ab"}) {
     Json::Value doc = FileDoc(p, 7, 1000);
@@ -140,15 +196,15 @@ TEST_F(StoreTest, ListingPagesThroughOneFolderInIdentifierOrder) {
   EXPECT_THAT(paths, ElementsAre("/v/s/a", "/v/s/a/x.txt", "/v/s/a/y", "/v/s/a/y/z.txt"));
 }
 
-TEST_F(StoreTest, SetFieldsRekeysAndReplacesTheDocumentAtTheNewPath) {
+TEST_P(StoreTest, SetFieldsRekeysAndReplacesTheDocumentAtTheNewPath) {
   Json::Value old_doc = FileDoc("/v/s/old.txt", 10);
   old_doc["QUIXMDSecret"] = "not stored";
   Put(old_doc);
   Put(FileDoc("/v/s/new.txt", 20));
-  WriteTxn txn(*store_);
+  std::unique_ptr<StoreTxn> txn = store_->Begin();
   store_->SetFields("/v/s/old.txt", tc::Parse(R"({"QUIXMDPath": "/v/s/new.txt",
       "QUIXMDFSName": "new.txt", "QUIXMDSearchFileName": "new.txt"})"));
-  txn.Commit();
+  txn->Commit();
   const Json::Value hits =
       store_->GetByQuery(DocQuery(), {"QUIXMDSecret", "QUIXMDPath", "QUIXMDFSSize"}, 0, 10);
   ASSERT_EQ(hits.size(), 1u);
@@ -160,7 +216,7 @@ TEST_F(StoreTest, SetFieldsRekeysAndReplacesTheDocumentAtTheNewPath) {
 }
 
 // Which suggestions a caller sees is checked against real permissions through the daemon.
-TEST_F(StoreTest, SuggestsTermsMostUsedFirst) {
+TEST_P(StoreTest, SuggestsTermsMostUsedFirst) {
   Put(FileDoc("/v/s/beach.jpg"));
   Put(FileDoc("/v/s/bear one.jpg"));
   Put(FileDoc("/v/s/sub/bear two.jpg"));
@@ -176,7 +232,7 @@ TEST_F(StoreTest, SuggestsTermsMostUsedFirst) {
 // UTF-8, so the tokenizers see every valid part of a name; what comes back is the real bytes.
 // Searches by names, folders and words, and renames below such folders, are checked end to end
 // with the other daemons.
-TEST_F(StoreTest, NamesThatAreNotUtf8AreFoundByTheirValidParts) {
+TEST_F(SqliteStoreTest, NamesThatAreNotUtf8AreFoundByTheirValidParts) {
   for (const char* p : {"/v/s/caf\xE9 menu.txt", "/v/s/\xFF\xFEreport.pdf",
                         "/v/s/dir\xFF/inner.txt", "/v/s/\xE6\x97\xA5\xE6\x9C\xAC.txt"}) {
     Put(FileDoc(p));
@@ -195,7 +251,7 @@ TEST_F(StoreTest, NamesThatAreNotUtf8AreFoundByTheirValidParts) {
 
 // Documents are kept as columns plus the fields the columns cannot give back; what comes back
 // must be what was sent, whatever the values' types and however they differ from the columns.
-TEST_F(StoreTest, DocumentsComeBackAsTheyWereSent) {
+TEST_P(StoreTest, DocumentsComeBackAsTheyWereSent) {
   std::vector<Json::Value> docs;
   docs.push_back(FileDoc("/v/s/plain.txt", 12, 1600000000));
   for (const Spoil& spoil : std::vector<Spoil>{
@@ -235,17 +291,17 @@ TEST_F(StoreTest, DocumentsComeBackAsTheyWereSent) {
   docs.push_back(odd);
   std::vector<std::pair<size_t, std::string>> refused;
   {
-    WriteTxn txn(*store_);
+    std::unique_ptr<StoreTxn> txn = store_->Begin();
     Json::Value bad = FileDoc("/v/s/bad.txt");
     bad["QUIXMDFSSize"] = "twelve";
     docs.push_back(bad);
     EXPECT_EQ(store_->UpsertMany(docs, &refused), docs.size() - 1);
     docs.pop_back();
-    txn.Commit();
+    txn->Commit();
   }
   ASSERT_EQ(refused.size(), 1u);
   EXPECT_EQ(refused[0].first, docs.size());
-  const Schema& schema = store_->schema();
+  const Schema schema = Schema::Parse(tc::FileMappings());
   for (const Json::Value& d : docs) {
     const std::string path = d["QUIXMDPath"].asString();
     const Json::Value hits =
@@ -264,7 +320,7 @@ TEST_F(StoreTest, DocumentsComeBackAsTheyWereSent) {
 
 // Names are compared folded, as words are: any case, with or without diacritics, in either
 // Unicode form; characters that mean something to a pattern are matched as themselves.
-TEST_F(StoreTest, NamesMatchInAnyCaseWithOrWithoutDiacritics) {
+TEST_P(StoreTest, NamesMatchInAnyCaseWithOrWithoutDiacritics) {
   for (const char* p : {"/v/s/Caf\xC3\xA9 Menu.txt", "/v/s/cafe.txt", "/v/s/CAFE\xCC\x81-noir.pdf",
                         "/v/s/a[1]?.txt", "/v/s/a*b.txt", "/v/s/acb.txt", "/v/s/\xC3\x85ngstr\xC3\xB6m.doc"}) {
     Put(FileDoc(p));
@@ -351,7 +407,7 @@ TEST(StoreUpgradeTest, AnOldStoreIsRewrittenAtOpenOrLeftWhole) {
   EXPECT_TRUE(store->QuickCheck(&detail)) << detail;
 }
 
-TEST_F(StoreTest, AFullDiskFailsTheWriteAndKeepsWhatWasThere) {
+TEST_F(SqliteStoreTest, AFullDiskFailsTheWriteAndKeepsWhatWasThere) {
   Put(FileDoc("/v/s/kept.txt"));
   // The page limit stands in for a full disk: SQLite answers SQLITE_FULL the same way.
   {
