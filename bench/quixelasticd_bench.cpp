@@ -102,8 +102,11 @@ int main(int argc, char** argv) {
   const std::string dir = orvane::bench::ScratchRoot("quixelasticd-bench", false);
   if (dir.empty()) return 1;
   const std::string conninfo = argc > 5 ? argv[5] : "";
+  // This run's own name in the database, which may hold earlier runs' indexes.
+  const std::string pg_server = "bench-" + std::to_string(::getpid());
   orvane::bench::InProcessEngine engine(
-      dir, conninfo.empty() ? nullptr : orvane::elasticd::PgBackend(conninfo, "bench"));
+      dir, conninfo.empty() ? nullptr
+                            : orvane::elasticd::PgBackend(conninfo, pg_server));
   engine.Serve(false);
   g_socket = engine.socket();
 
@@ -143,9 +146,11 @@ int main(int argc, char** argv) {
   if (!conninfo.empty()) {
     // The index's partition with its indexes and out-of-line values.
     PGconn* conn = PQconnectdb(conninfo.c_str());
-    PGresult* r = PQexec(conn,
-                         "SELECT sum(pg_total_relation_size(inhrelid)) FROM pg_inherits"
-                         " WHERE inhparent = 'fi_docs'::regclass");
+    const char* values[] = {pg_server.c_str(), kId};
+    PGresult* r = PQexecParams(conn,
+                               "SELECT pg_total_relation_size(('fi_docs_' || part)::regclass)"
+                               " FROM fi_indexes WHERE server = $1 AND id = $2",
+                               2, nullptr, values, nullptr, nullptr, 0);
     if (PQresultStatus(r) == PGRES_TUPLES_OK && PQntuples(r) == 1) {
       const double bytes = std::strtod(PQgetvalue(r, 0, 0), nullptr);
       std::printf("store size after the load: %.1f MiB, %.0f bytes per name-only document\n",
@@ -309,6 +314,12 @@ int main(int argc, char** argv) {
   std::printf("IndexDelDir of 100000 documents (then IndexCommit): %.2f s, %.2f CPU s\n",
               Seconds(start), CpuSeconds() - cpu);
 
+  // The database keeps what the scratch folder does not: the index goes with the run.
+  if (!conninfo.empty()) {
+    Json::Value index;
+    index["id"] = kId;
+    Request(Cmd("index_delete", index));
+  }
   engine.Stop();
   std::string cleanup = "rm -rf '" + dir + "'";
   return std::system(cleanup.c_str()) == 0 ? 0 : 1;
