@@ -123,6 +123,20 @@ TEST_F(CtlTest, SearchSendsTheFiltersAndShowsHits) {
   for (const std::string& key : want.getMemberNames()) {
     EXPECT_EQ(req["data"][key], want[key]) << key;
   }
+  EXPECT_FALSE(req["data"].isMember("servers"));
+}
+
+// Over every file server sharing the engine's database, each hit shows where it lives.
+TEST_F(CtlTest, SearchOverAllServersShowsEachHitsServer) {
+  const std::string reply =
+      R"({"success":true,"data":{"total":1,"total_exact":true,"hits":[{"path":"/srv/docs/q3.pdf",)"
+      R"("name":"q3.pdf","size":1536,"mtime":1700000000,"is_dir":false,"server":"fs2"}]}})";
+  test::FakeDaemon engine(dir_.Path("var/run/quixelasticd.search.sock"),
+                          test::FakeDaemon::Replies({reply}));
+  Result r = Run({"search", "--name", "q3", "--all-servers"});
+  ASSERT_EQ(r.status, 0) << r.err;
+  EXPECT_THAT(r.out, AllOf(HasSubstr("SERVER"), HasSubstr("fs2"), HasSubstr("/srv/docs")));
+  EXPECT_EQ(engine.json_requests().at(0)["data"]["servers"], "all");
 }
 
 TEST_F(CtlTest, StatusShowsEachShareFromBothDaemonsOrDashesWithoutThem) {

@@ -472,6 +472,8 @@ Json::Value SearchRequest(const Args& args) {
   if (data.size() == 2 + (args.Has("share") ? 1 : 0)) {
     throw UsageError("give keywords, --name or a filter to search for");
   }
+  // Asked after the check above: it is a scope, not something to search for.
+  if (args.Has("all-servers")) data["servers"] = "all";
   return data;
 }
 
@@ -494,12 +496,19 @@ void SearchCmd(const Args& args, Output& out) {
       os << "no files found\n";
       return;
     }
-    Table table({"NAME", "SIZE", "MODIFIED", "FOLDER"});
+    // Hits of a search over every file server sharing the engine's database name theirs.
+    const bool servers = hits[0].isMember("server");
+    Table table(servers ? std::vector<std::string>{"NAME", "SIZE", "MODIFIED", "SERVER", "FOLDER"}
+                        : std::vector<std::string>{"NAME", "SIZE", "MODIFIED", "FOLDER"});
     for (const Json::Value& hit : hits) {
       const std::string path = hit["path"].asString();
-      table.Add({hit["name"].asString() + (hit["is_dir"].asBool() ? "/" : ""),
-                 hit["is_dir"].asBool() ? "-" : HumanSize(hit["size"].asUInt64()),
-                 HumanTime(hit["mtime"].asInt64()), Dirname(path)});
+      std::vector<std::string> row = {
+          hit["name"].asString() + (hit["is_dir"].asBool() ? "/" : ""),
+          hit["is_dir"].asBool() ? "-" : HumanSize(hit["size"].asUInt64()),
+          HumanTime(hit["mtime"].asInt64())};
+      if (servers) row.push_back(hit["server"].asString());
+      row.push_back(Dirname(path));
+      table.Add(row);
     }
     table.Print(os);
     bool snippets = false;
@@ -984,11 +993,11 @@ const std::vector<Command>& Commands() {
        "[--type document|audio|video|photo|folder] [--min-size SIZE] "
        "[--max-size SIZE] [--after DATE] [--before DATE] "
        "[--sort relevance|name|size|mtime] [--desc] [--from N] [--size N] "
-       "[--share SHARE]",
+       "[--share SHARE] [--all-servers]",
        "search file names, contents and metadata",
        {"name", "folder", "ext", "type", "min-size", "max-size", "after", "before", "sort", "from",
         "size", "share"},
-       {"desc"},
+       {"desc", "all-servers"},
        1000,
        SearchCmd},
       {"",
