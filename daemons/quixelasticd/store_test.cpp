@@ -61,6 +61,17 @@ TEST(SchemaTest, RefusesUnknownMappingsAndValidatesDocuments) {
   }
 }
 
+// The names a search by (part of) a name finds.
+std::vector<std::string> NamesFound(Store& store, const std::string& name) {
+  SearchParams p;
+  p.name = name;
+  std::vector<std::string> out;
+  for (const Json::Value& hit : store.Search(p, nullptr).hits) {
+    out.push_back(hit["name"].asString());
+  }
+  return out;
+}
+
 // The store's behaviour that both kinds of store share: the SQLite file of each index, and a
 // PostgreSQL database of the test's own (one server for the whole suite, an index per test).
 class StoreTest : public ::testing::TestWithParam<std::string> {
@@ -74,8 +85,8 @@ class StoreTest : public ::testing::TestWithParam<std::string> {
     } else {
       backend_ = SqliteBackend();
     }
-    id_ = "fileindex_" + std::string(::testing::UnitTest::GetInstance()->current_test_info()->name())
-                             .substr(0, 40);
+    const std::string test = ::testing::UnitTest::GetInstance()->current_test_info()->name();
+    id_ = "fileindex_" + test.substr(0, 40);
     for (char& c : id_) {
       if (!isalnum(static_cast<unsigned char>(c))) c = '_';
     }
@@ -97,16 +108,7 @@ class StoreTest : public ::testing::TestWithParam<std::string> {
     }
     return out;
   }
-  // The names a search by (part of a) name finds.
-  std::vector<std::string> NamesLike(const std::string& name) {
-    SearchParams p;
-    p.name = name;
-    std::vector<std::string> out;
-    for (const Json::Value& hit : store_->Search(p, nullptr).hits) {
-      out.push_back(hit["name"].asString());
-    }
-    return out;
-  }
+  std::vector<std::string> NamesLike(const std::string& name) { return NamesFound(*store_, name); }
 
   static std::unique_ptr<orvane::test::PgServer> pg_;
   orvane::test::TempDir dir_;
@@ -133,15 +135,7 @@ class SqliteStoreTest : public ::testing::Test {
     store_->Upsert(doc["QUIXMDPath"].asString(), doc);
     txn.Commit();
   }
-  std::vector<std::string> NamesLike(const std::string& name) {
-    SearchParams p;
-    p.name = name;
-    std::vector<std::string> out;
-    for (const Json::Value& hit : store_->Search(p, nullptr).hits) {
-      out.push_back(hit["name"].asString());
-    }
-    return out;
-  }
+  std::vector<std::string> NamesLike(const std::string& name) { return NamesFound(*store_, name); }
 
   orvane::test::TempDir dir_;
   std::shared_ptr<IndexStore> store_;
