@@ -146,7 +146,6 @@ void ToOptions(const Flags& flags, orvane::elasticd::EngineOptions* engine_optio
   }
 }
 
-// Serves until a stop signal; 1 when the engine or the server could not start.
 // The shared database's stores. A database that is starting too (the whole machine booting)
 // is waited for a while before the daemon gives up and its service manager starts it again.
 std::shared_ptr<orvane::elasticd::StoreBackend> ConnectPostgres(const Flags& flags) {
@@ -169,6 +168,7 @@ std::shared_ptr<orvane::elasticd::StoreBackend> ConnectPostgres(const Flags& fla
   }
 }
 
+// Serves until a stop signal; 1 when the engine or the server could not start.
 int Serve(const Flags& flags, orvane::platform::DaemonSignals* signals) {
   orvane::elasticd::EngineOptions engine_options;
   orvane::elasticd::ServerOptions server_options;
